@@ -1,0 +1,142 @@
+#include "Client/ctl/Output.h"
+
+#include "platform/MessageFormat.h"
+#include "platform/Unicode.h"
+
+#include <charconv>
+#include <cmath>
+#include <cstdlib>
+#include <cstring>
+
+namespace ostrand::ctl {
+
+namespace {
+
+constexpr char32_t replacementCharacter = 0xfffd;
+constexpr char hexDigits[] = "0123456789abcdef";
+
+void appendHex(std::string& out, unsigned char byte) {
+    out += hexDigits[byte >> 4];
+    out += hexDigits[byte & 15];
+}
+
+void appendNumber(std::string& out, auto number) {
+    char digits[32];
+    out.append(digits, std::to_chars(std::begin(digits), std::end(digits), number).ptr);
+}
+
+void appendString(std::string& out, std::string_view text) {
+    out += '"';
+    while (!text.empty()) {
+        const auto character = ost::platform::takeCodePoint(text).value_or(replacementCharacter);
+        if (character == '"' || character == '\\')
+            out += '\\';
+        if (character >= 0x20 && (character < 0x7f || character > 0x9f)) {
+            ost::platform::appendUTF8(out, character);
+        } else {
+            out += "\\u00";
+            appendHex(out, static_cast<unsigned char>(character));
+        }
+    }
+    out += '"';
+}
+
+void appendValue(std::string& out, const ost::OSTValue& value);
+
+/// Appends the elements between brackets, separated by commas.
+void appendList(std::string& out, std::string_view brackets, const auto& elements, const auto& appendElement) {
+    out += brackets[0];
+    const auto begin = out.size();
+    for (const auto& element : elements) {
+        if (out.size() > begin)
+            out += ", ";
+        appendElement(element);
+    }
+    out += brackets[1];
+}
+
+struct Appender {
+    std::string& out;
+
+    void operator()(bool value) const { out += value ? "true" : "false"; }
+    void operator()(std::int64_t value) const { appendNumber(out, value); }
+    void operator()(std::uint64_t value) const { appendNumber(out, value); }
+    void operator()(double value) const {
+        if (std::isfinite(value))
+            appendNumber(out, value);
+        else
+            out += "null";
+    }
+    void operator()(const std::string& value) const { appendString(out, value); }
+    void operator()(const ost::OSTDate& value) const { (*this)(value.secondsSince1970); }
+    void operator()(const ost::OSTData& value) const {
+        out += '"';
+        for (const char byte : value.bytes)
+            appendHex(out, static_cast<unsigned char>(byte));
+        out += '"';
+    }
+    void operator()(const std::shared_ptr<const ost::OSTArray>& value) const {
+        appendList(out, "[]", *value, [&](const auto& element) { appendValue(out, element); });
+    }
+    void operator()(const std::shared_ptr<const ost::OSTDictionary>& value) const {
+        appendList(out, "{}", *value, [&](const auto& entry) {
+            appendString(out, entry.first);
+            out += ": ";
+            appendValue(out, entry.second);
+        });
+    }
+};
+
+void appendValue(std::string& out, const ost::OSTValue& value) { std::visit(Appender{out}, value.variant()); }
+
+std::string_view nameOf(Error::Kind kind) {
+    switch (kind) {
+    case Error::Kind::refused:
+        return "refused";
+    case Error::Kind::failed:
+        return "failed";
+    case Error::Kind::transport:
+        break;
+    }
+    return "transport";
+}
+
+Failure makeFailure(int exitStatus, std::string_view kind, std::uint64_t code, std::string message) {
+    ost::OSTDictionary details;
+    details.set("kind", std::string(kind));
+    if (code != 0)
+        details.set("code", code);
+    details.set("message", message);
+    ost::OSTDictionary json;
+    json.set("error", std::move(details));
+    return {exitStatus, std::move(message), std::move(json)};
+}
+
+} // namespace
+
+Failure Failure::usage(std::string message) { return makeFailure(usageStatus, "usage", 0, std::move(message)); }
+
+Failure Failure::of(const Error& error) {
+    return makeFailure(EXIT_FAILURE, nameOf(error.kind), error.code, error.description());
+}
+
+Failure Failure::local(std::string message) { return makeFailure(EXIT_FAILURE, "local", 0, std::move(message)); }
+
+Failure Failure::system(std::string_view doing, int errnoValue) {
+    return makeFailure(EXIT_FAILURE, "local", static_cast<std::uint64_t>(errnoValue),
+                       escaped(doing) + ": " + std::strerror(errnoValue));
+}
+
+std::string escaped(std::string_view text) {
+    std::string out;
+    ost::platform::appendEscaped(out, text);
+    return out;
+}
+
+std::string jsonText(const ost::OSTValue& value) {
+    std::string out;
+    appendValue(out, value);
+    return out;
+}
+
+} // namespace ostrand::ctl

@@ -1,0 +1,307 @@
+#include "codesigning/OSTCodeSigningMapping.h"
+
+#include "model/OSTDictionaryFile.h"
+#include "model/OSTFailureReport.h"
+#include "model/OSTGlobalConfiguration.h"
+#include "platform/Assert.h"
+#include "platform/Log.h"
+#include "platform/Path.h"
+#include "store/OSTContainerCache.h"
+#include "store/OSTLocks.h"
+
+#include <algorithm>
+#include <cerrno>
+
+namespace ost {
+
+namespace {
+
+constexpr const char* applicationGroupsKey = "com.tamarok.security.application-groups";
+constexpr const char* systemGroupsKey = "com.tamarok.security.system-groups";
+constexpr const char* systemGroupContainersKey = "com.tamarok.security.system-group-containers";
+constexpr const char* systemContainerKey = "com.tamarok.security.system-container";
+constexpr std::string_view systemGroupPrefix = "systemgroup.";
+
+/// Where older releases cached code-signing information: in the info values of a bundle container.
+constexpr const char* cachedInfoKey = "com.tamarok.Tessaly.CachedCodeSigningInfo";
+constexpr const char* cachedEntitlementsKey = "Entitlements";
+
+/// What a mapping that is unavailable gives for a result.
+constexpr OSTErrorCode noResult{0};
+
+} // namespace
+
+OSTCodeSigningMapping& OSTCodeSigningMapping::sharedInstance() {
+    // Never destroyed: workers may still ask while the process ends.
+    static OSTCodeSigningMapping& mapping = *new OSTCodeSigningMapping;
+    return mapping;
+}
+
+OSTCodeSigningMapping::OSTCodeSigningMapping() {
+    auto entries = _readCodeSigningMappingFromDisk();
+    _available = entries.has_value();
+    if (entries)
+        _codeSigningMappingDict = *std::move(entries);
+    else
+        platform::logError("Unable to read mapping file from disk.  This is bad");
+}
+
+// The public operations
+
+bool OSTCodeSigningMapping::codeSigningInfoExistForIdentifier(std::string_view identifier) {
+    return _codeSignQueue.sync(
+        [&] { return _onQueue_codeSigningInfoForIdentifier(identifier, Request::internal) != nullptr; });
+}
+
+bool OSTCodeSigningMapping::identifierHasCallerRegisteredEntitlements(std::string_view identifier) {
+    return _codeSignQueue.sync([&] {
+        const auto entry = _entry(identifier);
+        return entry && entry->registeredByCaller;
+    });
+}
+
+bool OSTCodeSigningMapping::identifierHasSystemContainer(std::string_view identifier) {
+    return _codeSignQueue.sync([&] {
+        const auto entry = _onQueue_codeSigningInfoForIdentifier(identifier, Request::internal);
+        const auto* const entitlements = entry ? entry->entitlements() : nullptr;
+        const auto* const value = entitlements ? entitlements->find(systemContainerKey) : nullptr;
+        return value && value->truthValue();
+    });
+}
+
+std::uint64_t OSTCodeSigningMapping::dataContainerTypeForIdentifier(std::string_view identifier) {
+    return _codeSignQueue.sync([&] {
+        const auto entry = _entry(identifier);
+        return entry ? entry->dataContainerClass : 0;
+    });
+}
+
+std::optional<std::vector<std::string>>
+OSTCodeSigningMapping::appGroupIdentifiersForIdentifier(std::string_view identifier) {
+    return _codeSignQueue.sync([&] { return _onQueue_appGroupIdentifiersForIdentifier(identifier); });
+}
+
+std::optional<std::vector<std::string>>
+OSTCodeSigningMapping::systemGroupIdentifiersForIdentifier(std::string_view identifier) {
+    return _codeSignQueue.sync([&] { return _onQueue_systemGroupIdentifiersForIdentifier(identifier); });
+}
+
+std::shared_ptr<const OSTDictionary>
+OSTCodeSigningMapping::getCodeSigningInfoForIdentifier(std::string_view identifier) {
+    const OSTAllIdentifiersLock lock(OSTLockKind::writing);
+    return _codeSignQueue.sync([&]() -> std::shared_ptr<const OSTDictionary> {
+        const auto entry = _onQueue_codeSigningInfoForIdentifier(identifier, Request::external);
+        return entry ? entry->codeSigningInfo : nullptr;
+    });
+}
+
+OSTErrorCode OSTCodeSigningMapping::processCodeSigningInfo(std::shared_ptr<const OSTDictionary> info,
+                                                           std::optional<std::string_view> identifier,
+                                                           const OSTRegistrationOptions& options) {
+    if (!_available)
+        return noResult;
+    if (!identifier)
+        return OSTErrorCode::noIdentifier;
+    const OSTAllIdentifiersLock lock(OSTLockKind::writing);
+    const auto result = OSTGuarded([&] {
+        return _codeSignQueue.sync(
+            [&] { return _onQueue_processCodeSigningInfo(std::move(info), *identifier, options); });
+    });
+    return result ? OSTErrorCode::success : result.error().code();
+}
+
+OSTErrorCode
+OSTCodeSigningMapping::processCallerRegisteredEntitlements(std::shared_ptr<const OSTDictionary> entitlements,
+                                                           std::optional<std::string_view> identifier) {
+    OSTDictionary info;
+    info.set(OSTEntitlementsKey, std::move(entitlements));
+    return processCodeSigningInfo(std::make_shared<const OSTDictionary>(std::move(info)), identifier,
+                                  {.registeredByCaller = true});
+}
+
+// On the queue
+
+OSTCodeSigningMapping::EntryRecord OSTCodeSigningMapping::_entry(std::string_view identifier) const {
+    OST_ASSERT(_codeSignQueue.isCurrent());
+    const auto found = _codeSigningMappingDict.find(identifier);
+    return found == _codeSigningMappingDict.end() ? nullptr : found->second;
+}
+
+OSTCodeSigningMapping::EntryRecord
+OSTCodeSigningMapping::_onQueue_codeSigningInfoForIdentifier(std::string_view identifier, Request request) {
+    if (!_available)
+        return nullptr;
+    auto entry = _entry(identifier);
+    if (entry && request == Request::external && (entry->placeholder || entry->invalid))
+        return nullptr;
+    if (!entry)
+        entry = _migrateFromBundleContainer(identifier);
+    return entry && entry->codeSigningInfo ? entry : nullptr;
+}
+
+OSTCodeSigningMapping::EntryRecord OSTCodeSigningMapping::_migrateFromBundleContainer(std::string_view identifier) {
+    const auto bundle = OSTContainerCache::sharedInstance().containerForUser(
+        OSTInstallerUserId, OSTContainerClass::bundleApplication, identifier, false);
+    const auto* const cached = bundle && (*bundle)->info ? (*bundle)->info->find(cachedInfoKey) : nullptr;
+    if (!cached || !cached->asDictionary())
+        return nullptr;
+    platform::logNotice("Migrating code signing info from bundle container upon request for %@", (*bundle)->identifier);
+    OSTDictionary info = *cached->asDictionary();
+    if (const auto* const entitlements = info.find(cachedEntitlementsKey))
+        info.set(OSTEntitlementsKey, OSTValue(*entitlements));
+    auto entry = std::make_shared<const OSTCodeSigningEntry>(
+        OSTCodeSigningEntry{.codeSigningInfo = std::make_shared<const OSTDictionary>(std::move(info)),
+                            .dataContainerClass = static_cast<std::uint64_t>(OSTContainerClass::dataApplication)});
+    _codeSigningMappingDict.insert_or_assign((*bundle)->identifier, entry);
+    if (const auto written = _writeCodeSigningMappingToDisk(); !written)
+        platform::logError(
+            "Failed to write code signing mapping to disk during current identifier migration of %@: %@",
+            (*bundle)->identifier, written.error());
+    return entry;
+}
+
+OSTCodeSigningMapping::GroupList
+OSTCodeSigningMapping::_onQueue_appGroupIdentifiersForIdentifier(std::string_view identifier) {
+    const auto entry = _onQueue_codeSigningInfoForIdentifier(identifier, Request::internal);
+    return _copyApplicationGroupEntitlementForIdentifier(identifier, entry ? entry->entitlements() : nullptr,
+                                                         applicationGroupsKey);
+}
+
+OSTCodeSigningMapping::GroupList
+OSTCodeSigningMapping::_onQueue_systemGroupIdentifiersForIdentifier(std::string_view identifier) {
+    const auto entry = _onQueue_codeSigningInfoForIdentifier(identifier, Request::internal);
+    const auto* const entitlements = entry ? entry->entitlements() : nullptr;
+    auto groups = _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements, systemGroupsKey);
+    if (!groups || groups->empty())
+        groups = _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements, systemGroupContainersKey);
+    if (groups)
+        std::erase_if(*groups, [](const std::string& group) {
+            if (group.starts_with(systemGroupPrefix))
+                return false;
+            platform::logAs(platform::LogLevel::error, "_onQueue_systemGroupIdentifiersForIdentifier",
+                            "System group ID %@ does not have proper prefix, ignoring.", group);
+            return true;
+        });
+    return groups;
+}
+
+OSTCodeSigningMapping::GroupList OSTCodeSigningMapping::_copyApplicationGroupEntitlementForIdentifier(
+    std::string_view identifier, const OSTDictionary* entitlements, const char* groupKey) {
+    const auto* const value = entitlements ? entitlements->find(groupKey) : nullptr;
+    if (!value)
+        return std::nullopt;
+    if (const auto* const group = value->asString())
+        return std::vector<std::string>{*group};
+    const auto* const array = value->asArray();
+    if (!array) {
+        platform::logError("Entitlement %@ for %@ does not contain supported types; ignoring.", groupKey, identifier);
+        return std::nullopt;
+    }
+    std::vector<std::string> groups;
+    groups.reserve(array->size());
+    for (const auto& element : *array) {
+        const auto* const group = element.asString();
+        if (!group) {
+            platform::logError("Entitlement %@ for %@ contains non-string values; ignoring.", groupKey, identifier);
+            return std::nullopt;
+        }
+        groups.push_back(*group);
+    }
+    std::ranges::sort(groups);
+    const auto repeated = std::ranges::unique(groups);
+    groups.erase(repeated.begin(), repeated.end());
+    return groups;
+}
+
+OSTResult<void> OSTCodeSigningMapping::_onQueue_processCodeSigningInfo(std::shared_ptr<const OSTDictionary> info,
+                                                                       std::string_view identifier,
+                                                                       const OSTRegistrationOptions& options) {
+    const auto stored = _entry(identifier);
+    OSTCodeSigningEntry entry{.codeSigningInfo = std::move(info),
+                              .placeholder = options.placeholder,
+                              .registeredByCaller = options.registeredByCaller,
+                              .dataContainerClass = options.dataContainerClass};
+    if (stored && stored->childBundleIdentifiers) {
+        entry.childBundleIdentifiers = stored->childBundleIdentifiers;
+        std::erase_if(*entry.childBundleIdentifiers, [&](const std::string& child) { return !_entry(child); });
+    }
+    if (stored && *stored == entry)
+        return {};
+    return _setCodeSigningDictionaryValues({std::make_shared<const OSTCodeSigningEntry>(std::move(entry))},
+                                           {std::string(identifier)});
+}
+
+// The file
+
+std::string OSTCodeSigningMapping::_mappingFileURL() {
+    return platform::pathByAppending(OSTGlobalConfiguration::sharedInstance().libraryDirectory(),
+                                     "ost_code_signing_info.plist");
+}
+
+OSTResult<OSTCodeSigningMapping::Entries> OSTCodeSigningMapping::_readCodeSigningMappingFromDisk() {
+    const auto url = _mappingFileURL();
+    const auto dictionary = OST_dictionaryWithContentsOfURL(url, OSTLargeDictionaryFileSize);
+    if (!dictionary) {
+        if (dictionary.error().isPOSIX(ENOENT)) {
+            platform::logNotice("No code signing info file found.  We will create one now");
+            return Entries();
+        }
+        platform::logError("Failed to read code signing mapping file at %@ : %@", url, dictionary.error());
+        return std::unexpected(dictionary.error());
+    }
+    Entries entries;
+    for (const auto& [identifier, value] : *dictionary) {
+        if (const auto* const serialized = value.asDictionary())
+            entries.emplace_hint(entries.end(), identifier,
+                                 std::make_shared<const OSTCodeSigningEntry>(
+                                     OSTCodeSigningEntry::withSerializedDictionary(*serialized)));
+        else
+            platform::logError("Skipping the code signing info of %@, which is no dictionary", identifier);
+    }
+    return entries;
+}
+
+OSTResult<void> OSTCodeSigningMapping::_writeCodeSigningMappingToDisk() {
+    std::vector<OSTDictionary::Entry> serialized;
+    serialized.reserve(_codeSigningMappingDict.size());
+    for (const auto& [identifier, entry] : _codeSigningMappingDict)
+        serialized.emplace_back(identifier, entry->serialize());
+    const OSTDictionary dictionary(std::move(serialized));
+    const auto url = _mappingFileURL();
+    const auto written = OST_writeToURL(dictionary, url, OSTLargeDictionaryFileSize);
+    if (!written)
+        return std::unexpected(OSTCreateError(OSTErrorCode::mappingWriteFailed, written.error(),
+                                              "Failed to write entitlement mapping file at %@ : %@", url, dictionary));
+    return {};
+}
+
+OSTResult<void> OSTCodeSigningMapping::_setCodeSigningDictionaryValues(const std::vector<EntryRecord>& entries,
+                                                                       const std::vector<std::string>& identifiers) {
+    if (entries.size() != identifiers.size())
+        return std::unexpected(OSTCreateError(OSTErrorCode::countsDiffer,
+                                              "Can't act on an invalid input: values count: %ld, IDs count: %ld",
+                                              entries.size(), identifiers.size()));
+    bool changed = false;
+    for (std::size_t i = 0; i < entries.size(); ++i) {
+        const EntryRecord entry = entries[i] && entries[i]->codeSigningInfo ? entries[i] : nullptr;
+        const auto stored = _entry(identifiers[i]);
+        if ((!entry && !stored) || (entry && stored && *entry == *stored))
+            continue;
+        if (entry)
+            _codeSigningMappingDict.insert_or_assign(identifiers[i], entry);
+        else
+            _codeSigningMappingDict.erase(identifiers[i]);
+        platform::logDebug("Staging Code Signing Mapping for ID: %@ : %@", identifiers[i], entry);
+        changed = true;
+    }
+    if (!changed)
+        return {};
+    const auto written = _writeCodeSigningMappingToDisk();
+    if (!written)
+        platform::logError("Error writing code signing mappings to disk after set : %@", written.error());
+    else
+        platform::logDebug("Wrote code signing mappings to disk after set");
+    return written;
+}
+
+} // namespace ost

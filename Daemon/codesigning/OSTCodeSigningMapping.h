@@ -1,0 +1,94 @@
+#pragma once
+
+#include "codesigning/OSTCodeSigningEntry.h"
+#include "model/OSTError.h"
+#include "platform/OSTValue.h"
+#include "platform/WorkQueue.h"
+
+#include <cstdint>
+#include <map>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+namespace ost {
+
+/// How an identifier is registered.
+struct OSTRegistrationOptions {
+    std::uint64_t dataContainerClass = 0;
+    bool registeredByCaller = false;
+    bool placeholder = false;
+};
+
+/// What every identifier is entitled to: one entry for each that the installer or a client registered.
+///
+/// The shared instance reads the mapping file when it is first used; from then on memory is the authority and the file is only
+/// written: whole, atomically, and durable before the change is answered. A file that cannot be read is never overwritten:
+/// the mapping is then unavailable, every query answers as for an unknown identifier, and nothing is processed.
+///
+/// Threads: any. All work runs on one serial queue. Operations that may change entries take the all-identifiers write lock
+/// first; the order is always the lock, then the queue.
+/// On disk: "ost_code_signing_info.plist" in the library directory, a dictionary from identifier to serialized entry.
+class OSTCodeSigningMapping {
+public:
+    static OSTCodeSigningMapping& sharedInstance();
+
+    /// Whether the identifier has code-signing information, an invalid or placeholder one included.
+    [[nodiscard]] bool codeSigningInfoExistForIdentifier(std::string_view identifier);
+    [[nodiscard]] bool identifierHasCallerRegisteredEntitlements(std::string_view identifier);
+    [[nodiscard]] bool identifierHasSystemContainer(std::string_view identifier);
+    /// The class of the identifier's data container, 0 when none is known.
+    [[nodiscard]] std::uint64_t dataContainerTypeForIdentifier(std::string_view identifier);
+    /// The identifier's groups, each once; none when there are none or the entitlement is malformed, which is logged.
+    [[nodiscard]] std::optional<std::vector<std::string>> appGroupIdentifiersForIdentifier(std::string_view identifier);
+    [[nodiscard]] std::optional<std::vector<std::string>> systemGroupIdentifiersForIdentifier(std::string_view identifier);
+    /// The identifier's code-signing information as a request from outside sees it.
+    [[nodiscard]] std::shared_ptr<const OSTDictionary> getCodeSigningInfoForIdentifier(std::string_view identifier);
+
+    /// Registers code-signing information, or with none removes the identifier. Gives `success`, `noIdentifier`,
+    /// `mappingWriteFailed` (memory keeps the change), `exceptionCaught`, or 0 when the mapping is unavailable.
+    [[nodiscard]] OSTErrorCode processCodeSigningInfo(std::shared_ptr<const OSTDictionary> info,
+                                                      std::optional<std::string_view> identifier,
+                                                      const OSTRegistrationOptions& options);
+    /// Registers the entitlements that a client carries. Codes as above.
+    [[nodiscard]] OSTErrorCode processCallerRegisteredEntitlements(std::shared_ptr<const OSTDictionary> entitlements,
+                                                                   std::optional<std::string_view> identifier);
+
+private:
+    using EntryRecord = std::shared_ptr<const OSTCodeSigningEntry>;
+    using Entries = std::map<std::string, EntryRecord, std::less<>>;
+    using GroupList = std::optional<std::vector<std::string>>;
+    enum class Request : bool { internal, external };
+
+    OSTCodeSigningMapping();
+
+    [[nodiscard]] static std::string _mappingFileURL();
+    [[nodiscard]] static OSTResult<Entries> _readCodeSigningMappingFromDisk();
+    [[nodiscard]] OSTResult<void> _writeCodeSigningMappingToDisk();
+    /// Stores entries under identifiers, matched by index, and writes the mapping if that changed anything. An entry that is
+    /// null or has no information removes its identifier. Fails with `countsDiffer` or `mappingWriteFailed`.
+    [[nodiscard]] OSTResult<void> _setCodeSigningDictionaryValues(const std::vector<EntryRecord>& entries,
+                                                                  const std::vector<std::string>& identifiers);
+    [[nodiscard]] static GroupList _copyApplicationGroupEntitlementForIdentifier(std::string_view identifier,
+                                                                                 const OSTDictionary* entitlements,
+                                                                                 const char* groupKey);
+
+    // On the queue only
+    [[nodiscard]] EntryRecord _entry(std::string_view identifier) const;
+    [[nodiscard]] EntryRecord _onQueue_codeSigningInfoForIdentifier(std::string_view identifier, Request request);
+    [[nodiscard]] EntryRecord _migrateFromBundleContainer(std::string_view identifier);
+    [[nodiscard]] GroupList _onQueue_appGroupIdentifiersForIdentifier(std::string_view identifier);
+    [[nodiscard]] GroupList _onQueue_systemGroupIdentifiersForIdentifier(std::string_view identifier);
+    [[nodiscard]] OSTResult<void> _onQueue_processCodeSigningInfo(std::shared_ptr<const OSTDictionary> info,
+                                                                  std::string_view identifier,
+                                                                  const OSTRegistrationOptions& options);
+
+    platform::WorkQueue _codeSignQueue{"com.tamarok.Ostrand.EntitlementQueue"};
+    bool _available; ///< constant after construction
+    // On the queue only.
+    Entries _codeSigningMappingDict;
+};
+
+} // namespace ost

@@ -1,0 +1,38 @@
+#include "model/OSTDictionaryFile.h"
+
+#include "platform/PropertyList.h"
+#include "store/OSTFileManager.h"
+
+#include <cerrno>
+
+namespace ost {
+
+OSTResult<OSTDictionary> OST_dictionaryWithContents(std::string_view bytes, std::string_view path) {
+    const auto value = platform::parsePropertyList(bytes);
+    if (!value)
+        return std::unexpected(OSTCreatePropertyListError("%@ is no property list: %@", path, value.error()));
+    const OSTDictionary* const dictionary = value->asDictionary();
+    if (!dictionary)
+        return std::unexpected(OSTCreatePropertyListError("The property list at %@ is no dictionary", path));
+    return *dictionary;
+}
+
+OSTResult<OSTDictionary> OST_dictionaryWithContentsOfURL(std::string_view path, std::size_t maximumSize) {
+    const std::string bytes = OST_TRY(OSTFileManager::defaultManager().readFileAtURL(path, maximumSize));
+    return OST_dictionaryWithContents(bytes, path);
+}
+
+OSTResult<std::string> OST_contentsOfDictionary(const OSTDictionary& dictionary, std::string_view path,
+                                                std::size_t maximumSize) {
+    std::string bytes = platform::serializeBinaryPropertyList(dictionary);
+    if (bytes.size() > maximumSize)
+        return std::unexpected(OSTCreatePOSIXError(EFBIG, "%@ would hold %llu bytes", path, bytes.size()));
+    return bytes;
+}
+
+OSTResult<void> OST_writeToURL(const OSTDictionary& dictionary, std::string_view path, std::size_t maximumSize) {
+    const std::string bytes = OST_TRY(OST_contentsOfDictionary(dictionary, path, maximumSize));
+    return OSTFileManager::defaultManager().writeFileAtomicallyAtURL(path, bytes);
+}
+
+} // namespace ost

@@ -1,0 +1,141 @@
+#include "model/OSTGlobalConfiguration.h"
+
+#include "model/OSTMadeDirectory.h"
+#include "platform/Log.h"
+#include "platform/Path.h"
+
+#include <climits>
+#include <cstdlib>
+
+namespace ost {
+
+using platform::pathByAppending;
+
+namespace {
+
+constexpr OSTDirectoryAttributes withIntermediates{.withIntermediateDirectories = true, .mode = 0755};
+constexpr OSTDirectoryAttributes unprotected{
+    .withIntermediateDirectories = true, .mode = 0755, .protectionClass = OSTNoProtectionClass};
+
+/// `path` without symbolic links, or `path` itself when it does not exist yet.
+std::string canonical(const char* path) {
+    char buffer[PATH_MAX];
+    return ::realpath(path, buffer) ? buffer : path;
+}
+
+} // namespace
+
+OSTGlobalConfiguration& OSTGlobalConfiguration::sharedInstance() {
+    // Never destroyed: the process may end while somebody asks for a path.
+    static OSTGlobalConfiguration& instance = *new OSTGlobalConfiguration;
+    return instance;
+}
+
+OSTGlobalConfiguration::OSTGlobalConfiguration()
+    : _homeDirectory(canonical("/private/var/root")), _tessalydHomeDirectory(canonical("/private/var/tessalyd")),
+      _sharedContainersDirectory(pathByAppending(canonical("/private/var"), "containers")) {}
+
+std::string OSTGlobalConfiguration::sharedContainersDirectory() {
+    const std::lock_guard lock(_mutex);
+    return OSTMadeDirectory(_sharedContainersDirectory, withIntermediates,
+                            "Failed to create shared container dir at \"%@\": %@");
+}
+
+std::string OSTGlobalConfiguration::logDirectory() {
+    return OSTMadeDirectory(pathByAppending(_homeDirectory, "Library/Logs/Ostrand"), unprotected,
+                            "Failed to create log directory at \"%@\": %@");
+}
+
+std::string OSTGlobalConfiguration::cachesDirectory() {
+    const std::lock_guard lock(_mutex);
+    return OSTMadeDirectory(pathByAppending(_homeDirectory, "Library/Caches/com.tamarok.ostrandd"), unprotected,
+                            "Failed to create cache dir at \"%@\": %@");
+}
+
+std::string OSTGlobalConfiguration::libraryDirectory() {
+    const std::lock_guard lock(_mutex);
+    return OSTMadeDirectory(pathByAppending(_homeDirectory, "Library/Ostrand"), unprotected,
+                            "Failed to create library dir at \"%@\": %@");
+}
+
+std::string OSTGlobalConfiguration::transientDirectory() {
+    const std::lock_guard lock(_mutex);
+    return OSTMadeDirectory(pathByAppending(cachesDirectory(), "Temp"), withIntermediates,
+                            "Failed to create transient dir at \"%@\": %@");
+}
+
+std::string OSTGlobalConfiguration::stagingDirectory() {
+    const std::lock_guard lock(_mutex);
+    return OSTMadeDirectory(pathByAppending(cachesDirectory(), "Staging"), withIntermediates,
+                            "Failed to create staging dir at \"%@\": %@");
+}
+
+std::string OSTGlobalConfiguration::deathrowDirectory() {
+    const std::lock_guard lock(_mutex);
+    return OSTMadeDirectory(pathByAppending(cachesDirectory(), "Dead"), withIntermediates,
+                            "Failed to create deathrow dir at \"%@\": %@");
+}
+
+std::string OSTGlobalConfiguration::replaceDirectory() {
+    const std::lock_guard lock(_mutex);
+    return OSTMadeDirectory(pathByAppending(libraryDirectory(), "Replace"), withIntermediates,
+                            "Failed to create replace dir at \"%@\": %@");
+}
+
+std::string OSTGlobalConfiguration::bundleDirectory() {
+    const std::lock_guard lock(_mutex);
+    return OSTMadeDirectory(pathByAppending(sharedContainersDirectory(), "Bundle"), withIntermediates,
+                            "Failed to create bundle dir at \"%@\": %@");
+}
+
+std::string OSTGlobalConfiguration::transientBundleDirectory() {
+    const std::lock_guard lock(_mutex);
+    std::string path = _tessalydHomeDirectory;
+    for (const auto component : {"Library", "Caches", "com.tamarok.ostrandd"})
+        path = OSTMadeDirectory(pathByAppending(path, component), {.mode = 0755, .owner = OSTInstallerUserId},
+                                "Failed to create transient bundle dir at \"%@\": %@");
+    return path;
+}
+
+OSTPerUserConfiguration* OSTGlobalConfiguration::getPerUserConfigurationForUserId(std::uint32_t userId) {
+    const std::lock_guard lock(_mutex);
+    auto found = _perUserConfigurations.find(userId);
+    if (found == _perUserConfigurations.end()) {
+        auto configuration = OSTPerUserConfiguration::withUserId(userId);
+        if (!configuration)
+            return nullptr;
+        found = _perUserConfigurations.emplace(userId, std::move(configuration)).first;
+    }
+    return found->second.get();
+}
+
+std::optional<std::string> OSTGlobalConfiguration::containerDirectoryURLForUser(std::uint32_t userId,
+                                                                                OSTContainerClass contentClass,
+                                                                                bool transient) {
+    const std::lock_guard lock(_mutex);
+    std::string base;
+    std::uint32_t owner = OSTRootUserId;
+    if (isSystemClass(contentClass)) {
+        base = transient ? transientDirectory() : sharedContainersDirectory();
+    } else if (isBundleClass(contentClass)) {
+        base = transient ? transientBundleDirectory() : sharedContainersDirectory();
+        owner = OSTInstallerUserId;
+    } else {
+        auto* const configuration = getPerUserConfigurationForUserId(userId);
+        return configuration ? configuration->containerDirectoryURLForContentClass(contentClass, transient) : std::nullopt;
+    }
+    return OSTMadeDirectory(pathByAppending(base, pathComponentForContainerClass(contentClass)),
+                            {.withIntermediateDirectories = true, .mode = 0755, .owner = owner},
+                            "Failed to create container dir at \"%@\": %@");
+}
+
+const std::array<std::string_view, 4>& OSTGlobalConfiguration::appUserDataItemNames() {
+    static constexpr std::array<std::string_view, 4> names = {"Documents", "Library", "tmp", "Quibbet"};
+    return names;
+}
+
+bool OSTGlobalConfiguration::migrationFileExistsWithName(std::string_view name) {
+    return OSTFileManager::defaultManager().itemExistsAtURL(pathByAppending(libraryDirectory(), name));
+}
+
+} // namespace ost

@@ -1,0 +1,68 @@
+#pragma once
+
+#include "model/OSTContainerClass.h"
+#include "model/OSTPerUserConfiguration.h"
+
+#include <array>
+#include <cstdint>
+#include <map>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <string_view>
+
+namespace ost {
+
+/// Names every directory that all users share and makes each at every access, so one that was removed reappears at its next
+/// use. All other code asks here and never builds a root of the layout itself. No accessor fails: what cannot be made is
+/// logged, and the operation that then uses the directory fails.
+///
+/// Threads: any. One shared instance for the life of the process.
+class OSTGlobalConfiguration {
+public:
+    static OSTGlobalConfiguration& sharedInstance();
+
+    /// Holds every class directory of the bundle and system classes.
+    [[nodiscard]] std::string sharedContainersDirectory();
+    [[nodiscard]] std::string logDirectory();
+    [[nodiscard]] std::string cachesDirectory();
+    [[nodiscard]] std::string libraryDirectory();
+    /// Transient containers of the system classes.
+    [[nodiscard]] std::string transientDirectory();
+    /// Containers that are being built, or put aside during a replacement.
+    [[nodiscard]] std::string stagingDirectory();
+    /// What waits to be destroyed.
+    [[nodiscard]] std::string deathrowDirectory();
+    [[nodiscard]] std::string replaceDirectory();
+    [[nodiscard]] std::string bundleDirectory();
+    /// Transient containers of the bundle classes, inside the installer's home.
+    [[nodiscard]] std::string transientBundleDirectory();
+
+    /// The directories of one real user; null for a user id of 500 or less.
+    [[nodiscard]] OSTPerUserConfiguration* getPerUserConfigurationForUserId(std::uint32_t userId);
+
+    /// The directory that holds all containers of the class for the user; none when there is no such directory.
+    [[nodiscard]] std::optional<std::string> containerDirectoryURLForUser(std::uint32_t userId,
+                                                                          OSTContainerClass contentClass, bool transient);
+
+    /// The items at the top of an application's data container that belong to the user's data.
+    [[nodiscard]] static const std::array<std::string_view, 4>& appUserDataItemNames();
+
+    /// Whether an item of that name exists directly in `libraryDirectory`.
+    [[nodiscard]] bool migrationFileExistsWithName(std::string_view name);
+
+private:
+    OSTGlobalConfiguration();
+
+    // Constant after construction. Roots of the layout are made canonical here, once; no path below them may pass a link.
+    const std::string _homeDirectory;
+    const std::string _tessalydHomeDirectory;
+    const std::string _sharedContainersDirectory;
+
+    // Serialises the accessors and guards the dictionary. Recursive: directories lie inside each other.
+    std::recursive_mutex _mutex;
+    std::map<std::uint32_t, std::unique_ptr<OSTPerUserConfiguration>> _perUserConfigurations;
+};
+
+} // namespace ost

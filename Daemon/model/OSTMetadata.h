@@ -1,0 +1,74 @@
+#pragma once
+
+#include "model/OSTContainerClass.h"
+#include "model/OSTError.h"
+#include "platform/OSTValue.h"
+#include "platform/UUID.h"
+#include "store/OSTFileManager.h"
+
+#include <atomic>
+#include <cstdint>
+#include <memory>
+#include <string>
+#include <string_view>
+
+namespace ost {
+
+/// The file directly inside every container directory that says what the container is.
+inline constexpr std::string_view OSTMetadataFileName = ".com.tamarok.ostrand.metadata.plist";
+
+/// Whether reading a metadata file also checks that the container lies in the directory of its class.
+enum class OSTCheckClassPath : bool { no, yes };
+
+/// What is known of one container.
+///
+/// A value type. Records that are shared (`OSTMetadataRecord`) never change; whoever has to change one makes a copy.
+///
+/// On disk: a binary property list with "OSTMetadataIdentifier", "OSTMetadataUUID" (canonical text), "OSTMetadataContentClass",
+/// "OSTMetadataPersona" (the user id) and, when there is info, "OSTMetadataInfo". Old files lack the user id.
+struct OSTMetadata {
+    std::uint32_t uid = 0;
+    platform::UUID uuid = {}; ///< the internal UUID, which is not the directory's name
+    OSTContainerClass containerClass = OSTContainerClass::undefined;
+    std::string identifier = {};
+    std::shared_ptr<const OSTDictionary> info = nullptr; ///< null when there is none
+    std::string url = {};                      ///< path of the container directory
+    bool transient = false;                    ///< lies in a transient directory; not in the file
+    bool existed = false;                      ///< was found, not made, by the look-up that gave this record; not in the file
+    /// True while the rename that put the container in place may still be lost in a power cut; null for one read from disk.
+    std::shared_ptr<std::atomic<bool>> pendingPlacement = nullptr;
+
+    /// Reads the metadata file of the container at `url` and validates it for the user.
+    /// Fails with `metadataUnreadable` or `metadataInvalid`, logged.
+    [[nodiscard]] static OSTResult<OSTMetadata> readAndValidateMetadataAtUrl(std::string_view url, std::uint32_t userId,
+                                                                             OSTCheckClassPath checkClassPath);
+
+    /// The second half of the above, for a caller that has the file's bytes: `contents` is what was read, or why it was not.
+    [[nodiscard]] static OSTResult<OSTMetadata> readAndValidateMetadataAtUrl(const OSTResult<std::string_view>& contents,
+                                                                 std::string_view url, std::uint32_t userId,
+                                                                 OSTCheckClassPath checkClassPath);
+
+    /// The dictionary that the file holds.
+    [[nodiscard]] OSTDictionary dictionary() const;
+
+    /// Writes the metadata file at `url`, atomically; durable when this returns. Fails with `dictionaryWriteFailed`, logged.
+    [[nodiscard]] OSTResult<void> writeMetadataToDisk() const;
+
+    /// The same for a directory that nobody else can see yet; what it returns still has to be made durable.
+    [[nodiscard]] OSTResult<OSTNewFile> writeMetadataToNewDirectory() const;
+    [[nodiscard]] OSTResult<void> makeMetadataDurable(OSTNewFile file) const;
+
+    /// The path of the metadata file.
+    [[nodiscard]] std::string metadataFileURL() const;
+
+    [[nodiscard]] std::string description() const;
+
+private:
+    /// A write's result, its failure as `dictionaryWriteFailed`.
+    template<typename T>
+    [[nodiscard]] OSTResult<T> _written(OSTResult<T> result) const;
+};
+
+using OSTMetadataRecord = std::shared_ptr<const OSTMetadata>;
+
+} // namespace ost

@@ -1,0 +1,53 @@
+#include "model/OSTUserIdentity.h"
+
+#include "platform/Accounts.h"
+#include "platform/Log.h"
+
+#include <optional>
+
+namespace ost {
+
+namespace {
+
+std::optional<std::uint32_t> resolvedUserId(std::uint32_t userId, OSTContainerClass containerClass,
+                                            std::uint32_t clientUserId) {
+    const auto when = [&](bool valid) { return valid ? std::optional(userId) : std::nullopt; };
+    if (isBundleClass(containerClass))
+        return when(userId == OSTInstallerUserId);
+    if (isSystemClass(containerClass))
+        return when(userId == OSTSystemUserId);
+    // A user process acts for itself alone, whatever the class: the store refuses a class that does not exist.
+    if (clientUserId > OSTHighestSystemUserId) {
+        const bool valid = userId == clientUserId || userId == OSTCurrentUserPlaceholder;
+        return valid ? std::optional(clientUserId) : std::nullopt;
+    }
+    if (userId == OSTCurrentUserPlaceholder)
+        return getCurrentMobileUserId();
+    return when(OSTUserIdFitsClass(containerClass, userId));
+}
+
+} // namespace
+
+std::uint32_t getCurrentMobileUserId() {
+    static const std::uint32_t mobileUserId = [] {
+        const auto account = platform::accountForName("mobile");
+        if (!account) {
+            platform::logAs(platform::LogLevel::error, "getCurrentMobileUserId", "Failed to get mobile uid. This is bad");
+            return std::uint32_t{0};
+        }
+        platform::logAs(platform::LogLevel::error, "getCurrentMobileUserId", "Current mobile user ID is %u", account->uid);
+        return std::uint32_t{account->uid};
+    }();
+    return mobileUserId;
+}
+
+std::expected<std::uint32_t, OSTErrorCode> validateUserId(std::uint32_t userId, OSTContainerClass containerClass,
+                                                          std::uint32_t clientUserId, OSTLogging logging) {
+    if (const auto resolved = resolvedUserId(userId, containerClass, clientUserId))
+        return *resolved;
+    if (logging == OSTLogging::logged)
+        platform::logError("Invalid userId %u for class %llu from client %u", userId, containerClass, clientUserId);
+    return std::unexpected(OSTErrorCode::invalidParameter);
+}
+
+} // namespace ost

@@ -1,0 +1,31 @@
+#pragma once
+
+#include <sys/types.h>
+
+#include <expected>
+#include <string>
+#include <string_view>
+
+namespace ost::platform {
+
+/// The users and groups of the device, read from /etc/passwd and /etc/group at each call; a program that is linked
+/// statically has no name service. Lines that are not well-formed do not count, the first of several matching ones
+/// does.
+///
+/// Threads: any. Errors: ENOENT when nobody has the name or number, otherwise the errno of reading the file.
+
+struct Account {
+    std::string name;
+    uid_t uid;
+    gid_t gid;
+    std::string home;
+
+    friend bool operator==(const Account&, const Account&) = default;
+};
+
+[[nodiscard]] std::expected<Account, int> accountForName(std::string_view name);
+[[nodiscard]] std::expected<Account, int> accountForUserId(uid_t uid);
+[[nodiscard]] std::expected<gid_t, int> groupForName(std::string_view name);
+[[nodiscard]] std::expected<std::string, int> groupForId(gid_t gid);
+
+} // namespace ost::platform

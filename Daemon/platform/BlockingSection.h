@@ -1,0 +1,18 @@
+#pragma once
+
+namespace ost::platform {
+
+/// Stands around a wait that may last: for a lock that somebody holds, for a disk. While a thread of a `WorkerPool` is
+/// inside one, the pool lets another thread take its place, so that waiting requests never keep other connections from
+/// being served. On any other thread it does nothing. May be nested; only the outermost one counts.
+///
+/// Entering and leaving cost a mutex, and entering may wake a thread: try a lock first, and enter only if it is taken.
+class BlockingSection {
+public:
+    BlockingSection();
+    ~BlockingSection();
+    BlockingSection(const BlockingSection&) = delete;
+    BlockingSection& operator=(const BlockingSection&) = delete;
+};
+
+} // namespace ost::platform

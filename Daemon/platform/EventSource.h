@@ -1,0 +1,39 @@
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+#include <memory>
+#include <span>
+
+namespace ost::platform {
+
+/// Something that a `WorkerPool` serves: the object behind a watched descriptor.
+///
+/// Threads: the pool calls `serve` from any of its threads, but never twice at the same time for one source; what
+/// happens meanwhile is remembered and served afterwards. Ownership: shared; the pool keeps a watched source until it
+/// is removed.
+class EventSource : public std::enable_shared_from_this<EventSource> {
+public:
+    virtual ~EventSource() = default;
+    EventSource(const EventSource&) = delete;
+    EventSource& operator=(const EventSource&) = delete;
+
+    /// Beside the epoll events: a deadline has passed, or the source asked to be served for a reason of its own.
+    static constexpr std::uint32_t deadlineEvent = 1U << 24;
+    static constexpr std::uint32_t attentionEvent = 1U << 25;
+
+protected:
+    EventSource() = default;
+
+private:
+    friend class WorkerPool;
+
+    /// Serves `events` and returns soon: a source with much to do takes a share and posts itself the rest. `scratch` is
+    /// the thread's own memory, free to use until the function returns.
+    virtual void serve(std::uint32_t events, std::span<char> scratch) = 0;
+
+    static constexpr std::uint32_t _running = 1U << 23;
+    std::atomic<std::uint32_t> _state{0}; ///< events to be served, and _running while they are being served or queued
+};
+
+} // namespace ost::platform

@@ -1,0 +1,37 @@
+#pragma once
+
+#include <unistd.h>
+
+#include <utility>
+
+namespace ost::platform {
+
+/// Owns one open descriptor and closes it. Move-only; an empty one holds -1. Not thread-safe, like the int it wraps.
+class FileDescriptor {
+public:
+    FileDescriptor() noexcept = default;
+    explicit FileDescriptor(int fd) noexcept : _fd(fd) {}
+    FileDescriptor(FileDescriptor&& other) noexcept : _fd(std::exchange(other._fd, -1)) {}
+    FileDescriptor& operator=(FileDescriptor&& other) noexcept {
+        if (this != &other)
+            reset(std::exchange(other._fd, -1));
+        return *this;
+    }
+    FileDescriptor(const FileDescriptor&) = delete;
+    FileDescriptor& operator=(const FileDescriptor&) = delete;
+    ~FileDescriptor() { reset(); }
+
+    [[nodiscard]] int get() const noexcept { return _fd; }
+    [[nodiscard]] explicit operator bool() const noexcept { return _fd >= 0; }
+
+    /// Gives the descriptor up without closing it.
+    [[nodiscard]] int release() noexcept { return std::exchange(_fd, -1); }
+
+    /// Closes the held descriptor, keeping errno, and takes `fd` instead.
+    void reset(int fd = -1) noexcept;
+
+private:
+    int _fd = -1;
+};
+
+} // namespace ost::platform

@@ -1,0 +1,129 @@
+#include "platform/MessageFormat.h"
+
+#include "platform/Assert.h"
+#include <charconv>
+
+namespace ost::platform {
+
+namespace {
+
+/// The length of the valid UTF-8 sequence at the start of `text` that is no control character, or 0.
+std::size_t printableSequence(std::string_view text) {
+    const auto at = [&](std::size_t i) { return static_cast<unsigned char>(text[i]); };
+    const auto first = at(0);
+    if (first < 0x80)
+        return first >= 0x20 && first != 0x7f ? 1 : 0;
+    const std::size_t length = first >= 0xf0 ? 4 : first >= 0xe0 ? 3 : 2;
+    if (first < 0xc2 || first > 0xf4 || text.size() < length)
+        return 0;
+    for (std::size_t i = 1; i < length; ++i)
+        if ((at(i) & 0xc0) != 0x80)
+            return 0;
+    const auto second = at(1);
+    const bool secondControlBlock = first == 0xc2 && second < 0xa0;
+    const bool overlong = (first == 0xe0 && second < 0xa0) || (first == 0xf0 && second < 0x90);
+    const bool outOfRange = (first == 0xed && second >= 0xa0) || (first == 0xf4 && second >= 0x90);
+    return secondControlBlock || overlong || outOfRange ? 0 : length;
+}
+
+void appendNumber(std::string& out, auto value, int base) {
+    char buffer[24];
+    const auto end = std::to_chars(std::begin(buffer), std::end(buffer), value, base).ptr;
+    out.append(buffer, end);
+}
+
+} // namespace
+
+void appendEscaped(std::string& out, std::string_view text) {
+    while (!text.empty()) {
+        std::size_t length = printableSequence(text);
+        if (length > 0) {
+            out.append(text.substr(0, length));
+        } else {
+            constexpr char digits[] = "0123456789abcdef";
+            const auto byte = static_cast<unsigned char>(text[0]);
+            switch (byte) {
+            case '\n': out += "\\n"; break;
+            case '\t': out += "\\t"; break;
+            case '\r': out += "\\r"; break;
+            default:
+                out += "\\x";
+                out += digits[byte >> 4];
+                out += digits[byte & 15];
+            }
+            length = 1;
+        }
+        text.remove_prefix(length);
+    }
+}
+
+MessageArgument::MessageArgument(double value) : _kind(Kind::text), _unsigned(0) {
+    char buffer[32];
+    const auto end = std::to_chars(std::begin(buffer), std::end(buffer), value).ptr;
+    _owned.assign(buffer, end);
+    _text = _owned;
+}
+
+void MessageArgument::appendTo(std::string& out, char conversion) const {
+    const int base = conversion == 'x' || conversion == 'p' ? 16 : 10;
+    switch (_kind) {
+    case Kind::text: appendEscaped(out, _text); break;
+    case Kind::signedNumber: appendNumber(out, _signed, base); break;
+    case Kind::unsignedNumber: appendNumber(out, _unsigned, base); break;
+    case Kind::pointer:
+        out += "0x";
+        appendNumber(out, _unsigned, 16);
+        break;
+    }
+}
+
+std::string formatMessage(std::string_view format, std::initializer_list<const MessageArgument*> arguments) {
+    std::string out;
+    out.reserve(format.size() + 16 * arguments.size());
+    auto argument = arguments.begin();
+    for (std::size_t i = 0; i < format.size(); ++i) {
+        if (format[i] != '%') {
+            out += format[i];
+            continue;
+        }
+        do
+            ++i;
+        while (format[i] == 'l');
+        OST_ASSERT(argument != arguments.end());
+        (*argument++)->appendTo(out, format[i]);
+    }
+    return out;
+}
+
+std::string qualifiedFunctionName(const std::source_location& where) {
+    std::string name = where.function_name();
+    constexpr std::string_view gccAnonymous = "{anonymous}::";
+    constexpr std::string_view clangAnonymous = "(anonymous namespace)::";
+    for (const auto prefix : {gccAnonymous, clangAnonymous, std::string_view("ost::"), std::string_view("platform::")})
+        for (auto at = name.find(prefix); at != std::string::npos; at = name.find(prefix, at))
+            name.erase(at, prefix.size());
+
+    // The arguments begin at the first parenthesis outside template arguments; the result type ends at the last blank
+    // before them. What follows (arguments, qualifiers, lambdas) is no part of the name.
+    int depth = 0;
+    std::size_t begin = 0;
+    for (std::size_t i = 0; i < name.size(); ++i) {
+        const char c = name[i];
+        if (c == '<')
+            ++depth;
+        else if (c == '>')
+            --depth;
+        else if (depth == 0 && c == ' ')
+            begin = i + 1;
+        else if (depth == 0 && c == '(')
+            return name.substr(begin, i - begin);
+    }
+    return name.substr(begin);
+}
+
+std::string_view lastPartOfFunctionName(std::string_view qualifiedName) {
+    const auto at = qualifiedName.rfind("::");
+    return at == std::string_view::npos ? qualifiedName : qualifiedName.substr(at + 2);
+}
+
+} // namespace ost::platform

@@ -1,0 +1,19 @@
+#pragma once
+
+#include <sys/types.h>
+
+#include <expected>
+#include <string>
+
+namespace ost::platform {
+
+/// POSIX semaphores by name, used as markers: they are there until the device reboots. `name` has no slash.
+
+/// Whether the semaphore can be opened.
+[[nodiscard]] bool namedSemaphoreExists(const std::string& name);
+
+/// Makes the semaphore; one that exists stays as it is. Fails with the errno of sem_open.
+[[nodiscard]] std::expected<void, int> createNamedSemaphore(const std::string& name, mode_t mode,
+                                                            unsigned initialValue);
+
+} // namespace ost::platform

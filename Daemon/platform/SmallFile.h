@@ -1,0 +1,16 @@
+#pragma once
+
+#include <cstddef>
+#include <expected>
+#include <string>
+
+namespace ost::platform {
+
+/// Whether a symbolic link may stand in the file's place.
+enum class FinalLink { follow, refuse };
+
+/// Reads a whole regular file of at most `limit` bytes without ever waiting for what stands in its place. Fails with
+/// the errno of opening or reading it, EINVAL when it is not a regular file, EFBIG when it is larger.
+[[nodiscard]] std::expected<std::string, int> readSmallFile(const char* path, std::size_t limit, FinalLink finalLink);
+
+} // namespace ost::platform

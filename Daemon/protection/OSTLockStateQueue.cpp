@@ -1,0 +1,28 @@
+#include "protection/OSTLockStateQueue.h"
+
+#include "platform/DeviceLockState.h"
+#include "platform/Log.h"
+
+namespace ost {
+
+platform::WorkQueue& OSTLockStateQueue() {
+    // Never destroyed: the process may end while work is parked.
+    static platform::WorkQueue& queue = *new platform::WorkQueue("com.tamarok.ostrandd.lockstate");
+    return queue;
+}
+
+void OSTLockStateFollower::brevind_notification_callback() {
+    const auto state = platform::deviceLockState();
+    platform::logDebug("LockState=%d", state);
+    if (state == static_cast<std::int64_t>(State::locked)) {
+        if (_remembered != State::locked)
+            OSTLockStateQueue().suspend();
+        _remembered = State::locked;
+    } else if (state == static_cast<std::int64_t>(State::unlocked)) {
+        if (_remembered == State::locked)
+            OSTLockStateQueue().resume();
+        _remembered = State::unlocked;
+    }
+}
+
+} // namespace ost

@@ -1,0 +1,45 @@
+#include "service/OSTCommandTable.h"
+
+#include "service/OSTContainerCommands.h"
+
+namespace ost {
+
+namespace {
+
+constexpr auto allowed = OSTEntitlementAllowed;
+constexpr auto none = OSTEntitlementNone;
+constexpr auto wipeContainer = OSTEntitlementWipeContainer;
+constexpr auto dataMigration = OSTEntitlementDataMigration;
+
+} // namespace
+
+const std::array<OSTCommandEntry, OSTCommandCount> OSTCommandTable = {{
+    {0, OSTCreateOrLookupCommand, none, OSTReplyBy::dispatcher},
+    {1, OSTListCommand, allowed, OSTReplyBy::dispatcher},
+    {2, nullptr, allowed, OSTReplyBy::dispatcher},        // replace a container by another
+    {3, nullptr, allowed, OSTReplyBy::dispatcher},        // stage containers for deletion
+    {4, nullptr, allowed, OSTReplyBy::handler},           // destroy everything on death row
+    {5, nullptr, allowed, OSTReplyBy::dispatcher},        // set an info value of a container
+    {6, nullptr, allowed, OSTReplyBy::dispatcher},        // get an info value of a container
+    {7, nullptr, allowed, OSTReplyBy::dispatcher},        // get a container's path, transient flag and info
+    {8, nullptr, allowed, OSTReplyBy::dispatcher},        // recreate a container's default structure
+    {9, nullptr, allowed, OSTReplyBy::dispatcher},        // regenerate a container's directory UUID
+    {10, nullptr, allowed, OSTReplyBy::dispatcher},       // delete one container
+    {11, nullptr, wipeContainer, OSTReplyBy::dispatcher}, // wipe an entitled plug-in data container
+    {12, nullptr, allowed, OSTReplyBy::dispatcher},       // wipe a data container
+    {13, nullptr, none, OSTReplyBy::dispatcher},          // paths of the client's application group containers
+    {14, nullptr, allowed, OSTReplyBy::dispatcher},       // identifiers of an identifier's application groups
+    {15, nullptr, none, OSTReplyBy::dispatcher},          // path of a system container
+    {16, nullptr, none, OSTReplyBy::dispatcher},          // paths of the client's system group containers
+    {17, nullptr, none, OSTReplyBy::dispatcher},          // path of one system group container
+    {18, nullptr, allowed, OSTReplyBy::dispatcher},       // register code-signing information
+    {19, nullptr, allowed, OSTReplyBy::dispatcher},       // get code-signing information
+    {20, nullptr, allowed, OSTReplyBy::dispatcher},       // invalidate code-signing information
+    {21, nullptr, allowed, OSTReplyBy::handler},          // set a data container's protection class
+    {22, nullptr, allowed, OSTReplyBy::dispatcher},       // recreate a container's default structure, as 8
+    {23, nullptr, allowed, OSTReplyBy::dispatcher},       // disk usage of a container
+    {24, nullptr, dataMigration, OSTReplyBy::dispatcher}, // run the data migration
+    {25, nullptr, allowed, OSTReplyBy::dispatcher},       // retry test
+}};
+
+} // namespace ost

@@ -1,0 +1,211 @@
+#include "model/OSTFailureReport.h"
+#include "model/OSTGlobalConfiguration.h"
+#include "platform/Path.h"
+#include "platform/UUID.h"
+#include "store/OSTClientConnection.h"
+#include "store/OSTContainerCache.h"
+#include "store/OSTFileManager.h"
+#include "store/OSTLocks.h"
+#include "store/OSTStoreDelegate.h"
+
+#include <array>
+#include <span>
+
+namespace ost {
+
+using platform::pathByAppending;
+using platform::pathByDeletingLastComponent;
+
+namespace {
+
+/// Owner and group of everything inside a system container; what its services may do there, an access-control list says.
+constexpr std::uint32_t systemContentOwner = 4294967294;
+
+constexpr std::array<std::string_view, 5> dataSubDirectories = {"Documents", "Library", "Library/Caches",
+                                                                "Library/Preferences", "tmp"};
+constexpr std::array<std::string_view, 2> groupSubDirectories = {"Library", "Library/Caches"};
+
+std::span<const std::string_view> subDirectoriesOf(OSTContainerClass containerClass) {
+    if (isBundleClass(containerClass))
+        return {};
+    if (containerClass == OSTContainerClass::sharedAppGroup || containerClass == OSTContainerClass::sharedSystemGroup)
+        return groupSubDirectories;
+    return dataSubDirectories;
+}
+
+/// Waits until the renames that put the records' containers in place have reached the disk. Whoever made a container does so
+/// after the locks are released; whoever finds one that is not there yet does it too, since it is going to be answered.
+OSTResult<void> makePlacesDurable(std::span<const OSTMetadataRecord> records) {
+    for (const auto& record : records) {
+        if (!record->pendingPlacement || !*record->pendingPlacement)
+            continue;
+        OST_TRY(OSTFileManager::defaultManager().makeDirectoryDurable(pathByDeletingLastComponent(record->url)));
+        *record->pendingPlacement = false;
+    }
+    return {};
+}
+
+/// A record as an answer: the shared one stays as it is.
+OSTMetadataRecord answer(const OSTMetadata& record, bool existed) {
+    auto copy = std::make_shared<OSTMetadata>(record);
+    copy->existed = existed;
+    return copy;
+}
+
+} // namespace
+
+std::expected<OSTMetadataRecord, OSTErrorCode>
+OSTClientConnection::createOrLookupContainerForUser(const OSTContainerLookup& lookup) const {
+    const auto result = OSTGuarded([&]() -> OSTResult<OSTMetadataRecord> {
+        OST_TRY(_checkLookup(lookup));
+        OSTAllIdentifiersLock lock(OSTLockKind::writing, lookup.useLocking);
+        std::optional<std::string> staging;
+        auto record = OSTGuarded([&] { return _lookUpOrCreate(lookup, staging); });
+        if (staging) {
+            if (const auto cleared = _moveItemAtURLToDeathRow(*staging, StartPass::yes); !cleared)
+                record = std::unexpected(OSTCreateError(OSTErrorCode::stagingRemovalFailed, cleared.error(),
+                                                        "Failed to remove staging dir: %@", *staging));
+        }
+        lock.unlock();
+        if (record)
+            OST_TRY(makePlacesDurable({&*record, 1}));
+        return record;
+    });
+    if (!result)
+        return std::unexpected(result.error().code());
+    return *result;
+}
+
+OSTResult<void> OSTClientConnection::_checkLookup(const OSTContainerLookup& lookup) const {
+    if (!lookup.identifier || !isValidContainerClass(lookup.containerClass))
+        return std::unexpected(OSTCreateError(OSTErrorCode::invalidObject,
+                                              "Can't act on an invalid object: userId: %u, ID: %@, class: %ld",
+                                              lookup.userId, lookup.identifier, lookup.containerClass));
+    if (!OSTUserIdFitsClass(lookup.containerClass, lookup.userId))
+        return std::unexpected(OSTCreateError(OSTErrorCode::invalidObject, "Invalid userId %u for class %ld, ID: %@",
+                                              lookup.userId, lookup.containerClass, *lookup.identifier));
+    if (lookup.containerClass == OSTContainerClass::dataSystem && !_identity.allowOtherIdLookup &&
+        !OSTStoreDelegate::shared().identifierHasSystemContainer(*lookup.identifier))
+        return std::unexpected(OSTCreateError(OSTErrorCode::notEntitled,
+                                              "%@ not entitled for a system container, but %@ is trying",
+                                              *lookup.identifier, _identity.clientBundleIdentifier));
+    return {};
+}
+
+OSTResult<OSTMetadataRecord> OSTClientConnection::_lookUpOrCreate(const OSTContainerLookup& lookup,
+                                                                  std::optional<std::string>& staging) const {
+    const auto found = OSTContainerCache::sharedInstance().containerForUser(lookup.userId, lookup.containerClass,
+                                                                            *lookup.identifier, lookup.transient);
+    if (found && !lookup.transient)
+        return answer(**found, true);
+    if (found) {
+        // A transient container is never reused.
+        if (const auto removed = _moveItemAtURLToDeathRow((*found)->url, StartPass::yes); !removed)
+            return std::unexpected(OSTCreateError(OSTErrorCode::transientRemovalFailed, removed.error(),
+                                                  "Failed to remove transient container at %@", (*found)->url));
+    } else if (!found.error().is(OSTErrorCode::notFound)) {
+        return std::unexpected(found.error());
+    }
+    if (!lookup.createIfNecessary)
+        return std::unexpected(OSTCreateError(OSTErrorCode::notFound, OSTLogging::silent, nullptr,
+                                              "Container with identifier: \"%@\" Not Found", *lookup.identifier));
+    return _createContainer(lookup, staging);
+}
+
+OSTResult<OSTMetadataRecord> OSTClientConnection::_createContainer(const OSTContainerLookup& lookup,
+                                                                   std::optional<std::string>& staging) const {
+    auto& layout = OSTGlobalConfiguration::sharedInstance();
+    const std::string directoryUUID = platform::UUID::generate().string();
+    const std::string stagingURL = pathByAppending(layout.stagingDirectory(), directoryUUID);
+    staging = stagingURL;
+    OSTMetadata metadata = OST_TRY(_buildInStaging(lookup, stagingURL));
+
+    const auto liveParent = layout.containerDirectoryURLForUser(lookup.userId, lookup.containerClass, lookup.transient);
+    const auto liveName =
+        OSTStoreDelegate::shared().wellknownContainerForId(*lookup.identifier, lookup.containerClass).value_or(directoryUUID);
+    const auto liveURL = pathByAppending(liveParent.value_or(std::string()), liveName);
+    if (const auto moved = OSTFileManager::defaultManager().moveItemAtURL(stagingURL, liveURL); !moved)
+        return std::unexpected(OSTCreateError(OSTErrorCode::moveToLiveFailed, moved.error(),
+                                              "Failed to move staging dir: %@ to live dir: %@", stagingURL, liveURL));
+    staging.reset();
+
+    metadata.url = liveURL;
+    metadata.pendingPlacement = std::make_shared<std::atomic<bool>>(true);
+    const auto added = OSTContainerCache::sharedInstance().addContainerMetadata(metadata, lookup.userId, liveURL,
+                                                                                lookup.transient);
+    if (!added)
+        return std::unexpected(OSTCreateError(OSTErrorCode::cacheAddFailed, added.error(),
+                                              "Failed to add to cache for %u : %@, url: %@, transient: %d",
+                                              lookup.userId, metadata, liveURL, lookup.transient));
+    return *added;
+}
+
+OSTResult<OSTMetadata> OSTClientConnection::_buildInStaging(const OSTContainerLookup& lookup,
+                                                            const std::string& staging) {
+    if (const auto made = _createTopLevelContainerDirectory(staging, lookup.containerClass, lookup.userId); !made)
+        return std::unexpected(OSTCreateError(OSTErrorCode::stagingCreationFailed, made.error(),
+                                              "Failed to create staging dir at %@ : %@", staging, made.error()));
+    OSTMetadata metadata{.uid = lookup.userId,
+                         .uuid = platform::UUID::generate(),
+                         .containerClass = lookup.containerClass,
+                         .identifier = std::string(*lookup.identifier),
+                         .url = staging};
+    auto pendingFile = OST_TRY(metadata.writeMetadataToNewDirectory());
+    if (isSystemClass(lookup.containerClass))
+        OST_TRY(OSTFileManager::defaultManager().setTopLevelSystemContainerACLAtURL(staging));
+    OST_TRY(_createSubDirectories(staging, lookup.userId, lookup.containerClass));
+    // Last, so that one commit of the file system's journal carries the sub-directories as well.
+    OST_TRY(metadata.makeMetadataDurable(std::move(pendingFile)));
+    return metadata;
+}
+
+OSTResult<void> OSTClientConnection::_createTopLevelContainerDirectory(const std::string& url,
+                                                                       OSTContainerClass containerClass,
+                                                                       std::uint32_t owner) {
+    if (isBundleClass(containerClass))
+        owner = OSTInstallerUserId;
+    else if (isSystemClass(containerClass))
+        owner = OSTRootUserId;
+    return OSTFileManager::defaultManager().createDirectoryAtURL(
+        url, {.withIntermediateDirectories = true, .mode = 0755, .owner = owner, .protectionClass = 0});
+}
+
+OSTResult<void> OSTClientConnection::_createSubDirectories(const std::string& url, std::uint32_t userId,
+                                                           OSTContainerClass containerClass) {
+    const bool system = isSystemClass(containerClass);
+    for (const auto name : subDirectoriesOf(containerClass)) {
+        const auto made = _createDefaultDirectory(pathByAppending(url, name), system ? 0 : 0755,
+                                                  system ? systemContentOwner : userId);
+        if (!made)
+            return std::unexpected(OSTCreateError(OSTErrorCode::subDirectoryCreationFailed, made.error(),
+                                                  "Failed to create sub-dir at %@%@", url, name));
+    }
+    return {};
+}
+
+OSTResult<void> OSTClientConnection::_createDefaultDirectory(const std::string& url, std::uint16_t mode,
+                                                             std::uint32_t owner) {
+    return OSTFileManager::defaultManager().createDirectoryAtURL(
+        url, {.withIntermediateDirectories = true, .mode = mode, .owner = owner});
+}
+
+std::expected<std::vector<OSTMetadataRecord>, OSTErrorCode>
+OSTClientConnection::containersForUser(std::uint32_t userId, OSTContainerClass containerClass, bool transient) const {
+    const auto result = OSTGuarded([&]() -> OSTResult<std::vector<OSTMetadataRecord>> {
+        if (!isValidContainerClass(containerClass))
+            return std::unexpected(OSTCreateError(OSTErrorCode::invalidObject,
+                                                  "Can't act on an invalid container-userId: %u, class: %ld", userId,
+                                                  containerClass));
+        OSTAllIdentifiersLock lock(OSTLockKind::reading);
+        auto records = OST_TRY(
+            OSTContainerCache::sharedInstance().allContainersForUser(userId, containerClass, transient));
+        lock.unlock();
+        OST_TRY(makePlacesDurable(records));
+        return records;
+    });
+    if (!result)
+        return std::unexpected(result.error().code());
+    return *result;
+}
+
+} // namespace ost

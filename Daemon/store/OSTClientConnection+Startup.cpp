@@ -1,0 +1,29 @@
+#include "model/OSTGlobalConfiguration.h"
+#include "platform/Path.h"
+#include "store/OSTClientConnection.h"
+#include "store/OSTFileManager.h"
+
+#include <cerrno>
+
+namespace ost {
+
+OSTClientConnection& OSTClientConnection::sharedClientConnection() {
+    static OSTClientConnection connection(
+        {.clientBundleIdentifier = "com.tamarok.ostrandd.internal", .clientUserId = 0, .allowOtherIdLookup = true});
+    return connection;
+}
+
+void OSTClientConnection::containerManagerCleanup() const {
+    const auto staging = OSTGlobalConfiguration::sharedInstance().stagingDirectory();
+    const auto items = OSTFileManager::defaultManager().urlsForItemsInDirectoryAtURL(staging);
+    if (items) {
+        // An item that cannot be moved stays for the next start.
+        for (const auto& item : *items)
+            (void)_moveItemAtURLToDeathRow(platform::pathByAppending(staging, item.name), StartPass::no);
+    } else if (!items.error().isPOSIX(ENOENT)) {
+        platform::logError("Failed to get items at staging URL%@ : %@", staging, items.error());
+    }
+    deleteContainersOnDeathRowWithCompletion();
+}
+
+} // namespace ost

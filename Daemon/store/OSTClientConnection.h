@@ -1,0 +1,117 @@
+#pragma once
+
+#include "model/OSTContainerClass.h"
+#include "model/OSTError.h"
+#include "model/OSTMetadata.h"
+#include "platform/WorkQueue.h"
+
+#include <cstdint>
+#include <expected>
+#include <functional>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+namespace ost {
+
+/// Who a client is and what it may look up.
+struct OSTClientIdentity {
+    std::optional<std::string> clientBundleIdentifier = std::nullopt;
+    std::uint32_t clientUserId = 0;
+    bool allowOtherIdLookup = false; ///< may act on identifiers other than its own
+    bool allowGroupIdLookup = false;
+    std::optional<std::vector<std::string>> entitledWipeIdentifiers = std::nullopt;
+};
+
+/// What a client asks for when it asks for one container.
+struct OSTContainerLookup {
+    std::uint32_t userId = 0;
+    std::optional<std::string_view> identifier = std::nullopt;
+    OSTContainerClass containerClass = OSTContainerClass::undefined;
+    bool transient = false;
+    bool createIfNecessary = false;
+    bool useLocking = true; ///< false when the caller holds the all-identifiers lock for writing
+};
+
+/// The serial queue on which every death-row pass runs, at background priority.
+[[nodiscard]] platform::WorkQueue& OSTDeathRowQueue();
+
+/// The object through which every store operation runs, with one client's identity and rights. A new one is made for each
+/// request and dies with it; the daemon's own work uses `sharedClientConnection`.
+///
+/// Threads: any; an object holds nothing that changes. Operations serialise themselves with the locks of OSTLocks.
+/// On disk: a container is built in the staging directory and put in place with one rename, so a live one is never half made.
+/// What is thrown away is moved to death row with one rename and destroyed by a later pass.
+/// Failures leave as a code alone; the error behind it is in the log. An exception becomes `exceptionCaught`.
+class OSTClientConnection {
+public:
+    explicit OSTClientConnection(OSTClientIdentity identity) : _identity(std::move(identity)) {}
+
+    /// The connection of the daemon's own work: identifier "com.tamarok.ostrandd.internal", user 0, any identifier.
+    [[nodiscard]] static OSTClientConnection& sharedClientConnection();
+
+    [[nodiscard]] const OSTClientIdentity& identity() const { return _identity; }
+
+    // Creation and look-up
+
+    /// Gives the container that the look-up names, making it when it is missing and may be made; `existed` tells which. A
+    /// transient container is never reused: one that is found is thrown away first. What is answered has reached the disk.
+    ///
+    /// Codes: `invalidObject` (no identifier, or a class or user that do not fit), `notEntitled`, `notFound`,
+    /// `transientRemovalFailed`, `stagingCreationFailed`, `dictionaryWriteFailed`, `accessControlListFailed`,
+    /// `subDirectoryCreationFailed`, `moveToLiveFailed`, `cacheAddFailed`, `stagingRemovalFailed`, those of the cache.
+    [[nodiscard]] std::expected<OSTMetadataRecord, OSTErrorCode>
+    createOrLookupContainerForUser(const OSTContainerLookup& lookup) const;
+
+    /// All containers of the user and class. Codes: `invalidObject`, those of the cache.
+    [[nodiscard]] std::expected<std::vector<OSTMetadataRecord>, OSTErrorCode>
+    containersForUser(std::uint32_t userId, OSTContainerClass containerClass, bool transient) const;
+
+    // Deletion
+
+    using DeathRowCompletion = std::move_only_function<void(std::int64_t code)>;
+
+    /// Enqueues a death-row pass, which destroys everything on death row, and returns. `completion`, if any, gets
+    /// `success`, or the code of the last failure.
+    void deleteContainersOnDeathRowWithCompletion(DeathRowCompletion completion = nullptr) const;
+
+    // Start-up
+
+    /// Brings the store to order before anybody is served: what a crash left in staging goes to death row, and a first pass
+    /// destroys it. Failures are logged. Runs before requests are accepted, and so takes no locks.
+    void containerManagerCleanup() const;
+
+private:
+    enum class StartPass : bool { no, yes };
+
+    // +Creation
+    [[nodiscard]] OSTResult<void> _checkLookup(const OSTContainerLookup& lookup) const;
+    [[nodiscard]] OSTResult<OSTMetadataRecord> _lookUpOrCreate(const OSTContainerLookup& lookup,
+                                                               std::optional<std::string>& staging) const;
+    [[nodiscard]] OSTResult<OSTMetadataRecord> _findContainer(const OSTContainerLookup& lookup) const;
+    [[nodiscard]] OSTResult<OSTMetadataRecord> _createContainer(const OSTContainerLookup& lookup,
+                                                                std::optional<std::string>& staging) const;
+    [[nodiscard]] static OSTResult<OSTMetadata> _buildInStaging(const OSTContainerLookup& lookup,
+                                                                const std::string& staging);
+    [[nodiscard]] static OSTResult<void> _createTopLevelContainerDirectory(const std::string& url,
+                                                                           OSTContainerClass containerClass,
+                                                                           std::uint32_t owner);
+    [[nodiscard]] static OSTResult<void> _createSubDirectories(const std::string& url, std::uint32_t userId,
+                                                               OSTContainerClass containerClass);
+    [[nodiscard]] static OSTResult<void> _createDefaultDirectory(const std::string& url, std::uint16_t mode,
+                                                                 std::uint32_t owner);
+
+    // +Deletion
+    /// Moves one item to death row with one rename; an item that is already gone is success.
+    /// Fails with `moveToDeathRowFailed`.
+    [[nodiscard]] OSTResult<void> _moveItemAtURLToDeathRow(const std::string& url, StartPass startDeletionThread) const;
+    /// Removes an item, or parks it under /tmp when it cannot be removed; the value is then the removal's error.
+    /// Fails with `moveAsideFailed`.
+    [[nodiscard]] static OSTResult<std::optional<OSTError>> _removeItemOrMoveToTempAtURL(const std::string& url);
+    [[nodiscard]] static std::optional<OSTError> _emptyDeathRow();
+
+    const OSTClientIdentity _identity;
+};
+
+} // namespace ost

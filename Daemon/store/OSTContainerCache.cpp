@@ -1,0 +1,193 @@
+#include "store/OSTContainerCache.h"
+
+#include "model/OSTDictionaryFile.h"
+#include "model/OSTFailureReport.h"
+#include "model/OSTGlobalConfiguration.h"
+#include "platform/BlockingSection.h"
+#include "platform/Log.h"
+#include "platform/Path.h"
+#include "store/OSTFileManager.h"
+
+#include <cerrno>
+#include <cstring>
+
+namespace ost {
+
+using platform::pathByAppending;
+
+namespace {
+
+std::string_view suffix(bool transient) {
+    return transient ? "(transient)" : "";
+}
+
+/// A scan of a large class directory holds the mutex for long; a listener's worker that waits for it lets others be served.
+std::unique_lock<std::mutex> lockCache(std::mutex& mutex) {
+    std::unique_lock lock(mutex, std::try_to_lock);
+    if (!lock) {
+        const platform::BlockingSection blocking;
+        lock.lock();
+    }
+    return lock;
+}
+
+OSTError invalidContentClass(OSTContainerClass contentClass, std::source_location where) {
+    return OSTCreateErrorAt(where, OSTErrorCode::invalidCacheInput, nullptr, "Invalid Content Class: %ld", contentClass);
+}
+
+/// Checks a record that the cache holds against the disk.
+OSTResult<void> checkOnDisk(const OSTMetadata& record, bool transient, std::source_location where) {
+    const auto className = pathComponentForContainerClass(record.containerClass);
+    if (record.url.empty())
+        return std::unexpected(OSTCreateErrorAt(where, OSTErrorCode::invalidCacheInput, nullptr,
+                                                "Cache: %@%@: Invalid URL path string: %@", className, suffix(transient),
+                                                record.url));
+    const auto metadataFile = record.metadataFileURL();
+    if (!OSTFileManager::defaultManager().itemExistsAtURL(metadataFile))
+        return std::unexpected(OSTCreateErrorAt(where, OSTErrorCode::cacheInconsistent, nullptr,
+                                                "Cache: %@%@: INCONSISTENT-No Metadata at: %@", className,
+                                                suffix(transient), metadataFile));
+    return {};
+}
+
+} // namespace
+
+OSTContainerCache& OSTContainerCache::sharedInstance() {
+    // Never destroyed: workers may still ask while the process ends.
+    static OSTContainerCache& cache = *new OSTContainerCache;
+    return cache;
+}
+
+OSTResult<OSTMetadataRecord> OSTContainerCache::containerForUser(std::uint32_t userId, OSTContainerClass contentClass,
+                                                                 std::string_view identifier, bool transient) {
+    const auto here = std::source_location::current();
+    return OSTGuarded([&]() -> OSTResult<OSTMetadataRecord> {
+        if (!isValidContainerClass(contentClass))
+            return std::unexpected(invalidContentClass(contentClass, here));
+        const auto className = pathComponentForContainerClass(contentClass);
+        OSTMetadataRecord record;
+        {
+            const auto lock = lockCache(_cacheLock);
+            const ClassTable* const table = OST_TRY(_tableForUserId(userId, contentClass, transient, here));
+            if (const auto found = table->find(identifier); found != table->end())
+                record = *found;
+        }
+        if (!record)
+            return std::unexpected(OSTCreateError(OSTErrorCode::notFound, OSTLogging::silent, nullptr,
+                                                  "Cache: %@%@: Container Not Found with ID: %@", className,
+                                                  suffix(transient), identifier));
+        OST_TRY(checkOnDisk(*record, transient, here));
+        platform::logDebug("Cache: %@%@: Found Identifier: %@", className, suffix(transient), identifier);
+        return record;
+    });
+}
+
+OSTResult<std::vector<OSTMetadataRecord>>
+OSTContainerCache::allContainersForUser(std::uint32_t userId, OSTContainerClass contentClass, bool transient) {
+    const auto here = std::source_location::current();
+    return OSTGuarded([&]() -> OSTResult<std::vector<OSTMetadataRecord>> {
+        if (!isValidContainerClass(contentClass))
+            return std::unexpected(invalidContentClass(contentClass, here));
+        std::vector<OSTMetadataRecord> records;
+        {
+            const auto lock = lockCache(_cacheLock);
+            const ClassTable* const table = OST_TRY(_tableForUserId(userId, contentClass, transient, here));
+            records.assign(table->begin(), table->end());
+        }
+        std::erase_if(records, [&](const OSTMetadataRecord& record) {
+            if (!checkOnDisk(*record, transient, here))
+                return true;
+            platform::logDebug("Cache: %@%@: ALL Found Identifier: %@", pathComponentForContainerClass(contentClass),
+                               suffix(transient), record->identifier);
+            return false;
+        });
+        return records;
+    });
+}
+
+OSTResult<OSTMetadataRecord> OSTContainerCache::addContainerMetadata(OSTMetadata metadata, std::uint32_t userId,
+                                                                     std::string_view url, bool transient) {
+    const auto here = std::source_location::current();
+    return OSTGuarded([&]() -> OSTResult<OSTMetadataRecord> {
+        const auto contentClass = metadata.containerClass;
+        if (!isValidContainerClass(contentClass))
+            return std::unexpected(OSTCreateError(OSTErrorCode::invalidCacheInput,
+                                                  "Invalid Metadata Content Class: %lld", contentClass));
+        if (url.empty())
+            return std::unexpected(OSTCreateError(OSTErrorCode::invalidCacheInput, "Invalid input: URL: %@", url));
+        metadata.url = url;
+        metadata.transient = transient;
+        auto record = std::make_shared<const OSTMetadata>(std::move(metadata));
+        {
+            const auto lock = lockCache(_cacheLock);
+            ClassTable* const table = OST_TRY(_tableForUserId(userId, contentClass, transient, here));
+            _put(*table, record);
+        }
+        platform::logDebug("Cache: %@%@: Added Identifier: %@", pathComponentForContainerClass(contentClass),
+                           suffix(transient), record->identifier);
+        return record;
+    });
+}
+
+OSTResult<OSTContainerCache::ClassTable*> OSTContainerCache::_tableForUserId(std::uint32_t userId,
+                                                                             OSTContainerClass contentClass,
+                                                                             bool transient, std::source_location where) {
+    auto table = _getCacheForUserId(userId, contentClass, transient);
+    if (!table)
+        return std::unexpected(OSTCreateErrorAt(where, OSTErrorCode::cacheRebuildFailed, &table.error(),
+                                                "Cache: %u-%@%@: Failed to rebuild", userId,
+                                                pathComponentForContainerClass(contentClass), suffix(transient)));
+    return table;
+}
+
+OSTResult<OSTContainerCache::ClassTable*>
+OSTContainerCache::_getCacheForUserId(std::uint32_t userId, OSTContainerClass contentClass, bool transient) {
+    if (!OSTUserIdFitsClass(contentClass, userId))
+        return std::unexpected(OSTCreateError(OSTErrorCode::invalidCacheInput,
+                                              "Invalid cache get-userId %u for class %ld", userId, contentClass));
+    const ClassKey key{userId, contentClass};
+    ClassTables& tables = transient ? _transientContainerCache : _liveContainerCache;
+    if (const auto found = tables.find(key); found != tables.end())
+        return &found->second;
+
+    platform::logDebug("Rebuilding container class cache: %u-%@%@", userId, pathComponentForContainerClass(contentClass),
+                       suffix(transient));
+    const auto directory =
+        OSTGlobalConfiguration::sharedInstance().containerDirectoryURLForUser(userId, contentClass, transient);
+    if (!directory)
+        return std::unexpected(OSTCreatePOSIXError(ENOENT, "User %u has no container directories", userId));
+    return &tables.emplace(key, OST_TRY(_readClassDirectory(*directory, userId, transient))).first->second;
+}
+
+OSTResult<OSTContainerCache::ClassTable>
+OSTContainerCache::_readClassDirectory(const std::string& directory, std::uint32_t userId, bool transient) {
+    const auto& files = OSTFileManager::defaultManager();
+    const auto items = OST_TRY(files.urlsForItemsInDirectoryAtURL(directory));
+    const auto open = OST_TRY(files.openDirectoryAtURL(directory));
+    ClassTable table;
+    table.reserve(items.size());
+    std::string buffer;
+    for (const auto& item : items) {
+        const auto url = pathByAppending(directory, item.name);
+        const auto read = files.readFile(open.get(), pathByAppending(item.name, OSTMetadataFileName),
+                                         OSTSmallDictionaryFileSize, buffer);
+        auto metadata = OSTMetadata::readAndValidateMetadataAtUrl(
+            read ? OSTResult<std::string_view>(buffer)
+                 : std::unexpected(OSTCreatePOSIXError(read.error(), "read of %@ failed: %s", url, std::strerror(read.error()))),
+            url, userId, OSTCheckClassPath::yes);
+        // An item that is no valid container is passed over; the log has the reason.
+        if (!metadata)
+            continue;
+        metadata->transient = transient;
+        _put(table, std::make_shared<const OSTMetadata>(*std::move(metadata)));
+    }
+    return table;
+}
+
+void OSTContainerCache::_put(ClassTable& table, OSTMetadataRecord record) {
+    if (const auto old = table.find(record); old != table.end())
+        table.erase(old);
+    table.insert(std::move(record));
+}
+
+} // namespace ost

@@ -1,0 +1,168 @@
+#include "store/OSTFileManager.h"
+
+#include "platform/AccessControlList.h"
+#include "platform/BlockingSection.h"
+#include "platform/Path.h"
+#include "platform/ProtectionClass.h"
+#include "store/OSTPathResolution.h"
+#include "store/OSTUniqueName.h"
+
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+
+namespace ost {
+
+using platform::FileDescriptor;
+
+namespace {
+
+/// Makes the directories on the way to the item at `path` that are missing.
+std::expected<void, int> makeParents(int base, std::string_view path, mode_t mode) {
+    FileDescriptor held;
+    if (path.starts_with('/'))
+        held = OST_TRY(OSTOpenItem(base, "/", O_PATH | O_DIRECTORY));
+    for (auto slash = path.find('/'); slash != std::string_view::npos; slash = path.find('/')) {
+        const std::string_view name = path.substr(0, slash);
+        path.remove_prefix(slash + 1);
+        if (name.empty())
+            continue;
+        const int above = held ? held.get() : base;
+        auto opened = OSTOpenItem(above, name, O_PATH | O_DIRECTORY);
+        if (!opened && opened.error() == ENOENT) {
+            if (::mkdirat(above, std::string(name).c_str(), mode) != 0 && errno != EEXIST)
+                return std::unexpected(errno);
+            opened = OSTOpenItem(above, name, O_PATH | O_DIRECTORY);
+        }
+        held = OST_TRY(std::move(opened));
+    }
+    return {};
+}
+
+struct MadeDirectory {
+    bool isNew;
+    std::expected<FileDescriptor, int> opened;
+};
+
+/// Makes a directory unless something is there, and opens it with `access`.
+std::expected<MadeDirectory, int> makeDirectory(int base, std::string_view path,
+                                                const OSTDirectoryAttributes& attributes, int access) {
+    auto place = OSTItemPlace::find(base, path);
+    if (!place && place.error() == ENOENT && attributes.withIntermediateDirectories) {
+        OST_TRY(makeParents(base, path, attributes.mode));
+        place = OSTItemPlace::find(base, path);
+    }
+    if (!place)
+        return std::unexpected(place.error());
+    const bool isNew = ::mkdirat(place->directory(), place->name(), attributes.mode) == 0;
+    if (!isNew && errno != EEXIST)
+        return std::unexpected(errno);
+    auto opened = OSTOpenItem(place->directory(), place->name(), access);
+    if (isNew && opened && attributes.mode == 0) { // which masks all that the directory inherits
+        const auto applied = platform::applyInheritedEntries(place->directory(), opened->get());
+        if (!applied && applied.error() != EOPNOTSUPP)
+            return std::unexpected(applied.error());
+    }
+    return MadeDirectory{.isNew = isNew, .opened = std::move(opened)};
+}
+
+void giveDirectory(int directory, std::uint32_t owner) {
+    // What cannot be given away stays root's.
+    (void)::fchownat(directory, "", owner, owner, AT_EMPTY_PATH);
+}
+
+bool belongsTo(int directory, std::uint32_t owner) {
+    struct stat status{};
+    return ::fstat(directory, &status) == 0 && status.st_uid == owner && status.st_gid == owner;
+}
+
+OSTResult<void> makeDurable(int directory, std::string_view path) {
+    const platform::BlockingSection blocking;
+    if (::fsync(directory) != 0)
+        return std::unexpected(OSTCreatePOSIXError(errno, "fsync of %@ failed: %s", path, std::strerror(errno)));
+    return {};
+}
+
+} // namespace
+
+const OSTFileManager& OSTFileManager::defaultManager() {
+    static const OSTFileManager manager;
+    return manager;
+}
+
+OSTResult<void> OSTFileManager::createDirectoryAtURL(std::string_view path,
+                                                     const OSTDirectoryAttributes& attributes) const {
+    return createDirectory(AT_FDCWD, path, attributes);
+}
+
+OSTResult<void> OSTFileManager::createDirectory(int base, std::string_view path,
+                                                const OSTDirectoryAttributes& attributes) const {
+    const bool setsClass = attributes.protectionClass != OSTKeepProtectionClass;
+    const int access = O_DIRECTORY | (setsClass ? O_RDONLY : O_PATH);
+
+    // Most directories asked for exist. Looking first is dearer only where making one needs no parent to be opened.
+    std::expected<FileDescriptor, int> directory = std::unexpected(ENOENT);
+    if (path.contains('/'))
+        directory = OSTOpenItem(base, path, access);
+    bool isNew = false;
+    if (!directory) {
+        auto made = makeDirectory(base, path, attributes, access);
+        if (!made && attributes.withIntermediateDirectories)
+            return std::unexpected(
+                OSTCreatePOSIXError(made.error(), "forgepath of %s failed: %s", path, std::strerror(made.error())));
+        if (!made)
+            return std::unexpected(
+                OSTCreatePOSIXError(made.error(), "mkdir of %s failed: %s", path, std::strerror(made.error())));
+        isNew = made->isNew;
+        directory = std::move(made->opened);
+    }
+    if (!directory)
+        return std::unexpected(
+            OSTCreatePOSIXError(directory.error(), "opendir of %s failed: %s", path, std::strerror(directory.error())));
+
+    if (setsClass && (isNew || platform::protectionClass(directory->get(), -1) != attributes.protectionClass)) {
+        const auto set = platform::setProtectionClass(directory->get(), attributes.protectionClass);
+        if (!set)
+            return std::unexpected(OSTCreatePOSIXError(set.error(), "Failed to setclass(%d) on directory %s: %s",
+                                                       attributes.protectionClass, path, std::strerror(set.error())));
+    }
+    if (attributes.owner != 0 && (isNew || !belongsTo(directory->get(), attributes.owner)))
+        giveDirectory(directory->get(), attributes.owner);
+    return {};
+}
+
+OSTResult<FileDescriptor> OSTFileManager::openDirectoryAtURL(std::string_view path) const {
+    auto opened = OSTOpenItem(AT_FDCWD, path, O_RDONLY | O_DIRECTORY);
+    if (!opened)
+        return std::unexpected(
+            OSTCreatePOSIXError(opened.error(), "opendir of %s failed: %s", path, std::strerror(opened.error())));
+    return *std::move(opened);
+}
+
+OSTResult<std::string> OSTFileManager::createTemporaryDirectoryInDirectoryURL(std::string_view path,
+                                                                              std::uint32_t owner) const {
+    const auto make = [&]() -> std::expected<std::string, int> {
+        const FileDescriptor parent = OST_TRY(OSTOpenItem(AT_FDCWD, path, O_PATH | O_DIRECTORY));
+        std::string name = OST_TRY(OSTMakeUnique(
+            "temp.", [&](const char* candidate) { return ::mkdirat(parent.get(), candidate, S_IRWXU) == 0; }));
+        if (owner != 0)
+            if (const auto made = OSTOpenItem(parent.get(), name, O_PATH | O_DIRECTORY))
+                giveDirectory(made->get(), owner);
+        return name;
+    };
+    const auto name = make();
+    if (!name)
+        return std::unexpected(OSTCreatePOSIXError(name.error(), "Failed to create temp dir at path %s : %s",
+                                                   platform::pathByAppending(path, "temp.XXXXXX"),
+                                                   std::strerror(name.error())));
+    return platform::pathByAppending(path, *name);
+}
+
+OSTResult<void> OSTFileManager::makeDirectoryDurable(std::string_view path) const {
+    const FileDescriptor directory = OST_TRY(openDirectoryAtURL(path));
+    return makeDurable(directory.get(), path);
+}
+
+} // namespace ost

@@ -1,0 +1,123 @@
+#include "store/OSTFileManager.h"
+
+#include "platform/BlockingSection.h"
+#include "platform/ProtectionClass.h"
+#include "store/OSTPathResolution.h"
+#include "store/OSTUniqueName.h"
+
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdio>
+#include <cstring>
+
+namespace ost {
+
+using platform::FileDescriptor;
+
+namespace {
+
+/// The name of a file that is removed again unless it was kept.
+class UnfinishedFile {
+public:
+    UnfinishedFile(int directory, std::string name) : _directory(directory), _name(std::move(name)) {}
+    UnfinishedFile(const UnfinishedFile&) = delete;
+    UnfinishedFile& operator=(const UnfinishedFile&) = delete;
+    ~UnfinishedFile() {
+        if (!_name.empty())
+            ::unlinkat(_directory, _name.c_str(), 0);
+    }
+
+    [[nodiscard]] const char* name() const { return _name.c_str(); }
+    void keep() { _name.clear(); }
+
+private:
+    int _directory;
+    std::string _name;
+};
+
+FileDescriptor createExclusively(int directory, const char* name, mode_t mode) {
+    return FileDescriptor(::openat(directory, name, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, mode));
+}
+
+std::expected<void, int> fill(int file, std::string_view bytes, std::int32_t protectionClass) {
+    if (protectionClass != OSTKeepProtectionClass) {
+        const auto set = platform::setProtectionClass(file, protectionClass);
+        // On a file system without classes every file is unprotected anyway.
+        if (!set && set.error() != EBADF)
+            return std::unexpected(set.error());
+    }
+    while (!bytes.empty()) {
+        const ssize_t count = ::write(file, bytes.data(), bytes.size());
+        if (count < 0 && errno != EINTR)
+            return std::unexpected(errno);
+        if (count > 0)
+            bytes.remove_prefix(static_cast<std::size_t>(count));
+    }
+    return {};
+}
+
+std::expected<void, int> waitForDisk(int file, int (*synchronise)(int)) {
+    const platform::BlockingSection blocking;
+    if (synchronise(file) != 0)
+        return std::unexpected(errno);
+    return {};
+}
+
+std::expected<void, int> writeAtomically(std::string_view path, std::string_view bytes,
+                                         const OSTFileAttributes& attributes) {
+    const auto place = OST_TRY(OSTItemPlace::find(path, O_RDONLY));
+    FileDescriptor file;
+    UnfinishedFile unfinished(place.directory(), OST_TRY(OSTMakeUnique(".temp.", [&](const char* candidate) {
+                                  file = createExclusively(place.directory(), candidate, attributes.mode);
+                                  return static_cast<bool>(file);
+                              })));
+    OST_TRY(fill(file.get(), bytes, attributes.protectionClass));
+    OST_TRY(waitForDisk(file.get(), ::fdatasync));
+    if (::renameat(place.directory(), unfinished.name(), place.directory(), place.name()) != 0)
+        return std::unexpected(errno);
+    unfinished.keep();
+    return waitForDisk(place.directory(), ::fsync);
+}
+
+} // namespace
+
+OSTResult<void> OSTFileManager::writeFileAtomicallyAtURL(std::string_view path, std::string_view bytes,
+                                                         const OSTFileAttributes& attributes) const {
+    if (const auto written = writeAtomically(path, bytes, attributes); !written)
+        return std::unexpected(
+            OSTCreatePOSIXError(written.error(), "write of %@ failed: %s", path, std::strerror(written.error())));
+    return {};
+}
+
+OSTResult<OSTNewFile> OSTFileManager::createFileAtURL(std::string_view path, std::string_view bytes,
+                                                      const OSTFileAttributes& attributes) const {
+    const auto create = [&]() -> std::expected<OSTNewFile, int> {
+        auto place = OST_TRY(OSTItemPlace::find(path, O_RDONLY));
+        FileDescriptor file = createExclusively(place.directory(), place.name(), attributes.mode);
+        if (!file)
+            return std::unexpected(errno);
+        UnfinishedFile unfinished(place.directory(), place.name());
+        OST_TRY(fill(file.get(), bytes, attributes.protectionClass));
+        unfinished.keep();
+        return OSTNewFile(std::string(path), std::move(file), std::move(place).takeDirectory());
+    };
+    auto created = create();
+    if (!created)
+        return std::unexpected(
+            OSTCreatePOSIXError(created.error(), "write of %@ failed: %s", path, std::strerror(created.error())));
+    return *std::move(created);
+}
+
+OSTResult<void> OSTNewFile::makeDurable() {
+    auto durable = waitForDisk(_file.get(), ::fdatasync);
+    if (durable)
+        durable = waitForDisk(_directory.get(), ::fsync);
+    if (!durable)
+        return std::unexpected(
+            OSTCreatePOSIXError(durable.error(), "fsync of %@ failed: %s", _path, std::strerror(durable.error())));
+    return {};
+}
+
+} // namespace ost

@@ -1,0 +1,78 @@
+#pragma once
+
+#include <string>
+#include <string_view>
+#include <utility>
+#include <vector>
+
+namespace ost {
+
+/// Reader/writer locks on identifiers, and one daemon-wide reader/writer lock on all of them.
+///
+/// A writer of all identifiers excludes every other holder; a reader of all identifiers excludes identifier writers. Locks of
+/// different identifiers do not meet. Not re-entrant in any combination: a thread that holds the all-identifiers lock takes
+/// neither it nor an identifier lock. Identifiers of one call are taken in ascending order and given back in descending order,
+/// which rules out deadlock between two callers.
+///
+/// The all-identifiers write lock is taken before the code-signing mapping's queue is entered, never after.
+///
+/// Threads: any. Misuse (unlocking what is not locked, taking the all-identifiers lock twice) stops the process. Code takes
+/// the locks through the two guards at the end; the functions are what the guards are made of.
+enum class OSTLockKind : bool { reading, writing };
+
+void take_one_lock(std::string_view identifier, OSTLockKind kind);
+void unlock_one_lock(std::string_view identifier);
+
+/// Takes the lock of each identifier, each distinct one once.
+void _lock_identifier(std::vector<std::string_view> identifiers, OSTLockKind kind);
+void unlock_identifier(std::vector<std::string_view> identifiers);
+
+void _lock_all_identifiers(OSTLockKind kind);
+/// Releases the all-identifiers lock, of either kind.
+void unlock_all_identifiers();
+
+/// Whether the calling thread holds the all-identifiers lock.
+[[nodiscard]] bool OSTHoldsAllIdentifiersLock();
+
+/// The number of live lock records: identifiers that somebody holds or waits for.
+[[nodiscard]] std::size_t OSTLockRecordCount();
+
+/// Holds the all-identifiers lock from construction to `unlock` or destruction.
+class OSTAllIdentifiersLock {
+public:
+    explicit OSTAllIdentifiersLock(OSTLockKind kind) : OSTAllIdentifiersLock(kind, true) {}
+    /// Holds nothing when `useLocking` is false: the caller's caller holds the lock.
+    OSTAllIdentifiersLock(OSTLockKind kind, bool useLocking) : _locked(useLocking) {
+        if (useLocking)
+            _lock_all_identifiers(kind);
+    }
+    OSTAllIdentifiersLock(const OSTAllIdentifiersLock&) = delete;
+    OSTAllIdentifiersLock& operator=(const OSTAllIdentifiersLock&) = delete;
+    ~OSTAllIdentifiersLock() { unlock(); }
+
+    void unlock() {
+        if (std::exchange(_locked, false))
+            unlock_all_identifiers();
+    }
+
+private:
+    bool _locked;
+};
+
+/// Holds the locks of some identifiers from construction to destruction.
+class OSTIdentifierLock {
+public:
+    OSTIdentifierLock(std::vector<std::string> identifiers, OSTLockKind kind) : _identifiers(std::move(identifiers)) {
+        _lock_identifier(_views(), kind);
+    }
+    OSTIdentifierLock(const OSTIdentifierLock&) = delete;
+    OSTIdentifierLock& operator=(const OSTIdentifierLock&) = delete;
+    ~OSTIdentifierLock() { unlock_identifier(_views()); }
+
+private:
+    [[nodiscard]] std::vector<std::string_view> _views() const { return {_identifiers.begin(), _identifiers.end()}; }
+
+    const std::vector<std::string> _identifiers;
+};
+
+} // namespace ost

@@ -1,0 +1,64 @@
+#include "store/OSTPathResolution.h"
+
+#include "platform/Try.h"
+
+#include <linux/openat2.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+
+namespace ost {
+
+using platform::FileDescriptor;
+
+namespace {
+
+std::string_view withoutTrailingSlashes(std::string_view path) {
+    while (path.size() > 1 && path.ends_with('/'))
+        path.remove_suffix(1);
+    return path;
+}
+
+} // namespace
+
+std::expected<FileDescriptor, int> OSTOpenItem(int base, std::string_view path, int flags, OSTMounts mounts) {
+    path = withoutTrailingSlashes(path);
+    char terminated[PATH_MAX];
+    if (path.size() >= sizeof terminated)
+        return std::unexpected(ENAMETOOLONG);
+    terminated[path.copy(terminated, path.size())] = '\0';
+
+    // The kernel refuses non-blocking together with O_PATH, which never waits anyway.
+    const int unblocked = (flags & O_PATH) != 0 ? 0 : O_NONBLOCK | O_NOCTTY;
+    open_how how{};
+    how.flags = static_cast<std::uint32_t>(flags | O_NOFOLLOW | O_CLOEXEC | unblocked);
+    how.resolve = RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS;
+    if (mounts == OSTMounts::stayOut)
+        how.resolve |= RESOLVE_NO_XDEV;
+    const long fd = ::syscall(SYS_openat2, base, terminated, &how, sizeof how);
+    if (fd < 0)
+        return std::unexpected(errno);
+    return FileDescriptor(static_cast<int>(fd));
+}
+
+std::expected<OSTItemPlace, int> OSTItemPlace::find(int base, std::string_view path, int access) {
+    path = withoutTrailingSlashes(path);
+    const auto slash = path.rfind('/');
+    const std::string_view name = path.substr(slash + 1);
+    // These name a directory's relatives, not an item that could be made, moved or removed.
+    if (name.empty() || name == "." || name == "..")
+        return std::unexpected(EINVAL);
+    if (name.size() > NAME_MAX)
+        return std::unexpected(ENAMETOOLONG);
+
+    OSTItemPlace place;
+    place._name[name.copy(place._name, name.size())] = '\0';
+    place._base = base;
+    if (slash != std::string_view::npos)
+        place._owned = OST_TRY(OSTOpenItem(base, path.substr(0, slash == 0 ? 1 : slash), access | O_DIRECTORY));
+    return place;
+}
+
+} // namespace ost

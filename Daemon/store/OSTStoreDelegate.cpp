@@ -1,0 +1,31 @@
+#include "store/OSTStoreDelegate.h"
+
+#include <atomic>
+
+namespace ost {
+
+namespace {
+
+class Nobody final : public OSTStoreDelegate {
+public:
+    bool identifierHasSystemContainer(std::string_view) override { return false; }
+    std::optional<std::string> wellknownContainerForId(std::string_view, OSTContainerClass) override {
+        return std::nullopt;
+    }
+};
+
+constinit std::atomic<OSTStoreDelegate*> joined = nullptr;
+
+} // namespace
+
+OSTStoreDelegate& OSTStoreDelegate::shared() {
+    static Nobody nobody;
+    OSTStoreDelegate* const delegate = joined;
+    return delegate ? *delegate : nobody;
+}
+
+void OSTStoreDelegate::join(OSTStoreDelegate& delegate) {
+    joined = &delegate;
+}
+
+} // namespace ost

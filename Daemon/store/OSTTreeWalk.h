@@ -1,0 +1,45 @@
+#pragma once
+
+#include <sys/types.h>
+
+#include <cstdint>
+#include <functional>
+#include <string>
+#include <string_view>
+
+namespace ost {
+
+/// One stop of a walk through a tree. Borrowed: valid during the visit.
+struct OSTTreeEntry {
+    enum class Visit : std::uint8_t {
+        item,            ///< anything but a directory
+        directoryBefore, ///< a directory, before what it holds
+        directoryAfter,  ///< the same directory, after that, with the status that it had before
+        failure,         ///< an item without readable status, or a directory that cannot be read; `error` says why
+    };
+    struct Status {
+        mode_t mode;
+        uid_t uid;
+        gid_t gid;
+        nlink_t links;
+        ino_t inode;
+        std::uint64_t size;   ///< bytes
+        std::uint64_t blocks; ///< allocated, 512 bytes each
+    };
+
+    Visit visit;
+    int error; ///< errno of a failure, else 0
+    /// The directory that holds the item, open at least for the *at calls, and the item's name there.
+    int directory;
+    const char* name;
+    const std::string& path;
+    const Status& status; ///< all 0 where it could not be read
+};
+
+/// Visits the item at `path` and everything below it, to any depth, in the order of the directories. Neither symbolic
+/// links nor mount points are entered; a mount point is not visited either. Returns whether the walk reached its end:
+/// not when `visit` answered false, nor when the tree was moved about so that there was no way on, which is visited as
+/// a failure.
+bool OSTWalkTree(std::string_view path, const std::function<bool(const OSTTreeEntry&)>& visit);
+
+} // namespace ost

@@ -1,0 +1,24 @@
+#include "platform/NamedSemaphore.h"
+
+#include "support/DeviceTest.h"
+
+#include <semaphore.h>
+
+namespace ost::platform {
+namespace {
+
+class NamedSemaphoreTest : public test::DeviceTest {};
+
+TEST_F(NamedSemaphoreTest, existsOnceItIsCreated) {
+    EXPECT_FALSE(namedSemaphoreExists("ostrandd.fb_check"));
+    ASSERT_TRUE(createNamedSemaphore("ostrandd.fb_check", 0400, 0));
+    EXPECT_TRUE(namedSemaphoreExists("ostrandd.fb_check"));
+    EXPECT_EQ(test::tree("/dev/shm"), "-r-------- 0:0 sem.ostrandd.fb_check\n");
+    EXPECT_TRUE(createNamedSemaphore("ostrandd.fb_check", 0400, 0)) << "one that exists will do";
+
+    EXPECT_EQ(createNamedSemaphore(std::string(300, 'x'), 0400, 0).error(), ENAMETOOLONG);
+    EXPECT_FALSE(namedSemaphoreExists("another"));
+}
+
+} // namespace
+} // namespace ost::platform
