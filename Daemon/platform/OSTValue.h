@@ -1,6 +1,7 @@
 #pragma once
 
 #include <compare>
+#include <concepts>
 #include <cstddef>
 #include <cstdint>
 #include <memory>
@@ -36,7 +37,9 @@ struct OSTDate {
 /// equal.
 class OSTValue {
 public:
-    OSTValue(bool value) : _value(value) {}
+    /// Takes nothing but a `bool`: a pointer is no boolean.
+    template<std::same_as<bool> T>
+    OSTValue(T value) : _value(value) {}
     OSTValue(std::int64_t value);
     OSTValue(std::uint64_t value) : _value(value) {}
     OSTValue(double value) : _value(value) {}

@@ -82,6 +82,16 @@ OSTResult<OSTMetadataRecord> OSTContainerCache::containerForUser(std::uint32_t u
     });
 }
 
+OSTMetadataRecord OSTContainerCache::containerForUser(std::uint32_t userId, OSTContainerClass contentClass,
+                                                      std::string_view identifier, const platform::UUID& uuid) {
+    for (const bool transient : {false, true}) {
+        auto found = containerForUser(userId, contentClass, identifier, transient);
+        if (found && (*found)->uuid == uuid)
+            return *std::move(found);
+    }
+    return nullptr;
+}
+
 OSTResult<std::vector<OSTMetadataRecord>>
 OSTContainerCache::allContainersForUser(std::uint32_t userId, OSTContainerClass contentClass, bool transient) {
     const auto here = std::source_location::current();
@@ -102,6 +112,22 @@ OSTContainerCache::allContainersForUser(std::uint32_t userId, OSTContainerClass 
             return false;
         });
         return records;
+    });
+}
+
+OSTResult<std::vector<std::string>>
+OSTContainerCache::allContainerIdentifiersForUser(std::uint32_t userId, OSTContainerClass contentClass, bool transient) {
+    const auto here = std::source_location::current();
+    return OSTGuarded([&]() -> OSTResult<std::vector<std::string>> {
+        if (!isValidContainerClass(contentClass))
+            return std::unexpected(invalidContentClass(contentClass, here));
+        const auto lock = lockCache(_cacheLock);
+        const ClassTable* const table = OST_TRY(_tableForUserId(userId, contentClass, transient, here));
+        std::vector<std::string> identifiers;
+        identifiers.reserve(table->size());
+        for (const auto& record : *table)
+            identifiers.push_back(record->identifier);
+        return identifiers;
     });
 }
 
@@ -126,6 +152,24 @@ OSTResult<OSTMetadataRecord> OSTContainerCache::addContainerMetadata(OSTMetadata
         platform::logDebug("Cache: %@%@: Added Identifier: %@", pathComponentForContainerClass(contentClass),
                            suffix(transient), record->identifier);
         return record;
+    });
+}
+
+OSTResult<void> OSTContainerCache::removeContainerForUser(std::uint32_t userId, OSTContainerClass contentClass,
+                                                          std::string_view identifier, bool transient) {
+    const auto here = std::source_location::current();
+    return OSTGuarded([&]() -> OSTResult<void> {
+        if (!isValidContainerClass(contentClass))
+            return std::unexpected(invalidContentClass(contentClass, here));
+        {
+            const auto lock = lockCache(_cacheLock);
+            ClassTable* const table = OST_TRY(_tableForUserId(userId, contentClass, transient, here));
+            if (const auto found = table->find(identifier); found != table->end())
+                table->erase(found);
+        }
+        platform::logDebug("Cache: %@%@: Removed Identifier: %@", pathComponentForContainerClass(contentClass),
+                           suffix(transient), identifier);
+        return {};
     });
 }
 

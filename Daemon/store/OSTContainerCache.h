@@ -34,14 +34,26 @@ public:
     [[nodiscard]] OSTResult<OSTMetadataRecord> containerForUser(std::uint32_t userId, OSTContainerClass contentClass,
                                                                 std::string_view identifier, bool transient);
 
+    /// Finds the container with that internal UUID, among the live ones first; null when neither table has it.
+    [[nodiscard]] OSTMetadataRecord containerForUser(std::uint32_t userId, OSTContainerClass contentClass,
+                                                     std::string_view identifier, const platform::UUID& uuid);
+
     /// All containers whose metadata file is on disk; the errors of others are logged and not returned.
     [[nodiscard]] OSTResult<std::vector<OSTMetadataRecord>>
     allContainersForUser(std::uint32_t userId, OSTContainerClass contentClass, bool transient);
+
+    /// The identifiers of all containers, without a look at the disk.
+    [[nodiscard]] OSTResult<std::vector<std::string>>
+    allContainerIdentifiersForUser(std::uint32_t userId, OSTContainerClass contentClass, bool transient);
 
     /// Puts `metadata`, found at `url` from now on, into the table of the user and the record's class. Gives the record as it
     /// is held. Fails with `invalidCacheInput` or `cacheRebuildFailed`.
     [[nodiscard]] OSTResult<OSTMetadataRecord> addContainerMetadata(OSTMetadata metadata, std::uint32_t userId,
                                                                     std::string_view url, bool transient);
+
+    /// Forgets a container; one that is not there is no error. Fails with `invalidCacheInput` or `cacheRebuildFailed`.
+    [[nodiscard]] OSTResult<void> removeContainerForUser(std::uint32_t userId, OSTContainerClass contentClass,
+                                                         std::string_view identifier, bool transient);
 
 private:
     /// Hashes and compares records by identifier, and finds them by a plain string.

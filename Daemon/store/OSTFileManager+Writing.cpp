@@ -1,5 +1,6 @@
 #include "store/OSTFileManager.h"
 
+#include "platform/AccessControlList.h"
 #include "platform/BlockingSection.h"
 #include "platform/ProtectionClass.h"
 #include "store/OSTPathResolution.h"
@@ -41,9 +42,23 @@ FileDescriptor createExclusively(int directory, const char* name, mode_t mode) {
     return FileDescriptor(::openat(directory, name, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, mode));
 }
 
-std::expected<void, int> fill(int file, std::string_view bytes, std::int32_t protectionClass) {
-    if (protectionClass != OSTKeepProtectionClass) {
-        const auto set = platform::setProtectionClass(file, protectionClass);
+/// A directory may hand an ACL down to what is made in it, which then takes from the mode, and a file of the daemon is
+/// nobody else's to write.
+std::expected<void, int> insistOnMode(int file, mode_t mode) {
+    struct stat status{};
+    if (::fstat(file, &status) != 0)
+        return std::unexpected(errno);
+    if ((status.st_mode & static_cast<mode_t>(ALLPERMS)) == mode)
+        return {};
+    const auto none = OST_TRY(platform::AccessControlList::create(0));
+    OST_TRY(none.apply(file));
+    return platform::setModeKeepingMask(file, mode);
+}
+
+std::expected<void, int> finish(int file, std::string_view bytes, const OSTFileAttributes& attributes) {
+    OST_TRY(insistOnMode(file, attributes.mode));
+    if (attributes.protectionClass != OSTKeepProtectionClass) {
+        const auto set = platform::setProtectionClass(file, attributes.protectionClass);
         // On a file system without classes every file is unprotected anyway.
         if (!set && set.error() != EBADF)
             return std::unexpected(set.error());
@@ -73,7 +88,7 @@ std::expected<void, int> writeAtomically(std::string_view path, std::string_view
                                   file = createExclusively(place.directory(), candidate, attributes.mode);
                                   return static_cast<bool>(file);
                               })));
-    OST_TRY(fill(file.get(), bytes, attributes.protectionClass));
+    OST_TRY(finish(file.get(), bytes, attributes));
     OST_TRY(waitForDisk(file.get(), ::fdatasync));
     if (::renameat(place.directory(), unfinished.name(), place.directory(), place.name()) != 0)
         return std::unexpected(errno);
@@ -99,7 +114,7 @@ OSTResult<OSTNewFile> OSTFileManager::createFileAtURL(std::string_view path, std
         if (!file)
             return std::unexpected(errno);
         UnfinishedFile unfinished(place.directory(), place.name());
-        OST_TRY(fill(file.get(), bytes, attributes.protectionClass));
+        OST_TRY(finish(file.get(), bytes, attributes));
         unfinished.keep();
         return OSTNewFile(std::string(path), std::move(file), std::move(place).takeDirectory());
     };

@@ -68,7 +68,7 @@ std::expected<void, int> OSTTreeCursor::enter() {
     FileDescriptor opened = OST_TRY(OSTOpenSubdirectory(directory(), name()));
     const std::size_t depthOfItem = _levels.size();
     if (depthOfItem >= maximumOpenDirectories)
-        _closeForNow(depthOfItem - maximumOpenDirectories);
+        OST_TRY(_closeForNow(depthOfItem - maximumOpenDirectories));
     _levels.push_back({.pathLength = _path.size()});
     _open[depthOfItem % maximumOpenDirectories].restart(std::move(opened), 0);
     return {};
@@ -96,17 +96,19 @@ void OSTTreeCursor::_setItem(const char* name) {
     _path.append(1, '/').append(name);
 }
 
-void OSTTreeCursor::_closeForNow(std::size_t depth) {
+std::expected<void, int> OSTTreeCursor::_closeForNow(std::size_t depth) {
     OpenDirectory& open = _open[depth % maximumOpenDirectories];
     if (!open.descriptor)
-        return; // since an earlier way down
+        return {}; // since an earlier way down
     struct stat status{};
-    OST_ASSERT(::fstat(open.descriptor.get(), &status) == 0);
+    if (::fstat(open.descriptor.get(), &status) != 0)
+        return std::unexpected(errno);
     Level& level = _levels[depth];
     level.position = open.position;
     level.device = status.st_dev;
     level.inode = status.st_ino;
     open.descriptor.reset();
+    return {};
 }
 
 std::expected<void, int> OSTTreeCursor::_reopen(std::size_t depth, int child) {

@@ -69,7 +69,7 @@ private:
     };
 
     void _setItem(const char* name);
-    void _closeForNow(std::size_t depth);
+    [[nodiscard]] std::expected<void, int> _closeForNow(std::size_t depth);
     [[nodiscard]] std::expected<void, int> _reopen(std::size_t depth, int child);
 
     std::vector<Level> _levels;

@@ -41,11 +41,9 @@ TEST_F(UserIdentity, IsResolvedByTheFirstRuleThatApplies) {
     };
     for (const auto& c : cases) {
         const auto result = validateUserId(c.userId, static_cast<OSTContainerClass>(c.containerClass), c.client);
-        EXPECT_EQ(c.resolved.has_value(), result.has_value()) << c.userId << " " << c.containerClass << " " << c.client;
-        if (result && c.resolved)
-            EXPECT_EQ(*c.resolved, *result);
-        if (!result)
-            EXPECT_EQ(OSTErrorCode::invalidParameter, result.error());
+        const auto expected = c.resolved ? std::expected<std::uint32_t, OSTErrorCode>(*c.resolved)
+                                         : std::unexpected(OSTErrorCode::invalidParameter);
+        EXPECT_TRUE(expected == result) << c.userId << " " << c.containerClass << " " << c.client;
     }
 }
 

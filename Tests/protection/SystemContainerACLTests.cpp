@@ -100,9 +100,17 @@ TEST_F(SystemContainerACLTest, OnlySystemServicesGetIntoANewContainer) {
 
     EXPECT_EQ(asService(true, [] { return makeDirectory(std::string(container) + "/added"); }), 0);
     EXPECT_EQ(asService(false, [] { return makeDirectory(std::string(container) + "/refused"); }), EACCES);
-    // The metadata file was there before the ACL; it is everybody's to read and root's to write.
-    EXPECT_EQ(asService(true, [] { return openFile(std::string(container) + "/" + metadataName, O_RDWR); }), EACCES);
-    EXPECT_EQ(asService(true, [] { return openFile(std::string(container) + "/" + metadataName, O_RDONLY); }), 0);
+    // The metadata file is everybody's to read and root's to write, also when it is written again below the ACL.
+    const auto metadata = std::string(container) + "/" + metadataName;
+    for (const bool rewritten : {false, true}) {
+        if (rewritten) {
+            ASSERT_TRUE(files.writeFileAtomicallyAtURL(metadata, "new metadata"));
+        }
+        for (const bool member : {true, false}) {
+            EXPECT_EQ(asService(member, [&] { return openFile(metadata, O_RDWR); }), EACCES);
+            EXPECT_EQ(asService(member, [&] { return openFile(metadata, O_RDONLY); }), 0);
+        }
+    }
 
     EXPECT_TRUE(files.setTopLevelSystemContainerACLAtURL("/missing").error().is(OSTErrorCode::accessControlListFailed));
     fs::create_directory_symlink(container, "/link");

@@ -15,6 +15,7 @@
 #include <sys/sysmacros.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <filesystem>
 #include <future>
 
@@ -267,11 +268,27 @@ TEST_F(ContainerStore, CacheReportsWhatGoneBehindItsBack) {
     EXPECT_EQ(OSTErrorCode::cacheInconsistent, lookUp("org.example.app", true).error());
     EXPECT_EQ(1U, store().containersForUser(501, dataApplication, false)->size());
 
-    const auto& cache = OSTContainerCache::sharedInstance();
-    const auto wrongUser = const_cast<OSTContainerCache&>(cache).containerForUser(501, dataSystem, "a", false);
+    const auto wrongUser = OSTContainerCache::sharedInstance().containerForUser(501, dataSystem, "a", false);
     ASSERT_FALSE(wrongUser);
     EXPECT_TRUE(wrongUser.error().is(OSTErrorCode::cacheRebuildFailed));
     EXPECT_TRUE(wrongUser.error().underlyingError()->is(OSTErrorCode::invalidCacheInput));
+}
+
+TEST_F(ContainerStore, CacheTellsLiveAndTransientContainersApart) {
+    auto& cache = OSTContainerCache::sharedInstance();
+    const auto live = *lookUp("org.example.app", true);
+    const auto transient = *lookUp("org.example.app", true, true);
+    EXPECT_EQ(live->url, cache.containerForUser(501, dataApplication, "org.example.app", live->uuid)->url);
+    const auto found = cache.containerForUser(501, dataApplication, "org.example.app", transient->uuid);
+    EXPECT_EQ(transient->url, found->url);
+    EXPECT_TRUE(found->transient);
+    EXPECT_FALSE(cache.containerForUser(501, dataApplication, "org.example.app", platform::UUID::generate()));
+
+    ASSERT_TRUE(cache.removeContainerForUser(501, dataApplication, "org.example.app", true));
+    ASSERT_TRUE(cache.removeContainerForUser(501, dataApplication, "org.example.app", true)) << "absent is no error";
+    EXPECT_TRUE(cache.allContainerIdentifiersForUser(501, dataApplication, true)->empty());
+    EXPECT_EQ(std::vector<std::string>{"org.example.app"},
+              *cache.allContainerIdentifiersForUser(501, dataApplication, false));
 }
 
 TEST_F(ContainerStore, ParallelCreationMakesEachContainerOnce) {

@@ -56,9 +56,9 @@ bool setImmutable(const std::string& path, bool immutable) {
 /// A file system of its own, mounted for the life of the object.
 class Mount {
 public:
-    explicit Mount(std::string path) : _path(std::move(path)) {
+    explicit Mount(std::string path, const char* options = "") : _path(std::move(path)) {
         fs::create_directories(_path);
-        _mounted = ::mount("tmpfs", _path.c_str(), "tmpfs", 0, "") == 0;
+        _mounted = ::mount("tmpfs", _path.c_str(), "tmpfs", 0, options) == 0;
     }
     ~Mount() {
         if (_mounted)
@@ -463,6 +463,13 @@ TEST_F(OSTFileManagerTest, WritesAtomicallyWithoutFollowingOrLeavingAnything) {
         EXPECT_EQ(readFile(at(name)), name);
     }
     EXPECT_EQ(readFile(at("victim/file")), "untouched");
+
+    if (const Mount small(at("small"), "size=64k"); small) {
+        const std::string tooMuch(100'000, 'x');
+        EXPECT_EQ(errorOf(files.writeFileAtomicallyAtURL(at("small/file"), tooMuch)), ENOSPC);
+        EXPECT_EQ(errorOf(files.createFileAtURL(at("small/file"), tooMuch)), ENOSPC);
+        EXPECT_TRUE(fs::is_empty(at("small")));
+    }
 
     auto created = files.createFileAtURL(at("target/new"), "content", {.mode = 0640});
     ASSERT_TRUE(created);
