@@ -73,12 +73,13 @@ public:
         auto top = OSTOpenSubdirectory(place.directory(), place.name());
         if (!top && !isNoDirectory(top.error()))
             return std::unexpected(top.error());
-        if (top)
+        const bool isDirectory = top.has_value();
+        if (isDirectory)
             OST_TRY(_removeContent(*std::move(top), path));
         _unlink({.directory = place.directory(),
                  .name = place.name(),
                  .path = path,
-                 .unlinkFlags = top ? AT_REMOVEDIR : 0,
+                 .unlinkFlags = isDirectory ? AT_REMOVEDIR : 0,
                  .liesInTree = false});
         return {};
     }

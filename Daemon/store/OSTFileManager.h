@@ -78,8 +78,8 @@ public:
     /// mode 0 takes nothing from the entries inherited. Fails with ENOTDIR when something else is in the place.
     [[nodiscard]] OSTResult<void> createDirectoryAtURL(std::string_view path,
                                                        const OSTDirectoryAttributes& attributes = {}) const;
-    /// The same for a path relative to `directory`, which is open for reading. `path` is what messages name.
-    [[nodiscard]] OSTResult<void> createDirectory(int directory, std::string_view relativePath,
+    /// The same for a path relative to the directory `base`; messages name the relative path.
+    [[nodiscard]] OSTResult<void> createDirectory(int base, std::string_view path,
                                                   const OSTDirectoryAttributes& attributes) const;
     /// Opens the directory at `path` for the functions that take a path relative to one.
     [[nodiscard]] OSTResult<platform::FileDescriptor> openDirectoryAtURL(std::string_view path) const;

@@ -78,10 +78,10 @@ void makeDeepTree(const std::string& top, int depth) {
     fs::create_directory(top);
     platform::FileDescriptor directory(::open(top.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     for (int level = 0; level < depth; ++level) {
-        ASSERT_EQ(::mkdirat(directory.get(), "level", 0755), 0);
-        platform::FileDescriptor(::openat(directory.get(), "file", O_CREAT | O_WRONLY | O_CLOEXEC, 0644));
-        directory.reset(::openat(directory.get(), "level", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
         ASSERT_TRUE(directory);
+        ASSERT_EQ(::mkdirat(directory.get(), "level", 0755), 0);
+        ASSERT_EQ(::mknodat(directory.get(), "file", S_IFREG | 0644, 0), 0);
+        directory.reset(::openat(directory.get(), "level", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     }
 }
 
