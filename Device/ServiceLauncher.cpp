@@ -123,6 +123,8 @@ Result<ServiceLauncher> ServiceLauncher::prepare(const BootOptions& options) {
     ServiceLauncher launcher(OST_TRY(DeviceImage::openOrMake(options.image)));
     launcher._command = options.command;
     OST_TRY(launcher._image.reserve());
+    // Before the sockets appear: whoever sees them may also end us.
+    OST_TRY(launcher._receiveSignals());
     OST_TRY(launcher._rememberHost());
     OST_TRY(launcher._openDaemon(options.daemon));
     OST_TRY(launcher._image.mountDeviceFileSystems());
@@ -133,7 +135,6 @@ Result<ServiceLauncher> ServiceLauncher::prepare(const BootOptions& options) {
                            Listener{"com.tamarok.ostrandd.upcall", SOCK_SEQPACKET}};
     for (Listener& listener : launcher._listeners)
         OST_TRY(launcher._listen(listener));
-    OST_TRY(launcher._receiveSignals());
     return launcher;
 }
 

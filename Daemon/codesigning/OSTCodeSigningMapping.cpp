@@ -119,7 +119,70 @@ OSTCodeSigningMapping::processCallerRegisteredEntitlements(std::shared_ptr<const
                                   {.registeredByCaller = true});
 }
 
+void OSTCodeSigningMapping::removeCodeSigningDictionariesForIdentifierAndItsChildren(std::string_view identifier) {
+    _codeSignQueue.sync([&] {
+        for (const auto& each : _childrenAndIdentifier(identifier))
+            if (const auto removed = _onQueue_processCodeSigningInfo(nullptr, each, {}); !removed)
+                platform::logAs(platform::LogLevel::error,
+                                "_onQueue_removeCodeSigningDictionariesForIdentifierAndItsChildren",
+                                "Failed to clear entitlements for %@ : %llu", each, removed.error().code());
+    });
+}
+
+OSTResult<void>
+OSTCodeSigningMapping::invalidateCodeSigningInfoForIdentifierAndItsChildren(std::string_view identifier) {
+    return _codeSignQueue.sync([&]() -> OSTResult<void> {
+        if (!_available)
+            return {};
+        for (const auto& each : _childrenAndIdentifier(identifier)) {
+            const auto stored = _entry(each);
+            if (!stored)
+                continue;
+            auto entry = *stored;
+            entry.invalid = true;
+            _codeSigningMappingDict.insert_or_assign(each, std::make_shared<const OSTCodeSigningEntry>(std::move(entry)));
+            if (each == identifier)
+                platform::logDebug("Invalidating code signing info for %@", identifier);
+            else
+                platform::logDebug("Invalidating code signing info for %@ child: %@", identifier, each);
+        }
+        return _writeCodeSigningMappingToDisk();
+    });
+}
+
+std::vector<std::pair<std::string, OSTCodeSigningMapping::EntryRecord>>
+OSTCodeSigningMapping::entriesOfIdentifierAndItsChildren(std::string_view identifier) {
+    return _codeSignQueue.sync([&] {
+        std::vector<std::pair<std::string, EntryRecord>> entries;
+        for (auto& each : _childrenAndIdentifier(identifier)) {
+            auto entry = _entry(each);
+            entries.emplace_back(std::move(each), std::move(entry));
+        }
+        return entries;
+    });
+}
+
+void OSTCodeSigningMapping::restoreEntries(const std::vector<std::pair<std::string, EntryRecord>>& entries) {
+    if (!_available)
+        return;
+    std::vector<std::string> identifiers;
+    std::vector<EntryRecord> records;
+    for (const auto& [identifier, entry] : entries) {
+        identifiers.push_back(identifier);
+        records.push_back(entry);
+    }
+    // What fails is in the log; memory has the entries, and the next successful write stores them.
+    _codeSignQueue.sync([&] { (void)_setCodeSigningDictionaryValues(records, identifiers); });
+}
+
 // On the queue
+
+std::vector<std::string> OSTCodeSigningMapping::_childrenAndIdentifier(std::string_view identifier) const {
+    const auto entry = _entry(identifier);
+    auto identifiers = entry ? entry->childBundleIdentifiers.value_or(std::vector<std::string>()) : std::vector<std::string>();
+    identifiers.emplace_back(identifier);
+    return identifiers;
+}
 
 OSTCodeSigningMapping::EntryRecord OSTCodeSigningMapping::_entry(std::string_view identifier) const {
     OST_ASSERT(_codeSignQueue.isCurrent());

@@ -11,6 +11,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <utility>
 #include <vector>
 
 namespace ost {
@@ -56,8 +57,23 @@ public:
     [[nodiscard]] OSTErrorCode processCallerRegisteredEntitlements(std::shared_ptr<const OSTDictionary> entitlements,
                                                                    std::optional<std::string_view> identifier);
 
-private:
+    /// Removes the entries of an identifier and of its children, and writes the mapping. Failures are logged. The caller holds
+    /// the all-identifiers lock for writing.
+    void removeCodeSigningDictionariesForIdentifierAndItsChildren(std::string_view identifier);
+
+    /// Marks the entries of an identifier and of its children invalid and writes the mapping, also when there are none. Fails
+    /// with `mappingWriteFailed`.
+    [[nodiscard]] OSTResult<void> invalidateCodeSigningInfoForIdentifierAndItsChildren(std::string_view identifier);
+
     using EntryRecord = std::shared_ptr<const OSTCodeSigningEntry>;
+
+    /// The entries of an identifier and of its children as they are now.
+    [[nodiscard]] std::vector<std::pair<std::string, EntryRecord>>
+    entriesOfIdentifierAndItsChildren(std::string_view identifier);
+    /// Puts entries back and writes the mapping; a failure is logged.
+    void restoreEntries(const std::vector<std::pair<std::string, EntryRecord>>& entries);
+
+private:
     using Entries = std::map<std::string, EntryRecord, std::less<>>;
     using GroupList = std::optional<std::vector<std::string>>;
     enum class Request : bool { internal, external };
@@ -78,6 +94,8 @@ private:
     // On the queue only
     [[nodiscard]] EntryRecord _entry(std::string_view identifier) const;
     [[nodiscard]] EntryRecord _onQueue_codeSigningInfoForIdentifier(std::string_view identifier, Request request);
+    /// The identifier's children in order, then the identifier itself.
+    [[nodiscard]] std::vector<std::string> _childrenAndIdentifier(std::string_view identifier) const;
     [[nodiscard]] EntryRecord _migrateFromBundleContainer(std::string_view identifier);
     [[nodiscard]] GroupList _onQueue_appGroupIdentifiersForIdentifier(std::string_view identifier);
     [[nodiscard]] GroupList _onQueue_systemGroupIdentifiersForIdentifier(std::string_view identifier);

@@ -14,4 +14,20 @@ OSTCodeSigningStoreDelegate::wellknownContainerForId(std::string_view identifier
     return OSTWhitelist::sharedWhitelist().wellknownContainerForId(identifier, containerClass);
 }
 
+void OSTCodeSigningStoreDelegate::removeCodeSigningDictionariesForIdentifierAndItsChildren(std::string_view identifier) {
+    OSTCodeSigningMapping::sharedInstance().removeCodeSigningDictionariesForIdentifierAndItsChildren(identifier);
+}
+
+OSTStoreDelegate::Restoration
+OSTCodeSigningStoreDelegate::rememberIdentifierAndItsChildren(std::string_view identifier) {
+    return [entries = OSTCodeSigningMapping::sharedInstance().entriesOfIdentifierAndItsChildren(identifier)] {
+        OSTCodeSigningMapping::sharedInstance().restoreEntries(entries);
+    };
+}
+
+OSTResult<void>
+OSTCodeSigningStoreDelegate::invalidateCodeSigningInfoForIdentifierAndItsChildren(std::string_view identifier) {
+    return OSTCodeSigningMapping::sharedInstance().invalidateCodeSigningInfoForIdentifierAndItsChildren(identifier);
+}
+
 } // namespace ost

@@ -7,8 +7,16 @@
 
 namespace ost {
 
+namespace {
+
+/// Deeper than any value that comes from a request or a program's signature, which are at most 64 deep, and is then stored
+/// some levels down: whatever is written can be read again. No object takes less than a byte.
+constexpr std::size_t maximumDepth = 128;
+
+} // namespace
+
 OSTResult<OSTDictionary> OST_dictionaryWithContents(std::string_view bytes, std::string_view path) {
-    const auto value = platform::parsePropertyList(bytes);
+    const auto value = platform::parsePropertyList(bytes, {.depth = maximumDepth, .objectCount = bytes.size()});
     if (!value)
         return std::unexpected(OSTCreatePropertyListError("%@ is no property list: %@", path, value.error()));
     const OSTDictionary* const dictionary = value->asDictionary();

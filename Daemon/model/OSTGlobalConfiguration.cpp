@@ -1,6 +1,7 @@
 #include "model/OSTGlobalConfiguration.h"
 
 #include "model/OSTMadeDirectory.h"
+#include "platform/Accounts.h"
 #include "platform/Log.h"
 #include "platform/Path.h"
 
@@ -21,6 +22,21 @@ constexpr OSTDirectoryAttributes unprotected{
 std::string canonical(const char* path) {
     char buffer[PATH_MAX];
     return ::realpath(path, buffer) ? buffer : path;
+}
+
+constexpr std::string_view cachesName = "Library/Caches/com.tamarok.ostrandd";
+constexpr std::string_view transientName = "Temp";
+
+/// Whether `base` holds class directories of real users.
+bool isBaseOfAUser(std::string_view base) {
+    return platform::accountMatching([&](const platform::Account& account) {
+               if (account.uid <= OSTHighestSystemUserId)
+                   return false;
+               const auto home = canonical(account.home.c_str());
+               return base == pathByAppending(home, OSTUserBaseDirectoryName) ||
+                      base == pathByAppending(home, OSTUserTransientDirectoryName);
+           })
+        .has_value();
 }
 
 } // namespace
@@ -48,7 +64,7 @@ std::string OSTGlobalConfiguration::logDirectory() {
 
 std::string OSTGlobalConfiguration::cachesDirectory() {
     const std::lock_guard lock(_mutex);
-    return OSTMadeDirectory(pathByAppending(_homeDirectory, "Library/Caches/com.tamarok.ostrandd"), unprotected,
+    return OSTMadeDirectory(pathByAppending(_homeDirectory, cachesName), unprotected,
                             "Failed to create cache dir at \"%@\": %@");
 }
 
@@ -60,7 +76,7 @@ std::string OSTGlobalConfiguration::libraryDirectory() {
 
 std::string OSTGlobalConfiguration::transientDirectory() {
     const std::lock_guard lock(_mutex);
-    return OSTMadeDirectory(pathByAppending(cachesDirectory(), "Temp"), withIntermediates,
+    return OSTMadeDirectory(pathByAppending(cachesDirectory(), transientName), withIntermediates,
                             "Failed to create transient dir at \"%@\": %@");
 }
 
@@ -127,6 +143,28 @@ std::optional<std::string> OSTGlobalConfiguration::containerDirectoryURLForUser(
     return OSTMadeDirectory(pathByAppending(base, pathComponentForContainerClass(contentClass)),
                             {.withIntermediateDirectories = true, .mode = 0755, .owner = owner},
                             "Failed to create container dir at \"%@\": %@");
+}
+
+bool OSTGlobalConfiguration::isContainerURL(std::string_view url) const {
+    const auto name = platform::lastPathComponent(url);
+    if (!url.starts_with('/') || name.empty() || name == "." || name == "..")
+        return false;
+    const auto holder = platform::pathByDeletingLastComponent(url);
+    for (auto number = std::uint64_t{1}; number < static_cast<std::uint64_t>(OSTContainerClass::max); ++number) {
+        const auto containerClass = static_cast<OSTContainerClass>(number);
+        const auto component = pathComponentForContainerClass(containerClass);
+        if (!holder.ends_with(component) || !holder.substr(0, holder.size() - component.size()).ends_with('/'))
+            continue;
+        const auto base = holder.substr(0, holder.size() - component.size() - 1);
+        if (isPerUserClass(containerClass))
+            return isBaseOfAUser(base);
+        if (base == _sharedContainersDirectory)
+            return true;
+        const auto& home = isBundleClass(containerClass) ? _tessalydHomeDirectory : _homeDirectory;
+        const auto caches = pathByAppending(home, cachesName);
+        return base == (isBundleClass(containerClass) ? caches : pathByAppending(caches, transientName));
+    }
+    return false;
 }
 
 const std::array<std::string_view, 4>& OSTGlobalConfiguration::appUserDataItemNames() {

@@ -46,6 +46,10 @@ public:
     [[nodiscard]] std::optional<std::string> containerDirectoryURLForUser(std::uint32_t userId,
                                                                           OSTContainerClass contentClass, bool transient);
 
+    /// Whether `url` could be the path of a container: a name directly inside the class directory of a class and user. Makes no
+    /// directory.
+    [[nodiscard]] bool isContainerURL(std::string_view url) const;
+
     /// The items at the top of an application's data container that belong to the user's data.
     [[nodiscard]] static const std::array<std::string_view, 4>& appUserDataItemNames();
 

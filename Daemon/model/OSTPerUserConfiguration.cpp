@@ -49,7 +49,7 @@ OSTDirectoryAttributes OSTPerUserConfiguration::_ownedByUser() const {
 }
 
 std::optional<std::string> OSTPerUserConfiguration::userBaseDirectory() {
-    auto path = _inHome("Containers");
+    auto path = _inHome(OSTUserBaseDirectoryName);
     if (!path)
         return std::nullopt;
     const std::lock_guard lock(_mutex);
@@ -57,7 +57,7 @@ std::optional<std::string> OSTPerUserConfiguration::userBaseDirectory() {
 }
 
 std::optional<std::string> OSTPerUserConfiguration::transientDirectory() {
-    auto path = _inHome("Library/Caches/com.tamarok.ostrandd/Temp");
+    auto path = _inHome(OSTUserTransientDirectoryName);
     if (!path)
         return std::nullopt;
     const std::lock_guard lock(_mutex);

@@ -88,6 +88,10 @@ std::expected<Account, int> accountForUserId(uid_t uid) {
     return find(passwdFile, parseAccount, [&](const Account& account) { return account.uid == uid; });
 }
 
+std::expected<Account, int> accountMatching(const std::function<bool(const Account&)>& matches) {
+    return find(passwdFile, parseAccount, matches);
+}
+
 std::expected<gid_t, int> groupForName(std::string_view name) {
     return OST_TRY(find(groupFile, parseGroup, [&](const Group& group) { return group.name == name; }))
     .gid;

@@ -3,6 +3,7 @@
 #include <sys/types.h>
 
 #include <expected>
+#include <functional>
 #include <string>
 #include <string_view>
 
@@ -25,6 +26,8 @@ struct Account {
 
 [[nodiscard]] std::expected<Account, int> accountForName(std::string_view name);
 [[nodiscard]] std::expected<Account, int> accountForUserId(uid_t uid);
+/// The first account for which `matches` gives true.
+[[nodiscard]] std::expected<Account, int> accountMatching(const std::function<bool(const Account&)>& matches);
 [[nodiscard]] std::expected<gid_t, int> groupForName(std::string_view name);
 [[nodiscard]] std::expected<std::string, int> groupForId(gid_t gid);
 

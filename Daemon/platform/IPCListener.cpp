@@ -93,10 +93,12 @@ private:
             return peer.error();
         const auto connection =
             std::make_shared<IPCConnection>(std::exchange(_next, {}), *std::move(peer), _surroundings);
-        if (const auto added = _surroundings.registry.add(connection); !added)
-            logError("connection of pid %d closed: %s", connection->peer().processId(), added.error());
-        else
+        if (const auto added = _surroundings.registry.add(connection)) {
             _introduce(connection);
+        } else {
+            logError("connection of pid %d closed: %s", connection->peer().processId(), added.error());
+            connection->_close();
+        }
         return 0;
     }
 

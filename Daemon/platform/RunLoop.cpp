@@ -9,7 +9,6 @@
 #include <algorithm>
 #include <array>
 #include <cerrno>
-#include <limits>
 #include <span>
 
 namespace ost::platform {
@@ -86,14 +85,6 @@ void RunLoop::async(Work work) {
     _wake();
 }
 
-void RunLoop::asyncAfter(std::chrono::milliseconds delay, Work work) {
-    {
-        const std::lock_guard lock(_mutex);
-        _timers.emplace(Clock::now() + delay, std::move(work));
-    }
-    _wake();
-}
-
 void RunLoop::stop() {
     _stopping = true;
     _wake();
@@ -109,7 +100,7 @@ void RunLoop::run() {
     OST_ASSERT(_thread == std::this_thread::get_id());
     std::array<epoll_event, eventsPerWait> events;
     while (!_stopping) {
-        const int count = ::epoll_wait(_epoll.get(), events.data(), eventsPerWait, _millisecondsToNextTimer());
+        const int count = ::epoll_wait(_epoll.get(), events.data(), eventsPerWait, -1);
         OST_ASSERT(count >= 0 || errno == EINTR);
         for (const auto& event : std::span(events).first(static_cast<std::size_t>(std::max(count, 0)))) {
             if (_stopping)
@@ -125,16 +116,6 @@ void RunLoop::run() {
     _stopping = false;
 }
 
-int RunLoop::_millisecondsToNextTimer() {
-    const std::lock_guard lock(_mutex);
-    if (!_work.empty())
-        return 0;
-    if (_timers.empty())
-        return -1;
-    const auto left = std::chrono::ceil<std::chrono::milliseconds>(_timers.begin()->first - Clock::now()).count();
-    return static_cast<int>(std::clamp<std::int64_t>(left, 0, std::numeric_limits<int>::max()));
-}
-
 void RunLoop::_clearWakeUp() {
     // Happens before the work is taken: work that comes later sets it again.
     std::uint64_t wakeUps = 0;
@@ -146,9 +127,6 @@ void RunLoop::_runDueWork() {
     {
         const std::lock_guard lock(_mutex);
         due.swap(_work);
-        const auto end = _timers.empty() ? _timers.end() : _timers.upper_bound(Clock::now());
-        for (auto timer = _timers.begin(); timer != end; timer = _timers.erase(timer))
-            due.push_back(std::move(timer->second));
     }
     for (auto work = due.begin(); work != due.end(); ++work) {
         (*work)();

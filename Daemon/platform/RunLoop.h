@@ -3,11 +3,9 @@
 #include "platform/FileDescriptor.h"
 
 #include <atomic>
-#include <chrono>
 #include <cstdint>
 #include <expected>
 #include <functional>
-#include <map>
 #include <memory>
 #include <mutex>
 #include <thread>
@@ -20,7 +18,7 @@ namespace ost::platform {
 /// The run loop of one thread, which is also that thread's work queue: handlers of descriptors and enqueued work run on
 /// it one at a time.
 ///
-/// Threads: the loop belongs to the thread that created it. `async`, `asyncAfter` and `stop` may be called from any
+/// Threads: the loop belongs to the thread that created it. `async` and `stop` may be called from any
 /// thread, everything else from the loop's own.
 class RunLoop {
 public:
@@ -62,15 +60,12 @@ public:
 
     /// Runs `work` on the loop's thread, in order. Work that the loop no longer comes to is destroyed with the loop.
     void async(Work work);
-    /// The same, not before `delay` has passed.
-    void asyncAfter(std::chrono::milliseconds delay, Work work);
 
     /// Serves until `stop`; returns at once when `stop` came first. What a handler throws leaves `run`.
     void run();
     void stop();
 
 private:
-    using Clock = std::chrono::steady_clock;
     struct Registration {
         int fd;
         Handler handler;
@@ -80,7 +75,6 @@ private:
 
     void _wake();
     void _clearWakeUp();
-    [[nodiscard]] int _millisecondsToNextTimer();
     void _runDueWork();
     void _serve(std::uint64_t id, std::uint32_t events);
     void _setEvents(std::uint64_t id, std::uint32_t events);
@@ -100,7 +94,6 @@ private:
     std::mutex _mutex;
     // Guarded by _mutex.
     std::vector<Work> _work;
-    std::multimap<Clock::time_point, Work> _timers;
 };
 
 } // namespace ost::platform

@@ -70,6 +70,7 @@ bool OSTDaemon::start() {
     const bool firstBoot = !platform::namedSemaphoreExists(firstBootMarker);
     if (firstBoot)
         logAs(LogLevel::notice, "main", "ostrandd performing first boot initialization");
+    store.containerManagerSetup();
 
     if (_startRunLoop())
         _upcallPort =

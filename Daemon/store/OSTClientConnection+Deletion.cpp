@@ -1,8 +1,12 @@
+#include "model/OSTFailureReport.h"
 #include "model/OSTGlobalConfiguration.h"
 #include "platform/Path.h"
 #include "platform/Transactions.h"
 #include "store/OSTClientConnection.h"
+#include "store/OSTContainerCache.h"
 #include "store/OSTFileManager.h"
+#include "store/OSTLocks.h"
+#include "store/OSTStoreDelegate.h"
 
 #include <cerrno>
 
@@ -26,6 +30,86 @@ platform::WorkQueue& OSTDeathRowQueue() {
     // Never destroyed: the process may end while a pass runs.
     static platform::WorkQueue& queue = *new platform::WorkQueue("com.tamarok.ostrandd.deathrow");
     return queue;
+}
+
+std::expected<void, OSTErrorCode>
+OSTClientConnection::stageForDeleteContainersWithUsers(const OSTDeletion& deletion) const {
+    const auto result = OSTGuarded([&]() -> OSTResult<void> {
+        if (deletion.uuids.size() != deletion.classes.size() || deletion.uuids.size() != deletion.identifiers.size())
+            return std::unexpected(
+                OSTCreateError(OSTErrorCode::invalidObject,
+                               "Can't act on an invalid input: UUIDString count: %ld, class count: %ld, ID count: %ld",
+                               deletion.uuids.size(), deletion.classes.size(), deletion.identifiers.size()));
+        const OSTAllIdentifiersLock lock(OSTLockKind::writing, deletion.useLocking);
+        return _stageForDeletion(deletion);
+    });
+    if (!result)
+        return std::unexpected(result.error().code());
+    return {};
+}
+
+OSTResult<void> OSTClientConnection::_stageForDeletion(const OSTDeletion& deletion) const {
+    for (std::size_t i = 0; i < deletion.uuids.size(); ++i) {
+        // A list of users that is too short is the caller's mistake, which the guard reports.
+        const auto userId = deletion.userIds.at(i);
+        const auto& uuid = deletion.uuids[i];
+        const auto& identifier = deletion.identifiers[i];
+        const auto containerClass = deletion.classes[i];
+        if (!uuid || !identifier || !isValidContainerClass(containerClass)) {
+            static_cast<void>(OSTCreateError(OSTErrorCode::invalidObject,
+                                             "Can't act on an invalid object: userId: %u, UUID: %@, ID: %@, Class: %ld",
+                                             userId, uuid, identifier, containerClass));
+            continue;
+        }
+        const auto record =
+            OSTContainerCache::sharedInstance().containerForUser(userId, containerClass, *identifier, *uuid);
+        if (record)
+            OST_TRY(_stageContainer(userId, *record));
+    }
+    return {};
+}
+
+OSTResult<void> OSTClientConnection::_stageContainer(std::uint32_t userId, const OSTMetadata& metadata) {
+    const auto& files = OSTFileManager::defaultManager();
+    const auto destination =
+        pathByAppending(OSTGlobalConfiguration::sharedInstance().deathrowDirectory(), lastPathComponent(metadata.url));
+    if (isBundleClass(metadata.containerClass))
+        OSTStoreDelegate::shared().removeCodeSigningDictionariesForIdentifierAndItsChildren(metadata.identifier);
+    if (const auto moved = files.moveItemAtURL(metadata.url, destination); !moved) {
+        platform::logDebug("Couldn't stage for deletion from %@ to %@: %@", metadata.url, destination, moved.error());
+        if (const auto removed = files.removeItemAtURL(metadata.url); !removed) {
+            static_cast<void>(OSTCreateError(OSTErrorCode::deletionFailed, "Failed to delete container at %@: %@",
+                                             metadata.url, removed.error()));
+            return {};
+        }
+    }
+    if (!_setSandboxContainerMappingForUser(userId, metadata.identifier, metadata.containerClass, std::nullopt))
+        platform::logError("Failed to remove container mapping in delete operation of %@, %llu", metadata.identifier,
+                           metadata.containerClass);
+    const auto removed = OSTContainerCache::sharedInstance().removeContainerForUser(
+        userId, metadata.containerClass, metadata.identifier, metadata.transient);
+    if (!removed)
+        return std::unexpected(OSTCreateError(OSTErrorCode::cacheRemoveFailed, removed.error(),
+                                              "Failed to remove from cache id: %@, class: %ld, transient: %d",
+                                              metadata.identifier, metadata.containerClass, metadata.transient));
+    return {};
+}
+
+std::expected<void, OSTErrorCode> OSTClientConnection::deleteContainerForUser(std::uint32_t userId,
+                                                                              std::optional<std::string_view> identifier,
+                                                                              OSTContainerClass containerClass,
+                                                                              bool transient) const {
+    const auto record = createOrLookupContainerForUser(
+        {.userId = userId, .identifier = identifier, .containerClass = containerClass, .transient = transient});
+    if (!record) {
+        platform::logError("Failed to lookup existing container to delete-identifier: %@, class: %ld, transient: %d",
+                           identifier, containerClass, transient);
+        return std::unexpected(record.error());
+    }
+    return stageForDeleteContainersWithUsers({.userIds = {(*record)->uid},
+                                              .uuids = {(*record)->uuid},
+                                              .identifiers = {(*record)->identifier},
+                                              .classes = {(*record)->containerClass}});
 }
 
 OSTResult<void> OSTClientConnection::_moveItemAtURLToDeathRow(const std::string& url,

@@ -13,6 +13,13 @@ OSTClientConnection& OSTClientConnection::sharedClientConnection() {
     return connection;
 }
 
+void OSTClientConnection::containerManagerSetup() const {
+    OSTFileManager::defaultManager().removeUnfinishedFilesInDirectoryURL(
+        OSTGlobalConfiguration::sharedInstance().libraryDirectory());
+    if (!_recoverFromReplaceOperations())
+        platform::logError("Failed recovering from replace operations");
+}
+
 void OSTClientConnection::containerManagerCleanup() const {
     const auto staging = OSTGlobalConfiguration::sharedInstance().stagingDirectory();
     const auto items = OSTFileManager::defaultManager().urlsForItemsInDirectoryAtURL(staging);

@@ -3,6 +3,7 @@
 #include "model/OSTContainerClass.h"
 #include "model/OSTError.h"
 #include "model/OSTMetadata.h"
+#include "platform/UUID.h"
 #include "platform/WorkQueue.h"
 
 #include <cstdint>
@@ -32,6 +33,31 @@ struct OSTContainerLookup {
     bool transient = false;
     bool createIfNecessary = false;
     bool useLocking = true; ///< false when the caller holds the all-identifiers lock for writing
+};
+
+/// Containers to be deleted, one for each index.
+struct OSTDeletion {
+    std::vector<std::uint32_t> userIds;
+    std::vector<std::optional<platform::UUID>> uuids;
+    std::vector<std::optional<std::string>> identifiers;
+    std::vector<OSTContainerClass> classes;
+    bool useLocking = true; ///< false when the caller holds the all-identifiers lock for writing
+};
+
+/// One of the two containers of a replacement.
+struct OSTReplacementSide {
+    std::optional<platform::UUID> uuid = std::nullopt;
+    std::uint32_t userId = 0;
+    std::optional<std::string> identifier = std::nullopt;
+    OSTContainerClass containerClass = OSTContainerClass::undefined;
+};
+
+/// A container to be put in another's place.
+struct OSTReplacement {
+    OSTReplacementSide oldContainer; ///< without a UUID: there is none
+    OSTReplacementSide newContainer;
+    bool preserveOldUUID = false; ///< the new one takes the old one's directory name and internal UUID
+    bool startDeletionThread = false;
 };
 
 /// The serial queue on which every death-row pass runs, at background priority.
@@ -70,13 +96,38 @@ public:
 
     // Deletion
 
+    /// Takes containers out of their places, the cache and the sandbox's mapping, and leaves them on death row. An entry that
+    /// names no container is passed over; one whose container cannot be moved or removed is logged, and keeps its place.
+    /// Codes: `invalidObject` when UUIDs, identifiers and classes differ in number, `cacheRemoveFailed`.
+    [[nodiscard]] std::expected<void, OSTErrorCode> stageForDeleteContainersWithUsers(const OSTDeletion& deletion) const;
+
+    /// Looks one container up and stages it for deletion. Codes: those of the look-up and of the staging.
+    [[nodiscard]] std::expected<void, OSTErrorCode> deleteContainerForUser(std::uint32_t userId,
+                                                                           std::optional<std::string_view> identifier,
+                                                                           OSTContainerClass containerClass,
+                                                                           bool transient) const;
+
     using DeathRowCompletion = std::move_only_function<void(std::int64_t code)>;
 
     /// Enqueues a death-row pass, which destroys everything on death row, and returns. `completion`, if any, gets
     /// `success`, or the code of the last failure.
     void deleteContainersOnDeathRowWithCompletion(DeathRowCompletion completion = nullptr) const;
 
+    // Replacement
+
+    /// Puts the new container in the place of the old one, which is discarded, or, without an old one, into its live class
+    /// directory. A crash at any moment leaves one of the two in its place. When a step fails the old container is
+    /// put back, unless the new one has taken its place already.
+    ///
+    /// Codes: `invalidObject`, `classesDiffer`, `usersDiffer`, `notFound`, `replacedByItself`, `unexpectedPath`, `alreadyExists`,
+    /// `replaceDescriptionIncomplete`, `dictionaryWriteFailed`, `moveOldToStagingFailed`, `cacheRemoveFailed`,
+    /// `mappingWriteFailed`, `replacingMoveFailed`, `cacheAddFailed`, `replaceCleanupFailed`, those of the cache.
+    [[nodiscard]] std::expected<void, OSTErrorCode> replaceContainer(const OSTReplacement& replacement) const;
+
     // Start-up
+
+    /// Finishes or undoes the replacements that a crash interrupted. Failures are logged. Runs first, and takes no locks.
+    void containerManagerSetup() const;
 
     /// Brings the store to order before anybody is served: what a crash left in staging goes to death row, and a first pass
     /// destroys it. Failures are logged. Runs before requests are accepted, and so takes no locks.
@@ -102,7 +153,34 @@ private:
     [[nodiscard]] static OSTResult<void> _createDefaultDirectory(const std::string& url, std::uint16_t mode,
                                                                  std::uint32_t owner);
 
+    // +Replacement
+    struct ReplaceOperation;
+    [[nodiscard]] static OSTResult<void> _checkReplacement(const OSTReplacement& replacement);
+    [[nodiscard]] OSTResult<void> _replace(const OSTReplacement& replacement, ReplaceOperation& operation) const;
+    [[nodiscard]] static OSTResult<OSTMetadataRecord> _containerOfSide(const OSTReplacementSide& side);
+    [[nodiscard]] static OSTResult<void> _findSides(const OSTReplacement& replacement, ReplaceOperation& operation);
+    [[nodiscard]] static OSTResult<void> _checkNothingLives(const OSTReplacement& replacement,
+                                                            const ReplaceOperation& operation);
+    [[nodiscard]] OSTResult<void> _parkOldContainer(const OSTReplacement& replacement, ReplaceOperation& operation) const;
+    [[nodiscard]] OSTResult<void> _putNewContainerInPlace(const OSTReplacement& replacement,
+                                                          ReplaceOperation& operation) const;
+    [[nodiscard]] static OSTResult<void> _forgetContainer(const OSTReplacementSide& side, const OSTMetadata& metadata);
+    [[nodiscard]] static OSTResult<void> _restoreOldContainer(ReplaceOperation& operation);
+    [[nodiscard]] OSTResult<void> _cleanUpReplacement(const OSTReplacement& replacement,
+                                                      const ReplaceOperation& operation) const;
+    [[nodiscard]] OSTResult<void> _recoverFromReplaceOperations() const;
+    [[nodiscard]] OSTResult<void> _recoverFromReplaceFile(const std::string& url) const;
+
+    // +SandboxMapping
+    /// Tells the sandbox where the container of an identifier lies, or with no URL that there is none. False, with the reason in
+    /// the log, when that failed. Bundle classes are not the sandbox's business.
+    static bool _setSandboxContainerMappingForUser(std::uint32_t userId, std::string_view identifier,
+                                                   OSTContainerClass containerClass,
+                                                   std::optional<std::string_view> url);
+
     // +Deletion
+    [[nodiscard]] OSTResult<void> _stageForDeletion(const OSTDeletion& deletion) const;
+    [[nodiscard]] static OSTResult<void> _stageContainer(std::uint32_t userId, const OSTMetadata& metadata);
     /// Moves one item to death row with one rename; an item that is already gone is success.
     /// Fails with `moveToDeathRowFailed`.
     [[nodiscard]] OSTResult<void> _moveItemAtURLToDeathRow(const std::string& url, StartPass startDeletionThread) const;

@@ -6,18 +6,24 @@
 #include "store/OSTPathResolution.h"
 #include "store/OSTUniqueName.h"
 
+#include <dirent.h>
+#include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
+#include <memory>
 
 namespace ost {
 
 using platform::FileDescriptor;
 
 namespace {
+
+/// What the name of an unfinished file begins with.
+constexpr std::string_view unfinishedPrefix = ".temp.";
 
 /// The name of a file that is removed again unless it was kept.
 class UnfinishedFile {
@@ -84,7 +90,7 @@ std::expected<void, int> writeAtomically(std::string_view path, std::string_view
                                          const OSTFileAttributes& attributes) {
     const auto place = OST_TRY(OSTItemPlace::find(path, O_RDONLY));
     FileDescriptor file;
-    UnfinishedFile unfinished(place.directory(), OST_TRY(OSTMakeUnique(".temp.", [&](const char* candidate) {
+    UnfinishedFile unfinished(place.directory(), OST_TRY(OSTMakeUnique(unfinishedPrefix, [&](const char* candidate) {
                                   file = createExclusively(place.directory(), candidate, attributes.mode);
                                   return static_cast<bool>(file);
                               })));
@@ -104,6 +110,17 @@ OSTResult<void> OSTFileManager::writeFileAtomicallyAtURL(std::string_view path, 
         return std::unexpected(
             OSTCreatePOSIXError(written.error(), "write of %@ failed: %s", path, std::strerror(written.error())));
     return {};
+}
+
+void OSTFileManager::removeUnfinishedFilesInDirectoryURL(std::string_view path) const {
+    auto directory = OSTOpenItem(AT_FDCWD, path, O_RDONLY | O_DIRECTORY);
+    const auto close = [](DIR* stream) { ::closedir(stream); };
+    const std::unique_ptr<DIR, decltype(close)> stream(directory ? ::fdopendir(directory->release()) : nullptr);
+    if (!stream)
+        return;
+    while (const dirent* const entry = ::readdir(stream.get()))
+        if (std::string_view(entry->d_name).starts_with(unfinishedPrefix))
+            ::unlinkat(::dirfd(stream.get()), entry->d_name, 0);
 }
 
 OSTResult<OSTNewFile> OSTFileManager::createFileAtURL(std::string_view path, std::string_view bytes,

@@ -12,6 +12,11 @@ public:
     std::optional<std::string> wellknownContainerForId(std::string_view, OSTContainerClass) override {
         return std::nullopt;
     }
+    void removeCodeSigningDictionariesForIdentifierAndItsChildren(std::string_view) override {}
+    Restoration rememberIdentifierAndItsChildren(std::string_view) override {
+        return [] {};
+    }
+    OSTResult<void> invalidateCodeSigningInfoForIdentifierAndItsChildren(std::string_view) override { return {}; }
 };
 
 constinit std::atomic<OSTStoreDelegate*> joined = nullptr;

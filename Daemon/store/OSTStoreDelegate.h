@@ -1,7 +1,9 @@
 #pragma once
 
 #include "model/OSTContainerClass.h"
+#include "model/OSTError.h"
 
+#include <functional>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -20,6 +22,20 @@ public:
     /// The directory name of a system service's container that exists on every device; none for all other identifiers.
     [[nodiscard]] virtual std::optional<std::string> wellknownContainerForId(std::string_view identifier,
                                                                              OSTContainerClass containerClass) = 0;
+
+    /// Forgets the code signing of an identifier and of its children: its bundle is being deleted. Failures are logged. The
+    /// caller holds the all-identifiers lock for writing.
+    virtual void removeCodeSigningDictionariesForIdentifierAndItsChildren(std::string_view identifier) = 0;
+
+    /// Puts back what was remembered.
+    using Restoration = std::move_only_function<void()>;
+    /// Remembers the code signing of an identifier and of its children as it is now.
+    [[nodiscard]] virtual Restoration rememberIdentifierAndItsChildren(std::string_view identifier) = 0;
+
+    /// Marks the code signing of an identifier and of its children as stale: its bundle is being replaced. Fails with
+    /// `mappingWriteFailed`.
+    [[nodiscard]] virtual OSTResult<void>
+    invalidateCodeSigningInfoForIdentifierAndItsChildren(std::string_view identifier) = 0;
 
     /// The joined delegate.
     [[nodiscard]] static OSTStoreDelegate& shared();

@@ -55,10 +55,17 @@ std::uint64_t objectCountOf(const std::string& file) {
     return count;
 }
 
+void expectRefused(const std::string& bytes, const std::string& reason, const PropertyListLimits& limits = {}) {
+    const auto value = parsePropertyList(bytes, limits);
+    ASSERT_FALSE(value) << bytes;
+    EXPECT_NE(value.error().reason.find(reason), std::string::npos)
+        << "\"" << value.error().reason << "\" instead of \"" << reason << "\" for " << bytes;
+}
+
 OSTDictionary everyType() {
     return OSTDictionary({{"string", "text"},
                           {"long", std::string(300, 'x')},
-                          {"wide", "caf\u00e9 \U0001f600"},
+                          {"wide", "caf\u00e9 \u6f22 \U0001f600"},
                           {"", ""},
                           {"0", u(0)},
                           {"2^8", u(256)},
@@ -79,14 +86,23 @@ OSTDictionary everyType() {
 }
 
 TEST(PropertyListTests, ReadsWhatItWrites) {
-    std::vector<OSTDictionary> dictionaries = {OSTDictionary(), everyType()};
-    OSTArray many; // references and offsets of two and four bytes
-    for (std::uint64_t i = 0; i < 70'000; ++i)
-        many.push_back(u(i));
-    dictionaries.push_back(OSTDictionary({{"few", OSTArray(many.begin(), many.begin() + 300)}}));
-    dictionaries.push_back(OSTDictionary({{"many", many}}));
-    for (const auto& dictionary : dictionaries) {
-        const auto value = parsePropertyList(serializeBinaryPropertyList(dictionary));
+    const auto numbers = [](std::uint64_t count) {
+        OSTArray array;
+        for (std::uint64_t i = 0; i < count; ++i)
+            array.push_back(u(i));
+        return OSTDictionary({{"numbers", std::move(array)}});
+    };
+    const struct {
+        OSTDictionary dictionary;
+        int offsetWidth;
+        int referenceWidth;
+    } cases[] = {{OSTDictionary(), 1, 1}, {numbers(50), 1, 1}, {numbers(253), 2, 1},
+                 {numbers(254), 2, 2},    {everyType(), 2, 1}, {numbers(70'000), 4, 4}};
+    for (const auto& [dictionary, offsetWidth, referenceWidth] : cases) {
+        const auto file = serializeBinaryPropertyList(dictionary);
+        EXPECT_EQ(file[file.size() - 26], offsetWidth);
+        EXPECT_EQ(file[file.size() - 25], referenceWidth);
+        const auto value = parsePropertyList(file);
         ASSERT_TRUE(value) << value.error().reason;
         EXPECT_EQ(*value, OSTValue(dictionary));
     }
@@ -108,11 +124,10 @@ TEST(PropertyListTests, WritesTheLeastEncodingOnce) {
         {"a\xff", "\x62\x00\x61\xff\xfd"s},
         {std::string(15, 'a'), "\x5f\x10\x0f"s + std::string(15, 'a')},
     };
-    for (const auto& [value, encoding] : cases)
-        EXPECT_EQ(serializeBinaryPropertyList(OSTDictionary({{"k", value}})),
-                  (BinaryFile{{"\x51k", encoding, "\xd1\x01\x02"}, 1}.bytes().replace(
-                      // The root is the first object of the table, and the last of the file.
-                      10 + encoding.size() + 3, 3, {static_cast<char>(10 + encoding.size()), '\x08', '\x0a'})));
+    for (const auto& [value, encoding] : cases) {
+        const auto file = serializeBinaryPropertyList(OSTDictionary({{"k", value}}));
+        EXPECT_EQ(file.substr(0, 10 + encoding.size()), "bplist00\x51k" + encoding);
+    }
 }
 
 TEST(PropertyListTests, ReadsBinaryFilesOfOtherWriters) {
@@ -137,53 +152,54 @@ TEST(PropertyListTests, ReadsBinaryFilesOfOtherWriters) {
 
 TEST(PropertyListTests, RefusesMalformedBinaryFiles) {
     const auto huge = ~std::uint64_t{0};
-    const std::pair<const char*, BinaryFile> cases[] = {
-        {"no objects", {{}}},
-        {"null", {{"\x00"s}}},
-        {"fill", {{"\x0f"}}},
-        {"UID", {{"\x80\x01"}}},
-        {"set", {{"\xc0"}}},
-        {"integer of 32 bytes", {{"\x15" + std::string(32, '\0')}}},
-        {"integer above 64 bits", {{"\x14\x00\x00\x00\x00\x00\x00\x00\x01"s + std::string(8, '\0')}}},
-        {"integer below 64 bits", {{"\x14" + std::string(16, '\xff')}}},
-        {"integer beyond the end", {{"\x13\x00\x00"s}}},
-        {"real of 2 bytes", {{"\x21\x00\x00"s}}},
-        {"date of 4 bytes", {{"\x32\x00\x00\x00\x00"s}}},
+    const std::pair<std::string, BinaryFile> cases[] = {
+        {"outside the table", {{}}},
+        {"null or fill object", {{"\x00"s}}},
+        {"null or fill object", {{"\x0f"}}},
+        {"unsupported kind", {{"\x80\x01"}}},
+        {"unsupported kind", {{"\xc0"}}},
+        {"bad integer", {{"\x15" + std::string(32, '\0')}}},
+        {"integer outside 64 bits", {{"\x14\x00\x00\x00\x00\x00\x00\x00\x01"s + std::string(8, '\0')}}},
+        {"integer outside 64 bits", {{"\x14" + std::string(16, '\xff')}}},
+        {"bad integer", {{"\x13\x00\x00"s}}},
+        {"bad real", {{"\x21\x00\x00"s}}},
+        {"bad date", {{"\x32\x00\x00\x00\x00"s}}},
         {"byte outside ASCII", {{"\x51\x80"}}},
-        {"NUL", {{"\x52z\x00"s}}},
-        {"NUL in UTF-16", {{"\x61\x00\x00"s}}},
-        {"lone high surrogate", {{"\x61\xd8\x00"s}}},
-        {"high surrogate without a low one", {{"\x62\xd8\x00\x00z"s}}},
-        {"lone low surrogate", {{"\x62\xdc\x00\x00z"s}}},
-        {"UTF-16 beyond the end", {{"\x62\x00z\x00"s}}},
+        {"NUL in a string", {{"\x52z\x00"s}}},
+        {"NUL in a string", {{"\x61\x00\x00"s}}},
+        {"half a surrogate pair", {{"\x61\xd8\x00"s}}},
+        {"half a surrogate pair", {{"\x62\xd8\x00\x00z"s}}},
+        {"half a surrogate pair", {{"\x62\xdc\x00\x00z"s}}},
+        {"string beyond the end", {{"\x62\x00z\x00"s}}},
         {"data beyond the end", {{"\x42z"}}},
-        {"count missing", {{"\x4f"}}},
-        {"count that is no integer", {{"\x5f\x51\x01"}}},
-        {"count of 16 bytes", {{"\x5f\x14" + std::string(16, '\0')}}},
-        {"huge count of data", {{"\x4f\x13" + bigEndian(huge, 8)}}},
-        {"huge count of UTF-16", {{"\x6f\x13" + bigEndian(huge / 2 + 1, 8)}}},
-        {"huge count of an array", {{"\xaf\x13" + bigEndian(huge / 8 + 1, 8)}, 2, 8}},
-        {"huge count of a dictionary", {{"\xdf\x13" + bigEndian(huge / 2 + 1, 8)}}},
-        {"array beyond the end", {{"\xa1"}}},
-        {"dictionary without values", {{"\xd1\x01", "\x51k"}}},
+        {"bad count", {{"\x4f"}}},
+        {"bad count", {{"\x5f\x51\x01"}}},
+        {"bad count", {{"\x5f\x14" + std::string(16, '\0')}}},
+        {"data beyond the end", {{"\x4f\x13" + bigEndian(huge, 8)}}},
+        {"string beyond the end", {{"\x6f\x13" + bigEndian(huge / 2 + 1, 8)}}},
+        {"array or dictionary beyond the end", {{"\xaf\x13" + bigEndian(huge / 8 + 1, 8)}, 2, 8}},
+        {"array or dictionary beyond the end", {{"\xdf\x13" + bigEndian(huge / 2 + 1, 8)}}},
+        {"array or dictionary beyond the end", {{"\xa1"}}},
+        {"outside the table", {{"\xd1\x01", "\x51k"}}},
         {"key that is no string", {{"\xd1\x01\x01", "\x10\x01"}}},
-        {"reference outside the table", {{"\xa1\x01"}}},
-        {"root outside the table", {{"\x09"}, 2, 1, 1}},
-        {"huge root", {{"\x09"}, 2, 1, huge}},
-        {"more objects than the table holds", {{"\x09"}, 2, 1, 0, 2}},
-        {"huge count of objects", {{"\x09"}, 2, 1, 0, huge / 2 + 2}},
-        {"offset width 0", {{"\x09"}, 0}},
-        {"offset width 9", {{"\x09"}, 9}},
-        {"reference width 0", {{"\x09"}, 2, 0}},
-        {"reference width 9", {{"\x09"}, 2, 9}},
-        {"table behind the trailer", {{"\x09"}, 2, 1, 0, 1, 100}},
-        {"table before the objects", {{"\x09"}, 2, 1, 0, 1, -5}},
-        {"table at the end of the numbers", {{"\x09"}, 2, 1, 0, 1, -10}},
-        {"array that holds itself", {{"\xa1\x00"s}}},
-        {"dictionary that holds itself", {{"\xd1\x01\x02", "\x51k", "\xa2\x00\x00"s}}},
+        {"outside the table", {{"\xa1\x01"}}},
+        {"outside the table", {{"\x09"}, 2, 1, 1}},
+        {"outside the table", {{"\x09"}, 2, 1, huge}},
+        {"table shorter than its count", {{"\x09"}, 2, 1, 0, 2}},
+        {"table shorter than its count", {{"\x09"}, 2, 1, 0, huge / 2 + 2}},
+        {"width of offsets or references", {{"\x09"}, 0}},
+        {"width of offsets or references", {{"\x09"}, 9}},
+        {"width of offsets or references", {{"\x09"}, 2, 0}},
+        {"width of offsets or references", {{"\x09"}, 2, 9}},
+        {"object outside the file", {{"\x09"}, 2, 1, 0, 1, -1}},
+        {"table outside the file", {{"\x09"}, 2, 1, 0, 1, 100}},
+        {"table outside the file", {{"\x09"}, 2, 1, 0, 1, -5}},
+        {"table outside the file", {{"\x09"}, 2, 1, 0, 1, -10}},
+        {"holds itself", {{"\xa1\x00"s}}},
+        {"holds itself", {{"\xd1\x01\x02", "\x51k", "\xa2\x00\x00"s}}},
     };
-    for (const auto& [what, file] : cases)
-        EXPECT_FALSE(parsePropertyList(file.bytes())) << what;
+    for (const auto& [reason, file] : cases)
+        expectRefused(file.bytes(), reason);
 }
 
 TEST(PropertyListTests, ReadsXML) {
@@ -206,7 +222,7 @@ TEST(PropertyListTests, ReadsXML) {
         {"<date>2026-11-22T19:46:01Z</date>", OSTDate{1795376761}},
         {"<date>1600-02-29T00:00:00Z</date>", OSTDate{-11670998400}},
         {"<array/>", OSTArray{}},
-        {"<array> <array></array> <!-- -- --> </array>"s.replace(31, 2, "x"), OSTArray{OSTArray{}}},
+        {"<array> <array></array> <!-- x --> </array>", OSTArray{OSTValue(OSTArray{})}},
         {"<dict><key>b</key><true/><key>a</key><integer>1</integer> <key>b</key><false/></dict>",
          OSTDictionary({{"a", u(1)}, {"b", false}})},
     };
@@ -217,7 +233,7 @@ TEST(PropertyListTests, ReadsXML) {
     }
 
     const auto prologue = parsePropertyList(
-        "\xef\xbb\xbf<?xml version='1.0' encoding='utf-8' standalone=\"no\" ?>\n<!-- a -- -->"s.replace(64, 2, "") +
+        "\xef\xbb\xbf<?xml version='1.0' encoding='utf-8' standalone=\"no\" ?>\n<!-- a - -->"
         "<!DOCTYPE plist PUBLIC \"-//A>[B]//EN\" 'http://a/'>\n<?p?><plist a='>' ><true /></plist ><!-- end -->\n");
     ASSERT_TRUE(prologue) << prologue.error().reason;
     EXPECT_EQ(*prologue, OSTValue(true));
@@ -227,87 +243,72 @@ TEST(PropertyListTests, RefusesMalformedXML) {
     const auto entity = [](const std::string& subset) {
         return "<!DOCTYPE plist " + subset + ">" + xml("<string>&x;</string>");
     };
-    const std::string documents[] = {
-        "",
-        "text",
-        "<plist/>",
-        "<plist></plist>",
-        "<dict/>",
-        "<plist><true/></dict>",
-        "<plist><true/>",
-        xml("<true/>") + "<true/>",
-        xml("<true/>") + "text",
-        xml("<true/><true/>"),
-        xml("text"),
-        xml("<unknown/>"),
-        xml("<string>a"),
-        xml("<string><true/></string>"),
-        xml("<string>a</key>"),
-        xml("<string>&nbsp;</string>"),
-        xml("<string>&amp</string>"),
-        xml("<string>&#0;</string>"),
-        xml("<string>&#xD800;</string>"),
-        xml("<string>&#x110000;</string>"),
-        xml("<string>&#4294967361;</string>"),
-        xml("<string>&#;</string>"),
-        xml("<string>a\0b</string>"s),
-        xml("<string>\x01</string>"),
-        xml("<string>\xff</string>"),
-        xml("<string>\xc0\x80</string>"),
-        xml("<string>\xed\xa0\x80</string>"),
-        xml("<string>\xc3</string>"),
-        xml("<string><!-- -- --></string>"),
-        xml("<string><![CDATA[</string>"),
-        xml("<integer/>"),
-        xml("<integer>1 2</integer>"),
-        xml("<integer>--1</integer>"),
-        xml("<integer>0x</integer>"),
-        xml("<integer>1f</integer>"),
-        xml("<integer>18446744073709551616</integer>"),
-        xml("<integer>-9223372036854775809</integer>"),
-        xml("<real>1,5</real>"),
-        xml("<real>+-1</real>"),
-        xml("<real></real>"),
-        xml("<true>yes</true>"),
-        xml("<data>A</data>"),
-        xml("<data>AA</data>"),
-        xml("<data>AA=A</data>"),
-        xml("<data>====</data>"),
-        xml("<data>AA-_</data>"),
-        xml("<date>2026-11-22</date>"),
-        xml("<date>2026-02-29T00:00:00Z</date>"),
-        xml("<date>2026-13-01T00:00:00Z</date>"),
-        xml("<date>2026-01-01T24:00:00Z</date>"),
-        xml("<date>2026-01-01T00:00:+1Z</date>"),
-        xml("<date>2026-01-01T00:00:00+</date>"),
-        xml("<dict><key>a</key></dict>"),
-        xml("<dict><true/></dict>"),
-        xml("<dict><key>a</key><key>b</key><true/></dict>"),
-        xml("<dict><string>a</string><true/></dict>"),
-        xml("<array><key>a</key></array>"),
-        xml("<array>a</array>"),
-        xml("<array></dict>"),
-        xml("<true a></true>"),
-        xml("<true a='<'/>"),
-        xml("<true a='b/>"),
-        "<?xml version='1.0' encoding='UTF-16'?>" + xml("<true/>"),
-        "<?xml version='1.0' encoding='ISO-8859-1'?>" + xml("<true/>"),
-        "\xff\xfe<\0p\0"s,
-        "\0<\0p"s,
-        "<!DOCTYPE plist",
-        entity("[<!ENTITY x 'y'>]"),
-        entity("SYSTEM 'file:///etc/passwd' [<!ENTITY x SYSTEM 'file:///etc/passwd'>]"),
-        entity("SYSTEM 'file:///etc/passwd'"),
+    const std::pair<std::string, std::vector<std::string>> cases[] = {
+        {"Neither a binary nor an XML property list", {"", "text"}},
+        {"no element \"plist\" with a value", {"<plist/>", "<dict/>"}},
+        {"value missing", {"<plist></plist>", xml("<dict><key>a</key></dict>")}},
+        {"closing tag of another element",
+         {"<plist><true/></dict>", xml("<string>a"), xml("<string>a</key>"), xml("<array></dict>")}},
+        {"element without an end", {"<plist><true/>"}},
+        {"element behind the root element", {xml("<true/>") + "<true/>"}},
+        {"text outside an element that may hold it", {xml("<true/>") + "text", xml("text"), xml("<array>a</array>")}},
+        {"more than one value", {xml("<true/><true/>")}},
+        {"bad or unknown element",
+         {xml("<unknown/>"),
+          xml("<integer/>"),
+          xml("<integer>1 2</integer>"),
+          xml("<integer>--1</integer>"),
+          xml("<integer>0x</integer>"),
+          xml("<integer>1f</integer>"),
+          xml("<integer>18446744073709551616</integer>"),
+          xml("<integer>-9223372036854775809</integer>"),
+          xml("<real>1,5</real>"),
+          xml("<real>+-1</real>"),
+          xml("<real></real>"),
+          xml("<true>yes</true>"),
+          xml("<data>A</data>"),
+          xml("<data>AA</data>"),
+          xml("<data>AA=A</data>"),
+          xml("<data>====</data>"),
+          xml("<data>AA-_</data>"),
+          xml("<date>2026-11-22</date>"),
+          xml("<date>2026-02-29T00:00:00Z</date>"),
+          xml("<date>2026-13-01T00:00:00Z</date>"),
+          xml("<date>2026-01-01T24:00:00Z</date>"),
+          xml("<date>2026-01-01T00:00:+1Z</date>"),
+          xml("<date>2026-01-01T00:00:00+</date>"),
+          xml("<dict><key>a</key><key>b</key><true/></dict>"),
+          xml("<array><key>a</key></array>")}},
+        {"element inside a text", {xml("<string><true/></string>")}},
+        {"unknown entity or character",
+         {xml("<string>&nbsp;</string>"), xml("<string>&amp</string>"), xml("<string>&#0;</string>"),
+          xml("<string>&#xD800;</string>"), xml("<string>&#x110000;</string>"), xml("<string>&#4294967361;</string>"),
+          xml("<string>&#;</string>"), entity("SYSTEM 'file:///etc/passwd'")}},
+        {"forbidden character", {xml("<string>a\0b</string>"s), xml("<string>\x01</string>")}},
+        {"text that is not UTF-8",
+         {xml("<string>\xff</string>"), xml("<string>\xc0\x80</string>"), xml("<string>\xed\xa0\x80</string>"),
+          xml("<string>\xc3</string>")}},
+        {"\"--\" in a comment", {xml("<string><!-- -- --></string>")}},
+        {"]]> is missing", {xml("<string><![CDATA[</string>")}},
+        {"value without a key", {xml("<dict><true/></dict>"), xml("<dict><string>a</string><true/></dict>")}},
+        {"attribute without a value", {xml("<true a></true>")}},
+        {"bad attribute value", {xml("<true a='<'/>"), xml("<true a='b/>")}},
+        {"encoding other than UTF-8",
+         {"<?xml version='1.0' encoding='UTF-16'?>" + xml("<true/>"),
+          "<?xml version='1.0' encoding='ISO-8859-1'?>" + xml("<true/>")}},
+        {"UTF-16 is not supported", {"\xff\xfe<\0p\0"s, "\0<\0p"s}},
+        {"document type without an end", {"<!DOCTYPE plist"}},
+        {"document type with declarations of its own",
+         {entity("[<!ENTITY x 'y'>]"),
+          entity("SYSTEM 'file:///etc/passwd' [<!ENTITY x SYSTEM 'file:///etc/passwd'>]")}},
     };
-    for (const auto& document : documents)
-        EXPECT_FALSE(parsePropertyList(document)) << document;
+    for (const auto& [reason, documents] : cases)
+        for (const auto& document : documents)
+            expectRefused(document, reason);
 }
 
 TEST(PropertyListTests, SaysWhereXMLIsMalformed) {
-    const auto value = parsePropertyList("<plist>\n<array>\n<oops/>\n</array></plist>");
-    ASSERT_FALSE(value);
-    EXPECT_NE(value.error().reason.find("line 3: bad or unknown element \"oops\""), std::string::npos)
-        << value.error().reason;
+    expectRefused("<plist>\n<array>\n<oops/>\n</array></plist>", "line 3: bad or unknown element \"oops\"");
 }
 
 TEST(PropertyListTests, RefusesEveryTruncation) {
@@ -339,13 +340,13 @@ TEST(PropertyListTests, BoundsDepthAndNumberOfObjects) {
     for (const auto& file : {nested(64), nestedXML(64)})
         EXPECT_TRUE(parsePropertyList(file));
     for (const auto& file : {nested(65), nestedXML(65)})
-        EXPECT_FALSE(parsePropertyList(file));
+        expectRefused(file, "nested too deeply");
 
     const OSTDictionary fiveObjects({{"a", OSTArray{true, true}}});
     for (const auto& file :
          {serializeBinaryPropertyList(fiveObjects), xml("<dict><key>a</key><array><true/><true/></array></dict>")}) {
         EXPECT_TRUE(parsePropertyList(file, {.objectCount = 5}));
-        EXPECT_FALSE(parsePropertyList(file, {.objectCount = 4}));
+        expectRefused(file, "too many objects", {.objectCount = 4});
     }
 }
 
@@ -371,11 +372,8 @@ TEST(PropertyListTests, RefusesTreesOutOfProportionToTheFile) {
                          "\x5f\x12" + bigEndian(1'000'000, 4) + std::string(1'000'000, 'x')},
                         4};
 
-    for (const auto& file : {doubling, aliased, repeated}) {
-        const auto value = parsePropertyList(file.bytes(), {.objectCount = std::size_t{1} << 40});
-        ASSERT_FALSE(value);
-        EXPECT_NE(value.error().reason.find("too often"), std::string::npos) << value.error().reason;
-    }
+    for (const auto& file : {doubling, aliased, repeated})
+        expectRefused(file.bytes(), "too often", {.objectCount = std::size_t{1} << 40});
     doubling.objects.erase(doubling.objects.begin() + 10, doubling.objects.end());
     doubling.objects.back() = "\xa0";
     doubling.count = 10;
@@ -383,8 +381,8 @@ TEST(PropertyListTests, RefusesTreesOutOfProportionToTheFile) {
 }
 
 TEST(PropertyListTests, ReadsItsOwnFilesHoweverOftenAStringOccurs) {
-    for (const std::size_t length : {10U, 64U, 65U, 200U, 100'000U}) {
-        const OSTDictionary dictionary({{"k", OSTArray(length > 1000 ? 2000 : 100'000, std::string(length, 'x'))}});
+    for (const std::size_t length : {10U, 64U, 65U, 200U, 1000U}) {
+        const OSTDictionary dictionary({{"k", OSTArray(20'000, std::string(length, 'x'))}});
         const auto file = serializeBinaryPropertyList(dictionary);
         const auto value = parsePropertyList(file);
         ASSERT_TRUE(value) << value.error().reason << " for " << length;

@@ -172,7 +172,7 @@ TEST_F(UpcallPortTest, copiesNoRegionThatIsNotOneOfItsSize) {
 
 TEST_F(UpcallPortTest, handsOnShortMessagesWithTheirTrueSizeAndDropsWhatIsNone) {
     const auto client = connect();
-    for (const std::size_t size : {24, 51})
+    for (const std::size_t size : {24U, 51U})
         send(client, request(), {}, size);
     const auto& messages = served();
     ASSERT_EQ(messages.size(), 2U);

@@ -1,0 +1,36 @@
+#pragma once
+
+#include "Client/Connection.h"
+#include "support/ChildProcess.h"
+
+#include <sys/types.h>
+
+#include <cstdint>
+#include <filesystem>
+#include <string>
+
+namespace ost::benchmarks {
+
+/// A device image with the daemon running in it, from construction to destruction. The image stays, and may be booted
+/// again.
+class BootedDevice {
+public:
+    /// Boots the image at `image`, which is made when it is missing, and waits until the daemon serves.
+    explicit BootedDevice(const std::filesystem::path& image);
+
+    [[nodiscard]] ostrand::Connection connect() const;
+    [[nodiscard]] std::string socketPath() const;
+    /// The path by which the host finds what a reply names.
+    [[nodiscard]] std::filesystem::path hostPath(const std::string& devicePath) const;
+
+    /// The daemon's resident memory that is its own.
+    [[nodiscard]] std::uint64_t residentBytes() const;
+
+private:
+    [[nodiscard]] pid_t _daemonId() const;
+
+    std::filesystem::path _image;
+    ChildProcess _launcher;
+};
+
+} // namespace ost::benchmarks

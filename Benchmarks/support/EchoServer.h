@@ -1,0 +1,22 @@
+#pragma once
+
+#include "platform/FileDescriptor.h"
+#include "support/ChildProcess.h"
+
+#include <cstddef>
+#include <string>
+
+namespace ost::benchmarks {
+
+/// The bare work of a daemon that answers: a process with an event loop, as many threads as there are processors, each of
+/// which serves what it receives, edge-triggered. Every `requestSize` bytes are answered with the same reply.
+class EchoServer {
+public:
+    EchoServer(const std::string& socketPath, std::size_t requestSize, std::string reply);
+
+private:
+    platform::FileDescriptor _listener;
+    ChildProcess _process;
+};
+
+} // namespace ost::benchmarks

@@ -1,0 +1,13 @@
+#pragma once
+
+#include "platform/FileDescriptor.h"
+
+#include <string>
+
+namespace ost::benchmarks {
+
+[[nodiscard]] platform::FileDescriptor connectTo(const std::string& path);
+/// Never waits in `accept`.
+[[nodiscard]] platform::FileDescriptor listenOn(const std::string& path);
+
+} // namespace ost::benchmarks

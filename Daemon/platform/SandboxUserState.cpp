@@ -1,0 +1,74 @@
+#include "platform/SandboxUserState.h"
+
+#include "platform/FileDescriptor.h"
+#include "platform/Try.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cerrno>
+#include <cstdio>
+#include <string>
+
+namespace ost::platform {
+
+namespace {
+
+/// A key as a file name. No name begins with a dot, so temporary links that do never collide with one.
+std::string escapedName(std::string_view key) {
+    constexpr std::string_view plain = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789._-";
+    constexpr char digits[] = "0123456789ABCDEF";
+    std::string name;
+    for (const char c : key) {
+        if (plain.contains(c) && !(c == '.' && name.empty())) {
+            name += c;
+            continue;
+        }
+        const auto byte = static_cast<unsigned char>(c);
+        name.append({'%', digits[byte >> 4U], digits[byte & 15U]});
+    }
+    return name;
+}
+
+std::expected<FileDescriptor, int> openOrMake(int parent, const std::string& name) {
+    constexpr mode_t searchable = 0755;
+    constexpr int flags = O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
+    FileDescriptor directory(::openat(parent, name.c_str(), flags));
+    if (!directory && errno == ENOENT) {
+        if (::mkdirat(parent, name.c_str(), searchable) != 0 && errno != EEXIST)
+            return std::unexpected(errno);
+        directory.reset(::openat(parent, name.c_str(), flags));
+    }
+    if (!directory)
+        return std::unexpected(errno);
+    return directory;
+}
+
+} // namespace
+
+std::expected<void, int> setSandboxUserStateItem(std::uint32_t userId, std::uint64_t type, std::string_view key,
+                                                 std::optional<std::string_view> path) {
+    const auto top = OST_TRY(openOrMake(AT_FDCWD, sandboxStateDirectory));
+    const auto user = OST_TRY(openOrMake(top.get(), std::to_string(userId)));
+    const auto items = OST_TRY(openOrMake(user.get(), std::to_string(type)));
+    const auto name = escapedName(key);
+    if (!path) {
+        if (::unlinkat(items.get(), name.c_str(), 0) != 0 && errno != ENOENT)
+            return std::unexpected(errno);
+        return {};
+    }
+    static std::atomic<unsigned> links = 0;
+    const auto temporary = "." + std::to_string(::getpid()) + "." + std::to_string(links++);
+    if (::symlinkat(std::string(*path).c_str(), items.get(), temporary.c_str()) != 0)
+        return std::unexpected(errno);
+    if (::renameat(items.get(), temporary.c_str(), items.get(), name.c_str()) != 0) {
+        const int error = errno;
+        ::unlinkat(items.get(), temporary.c_str(), 0);
+        return std::unexpected(error);
+    }
+    return {};
+}
+
+} // namespace ost::platform

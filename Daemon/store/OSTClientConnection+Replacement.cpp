@@ -1,0 +1,298 @@
+#include "model/OSTDictionaryFile.h"
+#include "model/OSTFailureReport.h"
+#include "model/OSTGlobalConfiguration.h"
+#include "platform/CrashReport.h"
+#include "platform/Log.h"
+#include "platform/Path.h"
+#include "platform/UUID.h"
+#include "store/OSTClientConnection.h"
+#include "store/OSTContainerCache.h"
+#include "store/OSTFileManager.h"
+#include "store/OSTLocks.h"
+#include "store/OSTReplaceFile.h"
+#include "store/OSTStoreDelegate.h"
+
+#include <cerrno>
+
+namespace ost {
+
+using platform::lastPathComponent;
+using platform::pathByAppending;
+using platform::pathByDeletingLastComponent;
+
+/// How far one replacement has come, and so what has to be undone or cleaned up when it stops.
+struct OSTClientConnection::ReplaceOperation {
+    OSTMetadataRecord oldContainer; ///< null when there is none
+    OSTMetadataRecord newContainer;
+    std::string destination;
+    bool transient = false; ///< of the container at the destination
+
+    std::string replaceFileURL; ///< empty until there may be a replace file
+    std::string stagingURL;     ///< where the old container is parked
+    bool oldIsParked = false;
+    bool oldIsForgotten = false; ///< by the cache
+    OSTStoreDelegate::Restoration restoreCodeSigning;
+    bool newIsInPlace = false;
+};
+
+std::expected<void, OSTErrorCode> OSTClientConnection::replaceContainer(const OSTReplacement& replacement) const {
+    const auto result = OSTGuarded([&]() -> OSTResult<void> {
+        OST_TRY(_checkReplacement(replacement));
+        const OSTAllIdentifiersLock lock(OSTLockKind::writing);
+        ReplaceOperation operation;
+        const auto replaced = OSTGuarded([&] { return _replace(replacement, operation); });
+        if (operation.oldIsParked && !operation.newIsInPlace) {
+            const auto restored = _restoreOldContainer(operation);
+            if (!restored && replaced.error().is(OSTErrorCode::exceptionCaught))
+                platform::crashWithMessage(restored.error().description());
+            // What could not be put back is left to the next start, for which the replace file stays.
+            if (!restored)
+                return replaced;
+        }
+        if (!operation.replaceFileURL.empty())
+            OST_TRY(_cleanUpReplacement(replacement, operation));
+        return replaced;
+    });
+    if (!result)
+        return std::unexpected(result.error().code());
+    return {};
+}
+
+OSTResult<void> OSTClientConnection::_checkReplacement(const OSTReplacement& replacement) {
+    const auto& [oldSide, newSide, preserveOldUUID, startDeletionThread] = replacement;
+    if (!newSide.uuid || !isValidContainerClass(newSide.containerClass))
+        return std::unexpected(OSTCreateError(OSTErrorCode::invalidObject,
+                                              "Can't act on an invalid object: new userId: %u, newUUID: %@, Class: %ld",
+                                              newSide.userId, newSide.uuid, newSide.containerClass));
+    if (!oldSide.uuid) {
+        if (preserveOldUUID)
+            return std::unexpected(OSTCreateError(OSTErrorCode::invalidObject,
+                                                  "Can't have a nil oldContainerUUID when preserving the UUID"));
+        return {};
+    }
+    if (!isValidContainerClass(oldSide.containerClass))
+        return std::unexpected(OSTCreateError(OSTErrorCode::invalidObject,
+                                              "Can't act on an invalid object: old userId: %u, oldUUID: %@, Class: %ld",
+                                              oldSide.userId, oldSide.uuid, oldSide.containerClass));
+    if (oldSide.containerClass != newSide.containerClass)
+        return std::unexpected(OSTCreateError(OSTErrorCode::classesDiffer,
+                                              "Can't replace containers of different class types: %ld and %ld",
+                                              oldSide.containerClass, newSide.containerClass));
+    if (oldSide.userId != newSide.userId)
+        return std::unexpected(OSTCreateError(OSTErrorCode::usersDiffer,
+                                              "Can't replace containers of different userIds: %u and %u", oldSide.userId,
+                                              newSide.userId));
+    return {};
+}
+
+OSTResult<void> OSTClientConnection::_replace(const OSTReplacement& replacement, ReplaceOperation& operation) const {
+    OST_TRY(_findSides(replacement, operation));
+    if (operation.oldContainer)
+        OST_TRY(_parkOldContainer(replacement, operation));
+    else
+        OST_TRY(_checkNothingLives(replacement, operation));
+    return _putNewContainerInPlace(replacement, operation);
+}
+
+OSTResult<OSTMetadataRecord> OSTClientConnection::_containerOfSide(const OSTReplacementSide& side) {
+    auto record = side.identifier ? OSTContainerCache::sharedInstance().containerForUser(
+                                        side.userId, side.containerClass, *side.identifier, *side.uuid)
+                                  : nullptr;
+    if (!record)
+        return std::unexpected(OSTCreateError(OSTErrorCode::notFound,
+                                              "No Container with userId: %u UUID: %@, identifier: %@, Class: %ld",
+                                              side.userId, *side.uuid, side.identifier, side.containerClass));
+    return record;
+}
+
+OSTResult<void> OSTClientConnection::_findSides(const OSTReplacement& replacement, ReplaceOperation& operation) {
+    if (replacement.oldContainer.uuid) {
+        operation.oldContainer = OST_TRY(_containerOfSide(replacement.oldContainer));
+        operation.transient = operation.oldContainer->transient;
+    }
+    operation.newContainer = OST_TRY(_containerOfSide(replacement.newContainer));
+    const auto& newURL = operation.newContainer->url;
+    if (operation.oldContainer && operation.oldContainer->url == newURL)
+        return std::unexpected(
+            OSTCreateError(OSTErrorCode::replacedByItself, "Can't replace the same container at %@", newURL));
+    if (!platform::UUID::parse(lastPathComponent(newURL)))
+        return std::unexpected(
+            OSTCreateError(OSTErrorCode::unexpectedPath, "Invalid URL (last path component not UUID): %@", newURL));
+    if (replacement.preserveOldUUID) {
+        operation.destination = operation.oldContainer->url;
+        return {};
+    }
+    const auto directory = OSTGlobalConfiguration::sharedInstance().containerDirectoryURLForUser(
+        replacement.newContainer.userId, replacement.newContainer.containerClass, operation.transient);
+    operation.destination = pathByAppending(directory.value_or(std::string()), lastPathComponent(newURL));
+    if (OSTFileManager::defaultManager().itemExistsAtURL(operation.destination))
+        return std::unexpected(
+            OSTCreateError(OSTErrorCode::alreadyExists, "Container already exists at %@", operation.destination));
+    return {};
+}
+
+OSTResult<void> OSTClientConnection::_checkNothingLives(const OSTReplacement& replacement,
+                                                        const ReplaceOperation& operation) {
+    const auto& identifier = operation.newContainer->identifier;
+    const auto containerClass = replacement.newContainer.containerClass;
+    const auto living = OSTContainerCache::sharedInstance().containerForUser(replacement.newContainer.userId,
+                                                                             containerClass, identifier, false);
+    if (living)
+        return std::unexpected(OSTCreateError(OSTErrorCode::alreadyExists,
+                                              "Container with identifier: %@, class: %ld, transient: %d already exists",
+                                              identifier, containerClass, false));
+    if (!living.error().is(OSTErrorCode::notFound))
+        return std::unexpected(living.error());
+    return {};
+}
+
+OSTResult<void> OSTClientConnection::_parkOldContainer(const OSTReplacement& replacement,
+                                                       ReplaceOperation& operation) const {
+    auto& layout = OSTGlobalConfiguration::sharedInstance();
+    const auto token = platform::UUID::generate().string();
+    operation.replaceFileURL = pathByAppending(layout.replaceDirectory(), token + ".plist");
+    operation.stagingURL = pathByAppending(layout.stagingDirectory(), token);
+    const auto& old = *operation.oldContainer;
+
+    const auto written = OSTReplaceFile{.oldURL = old.url,
+                                        .newURL = operation.newContainer->url,
+                                        .stagingURL = operation.stagingURL,
+                                        .destinationURL = operation.destination}
+                             .writeToDisk(operation.replaceFileURL);
+    if (!written) {
+        platform::logError("Failed to write replace file: %@", written.error());
+        return written;
+    }
+    if (const auto parked = OSTFileManager::defaultManager().moveItemAtURL(old.url, operation.stagingURL); !parked)
+        return std::unexpected(OSTCreateError(OSTErrorCode::moveOldToStagingFailed, parked.error(),
+                                              "Failed to move old %@ to staging %@", old.url, operation.stagingURL));
+    operation.oldIsParked = true;
+    OST_TRY(_forgetContainer(replacement.oldContainer, old));
+    operation.oldIsForgotten = true;
+    if (!isBundleClass(old.containerClass))
+        return {};
+    auto& codeSigning = OSTStoreDelegate::shared();
+    operation.restoreCodeSigning = codeSigning.rememberIdentifierAndItsChildren(old.identifier);
+    const auto invalidated = codeSigning.invalidateCodeSigningInfoForIdentifierAndItsChildren(old.identifier);
+    if (!invalidated)
+        platform::logError("Failed to invalidate code signing info for %@", old.identifier);
+    return invalidated;
+}
+
+OSTResult<void> OSTClientConnection::_forgetContainer(const OSTReplacementSide& side, const OSTMetadata& metadata) {
+    const auto removed = OSTContainerCache::sharedInstance().removeContainerForUser(
+        side.userId, side.containerClass, *side.identifier, metadata.transient);
+    if (!removed)
+        return std::unexpected(OSTCreateError(OSTErrorCode::cacheRemoveFailed, removed.error(),
+                                              "Failed to remove from cache id: %@, class: %ld, transient: %d",
+                                              *side.identifier, side.containerClass, metadata.transient));
+    return {};
+}
+
+OSTResult<void> OSTClientConnection::_putNewContainerInPlace(const OSTReplacement& replacement,
+                                                             ReplaceOperation& operation) const {
+    const auto& side = replacement.newContainer;
+    const auto& destination = operation.destination;
+    const auto& files = OSTFileManager::defaultManager();
+    const auto failedMove = [&](const OSTError& cause) {
+        const auto old = operation.oldContainer ? std::optional(operation.oldContainer->url) : std::nullopt;
+        return OSTCreateError(OSTErrorCode::replacingMoveFailed, cause, "Failed to replace: %@ with: %@ at: %@", old,
+                              operation.newContainer->url, destination);
+    };
+    if (const auto moved = files.moveItemAtURL(operation.newContainer->url, destination); !moved)
+        return std::unexpected(failedMove(moved.error()));
+    operation.newIsInPlace = true;
+
+    OST_TRY(_forgetContainer(side, *operation.newContainer));
+    if (!_setSandboxContainerMappingForUser(side.userId, *side.identifier, side.containerClass, destination))
+        platform::logError("Failed to set container mapping in replace operation of %@, %llu", *side.identifier,
+                           side.containerClass);
+    OSTMetadata metadata = *operation.newContainer;
+    if (replacement.preserveOldUUID)
+        metadata.uuid = *replacement.oldContainer.uuid;
+    const auto added = OSTContainerCache::sharedInstance().addContainerMetadata(metadata, side.userId, destination,
+                                                                                operation.transient);
+    if (!added)
+        return std::unexpected(OSTCreateError(OSTErrorCode::cacheAddFailed, added.error(),
+                                              "Failed to add to cache: %@, url: %@, transient: %d", metadata, destination,
+                                              operation.transient));
+    // Before the replace file goes, which would otherwise be gone after a power cut while the move had not happened.
+    if (const auto durable = files.makeDirectoryDurable(pathByDeletingLastComponent(destination)); !durable)
+        return std::unexpected(failedMove(durable.error()));
+    return {};
+}
+
+OSTResult<void> OSTClientConnection::_restoreOldContainer(ReplaceOperation& operation) {
+    const auto& files = OSTFileManager::defaultManager();
+    const auto& old = *operation.oldContainer;
+    platform::logDebug("Recovering from exception by moving: %@ to %@", operation.stagingURL, old.url);
+    // Something that stands in the old place is not to be replaced by what was there before.
+    auto restored = files.itemExistsAtURL(old.url)
+                        ? OSTResult<void>(std::unexpected(OSTCreatePOSIXError(EEXIST, "%@ is occupied", old.url)))
+                        : files.moveItemAtURL(operation.stagingURL, old.url);
+    if (restored)
+        restored = files.makeDirectoryDurable(pathByDeletingLastComponent(old.url));
+    if (!restored)
+        return std::unexpected(OSTCreateError(OSTErrorCode::replaceFileInvalid, restored.error(),
+                                              "Failed to recover replace move: %@ to %@", operation.stagingURL, old.url));
+    if (operation.restoreCodeSigning)
+        operation.restoreCodeSigning();
+    if (operation.oldIsForgotten)
+        static_cast<void>(
+            OSTContainerCache::sharedInstance().addContainerMetadata(old, old.uid, old.url, operation.transient));
+    return {};
+}
+
+OSTResult<void> OSTClientConnection::_cleanUpReplacement(const OSTReplacement& replacement,
+                                                         const ReplaceOperation& operation) const {
+    std::optional<OSTError> error;
+    if (const auto removed = _moveItemAtURLToDeathRow(operation.stagingURL, StartPass::no); !removed)
+        error = OSTCreateError(OSTErrorCode::replaceCleanupFailed, removed.error(), "Failed to remove staging dir: %@",
+                               operation.stagingURL);
+    const auto start = replacement.startDeletionThread ? StartPass::yes : StartPass::no;
+    if (const auto removed = _moveItemAtURLToDeathRow(operation.replaceFileURL, start); !removed)
+        error = OSTCreateError(OSTErrorCode::replaceCleanupFailed, removed.error(), "Failed to remove replace file: %@",
+                               operation.replaceFileURL);
+    if (error)
+        return std::unexpected(*error);
+    return {};
+}
+
+OSTResult<void> OSTClientConnection::_recoverFromReplaceOperations() const {
+    const auto& files = OSTFileManager::defaultManager();
+    const auto directory = OSTGlobalConfiguration::sharedInstance().replaceDirectory();
+    files.removeUnfinishedFilesInDirectoryURL(directory);
+    const auto items = files.urlsForItemsInDirectoryAtURL(directory);
+    if (!items) {
+        if (!items.error().isPOSIX(ENOENT))
+            platform::logError("Failed to get items at replace URL%@ : %@", directory, items.error());
+        return {};
+    }
+    for (const auto& item : *items)
+        OST_TRY(_recoverFromReplaceFile(pathByAppending(directory, item.name)));
+    return {};
+}
+
+OSTResult<void> OSTClientConnection::_recoverFromReplaceFile(const std::string& url) const {
+    const auto& files = OSTFileManager::defaultManager();
+    // A file that is not valid is in the log, and is only discarded.
+    if (const auto file = OSTReplaceFile::readAndValidateAtURL(url)) {
+        platform::logDebug("Doing a replace of %@ with info: %@", url, *file);
+        if (!files.itemExistsAtURL(file->oldURL) && !files.itemExistsAtURL(file->destinationURL)) {
+            platform::logDebug("Recovering from failed replace by moving: %@ to %@", file->stagingURL, file->oldURL);
+            auto moved = files.moveItemAtURL(file->stagingURL, file->oldURL);
+            if (moved)
+                moved = files.makeDirectoryDurable(pathByDeletingLastComponent(file->oldURL));
+            if (!moved)
+                return std::unexpected(OSTCreateError(OSTErrorCode::replaceFileInvalid, moved.error(),
+                                                      "Failed to recover replace move: %@ to %@", file->stagingURL,
+                                                      file->oldURL));
+        }
+    }
+    if (const auto removed = _moveItemAtURLToDeathRow(url, StartPass::no); !removed)
+        return std::unexpected(OSTCreateError(OSTErrorCode::replaceCleanupFailed, removed.error(),
+                                              "Failed to remove replace file at %@", url));
+    return {};
+}
+
+} // namespace ost

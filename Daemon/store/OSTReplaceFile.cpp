@@ -1,0 +1,73 @@
+#include "store/OSTReplaceFile.h"
+
+#include "model/OSTDictionaryFile.h"
+#include "model/OSTGlobalConfiguration.h"
+#include "platform/Path.h"
+#include "store/OSTFileManager.h"
+
+#include <optional>
+
+namespace ost {
+
+namespace {
+
+constexpr const char* oldKey = "OSTReplaceOperationOldURL";
+constexpr const char* newKey = "OSTReplaceOperationNewURL";
+constexpr const char* stagingKey = "OSTReplaceOperationStagingURL";
+constexpr const char* destinationKey = "OSTReplaceOperationDestURL";
+
+/// Whether a container may be parked there: directly in the staging directory. What is there must not be a link or a file.
+bool isStagingURL(const std::string& url) {
+    const auto name = platform::lastPathComponent(url);
+    const auto directory = platform::pathByDeletingLastComponent(url);
+    if (name.empty() || name == "." || name == ".." ||
+        directory != OSTGlobalConfiguration::sharedInstance().stagingDirectory())
+        return false;
+    const auto& files = OSTFileManager::defaultManager();
+    return files.itemDoesNotExistAtURL(url) || files.openDirectoryAtURL(url).has_value();
+}
+
+} // namespace
+
+OSTResult<void> OSTReplaceFile::writeToDisk(const std::string& url) const {
+    if (oldURL.empty() || newURL.empty() || stagingURL.empty() || destinationURL.empty())
+        return std::unexpected(OSTCreateError(OSTErrorCode::replaceDescriptionIncomplete,
+                                              "Invalid Replace File Info: old: %@, new: %@, staging: %@, dest: %@", oldURL,
+                                              newURL, stagingURL, destinationURL));
+    const OSTDictionary dictionary(
+        {{oldKey, oldURL}, {newKey, newURL}, {stagingKey, stagingURL}, {destinationKey, destinationURL}});
+    if (const auto written = OST_writeToURL(dictionary, url, OSTSmallDictionaryFileSize); !written)
+        return std::unexpected(OSTCreateError(OSTErrorCode::dictionaryWriteFailed, written.error(),
+                                              "Failed to write replace dictionary to URL %@", url));
+    return {};
+}
+
+OSTResult<OSTReplaceFile> OSTReplaceFile::readAndValidateAtURL(const std::string& url) {
+    const auto dictionary = OST_dictionaryWithContentsOfURL(url, OSTSmallDictionaryFileSize);
+    if (!dictionary)
+        return std::unexpected(OSTCreateError(OSTErrorCode::replaceFileInvalid, dictionary.error(),
+                                              "Failed to read replace file at URL %@", url));
+    const auto value = [&](const char* key) {
+        const auto* const found = dictionary->find(key);
+        return found ? std::optional(*found) : std::nullopt;
+    };
+    const auto path = [&](const char* key) {
+        const auto* const found = dictionary->find(key);
+        return found && found->asString() ? *found->asString() : std::string();
+    };
+    OSTReplaceFile file{path(oldKey), path(newKey), path(stagingKey), path(destinationKey)};
+    const auto& layout = OSTGlobalConfiguration::sharedInstance();
+    if (!layout.isContainerURL(file.oldURL) || !layout.isContainerURL(file.newURL) || !isStagingURL(file.stagingURL) ||
+        !layout.isContainerURL(file.destinationURL))
+        return std::unexpected(OSTCreateError(OSTErrorCode::replaceFileInvalid,
+                                              "Invalid replace data: Old: %@, New: %@, Staging: %@, Dest: %@",
+                                              value(oldKey), value(newKey), value(stagingKey), value(destinationKey)));
+    return file;
+}
+
+std::string OSTReplaceFile::description() const {
+    return platform::formatMessage("{old: %@, new: %@, staging: %@, dest: %@}", oldURL, newURL, stagingURL,
+                                   destinationURL);
+}
+
+} // namespace ost

@@ -1,0 +1,143 @@
+#include "support/BootedDevice.h"
+
+#include "platform/CodeSignature.h"
+#include "support/DeviceTest.h"
+#include "support/ScratchDirectory.h"
+
+#include <gtest/gtest.h>
+
+#include <poll.h>
+#include <sched.h>
+#include <sys/pidfd.h>
+#include <unistd.h>
+
+#include <charconv>
+#include <chrono>
+#include <fstream>
+#include <stdexcept>
+
+namespace ost::test {
+
+using platform::FileDescriptor;
+
+namespace {
+
+constexpr std::chrono::seconds patience{30};
+
+pid_t parentOf(pid_t process) {
+    std::ifstream status("/proc/" + std::to_string(process) + "/status");
+    for (std::string word; status >> word;)
+        if (pid_t parent = 0; word == "PPid:" && status >> parent)
+            return parent;
+    return 0;
+}
+
+bool runsDaemon(pid_t process) {
+    std::error_code gone;
+    return std::filesystem::read_symlink("/proc/" + std::to_string(process) + "/exe", gone).filename() == "ostrandd";
+}
+
+/// The daemon that a launcher has started, held so that its number cannot mean another process any more.
+FileDescriptor openDaemonOf(pid_t launcher) {
+    for (const auto& entry : std::filesystem::directory_iterator("/proc")) {
+        const std::string name = entry.path().filename();
+        pid_t process = 0;
+        if (std::from_chars(name.data(), name.data() + name.size(), process).ec != std::errc{} ||
+            parentOf(process) != launcher || !runsDaemon(process))
+            continue;
+        FileDescriptor daemon(::pidfd_open(process, 0));
+        if (daemon && parentOf(process) == launcher)
+            return daemon;
+    }
+    return {};
+}
+
+} // namespace
+
+std::string builtProgram(const char* name) { return std::string(OSTRAND_BIN_DIR "/") + name; }
+
+BootedDevice::BootedDevice()
+    : _scratch(makeScratchDirectory(0755)), _image(_scratch / "device"), _client(_makeSignedClient()) {
+    _boot();
+}
+
+BootedDevice::~BootedDevice() { shutDown(); }
+
+std::filesystem::path BootedDevice::socket() const { return onHost("/private/var/run/com.tamarok.ostrandd"); }
+
+std::filesystem::path BootedDevice::onHost(const std::filesystem::path& devicePath) const {
+    return _image / devicePath.relative_path();
+}
+
+void BootedDevice::_boot() {
+    // The command says that the device serves, and keeps it up for as long as its standard input is open.
+    _launcher.emplace(std::vector<std::string>{builtProgram("ostrand-device"), "boot", "--image", _image, "--", "sh",
+                                               "-c", "echo serving; exec cat"},
+                      _scratch / "complaints");
+    if (_launcher->readLine() != "serving")
+        throw std::runtime_error("The device does not boot: " + complaints());
+}
+
+std::filesystem::path BootedDevice::_makeSignedClient() const {
+    const auto place = _scratch / "bin"; // for root only: whoever may execute the program has its rights
+    std::filesystem::create_directory(place);
+    std::filesystem::permissions(place, std::filesystem::perms::owner_all);
+    auto client = place / "ostrandctl";
+    std::filesystem::copy_file(builtProgram("ostrandctl"), client);
+    OSTDictionary entitlements;
+    entitlements.set("com.tamarok.private.Ostrand.allowed", true);
+    OSTDictionary signature;
+    signature.set("Identifier", "com.tamarok.ostrandctl");
+    signature.set("Entitlements", std::move(entitlements));
+    const auto program = platform::openProgram(client);
+    if (!program || !platform::writeCodeSignature(program->get(), signature))
+        throw std::runtime_error("A copy of the client cannot be signed");
+    return client;
+}
+
+BootedDevice::Outcome BootedDevice::ostrandctl(std::vector<std::string> arguments) {
+    arguments.insert(arguments.begin(), _client);
+    arguments.insert(arguments.end(), {"--device", _image});
+    ChildProcess client(std::move(arguments), _scratch / "client-complaints");
+    std::string output = client.readAll();
+    return {client.wait(), std::move(output)};
+}
+
+void BootedDevice::killDaemon() {
+    const auto deadline = std::chrono::steady_clock::now() + patience;
+    FileDescriptor daemon;
+    while (!(daemon = openDaemonOf(_launcher->id()))) { // The launcher is just about to start it.
+        if (std::chrono::steady_clock::now() > deadline)
+            throw std::runtime_error("No daemon to kill: " + complaints());
+        ::sched_yield();
+    }
+    ::pidfd_send_signal(daemon.get(), SIGKILL, nullptr, 0);
+    pollfd ended{daemon.get(), POLLIN, 0};
+    ::poll(&ended, 1, -1);
+}
+
+void BootedDevice::reboot() {
+    shutDown();
+    _boot();
+}
+
+void BootedDevice::shutDown() {
+    if (!_launcher)
+        return;
+    _launcher->closeInput();
+    EXPECT_EQ(_launcher->wait(), 0);
+    _launcher.reset();
+    const std::string text = complaints();
+    for (const char* fault : {"Assertion failed", "Sanitizer:", "runtime error:"})
+        EXPECT_EQ(text.find(fault), std::string::npos) << text;
+}
+
+void BootedDeviceTest::SetUp() {
+    if (::geteuid() != 0)
+        GTEST_SKIP() << "A device can be booted by root only";
+    _device.emplace();
+}
+
+std::string BootedDevice::complaints() const { return readFile(_scratch / "complaints"); }
+
+} // namespace ost::test
