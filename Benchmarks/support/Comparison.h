@@ -16,8 +16,8 @@ struct Target {
     double limit;
 };
 
-/// One row of the table: the daemon's work beside the bare work. Both are sampled in turn, as often as the benchmark has
-/// iterations, because absolute figures drift; their medians make the row.
+/// One row of the table: the daemon's work beside the bare work. Both are sampled in turn, as often as the benchmark
+/// has iterations, because absolute figures drift; their medians make the row.
 struct Comparison {
     Unit unit;
     Target target;

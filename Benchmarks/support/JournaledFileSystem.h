@@ -6,8 +6,8 @@
 
 namespace ost::benchmarks {
 
-/// A new ext4 with a journal, mounted where only the benchmark sees it. It lies in a nameless sparse file on the host's disk,
-/// behind a loop device that does not cache: what is synchronised costs what it costs on that disk.
+/// A new ext4 with a journal, mounted where only the benchmark sees it. It lies in a nameless sparse file on the host's
+/// disk, behind a loop device that does not cache: what is synchronised costs what it costs on that disk.
 ///
 /// Both file and loop device are gone once nobody uses the mount any more.
 class JournaledFileSystem {

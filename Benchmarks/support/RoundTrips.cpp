@@ -75,8 +75,8 @@ double BusyConnections::rate(std::chrono::milliseconds duration) {
     const auto start = Clock::now();
     std::vector<std::future<unsigned>> counts;
     for (std::size_t thread = 0; thread < threads; ++thread)
-        counts.push_back(std::async(std::launch::async,
-                                    [&, thread] { return _drive(thread, threads, start + duration); }));
+        counts.push_back(
+            std::async(std::launch::async, [&, thread] { return _drive(thread, threads, start + duration); }));
     unsigned replies = 0;
     for (auto& count : counts)
         replies += count.get();

@@ -26,8 +26,8 @@ private:
     std::string _received;
 };
 
-/// Many connections, each of which sends its next request when it has its reply. One thread for every two processors keeps
-/// them busy, so that the other side has at least as many.
+/// Many connections, each of which sends its next request when it has its reply. One thread for every two processors
+/// keeps them busy, so that the other side has at least as many.
 class BusyConnections {
 public:
     BusyConnections(const std::string& socketPath, std::string request, std::size_t replySize, unsigned connections);

@@ -102,39 +102,36 @@ void RunLoop::run() {
     while (!_stopping) {
         const int count = ::epoll_wait(_epoll.get(), events.data(), eventsPerWait, -1);
         OST_ASSERT(count >= 0 || errno == EINTR);
+        bool hasWork = false;
         for (const auto& event : std::span(events).first(static_cast<std::size_t>(std::max(count, 0)))) {
-            if (_stopping)
-                break;
             if (event.data.u64 == wakeUpId)
-                _clearWakeUp();
-            else
+                hasWork = true;
+            else if (!_stopping)
                 _serve(event.data.u64, event.events);
         }
-        if (!_stopping)
-            _runDueWork();
+        if (hasWork && !_stopping)
+            _runWork();
     }
     _stopping = false;
 }
 
-void RunLoop::_clearWakeUp() {
-    // Happens before the work is taken: work that comes later sets it again.
+void RunLoop::_runWork() {
+    // Cleared before the work is taken: work that comes later sets it again.
     std::uint64_t wakeUps = 0;
     [[maybe_unused]] const auto read = ::read(_wakeUp.get(), &wakeUps, sizeof wakeUps);
-}
-
-void RunLoop::_runDueWork() {
-    std::vector<Work> due;
+    std::vector<Work> taken;
     {
         const std::lock_guard lock(_mutex);
-        due.swap(_work);
+        taken.swap(_work);
     }
-    for (auto work = due.begin(); work != due.end(); ++work) {
+    for (auto work = taken.begin(); work != taken.end(); ++work) {
         (*work)();
         *work = nullptr;
         if (_stopping) {
-            // What was taken but not run keeps its place.
+            // What was taken but not run keeps its place for the next run.
             const std::lock_guard lock(_mutex);
-            _work.insert(_work.begin(), std::make_move_iterator(work + 1), std::make_move_iterator(due.end()));
+            _work.insert(_work.begin(), std::make_move_iterator(work + 1), std::make_move_iterator(taken.end()));
+            _wake();
             return;
         }
     }

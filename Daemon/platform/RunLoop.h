@@ -18,8 +18,8 @@ namespace ost::platform {
 /// The run loop of one thread, which is also that thread's work queue: handlers of descriptors and enqueued work run on
 /// it one at a time.
 ///
-/// Threads: the loop belongs to the thread that created it. `async` and `stop` may be called from any
-/// thread, everything else from the loop's own.
+/// Threads: the loop belongs to the thread that created it. `async` and `stop` may be called from any thread,
+/// everything else from the loop's own.
 class RunLoop {
 public:
     using Work = std::move_only_function<void()>;
@@ -74,8 +74,7 @@ private:
     RunLoop(FileDescriptor epoll, FileDescriptor wakeUp) : _epoll(std::move(epoll)), _wakeUp(std::move(wakeUp)) {}
 
     void _wake();
-    void _clearWakeUp();
-    void _runDueWork();
+    void _runWork();
     void _serve(std::uint64_t id, std::uint32_t events);
     void _setEvents(std::uint64_t id, std::uint32_t events);
     void _remove(std::uint64_t id) noexcept;

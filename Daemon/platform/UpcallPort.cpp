@@ -7,6 +7,7 @@
 #include <sys/epoll.h>
 #include <sys/mman.h>
 #include <sys/stat.h>
+#include <sys/timerfd.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -18,8 +19,6 @@ namespace ost::platform {
 
 namespace {
 
-using namespace std::chrono_literals;
-
 constexpr std::size_t headerSize = 24;
 constexpr std::size_t sizeFieldOffset = 4;
 constexpr std::size_t regionAddressOffset = 28;
@@ -29,7 +28,7 @@ constexpr std::size_t regionLimit = 1 << 20;
 constexpr std::size_t connectionLimit = 64;
 /// Whoever is not root is refused anyway, and must not keep root out.
 constexpr std::size_t othersConnectionLimit = 32;
-constexpr auto acceptPause = 250ms;
+constexpr itimerspec acceptPause{.it_interval = {}, .it_value = {.tv_sec = 0, .tv_nsec = 250'000'000}};
 
 using Bytes = std::span<std::byte>;
 
@@ -147,10 +146,15 @@ std::expected<std::unique_ptr<UpcallPort>, int> UpcallPort::open(RunLoop& loop, 
     const int on = 1;
     if (::setsockopt(listener.get(), SOL_SOCKET, SO_PASSCRED, &on, sizeof on) != 0)
         return std::unexpected(errno);
-    const int socket = listener.get();
-    std::unique_ptr<UpcallPort> port(new UpcallPort(loop, std::move(listener), std::move(handler)));
-    port->_listenerSource =
-        OST_TRY(loop.addSource(socket, EPOLLIN, [port = port.get()](std::uint32_t) { port->_accept(); }));
+    FileDescriptor timer(::timerfd_create(CLOCK_MONOTONIC, TFD_CLOEXEC | TFD_NONBLOCK));
+    if (!timer)
+        return std::unexpected(errno);
+    std::unique_ptr<UpcallPort> port(new UpcallPort(loop, std::move(listener), std::move(timer), std::move(handler)));
+    auto* self = port.get();
+    self->_listenerSource =
+        OST_TRY(loop.addSource(self->_listener.get(), EPOLLIN, [self](std::uint32_t) { self->_accept(); }));
+    self->_pauseSource =
+        OST_TRY(loop.addSource(self->_pauseTimer.get(), EPOLLIN, [self](std::uint32_t) { self->_resumeAccepting(); }));
     return port;
 }
 
@@ -177,10 +181,13 @@ void UpcallPort::_accept() {
 void UpcallPort::_pauseAccepting(int error) {
     logError("Failed to accept a connection of the upcall port: %s", std::strerror(error));
     _listenerSource.setEvents(0);
-    _loop.asyncAfter(acceptPause, [this, alive = std::weak_ptr(_alive)] {
-        if (!alive.expired())
-            _listenerSource.setEvents(EPOLLIN);
-    });
+    ::timerfd_settime(_pauseTimer.get(), 0, &acceptPause, nullptr);
+}
+
+void UpcallPort::_resumeAccepting() {
+    std::uint64_t expirations = 0;
+    [[maybe_unused]] const auto read = ::read(_pauseTimer.get(), &expirations, sizeof expirations);
+    _listenerSource.setEvents(EPOLLIN);
 }
 
 bool UpcallPort::_hasRoomFor(bool root) const {

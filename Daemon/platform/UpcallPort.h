@@ -65,11 +65,13 @@ private:
     };
     using Connections = std::list<Connection>;
 
-    UpcallPort(RunLoop& loop, FileDescriptor listener, Handler handler)
-        : _loop(loop), _listener(std::move(listener)), _handler(std::move(handler)) {}
+    UpcallPort(RunLoop& loop, FileDescriptor listener, FileDescriptor pauseTimer, Handler handler)
+        : _loop(loop), _listener(std::move(listener)), _pauseTimer(std::move(pauseTimer)),
+          _handler(std::move(handler)) {}
 
     void _accept();
     void _pauseAccepting(int error);
+    void _resumeAccepting();
     [[nodiscard]] bool _hasRoomFor(bool root) const;
     void _receive(Connections::iterator connection);
     [[nodiscard]] bool _serveMessage(int socket);
@@ -77,11 +79,12 @@ private:
 
     RunLoop& _loop;
     const FileDescriptor _listener;
+    const FileDescriptor _pauseTimer; ///< made early, for the time when there are no descriptors
     Handler _handler;
     RunLoop::Source _listenerSource;
+    RunLoop::Source _pauseSource;
     Connections _connections;
     std::uint32_t _sequenceNumber = 0;
-    const std::shared_ptr<int> _alive = std::make_shared<int>(); ///< watched by work that may come after the port's end
 };
 
 } // namespace ost::platform

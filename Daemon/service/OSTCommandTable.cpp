@@ -1,6 +1,7 @@
 #include "service/OSTCommandTable.h"
 
 #include "service/OSTContainerCommands.h"
+#include "service/OSTRemovalCommands.h"
 
 namespace ost {
 
@@ -16,15 +17,15 @@ constexpr auto dataMigration = OSTEntitlementDataMigration;
 const std::array<OSTCommandEntry, OSTCommandCount> OSTCommandTable = {{
     {0, OSTCreateOrLookupCommand, none, OSTReplyBy::dispatcher},
     {1, OSTListCommand, allowed, OSTReplyBy::dispatcher},
-    {2, nullptr, allowed, OSTReplyBy::dispatcher},        // replace a container by another
-    {3, nullptr, allowed, OSTReplyBy::dispatcher},        // stage containers for deletion
-    {4, nullptr, allowed, OSTReplyBy::handler},           // destroy everything on death row
+    {2, OSTReplaceCommand, allowed, OSTReplyBy::dispatcher},
+    {3, OSTStageForDeleteCommand, allowed, OSTReplyBy::dispatcher},
+    {4, OSTDestroyDeathRowCommand, allowed, OSTReplyBy::handler},
     {5, nullptr, allowed, OSTReplyBy::dispatcher},        // set an info value of a container
     {6, nullptr, allowed, OSTReplyBy::dispatcher},        // get an info value of a container
     {7, nullptr, allowed, OSTReplyBy::dispatcher},        // get a container's path, transient flag and info
     {8, nullptr, allowed, OSTReplyBy::dispatcher},        // recreate a container's default structure
     {9, nullptr, allowed, OSTReplyBy::dispatcher},        // regenerate a container's directory UUID
-    {10, nullptr, allowed, OSTReplyBy::dispatcher},       // delete one container
+    {10, OSTDeleteCommand, allowed, OSTReplyBy::dispatcher},
     {11, nullptr, wipeContainer, OSTReplyBy::dispatcher}, // wipe an entitled plug-in data container
     {12, nullptr, allowed, OSTReplyBy::dispatcher},       // wipe a data container
     {13, nullptr, none, OSTReplyBy::dispatcher},          // paths of the client's application group containers

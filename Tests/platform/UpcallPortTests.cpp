@@ -49,6 +49,8 @@ protected:
         ASSERT_EQ(::listen(listener.get(), 128), 0);
         _port = UpcallPort::open(*_loop, std::move(listener), [this](const UpcallMessage& message) {
                     _messages.push_back(message);
+                    if (_stopAfterMessage)
+                        _loop->stop();
                     return _reply;
                 }).value();
     }
@@ -108,6 +110,7 @@ protected:
     std::unique_ptr<RunLoop> _loop = RunLoop::create().value();
     std::vector<UpcallMessage> _messages;
     std::optional<UpcallReply> _reply;
+    bool _stopAfterMessage = false;
     std::unique_ptr<UpcallPort> _port;
 };
 
@@ -260,8 +263,7 @@ TEST_F(UpcallPortTest, takesNoMoreConnectionsThanItsLimitAndPausesWithoutDescrip
     send(client, request());
     EXPECT_TRUE(served().empty());
     ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &limit), 0);
-    _loop->asyncAfter(std::chrono::seconds(1), [this] { _loop->stop(); });
-    _messages.clear();
+    _stopAfterMessage = true;
     _loop->run();
     EXPECT_EQ(_messages.size(), 1U);
 }

@@ -1,0 +1,111 @@
+#include "service/OSTRemovalCommands.h"
+
+#include "model/OSTUserIdentity.h"
+#include "platform/Log.h"
+#include "service/OSTRequestReaders.h"
+
+#include <utility>
+#include <vector>
+
+namespace ost {
+
+namespace {
+
+OSTErrorCode codeOf(const std::expected<void, OSTErrorCode>& result) {
+    return result ? OSTErrorCode::success : result.error();
+}
+
+std::optional<std::string> stringOf(const std::optional<std::string_view>& text) {
+    return text ? std::optional<std::string>(*text) : std::nullopt;
+}
+
+/// Reads every element of an array; a value that is no array has none.
+template<typename T, typename Read>
+std::vector<T> elementsOf(const platform::IPCRequest& request, std::string_view key, Read read) {
+    std::vector<T> values;
+    if (const auto array = request.item(key))
+        for (const auto element : array->elements())
+            values.push_back(read(element));
+    return values;
+}
+
+bool isArray(const platform::IPCRequest& request, std::string_view key) {
+    const auto item = request.item(key);
+    return item && item->type() == platform::CBORType::array;
+}
+
+std::uint64_t numberOf(const platform::CBORItem& element) {
+    return element.asUnsigned().value_or(0);
+}
+
+} // namespace
+
+OSTErrorCode OSTReplaceCommand(const platform::IPCRequest& request, platform::IPCReply& /*reply*/,
+                               const OSTClientConnection& client) {
+    OSTReplacement replacement;
+    auto& oldContainer = replacement.oldContainer;
+    if ((oldContainer.uuid = request.uuidValue("OldContainerUUID"))) {
+        const auto place = OSTRequestedPlace(request, client, "OldContainerClass", "OldContainerUserID");
+        if (!place)
+            return place.error();
+        oldContainer.containerClass = place->containerClass;
+        oldContainer.userId = place->userId;
+        oldContainer.identifier = stringOf(request.stringValue("OldIdentifier"));
+    }
+    const auto place = OSTRequestedPlace(request, client, "NewContainerClass", "NewContainerUserID");
+    if (!place)
+        return place.error();
+    replacement.newContainer = {.uuid = request.uuidValue("NewContainerUUID"),
+                                .userId = place->userId,
+                                .identifier = stringOf(request.stringValue("NewIdentifier")),
+                                .containerClass = place->containerClass};
+    return codeOf(client.replaceContainer(replacement));
+}
+
+OSTErrorCode OSTStageForDeleteCommand(const platform::IPCRequest& request, platform::IPCReply& /*reply*/,
+                                      const OSTClientConnection& client) {
+    OSTDeletion deletion;
+    deletion.classes = elementsOf<OSTContainerClass>(request, "ContainerClassesArray", [](const auto& element) {
+        return static_cast<OSTContainerClass>(numberOf(element));
+    });
+    deletion.uuids = elementsOf<std::optional<platform::UUID>>(request, "UUIDsArray",
+                                                               [](const auto& element) { return element.asUUID(); });
+    const auto userIds = elementsOf<std::uint32_t>(request, "UserIDsArray", [](const auto& element) {
+        return static_cast<std::uint32_t>(numberOf(element));
+    });
+    // A user without a class could not be validated.
+    if (userIds.size() > deletion.classes.size())
+        return OSTErrorCode::invalidObject;
+    for (std::size_t i = 0; i < userIds.size(); ++i) {
+        const auto resolved = validateUserId(userIds[i], deletion.classes[i], client.identity().clientUserId);
+        if (!resolved)
+            return resolved.error();
+        deletion.userIds.push_back(*resolved);
+    }
+    if (!isArray(request, "IdentifiersArray"))
+        platform::logAs(platform::LogLevel::error, "stageContainerForDelete",
+                        "Got non-Array input for the identifiers array");
+    deletion.identifiers = elementsOf<std::optional<std::string>>(
+        request, "IdentifiersArray", [](const auto& element) { return stringOf(element.asText()); });
+    return codeOf(client.stageForDeleteContainersWithUsers(deletion));
+}
+
+OSTErrorCode OSTDestroyDeathRowCommand(const platform::IPCRequest& /*request*/, platform::IPCReply& reply,
+                                       const OSTClientConnection& client) {
+    client.deleteContainersOnDeathRowWithCompletion([reply = std::move(reply)](std::int64_t code) mutable {
+        reply.set("ReplyError", static_cast<std::uint64_t>(code));
+        reply.send();
+    });
+    return OSTErrorCode::success;
+}
+
+OSTErrorCode OSTDeleteCommand(const platform::IPCRequest& request, platform::IPCReply& /*reply*/,
+                              const OSTClientConnection& client) {
+    const auto place = OSTRequestedPlace(request, client);
+    if (!place)
+        return place.error();
+    return codeOf(client.deleteContainerForUser(place->userId, request.stringValue("Identifier"), place->containerClass,
+                                                request.booleanValue("Transient")));
+}
+
+} // namespace ost

@@ -1,0 +1,30 @@
+#pragma once
+
+#include "model/OSTContainerClass.h"
+#include "model/OSTError.h"
+#include "platform/IPCMessage.h"
+#include "store/OSTClientConnection.h"
+
+#include <cstdint>
+#include <expected>
+#include <optional>
+#include <string_view>
+
+namespace ost {
+
+/// A class and a user that a request names, the user resolved for the client.
+struct OSTRequestedClassAndUser {
+    OSTContainerClass containerClass;
+    std::uint32_t userId;
+};
+
+/// Reads the class and the user of a request and validates the user for the client. Fails with `invalidParameter`.
+[[nodiscard]] std::expected<OSTRequestedClassAndUser, OSTErrorCode>
+OSTRequestedPlace(const platform::IPCRequest& request, const OSTClientConnection& client,
+                  std::string_view classKey = "ContainerClass", std::string_view userKey = "UserID");
+
+/// The identifier that a request names, or else the client's own.
+[[nodiscard]] std::optional<std::string_view> OSTRequestedIdentifier(const platform::IPCRequest& request,
+                                                                     const OSTClientConnection& client);
+
+} // namespace ost
