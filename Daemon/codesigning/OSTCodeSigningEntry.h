@@ -14,6 +14,9 @@ namespace ost {
 /// The key of an entry's code-signing information that holds the entitlements dictionary.
 inline constexpr const char* OSTEntitlementsKey = "com.tamarok.Ostrand.Entitlements";
 
+/// The entitlement, a boolean, that gives an identifier a system container.
+inline constexpr const char* OSTSystemContainerKey = "com.tamarok.security.system-container";
+
 /// What is known of one identifier's code signing.
 ///
 /// A value type. The mapping holds entries shared and unchanging; a change is a new entry.

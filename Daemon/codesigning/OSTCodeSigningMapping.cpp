@@ -1,7 +1,6 @@
 #include "codesigning/OSTCodeSigningMapping.h"
 
 #include "model/OSTDictionaryFile.h"
-#include "model/OSTFailureReport.h"
 #include "model/OSTGlobalConfiguration.h"
 #include "platform/Assert.h"
 #include "platform/Log.h"
@@ -10,26 +9,24 @@
 #include "store/OSTLocks.h"
 
 #include <algorithm>
+#include <array>
 #include <cerrno>
 
 namespace ost {
 
 namespace {
 
-constexpr const char* applicationGroupsKey = "com.tamarok.security.application-groups";
-constexpr const char* systemGroupsKey = "com.tamarok.security.system-groups";
-constexpr const char* systemGroupContainersKey = "com.tamarok.security.system-group-containers";
-constexpr const char* systemContainerKey = "com.tamarok.security.system-container";
 constexpr std::string_view systemGroupPrefix = "systemgroup.";
 
 /// Where older releases cached code-signing information: in the info values of a bundle container.
 constexpr const char* cachedInfoKey = "com.tamarok.Tessaly.CachedCodeSigningInfo";
 constexpr const char* cachedEntitlementsKey = "Entitlements";
 
-/// What a mapping that is unavailable gives for a result.
-constexpr OSTErrorCode noResult{0};
-
 } // namespace
+
+constinit const OSTGroupKeys OSTGroupKeys::application{"com.tamarok.security.application-groups", nullptr};
+constinit const OSTGroupKeys OSTGroupKeys::system{"com.tamarok.security.system-groups",
+                                                  "com.tamarok.security.system-group-containers"};
 
 OSTCodeSigningMapping& OSTCodeSigningMapping::sharedInstance() {
     // Never destroyed: workers may still ask while the process ends.
@@ -38,11 +35,8 @@ OSTCodeSigningMapping& OSTCodeSigningMapping::sharedInstance() {
 }
 
 OSTCodeSigningMapping::OSTCodeSigningMapping() {
-    auto entries = _readCodeSigningMappingFromDisk();
-    _available = entries.has_value();
-    if (entries)
-        _codeSigningMappingDict = *std::move(entries);
-    else
+    _available = _readCodeSigningMappingFromDisk().has_value();
+    if (!_available)
         platform::logError("Unable to read mapping file from disk.  This is bad");
 }
 
@@ -61,12 +55,7 @@ bool OSTCodeSigningMapping::identifierHasCallerRegisteredEntitlements(std::strin
 }
 
 bool OSTCodeSigningMapping::identifierHasSystemContainer(std::string_view identifier) {
-    return _codeSignQueue.sync([&] {
-        const auto entry = _onQueue_codeSigningInfoForIdentifier(identifier, Request::internal);
-        const auto* const entitlements = entry ? entry->entitlements() : nullptr;
-        const auto* const value = entitlements ? entitlements->find(systemContainerKey) : nullptr;
-        return value && value->truthValue();
-    });
+    return _codeSignQueue.sync([&] { return _onQueue_identifierHasSystemContainer(identifier); });
 }
 
 std::uint64_t OSTCodeSigningMapping::dataContainerTypeForIdentifier(std::string_view identifier) {
@@ -93,30 +82,6 @@ OSTCodeSigningMapping::getCodeSigningInfoForIdentifier(std::string_view identifi
         const auto entry = _onQueue_codeSigningInfoForIdentifier(identifier, Request::external);
         return entry ? entry->codeSigningInfo : nullptr;
     });
-}
-
-OSTErrorCode OSTCodeSigningMapping::processCodeSigningInfo(std::shared_ptr<const OSTDictionary> info,
-                                                           std::optional<std::string_view> identifier,
-                                                           const OSTRegistrationOptions& options) {
-    if (!_available)
-        return noResult;
-    if (!identifier)
-        return OSTErrorCode::noIdentifier;
-    const OSTAllIdentifiersLock lock(OSTLockKind::writing);
-    const auto result = OSTGuarded([&] {
-        return _codeSignQueue.sync(
-            [&] { return _onQueue_processCodeSigningInfo(std::move(info), *identifier, options); });
-    });
-    return result ? OSTErrorCode::success : result.error().code();
-}
-
-OSTErrorCode
-OSTCodeSigningMapping::processCallerRegisteredEntitlements(std::shared_ptr<const OSTDictionary> entitlements,
-                                                           std::optional<std::string_view> identifier) {
-    OSTDictionary info;
-    info.set(OSTEntitlementsKey, std::move(entitlements));
-    return processCodeSigningInfo(std::make_shared<const OSTDictionary>(std::move(info)), identifier,
-                                  {.registeredByCaller = true});
 }
 
 void OSTCodeSigningMapping::removeCodeSigningDictionariesForIdentifierAndItsChildren(std::string_view identifier) {
@@ -147,6 +112,32 @@ OSTCodeSigningMapping::invalidateCodeSigningInfoForIdentifierAndItsChildren(std:
                 platform::logDebug("Invalidating code signing info for %@ child: %@", identifier, each);
         }
         return _writeCodeSigningMappingToDisk();
+    });
+}
+
+OSTErrorCode OSTCodeSigningMapping::invalidateCodeSigningInfoForAppsWithoutBundleContainer() {
+    const OSTAllIdentifiersLock lock(OSTLockKind::writing);
+    const auto result = _codeSignQueue.sync([&]() -> OSTResult<void> {
+        if (!_available)
+            return {};
+        for (auto& [identifier, entry] : _codeSigningMappingDict) {
+            if (entry->registeredByCaller || _hasBundleContainer(identifier))
+                continue;
+            platform::logDebug("Invalidating the code signing info for: %@", identifier);
+            auto invalidated = *entry;
+            invalidated.invalid = true;
+            entry = std::make_shared<const OSTCodeSigningEntry>(std::move(invalidated));
+        }
+        return _writeCodeSigningMappingToDisk();
+    });
+    return result ? OSTErrorCode::success : result.error().code();
+}
+
+bool OSTCodeSigningMapping::_hasBundleContainer(std::string_view identifier) const {
+    using enum OSTContainerClass;
+    return std::ranges::any_of(std::array{bundleApplication, bundleLoomworkPlugin, bundleVPNPlugin}, [&](auto bundle) {
+        return OSTContainerCache::sharedInstance().containerForUser(OSTInstallerUserId, bundle, identifier, false)
+            .has_value();
     });
 }
 
@@ -223,20 +214,23 @@ OSTCodeSigningMapping::EntryRecord OSTCodeSigningMapping::_migrateFromBundleCont
     return entry;
 }
 
+bool OSTCodeSigningMapping::_onQueue_identifierHasSystemContainer(std::string_view identifier) {
+    const auto entry = _onQueue_codeSigningInfoForIdentifier(identifier, Request::internal);
+    const auto* const entitlements = entry ? entry->entitlements() : nullptr;
+    const auto* const value = entitlements ? entitlements->find(OSTSystemContainerKey) : nullptr;
+    return value && value->truthValue();
+}
+
 OSTCodeSigningMapping::GroupList
 OSTCodeSigningMapping::_onQueue_appGroupIdentifiersForIdentifier(std::string_view identifier) {
     const auto entry = _onQueue_codeSigningInfoForIdentifier(identifier, Request::internal);
-    return _copyApplicationGroupEntitlementForIdentifier(identifier, entry ? entry->entitlements() : nullptr,
-                                                         applicationGroupsKey);
+    return _groupList(identifier, entry ? entry->entitlements() : nullptr, OSTGroupKeys::application);
 }
 
 OSTCodeSigningMapping::GroupList
 OSTCodeSigningMapping::_onQueue_systemGroupIdentifiersForIdentifier(std::string_view identifier) {
     const auto entry = _onQueue_codeSigningInfoForIdentifier(identifier, Request::internal);
-    const auto* const entitlements = entry ? entry->entitlements() : nullptr;
-    auto groups = _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements, systemGroupsKey);
-    if (!groups || groups->empty())
-        groups = _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements, systemGroupContainersKey);
+    auto groups = _groupList(identifier, entry ? entry->entitlements() : nullptr, OSTGroupKeys::system);
     if (groups)
         std::erase_if(*groups, [](const std::string& group) {
             if (group.starts_with(systemGroupPrefix))
@@ -246,6 +240,22 @@ OSTCodeSigningMapping::_onQueue_systemGroupIdentifiersForIdentifier(std::string_
             return true;
         });
     return groups;
+}
+
+OSTCodeSigningMapping::GroupList OSTCodeSigningMapping::_groupList(std::string_view identifier,
+                                                                   const OSTDictionary* entitlements,
+                                                                   const OSTGroupKeys& keys) {
+    auto groups = _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements, keys.key);
+    if (keys.fallbackKey && (!groups || groups->empty()))
+        groups = _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements, keys.fallbackKey);
+    return groups;
+}
+
+void OSTCodeSigningMapping::iterateGroupIds(
+    const OSTGroupKeys& keys, const std::function<void(const std::string& identifier, const GroupList& groups)>& block) {
+    OST_ASSERT(_codeSignQueue.isCurrent());
+    for (const auto& [identifier, entry] : _codeSigningMappingDict)
+        block(identifier, _groupList(identifier, entry->entitlements(), keys));
 }
 
 OSTCodeSigningMapping::GroupList OSTCodeSigningMapping::_copyApplicationGroupEntitlementForIdentifier(
@@ -276,24 +286,6 @@ OSTCodeSigningMapping::GroupList OSTCodeSigningMapping::_copyApplicationGroupEnt
     return groups;
 }
 
-OSTResult<void> OSTCodeSigningMapping::_onQueue_processCodeSigningInfo(std::shared_ptr<const OSTDictionary> info,
-                                                                       std::string_view identifier,
-                                                                       const OSTRegistrationOptions& options) {
-    const auto stored = _entry(identifier);
-    OSTCodeSigningEntry entry{.codeSigningInfo = std::move(info),
-                              .placeholder = options.placeholder,
-                              .registeredByCaller = options.registeredByCaller,
-                              .dataContainerClass = options.dataContainerClass};
-    if (stored && stored->childBundleIdentifiers) {
-        entry.childBundleIdentifiers = stored->childBundleIdentifiers;
-        std::erase_if(*entry.childBundleIdentifiers, [&](const std::string& child) { return !_entry(child); });
-    }
-    if (stored && *stored == entry)
-        return {};
-    return _setCodeSigningDictionaryValues({std::make_shared<const OSTCodeSigningEntry>(std::move(entry))},
-                                           {std::string(identifier)});
-}
-
 // The file
 
 std::string OSTCodeSigningMapping::_mappingFileURL() {
@@ -301,34 +293,37 @@ std::string OSTCodeSigningMapping::_mappingFileURL() {
                                      "ost_code_signing_info.plist");
 }
 
-OSTResult<OSTCodeSigningMapping::Entries> OSTCodeSigningMapping::_readCodeSigningMappingFromDisk() {
+OSTResult<void> OSTCodeSigningMapping::_readCodeSigningMappingFromDisk() {
     const auto url = _mappingFileURL();
     const auto dictionary = OST_dictionaryWithContentsOfURL(url, OSTLargeDictionaryFileSize);
     if (!dictionary) {
         if (dictionary.error().isPOSIX(ENOENT)) {
             platform::logNotice("No code signing info file found.  We will create one now");
-            return Entries();
+            return {};
         }
         platform::logError("Failed to read code signing mapping file at %@ : %@", url, dictionary.error());
         return std::unexpected(dictionary.error());
     }
-    Entries entries;
     for (const auto& [identifier, value] : *dictionary) {
-        if (const auto* const serialized = value.asDictionary())
-            entries.emplace_hint(entries.end(), identifier,
-                                 std::make_shared<const OSTCodeSigningEntry>(
-                                     OSTCodeSigningEntry::withSerializedDictionary(*serialized)));
-        else
+        if (const auto* const serialized = value.asDictionary()) {
+            _codeSigningMappingDict.emplace_hint(_codeSigningMappingDict.end(), identifier,
+                                                 std::make_shared<const OSTCodeSigningEntry>(
+                                                     OSTCodeSigningEntry::withSerializedDictionary(*serialized)));
+        } else {
             platform::logError("Skipping the code signing info of %@, which is no dictionary", identifier);
+            _unreadableEntries.emplace(identifier, value);
+        }
     }
-    return entries;
+    return {};
 }
 
 OSTResult<void> OSTCodeSigningMapping::_writeCodeSigningMappingToDisk() {
     std::vector<OSTDictionary::Entry> serialized;
-    serialized.reserve(_codeSigningMappingDict.size());
+    serialized.reserve(_codeSigningMappingDict.size() + _unreadableEntries.size());
     for (const auto& [identifier, entry] : _codeSigningMappingDict)
         serialized.emplace_back(identifier, entry->serialize());
+    for (const auto& [identifier, value] : _unreadableEntries)
+        serialized.emplace_back(identifier, value);
     const OSTDictionary dictionary(std::move(serialized));
     const auto url = _mappingFileURL();
     const auto written = OST_writeToURL(dictionary, url, OSTLargeDictionaryFileSize);
@@ -354,6 +349,7 @@ OSTResult<void> OSTCodeSigningMapping::_setCodeSigningDictionaryValues(const std
             _codeSigningMappingDict.insert_or_assign(identifiers[i], entry);
         else
             _codeSigningMappingDict.erase(identifiers[i]);
+        _unreadableEntries.erase(identifiers[i]);
         platform::logDebug("Staging Code Signing Mapping for ID: %@ : %@", identifiers[i], entry);
         changed = true;
     }

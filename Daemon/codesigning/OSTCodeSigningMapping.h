@@ -6,6 +6,7 @@
 #include "platform/WorkQueue.h"
 
 #include <cstdint>
+#include <functional>
 #include <map>
 #include <memory>
 #include <optional>
@@ -19,8 +20,18 @@ namespace ost {
 /// How an identifier is registered.
 struct OSTRegistrationOptions {
     std::uint64_t dataContainerClass = 0;
+    std::optional<std::string> parentBundleIdentifier = std::nullopt;
     bool registeredByCaller = false;
     bool placeholder = false;
+};
+
+/// The entitlements that list an identifier's groups: the second one counts where the first lists none.
+struct OSTGroupKeys {
+    const char* key;
+    const char* fallbackKey;
+
+    static const OSTGroupKeys application;
+    static const OSTGroupKeys system;
 };
 
 /// What every identifier is entitled to: one entry for each that the installer or a client registered.
@@ -57,6 +68,16 @@ public:
     [[nodiscard]] OSTErrorCode processCallerRegisteredEntitlements(std::shared_ptr<const OSTDictionary> entitlements,
                                                                    std::optional<std::string_view> identifier);
 
+    /// Marks every entry invalid that the installer registered and whose application has no bundle container. Gives `success`
+    /// or `mappingWriteFailed`.
+    [[nodiscard]] OSTErrorCode invalidateCodeSigningInfoForAppsWithoutBundleContainer();
+
+    using GroupList = std::optional<std::vector<std::string>>;
+    /// Calls `block` with the group list of every identifier, which may be absent. Only from work that runs on the mapping's
+    /// queue already, which is why it does not enter it.
+    void iterateGroupIds(const OSTGroupKeys& keys,
+                         const std::function<void(const std::string& identifier, const GroupList& groups)>& block);
+
     /// Removes the entries of an identifier and of its children, and writes the mapping. Failures are logged. The caller holds
     /// the all-identifiers lock for writing.
     void removeCodeSigningDictionariesForIdentifierAndItsChildren(std::string_view identifier);
@@ -75,13 +96,12 @@ public:
 
 private:
     using Entries = std::map<std::string, EntryRecord, std::less<>>;
-    using GroupList = std::optional<std::vector<std::string>>;
     enum class Request : bool { internal, external };
 
     OSTCodeSigningMapping();
 
     [[nodiscard]] static std::string _mappingFileURL();
-    [[nodiscard]] static OSTResult<Entries> _readCodeSigningMappingFromDisk();
+    [[nodiscard]] OSTResult<void> _readCodeSigningMappingFromDisk();
     [[nodiscard]] OSTResult<void> _writeCodeSigningMappingToDisk();
     /// Stores entries under identifiers, matched by index, and writes the mapping if that changed anything. An entry that is
     /// null or has no information removes its identifier. Fails with `countsDiffer` or `mappingWriteFailed`.
@@ -90,6 +110,9 @@ private:
     [[nodiscard]] static GroupList _copyApplicationGroupEntitlementForIdentifier(std::string_view identifier,
                                                                                  const OSTDictionary* entitlements,
                                                                                  const char* groupKey);
+    /// The list of the first key, or where that is absent or empty of the second.
+    [[nodiscard]] static GroupList _groupList(std::string_view identifier, const OSTDictionary* entitlements,
+                                              const OSTGroupKeys& keys);
 
     // On the queue only
     [[nodiscard]] EntryRecord _entry(std::string_view identifier) const;
@@ -97,16 +120,24 @@ private:
     /// The identifier's children in order, then the identifier itself.
     [[nodiscard]] std::vector<std::string> _childrenAndIdentifier(std::string_view identifier) const;
     [[nodiscard]] EntryRecord _migrateFromBundleContainer(std::string_view identifier);
+    [[nodiscard]] bool _onQueue_identifierHasSystemContainer(std::string_view identifier);
+    [[nodiscard]] bool _hasBundleContainer(std::string_view identifier) const;
     [[nodiscard]] GroupList _onQueue_appGroupIdentifiersForIdentifier(std::string_view identifier);
     [[nodiscard]] GroupList _onQueue_systemGroupIdentifiersForIdentifier(std::string_view identifier);
     [[nodiscard]] OSTResult<void> _onQueue_processCodeSigningInfo(std::shared_ptr<const OSTDictionary> info,
                                                                   std::string_view identifier,
                                                                   const OSTRegistrationOptions& options);
+    struct Batch;
+    void _linkToParent(std::string_view identifier, const std::string& parent, Batch& batch);
+    void _releaseSystemContainer(std::string_view identifier, const OSTDictionary* newEntitlements);
+    void _releaseGroups(std::string_view identifier, const OSTDictionary* newEntitlements);
 
     platform::WorkQueue _codeSignQueue{"com.tamarok.Ostrand.EntitlementQueue"};
     bool _available; ///< constant after construction
     // On the queue only.
     Entries _codeSigningMappingDict;
+    /// What the file holds under identifiers but is no entry: kept and written back until the identifier is registered.
+    std::map<std::string, OSTValue, std::less<>> _unreadableEntries;
 };
 
 } // namespace ost

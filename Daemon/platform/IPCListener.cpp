@@ -61,6 +61,7 @@ public:
 
     /// A connection has gone, and with it its descriptors.
     void connectionGone() {
+        ++_gone;
         if (_paused.exchange(false))
             _surroundings.pool.post(shared_from_this(), attentionEvent);
     }
@@ -69,6 +70,7 @@ private:
     void serve(std::uint32_t /*events*/, std::span<char> /*scratch*/) override {
         _surroundings.timer.change(shared_from_this(), std::exchange(_retry, std::nullopt), std::nullopt);
         _paused = false;
+        const unsigned goneBefore = _gone;
         for (unsigned count = 0; count < acceptsInARow; ++count) {
             if (!_accepting)
                 return;
@@ -76,7 +78,7 @@ private:
             if (error == EAGAIN)
                 return;
             if (error != 0)
-                return _pause(error);
+                return _pause(error, goneBefore);
             _complained = false;
         }
         _surroundings.pool.post(shared_from_this(), EPOLLIN);
@@ -113,12 +115,15 @@ private:
 
     /// A client that waits already causes no further event, so it is a descriptor that is given back, or the time, that
     /// makes us try again.
-    void _pause(int error) {
+    void _pause(int error, unsigned goneBefore) {
         if (!std::exchange(_complained, true))
             logError("accepting pauses: %s", std::strerror(error));
         _retry = Clock::now() + _surroundings.limits.acceptAgain;
         _surroundings.timer.change(shared_from_this(), std::nullopt, _retry);
         _paused = true;
+        // One may have gone since we tried, when nobody was to be told yet.
+        if (_gone != goneBefore && _paused.exchange(false))
+            _surroundings.pool.post(shared_from_this(), attentionEvent);
     }
 
     const FileDescriptor _socket;
@@ -127,6 +132,7 @@ private:
     WorkerPool::Watch _watch = WorkerPool::Watch::none;
     std::atomic<bool> _accepting{false};
     std::atomic<bool> _paused{false};
+    std::atomic<unsigned> _gone{0}; ///< connections that have gone, ever
 
     // Of the thread that serves.
     FileDescriptor _next; ///< accepted, but its peer is not known yet

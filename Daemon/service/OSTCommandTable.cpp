@@ -1,5 +1,6 @@
 #include "service/OSTCommandTable.h"
 
+#include "service/OSTCodeSigningCommands.h"
 #include "service/OSTContainerCommands.h"
 #include "service/OSTRemovalCommands.h"
 
@@ -28,14 +29,14 @@ const std::array<OSTCommandEntry, OSTCommandCount> OSTCommandTable = {{
     {10, OSTDeleteCommand, allowed, OSTReplyBy::dispatcher},
     {11, nullptr, wipeContainer, OSTReplyBy::dispatcher}, // wipe an entitled plug-in data container
     {12, nullptr, allowed, OSTReplyBy::dispatcher},       // wipe a data container
-    {13, nullptr, none, OSTReplyBy::dispatcher},          // paths of the client's application group containers
-    {14, nullptr, allowed, OSTReplyBy::dispatcher},       // identifiers of an identifier's application groups
-    {15, nullptr, none, OSTReplyBy::dispatcher},          // path of a system container
-    {16, nullptr, none, OSTReplyBy::dispatcher},          // paths of the client's system group containers
-    {17, nullptr, none, OSTReplyBy::dispatcher},          // path of one system group container
-    {18, nullptr, allowed, OSTReplyBy::dispatcher},       // register code-signing information
-    {19, nullptr, allowed, OSTReplyBy::dispatcher},       // get code-signing information
-    {20, nullptr, allowed, OSTReplyBy::dispatcher},       // invalidate code-signing information
+    {13, OSTGroupContainerPathsCommand, none, OSTReplyBy::dispatcher},
+    {14, OSTGroupIdentifiersCommand, allowed, OSTReplyBy::dispatcher},
+    {15, OSTSystemContainerPathCommand, none, OSTReplyBy::dispatcher},
+    {16, OSTSystemGroupContainerPathsCommand, none, OSTReplyBy::dispatcher},
+    {17, OSTSystemGroupContainerPathCommand, none, OSTReplyBy::dispatcher},
+    {18, OSTRegisterCodeSigningCommand, allowed, OSTReplyBy::dispatcher},
+    {19, OSTCodeSigningInfoCommand, allowed, OSTReplyBy::dispatcher},
+    {20, OSTInvalidateCodeSigningCommand, allowed, OSTReplyBy::dispatcher},
     {21, nullptr, allowed, OSTReplyBy::handler},          // set a data container's protection class
     {22, nullptr, allowed, OSTReplyBy::dispatcher},       // recreate a container's default structure, as 8
     {23, nullptr, allowed, OSTReplyBy::dispatcher},       // disk usage of a container

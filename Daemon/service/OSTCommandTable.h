@@ -20,7 +20,7 @@ inline constexpr const char* OSTEntitlementDataMigration = "com.tamarok.private.
 /// Carries a command out: reads its keys from the request, acts for the client, puts the results into the reply. Gives the
 /// reply's code.
 using OSTCommandHandler = OSTErrorCode (*)(const platform::IPCRequest& request, platform::IPCReply& reply,
-                                           const OSTClientConnection& client);
+                                           OSTClientConnection& client);
 
 /// Who sends the reply of a command.
 enum class OSTReplyBy : std::uint32_t {

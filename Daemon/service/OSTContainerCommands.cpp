@@ -5,7 +5,7 @@
 namespace ost {
 
 OSTErrorCode OSTCreateOrLookupCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
-                                      const OSTClientConnection& client) {
+                                      OSTClientConnection& client) {
     const auto place = OSTRequestedPlace(request, client);
     if (!place)
         return place.error();
@@ -25,7 +25,7 @@ OSTErrorCode OSTCreateOrLookupCommand(const platform::IPCRequest& request, platf
 }
 
 OSTErrorCode OSTListCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
-                            const OSTClientConnection& client) {
+                            OSTClientConnection& client) {
     const auto place = OSTRequestedPlace(request, client);
     if (!place)
         return place.error();

@@ -41,7 +41,7 @@ std::uint64_t numberOf(const platform::CBORItem& element) {
 } // namespace
 
 OSTErrorCode OSTReplaceCommand(const platform::IPCRequest& request, platform::IPCReply& /*reply*/,
-                               const OSTClientConnection& client) {
+                               OSTClientConnection& client) {
     OSTReplacement replacement;
     auto& oldContainer = replacement.oldContainer;
     if ((oldContainer.uuid = request.uuidValue("OldContainerUUID"))) {
@@ -63,7 +63,7 @@ OSTErrorCode OSTReplaceCommand(const platform::IPCRequest& request, platform::IP
 }
 
 OSTErrorCode OSTStageForDeleteCommand(const platform::IPCRequest& request, platform::IPCReply& /*reply*/,
-                                      const OSTClientConnection& client) {
+                                      OSTClientConnection& client) {
     OSTDeletion deletion;
     deletion.classes = elementsOf<OSTContainerClass>(request, "ContainerClassesArray", [](const auto& element) {
         return static_cast<OSTContainerClass>(numberOf(element));
@@ -91,7 +91,7 @@ OSTErrorCode OSTStageForDeleteCommand(const platform::IPCRequest& request, platf
 }
 
 OSTErrorCode OSTDestroyDeathRowCommand(const platform::IPCRequest& /*request*/, platform::IPCReply& reply,
-                                       const OSTClientConnection& client) {
+                                       OSTClientConnection& client) {
     client.deleteContainersOnDeathRowWithCompletion([reply = std::move(reply)](std::int64_t code) mutable {
         reply.set("ReplyError", static_cast<std::uint64_t>(code));
         reply.send();
@@ -100,7 +100,7 @@ OSTErrorCode OSTDestroyDeathRowCommand(const platform::IPCRequest& /*request*/, 
 }
 
 OSTErrorCode OSTDeleteCommand(const platform::IPCRequest& request, platform::IPCReply& /*reply*/,
-                              const OSTClientConnection& client) {
+                              OSTClientConnection& client) {
     const auto place = OSTRequestedPlace(request, client);
     if (!place)
         return place.error();

@@ -116,7 +116,7 @@ void OSTProcessVexelEvent(const std::shared_ptr<platform::IPCConnection>& connec
     const auto* const command = commandOf(request);
     if (!command)
         return connection->cancel();
-    const auto client = checkEntitlementsAndInitClientObject(connection->peer(), *command);
+    auto client = checkEntitlementsAndInitClientObject(connection->peer(), *command);
     if (!client)
         return connection->cancel();
     auto reply = connection->createReply(request);

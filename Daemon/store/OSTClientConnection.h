@@ -66,7 +66,7 @@ struct OSTReplacement {
 /// The object through which every store operation runs, with one client's identity and rights. A new one is made for each
 /// request and dies with it; the daemon's own work uses `sharedClientConnection`.
 ///
-/// Threads: any; an object holds nothing that changes. Operations serialise themselves with the locks of OSTLocks.
+/// Threads: any, one at a time for an object whose rights change. Operations serialise themselves with the locks of OSTLocks.
 /// On disk: a container is built in the staging directory and put in place with one rename, so a live one is never half made.
 /// What is thrown away is moved to death row with one rename and destroyed by a later pass.
 /// Failures leave as a code alone; the error behind it is in the log. An exception becomes `exceptionCaught`.
@@ -78,6 +78,9 @@ public:
     [[nodiscard]] static OSTClientConnection& sharedClientConnection();
 
     [[nodiscard]] const OSTClientIdentity& identity() const { return _identity; }
+    /// Widen what the client may look up, for the rest of its request.
+    void setAllowOtherIdLookup() { _identity.allowOtherIdLookup = true; }
+    void setAllowGroupIdLookup() { _identity.allowGroupIdLookup = true; }
 
     // Creation and look-up
 
@@ -189,7 +192,7 @@ private:
     [[nodiscard]] static OSTResult<std::optional<OSTError>> _removeItemOrMoveToTempAtURL(const std::string& url);
     [[nodiscard]] static std::optional<OSTError> _emptyDeathRow();
 
-    const OSTClientIdentity _identity;
+    OSTClientIdentity _identity;
 };
 
 } // namespace ost

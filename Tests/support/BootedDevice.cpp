@@ -8,7 +8,7 @@
 
 #include <poll.h>
 #include <sched.h>
-#include <sys/pidfd.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <charconv>
@@ -45,7 +45,7 @@ FileDescriptor openDaemonOf(pid_t launcher) {
         if (std::from_chars(name.data(), name.data() + name.size(), process).ec != std::errc{} ||
             parentOf(process) != launcher || !runsDaemon(process))
             continue;
-        FileDescriptor daemon(::pidfd_open(process, 0));
+        FileDescriptor daemon(static_cast<int>(::syscall(SYS_pidfd_open, process, 0)));
         if (daemon && parentOf(process) == launcher)
             return daemon;
     }
@@ -111,7 +111,7 @@ void BootedDevice::killDaemon() {
             throw std::runtime_error("No daemon to kill: " + complaints());
         ::sched_yield();
     }
-    ::pidfd_send_signal(daemon.get(), SIGKILL, nullptr, 0);
+    ::syscall(SYS_pidfd_send_signal, daemon.get(), SIGKILL, nullptr, 0);
     pollfd ended{daemon.get(), POLLIN, 0};
     ::poll(&ended, 1, -1);
 }

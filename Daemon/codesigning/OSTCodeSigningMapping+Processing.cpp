@@ -1,0 +1,129 @@
+#include "codesigning/OSTCodeSigningMapping.h"
+#include "codesigning/OSTGroupManager.h"
+#include "model/OSTFailureReport.h"
+#include "platform/Log.h"
+#include "store/OSTClientConnection.h"
+#include "store/OSTContainerCache.h"
+#include "store/OSTLocks.h"
+
+#include <algorithm>
+
+namespace ost {
+
+namespace {
+
+/// What a mapping that is unavailable gives for a result.
+constexpr OSTErrorCode noResult{0};
+
+const OSTDictionary* entitlementsOf(const std::shared_ptr<const OSTDictionary>& info) {
+    const auto* const value = info ? info->find(OSTEntitlementsKey) : nullptr;
+    return value ? value->asDictionary() : nullptr;
+}
+
+} // namespace
+
+/// Entries to be staged together, matched by position.
+struct OSTCodeSigningMapping::Batch {
+    std::vector<EntryRecord> entries;
+    std::vector<std::string> identifiers;
+
+    void stage(OSTCodeSigningEntry entry, std::string_view identifier) {
+        entries.push_back(std::make_shared<const OSTCodeSigningEntry>(std::move(entry)));
+        identifiers.emplace_back(identifier);
+    }
+};
+
+OSTErrorCode OSTCodeSigningMapping::processCodeSigningInfo(std::shared_ptr<const OSTDictionary> info,
+                                                           std::optional<std::string_view> identifier,
+                                                           const OSTRegistrationOptions& options) {
+    if (!_available)
+        return noResult;
+    if (!identifier)
+        return OSTErrorCode::noIdentifier;
+    const OSTAllIdentifiersLock lock(OSTLockKind::writing);
+    const auto result = OSTGuarded([&] {
+        return _codeSignQueue.sync(
+            [&] { return _onQueue_processCodeSigningInfo(std::move(info), *identifier, options); });
+    });
+    return result ? OSTErrorCode::success : result.error().code();
+}
+
+OSTErrorCode
+OSTCodeSigningMapping::processCallerRegisteredEntitlements(std::shared_ptr<const OSTDictionary> entitlements,
+                                                           std::optional<std::string_view> identifier) {
+    OSTDictionary info;
+    info.set(OSTEntitlementsKey, std::move(entitlements));
+    return processCodeSigningInfo(std::make_shared<const OSTDictionary>(std::move(info)), identifier,
+                                  {.registeredByCaller = true});
+}
+
+OSTResult<void> OSTCodeSigningMapping::_onQueue_processCodeSigningInfo(std::shared_ptr<const OSTDictionary> info,
+                                                                       std::string_view identifier,
+                                                                       const OSTRegistrationOptions& options) {
+    Batch batch;
+    const auto stored = _entry(identifier);
+    OSTCodeSigningEntry entry{.codeSigningInfo = info,
+                              .placeholder = options.placeholder,
+                              .registeredByCaller = options.registeredByCaller,
+                              .dataContainerClass = options.dataContainerClass};
+    if (stored && stored->childBundleIdentifiers) {
+        entry.childBundleIdentifiers = stored->childBundleIdentifiers;
+        std::erase_if(*entry.childBundleIdentifiers, [&](const std::string& child) { return !_entry(child); });
+    }
+    if (options.parentBundleIdentifier)
+        _linkToParent(identifier, *options.parentBundleIdentifier, batch);
+    if (!stored || *stored != entry) {
+        // While the mapping still holds what is stored: the references that go are counted in it.
+        _releaseSystemContainer(identifier, entitlementsOf(info));
+        _releaseGroups(identifier, entitlementsOf(info));
+        batch.stage(info ? std::move(entry) : OSTCodeSigningEntry(), identifier);
+    }
+    if (batch.entries.empty())
+        return {};
+    return _setCodeSigningDictionaryValues(batch.entries, batch.identifiers);
+}
+
+void OSTCodeSigningMapping::_linkToParent(std::string_view identifier, const std::string& parent, Batch& batch) {
+    const auto stored = _entry(parent);
+    OSTCodeSigningEntry entry = stored ? *stored : OSTCodeSigningEntry();
+    auto children = entry.childBundleIdentifiers.value_or(std::vector<std::string>());
+    if (std::ranges::find(children, identifier) != children.end())
+        return;
+    children.emplace_back(identifier);
+    platform::logDebug("Staging Child Bundles: %@ for parent ID: %@ by appending: %@", children, parent, identifier);
+    entry.childBundleIdentifiers = std::move(children);
+    batch.stage(std::move(entry), parent);
+}
+
+void OSTCodeSigningMapping::_releaseSystemContainer(std::string_view identifier, const OSTDictionary* newEntitlements) {
+    const auto* const wanted = newEntitlements ? newEntitlements->find(OSTSystemContainerKey) : nullptr;
+    if (!_onQueue_identifierHasSystemContainer(identifier) || (wanted && wanted->truthValue()))
+        return;
+    const auto container = OSTContainerCache::sharedInstance().containerForUser(
+        OSTSystemUserId, OSTContainerClass::dataSystem, identifier, false);
+    if (!container) {
+        platform::logError("Failed to retrieve system container %@: %@", identifier, container.error());
+        return;
+    }
+    platform::logError("Deleting system container for ID: %@ because it is no longer in the entitlements", identifier);
+    const auto staged = OSTClientConnection::sharedClientConnection().stageForDeleteContainersWithUsers(
+        {.userIds = {OSTSystemUserId},
+         .uuids = {(*container)->uuid},
+         .identifiers = {std::string(identifier)},
+         .classes = {(*container)->containerClass},
+         .useLocking = false});
+    if (!staged)
+        platform::logError("Failed to destroy system container with identifier %@: %llu", identifier, staged.error());
+}
+
+void OSTCodeSigningMapping::_releaseGroups(std::string_view identifier, const OSTDictionary* newEntitlements) {
+    const auto& groups = OSTGroupManager::defaultManager();
+    groups.handleChangeFromOldGroupContainerIds(_onQueue_appGroupIdentifiersForIdentifier(identifier),
+                                                _groupList(identifier, newEntitlements, OSTGroupKeys::application),
+                                                OSTGroupType::application);
+    groups.handleChangeFromOldGroupContainerIds(_onQueue_systemGroupIdentifiersForIdentifier(identifier),
+                                                _groupList(identifier, newEntitlements, OSTGroupKeys::system),
+                                                OSTGroupType::system);
+}
+
+} // namespace ost

@@ -1,0 +1,161 @@
+#include "codesigning/OSTGroupManager.h"
+
+#include "codesigning/OSTCodeSigningMapping.h"
+#include "model/OSTFailureReport.h"
+#include "model/OSTGlobalConfiguration.h"
+#include "platform/Log.h"
+#include "store/OSTContainerCache.h"
+#include "store/OSTLocks.h"
+
+#include <algorithm>
+#include <unordered_set>
+
+namespace ost {
+
+namespace {
+
+/// Where the containers of a group type lie.
+struct GroupPlace {
+    std::uint32_t userId;
+    OSTContainerClass containerClass;
+};
+
+constexpr GroupPlace placeOf(OSTGroupType type) {
+    if (type == OSTGroupType::system)
+        return {OSTSystemUserId, OSTContainerClass::sharedSystemGroup};
+    return {OSTDefaultUserId, OSTContainerClass::sharedAppGroup};
+}
+
+OSTError invalidIdentifier(std::uint32_t userId, std::source_location where) {
+    return OSTCreateErrorAt(where, OSTErrorCode::invalidObject, nullptr,
+                            "Can't act on an invalid object: userId: %u, ID: %@", userId, nullptr);
+}
+
+bool userHasHome(std::uint32_t userId) {
+    const auto* const configuration = OSTGlobalConfiguration::sharedInstance().getPerUserConfigurationForUserId(userId);
+    return configuration && configuration->existsUserBaseDirectory();
+}
+
+} // namespace
+
+const OSTGroupManager& OSTGroupManager::defaultManager() {
+    static const OSTGroupManager manager;
+    return manager;
+}
+
+std::expected<OSTGroupManager::Paths, OSTErrorCode>
+OSTGroupManager::groupContainerPathsForUser(std::uint32_t userId, OSTClientConnection& client,
+                                            std::optional<std::string_view> identifier) const {
+    const auto here = std::source_location::current();
+    const auto paths = OSTGuarded([&]() -> OSTResult<Paths> {
+        if (!identifier)
+            return std::unexpected(invalidIdentifier(userId, here));
+        const OSTAllIdentifiersLock lock(OSTLockKind::writing);
+        auto& mapping = OSTCodeSigningMapping::sharedInstance();
+        const bool system = userId == OSTSystemUserId;
+        const auto groups = system ? mapping.systemGroupIdentifiersForIdentifier(*identifier)
+                                   : mapping.appGroupIdentifiersForIdentifier(*identifier);
+        client.setAllowGroupIdLookup();
+        Paths found;
+        for (const auto& group : groups.value_or(std::vector<std::string>())) {
+            const auto record = client.createOrLookupContainerForUser(
+                {.userId = userId,
+                 .identifier = group,
+                 .containerClass = placeOf(system ? OSTGroupType::system : OSTGroupType::application).containerClass,
+                 .createIfNecessary = true,
+                 .useLocking = false});
+            if (record)
+                found.emplace(group, (*record)->url);
+            else
+                platform::logError("Failed to create or lookup group container-userId: %u, ID: %@ : %llu", userId, group,
+                                   record.error());
+        }
+        return found;
+    });
+    if (!paths)
+        return std::unexpected(paths.error().code());
+    return *paths;
+}
+
+std::expected<std::vector<std::string>, OSTErrorCode>
+OSTGroupManager::groupContainerIdentifiersForUser(std::uint32_t userId,
+                                                  std::optional<std::string_view> identifier) const {
+    const auto here = std::source_location::current();
+    const auto groups = OSTGuarded([&]() -> OSTResult<std::vector<std::string>> {
+        if (!identifier)
+            return std::unexpected(invalidIdentifier(userId, here));
+        const OSTAllIdentifiersLock lock(OSTLockKind::writing);
+        return OSTCodeSigningMapping::sharedInstance()
+            .appGroupIdentifiersForIdentifier(*identifier)
+            .value_or(std::vector<std::string>());
+    });
+    if (!groups)
+        return std::unexpected(groups.error().code());
+    return *groups;
+}
+
+void OSTGroupManager::handleChangeFromOldGroupContainerIds(const GroupList& oldGroups, const GroupList& newGroups,
+                                                           OSTGroupType type) const {
+    if (oldGroups == newGroups || !oldGroups)
+        return;
+    std::vector<std::string> left = *oldGroups;
+    if (newGroups) {
+        const std::unordered_set<std::string_view> kept(newGroups->begin(), newGroups->end());
+        std::erase_if(left, [&](const std::string& group) { return kept.contains(group); });
+    }
+    _removeReferenceForGroupIdentifiers(left, type);
+}
+
+OSTGroupManager::ReferenceCounts OSTGroupManager::copyReferenceCountSetOfType(OSTGroupType type) {
+    ReferenceCounts counts;
+    OSTCodeSigningMapping::sharedInstance().iterateGroupIds(
+        type == OSTGroupType::system ? OSTGroupKeys::system : OSTGroupKeys::application,
+        [&](const std::string& identifier, const GroupList& groups) {
+            if (!groups)
+                return;
+            platform::logAs(platform::LogLevel::debug, "_copyReferenceCountSetOfType",
+                            "Entitlements for identifier %@ references container IDs: %@", identifier, *groups);
+            for (const auto& group : *groups)
+                ++counts[group];
+        });
+    return counts;
+}
+
+void OSTGroupManager::_removeReferenceForGroupIdentifiers(const std::vector<std::string>& groups, OSTGroupType type) {
+    if (groups.empty())
+        return;
+    const auto [userId, containerClass] = placeOf(type);
+    auto counts = copyReferenceCountSetOfType(type);
+    if (type == OSTGroupType::system || userHasHome(userId))
+        _removeGroupContainersIfNeededforUser(userId, containerClass, groups, std::move(counts));
+}
+
+void OSTGroupManager::_removeGroupContainersIfNeededforUser(std::uint32_t userId, OSTContainerClass groupContainerClass,
+                                                            const std::vector<std::string>& groups,
+                                                            ReferenceCounts referenceCounts) {
+    for (const auto& group : groups) {
+        auto& count = referenceCounts[group];
+        if (count != 1) {
+            platform::logDebug("Reference count for user: %u, ID: %@ is %ld", userId, group, count);
+        } else if (const auto container = OSTContainerCache::sharedInstance().containerForUser(
+                       userId, groupContainerClass, group, false)) {
+            platform::logNotice("Last reference to group container %@ for %u is going away; removing it.", group, userId);
+            const auto staged = OSTClientConnection::sharedClientConnection().stageForDeleteContainersWithUsers(
+                {.userIds = {userId},
+                 .uuids = {(*container)->uuid},
+                 .identifiers = {group},
+                 .classes = {(*container)->containerClass},
+                 .useLocking = false});
+            if (!staged)
+                platform::logError("Failed to destroy group container with identifier %@ for %u: %llu", group, userId,
+                                   staged.error());
+        } else {
+            platform::logDebug("Failed to retrieve group container %@ for %u : %@.  May not exist for this user", group,
+                               userId, container.error());
+        }
+        if (count > 0)
+            --count;
+    }
+}
+
+} // namespace ost

@@ -1,0 +1,196 @@
+#include "service/OSTCodeSigningCommands.h"
+
+#include "codesigning/OSTCodeSigningMapping.h"
+#include "codesigning/OSTGroupManager.h"
+#include "codesigning/OSTWhitelist.h"
+#include "model/OSTUserIdentity.h"
+#include "platform/IPCValue.h"
+#include "platform/Log.h"
+#include "service/OSTRequestReaders.h"
+
+#include <algorithm>
+
+namespace ost {
+
+namespace {
+
+constexpr const char* dataContainerClassOption = "com.tamarok.Ostrand.DataContainerClass";
+constexpr const char* parentBundleOption = "com.tamarok.Ostrand.ParentBundleID";
+constexpr const char* registeredByCallerOption = "RegByCaller";
+constexpr const char* placeholderOption = "com.tamarok.Ostrand.PlaceholderEntitlements";
+
+/// The user of a request about application groups, resolved for the client.
+std::expected<std::uint32_t, OSTErrorCode> groupUser(const platform::IPCRequest& request,
+                                                     const OSTClientConnection& client) {
+    return validateUserId(static_cast<std::uint32_t>(request.unsignedValue("UserID")), OSTContainerClass::sharedAppGroup,
+                          client.identity().clientUserId);
+}
+
+OSTErrorCode replyWithGroupPaths(const platform::IPCRequest& request, platform::IPCReply& reply,
+                                 OSTClientConnection& client, std::uint32_t userId) {
+    const auto paths = OSTGroupManager::defaultManager().groupContainerPathsForUser(
+        userId, client, OSTRequestedIdentifier(request, client));
+    if (!paths)
+        return paths.error();
+    auto dictionary = reply.encoder("ReplyGroupContainerDict");
+    dictionary.beginMap(paths->size());
+    for (const auto& [group, path] : *paths) {
+        dictionary.key(group);
+        dictionary.text(path);
+    }
+    return OSTErrorCode::success;
+}
+
+/// A value that must be a dictionary when it is there.
+std::expected<std::shared_ptr<const OSTDictionary>, OSTErrorCode> dictionaryOf(const platform::IPCRequest& request,
+                                                                               std::string_view key) {
+    const auto item = request.item(key);
+    if (!item)
+        return nullptr;
+    const auto value = platform::propertyListValue(*item);
+    auto dictionary = value ? value->sharedDictionary() : nullptr;
+    if (!dictionary) {
+        // To take it for a missing one would remove what is registered.
+        platform::logAs(platform::LogLevel::error, "registerCodeSigningInfo", "Value of %@ is no dictionary", key);
+        return std::unexpected(OSTErrorCode::invalidParameter);
+    }
+    return dictionary;
+}
+
+OSTRegistrationOptions optionsOf(const OSTDictionary* dictionary) {
+    OSTRegistrationOptions options;
+    if (!dictionary)
+        return options;
+    const auto isTrue = [&](const char* key) {
+        const auto* const value = dictionary->find(key);
+        return value && value->truthValue();
+    };
+    if (const auto* const containerClass = dictionary->find(dataContainerClassOption))
+        options.dataContainerClass = containerClass->unsignedValue().value_or(0);
+    if (const auto* const parent = dictionary->find(parentBundleOption); parent && parent->asString())
+        options.parentBundleIdentifier = *parent->asString();
+    options.registeredByCaller = isTrue(registeredByCallerOption);
+    options.placeholder = isTrue(placeholderOption);
+    return options;
+}
+
+/// The path of a system group container that the mapping grants to the client; none when its making failed.
+std::optional<std::string> grantedGroupPath(std::optional<std::string_view> identifier, const std::string& group,
+                                            OSTClientConnection& client) {
+    const auto paths =
+        OSTGroupManager::defaultManager().groupContainerPathsForUser(OSTSystemUserId, client, identifier);
+    if (!paths || !paths->contains(group))
+        return std::nullopt;
+    return paths->at(group);
+}
+
+std::optional<std::string> wellknownGroupPath(const std::string& group, OSTClientConnection& client) {
+    client.setAllowGroupIdLookup();
+    const auto record = client.createOrLookupContainerForUser({.userId = OSTSystemUserId,
+                                                               .identifier = group,
+                                                               .containerClass = OSTContainerClass::sharedSystemGroup,
+                                                               .createIfNecessary = true});
+    return record ? std::optional((*record)->url) : std::nullopt;
+}
+
+} // namespace
+
+OSTErrorCode OSTGroupContainerPathsCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
+                                           OSTClientConnection& client) {
+    const auto userId = groupUser(request, client);
+    return userId ? replyWithGroupPaths(request, reply, client, *userId) : userId.error();
+}
+
+OSTErrorCode OSTGroupIdentifiersCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
+                                        OSTClientConnection& client) {
+    const auto userId = groupUser(request, client);
+    if (!userId)
+        return userId.error();
+    const auto groups = OSTGroupManager::defaultManager().groupContainerIdentifiersForUser(
+        *userId, OSTRequestedIdentifier(request, client));
+    if (!groups)
+        return groups.error();
+    reply.set("ReplyGroupIdentifiersArray", *groups);
+    return OSTErrorCode::success;
+}
+
+OSTErrorCode OSTSystemContainerPathCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
+                                           OSTClientConnection& client) {
+    const auto identifier = OSTRequestedIdentifier(request, client);
+    const bool isOwn = identifier == client.identity().clientBundleIdentifier;
+    if (identifier && !isOwn && OSTWhitelist::sharedWhitelist().systemContainerIdIsWellknown(*identifier))
+        client.setAllowOtherIdLookup();
+    const auto record = client.createOrLookupContainerForUser({.userId = OSTSystemUserId,
+                                                               .identifier = identifier,
+                                                               .containerClass = OSTContainerClass::dataSystem,
+                                                               .createIfNecessary = true});
+    if (!record)
+        return record.error();
+    reply.set("ReplyPath", (*record)->url);
+    return OSTErrorCode::success;
+}
+
+OSTErrorCode OSTSystemGroupContainerPathsCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
+                                                 OSTClientConnection& client) {
+    return replyWithGroupPaths(request, reply, client, OSTSystemUserId);
+}
+
+OSTErrorCode OSTSystemGroupContainerPathCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
+                                                OSTClientConnection& client) {
+    constexpr const char* function = "systemGroupContainerPath";
+    const auto identifier = OSTRequestedIdentifier(request, client);
+    const auto& clientIdentifier = client.identity().clientBundleIdentifier;
+    const auto named = request.stringValue("GroupIdentifier");
+    const std::string group(named.value_or(std::string_view()));
+    const auto granted = clientIdentifier
+                             ? OSTCodeSigningMapping::sharedInstance().systemGroupIdentifiersForIdentifier(*clientIdentifier)
+                             : std::nullopt;
+    std::optional<std::string> path;
+    if (named && granted && std::ranges::find(*granted, group) != granted->end()) {
+        path = grantedGroupPath(identifier, group, client);
+    } else if (named && OSTWhitelist::sharedWhitelist().systemGroupContainerIdIsWellknown(group)) {
+        path = wellknownGroupPath(group, client);
+    } else {
+        platform::logAs(platform::LogLevel::error, function, "%@ is not entitled for system group identifier: %@",
+                        clientIdentifier, named);
+        return OSTErrorCode::notEntitled;
+    }
+    if (!path) {
+        platform::logAs(platform::LogLevel::error, function,
+                        "Did not find system group container with identifier: %@ for %@", group, identifier);
+        return OSTErrorCode::notFound;
+    }
+    reply.set("ReplyPath", *path);
+    return OSTErrorCode::success;
+}
+
+OSTErrorCode OSTRegisterCodeSigningCommand(const platform::IPCRequest& request, platform::IPCReply& /*reply*/,
+                                           OSTClientConnection& /*client*/) {
+    auto info = dictionaryOf(request, "CodeSigningInfo");
+    if (!info)
+        return info.error();
+    const auto options = dictionaryOf(request, "OptionsDictionary");
+    if (!options)
+        return options.error();
+    return OSTCodeSigningMapping::sharedInstance().processCodeSigningInfo(
+        *std::move(info), request.stringValue("Identifier"), optionsOf(options->get()));
+}
+
+OSTErrorCode OSTCodeSigningInfoCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
+                                       OSTClientConnection& /*client*/) {
+    const auto identifier = request.stringValue("Identifier");
+    const auto info = identifier ? OSTCodeSigningMapping::sharedInstance().getCodeSigningInfoForIdentifier(*identifier)
+                                 : nullptr;
+    if (!info)
+        return OSTErrorCode::notFound;
+    auto encoder = reply.encoder("ReplyInfoDictionary");
+    platform::encodePropertyListValue(encoder, *info);
+    return OSTErrorCode::success;
+}
+
+OSTErrorCode OSTInvalidateCodeSigningCommand(const platform::IPCRequest& /*request*/, platform::IPCReply& /*reply*/,
+                                             OSTClientConnection& /*client*/) {
+    return OSTCodeSigningMapping::sharedInstance().invalidateCodeSigningInfoForAppsWithoutBundleContainer();
+}
+
+} // namespace ost
