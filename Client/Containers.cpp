@@ -10,7 +10,14 @@ using ost::platform::CBORItem;
 
 namespace {
 
-enum Command : std::uint64_t { createOrLookupCommand = 0, listCommand = 1 };
+enum Command : std::uint64_t {
+    createOrLookupCommand = 0,
+    listCommand = 1,
+    replaceCommand = 2,
+    stageForDeletionCommand = 3,
+    destroyDeathRowCommand = 4,
+    deleteCommand = 10,
+};
 
 Request requestFor(Command command, const ContainerRequest& about) {
     Request request(command);
@@ -18,6 +25,20 @@ Request requestFor(Command command, const ContainerRequest& about) {
     request.key("UserID").unsignedNumber(about.user);
     request.key("Transient").boolean(about.transient);
     return request;
+}
+
+/// One of the two containers of a replacement; `side` is "Old" or "New".
+void addSide(Request& request, const std::string& side, const ContainerReference& container) {
+    request.key(side + "ContainerUUID").uuid(container.uuid);
+    request.key(side + "ContainerClass").unsignedNumber(static_cast<std::uint64_t>(container.containerClass));
+    request.key(side + "ContainerUserID").unsignedNumber(container.user);
+    request.key(side + "Identifier").text(container.identifier);
+}
+
+Result<void> withoutAnswer(const Result<Reply>& reply) {
+    if (!reply)
+        return std::unexpected(reply.error());
+    return {};
 }
 
 } // namespace
@@ -54,6 +75,43 @@ Result<std::vector<ListedContainer>> list(Connection& connection, const Containe
         containers.push_back({std::string(*identifier), *uuid});
     }
     return containers;
+}
+
+Result<void> stageForDeletion(Connection& connection, const std::vector<ContainerReference>& containers) {
+    Request request(stageForDeletionCommand);
+    const auto array = [&](std::string_view key, auto writeElement) {
+        auto elements = request.key(key);
+        elements.beginArray(containers.size());
+        for (const auto& container : containers)
+            writeElement(elements, container);
+    };
+    array("ContainerClassesArray", [](auto& elements, const auto& container) {
+        elements.unsignedNumber(static_cast<std::uint64_t>(container.containerClass));
+    });
+    array("UUIDsArray", [](auto& elements, const auto& container) { elements.uuid(container.uuid); });
+    array("UserIDsArray", [](auto& elements, const auto& container) { elements.unsignedNumber(container.user); });
+    array("IdentifiersArray", [](auto& elements, const auto& container) { elements.text(container.identifier); });
+    return withoutAnswer(connection.call(request));
+}
+
+Result<void> deleteContainer(Connection& connection, const ContainerRequest& about) {
+    auto request = requestFor(deleteCommand, about);
+    if (about.identifier)
+        request.key("Identifier").text(*about.identifier);
+    return withoutAnswer(connection.call(request));
+}
+
+Result<void> destroyDeathRow(Connection& connection) {
+    return withoutAnswer(connection.call(Request(destroyDeathRowCommand)));
+}
+
+Result<void> replace(Connection& connection, const std::optional<ContainerReference>& oldContainer,
+                     const ContainerReference& newContainer) {
+    Request request(replaceCommand);
+    if (oldContainer)
+        addSide(request, "Old", *oldContainer);
+    addSide(request, "New", newContainer);
+    return withoutAnswer(connection.call(request));
 }
 
 } // namespace ostrand

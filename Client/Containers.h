@@ -32,6 +32,14 @@ struct ListedContainer {
     ost::platform::UUID uuid;
 };
 
+/// A container that its lister knows by its UUID.
+struct ContainerReference {
+    ContainerClass containerClass;
+    std::uint64_t user = currentUser;
+    std::string identifier;
+    ost::platform::UUID uuid;
+};
+
 /// What a request does about a container that is not there.
 enum class WhenMissing : bool { fail, create };
 
@@ -43,5 +51,27 @@ enum class WhenMissing : bool { fail, create };
 /// The containers of a user and class; the request's identifier plays no part. Asks for full access. Fails with 38 for
 /// a user that does not fit the class.
 [[nodiscard]] Result<std::vector<ListedContainer>> list(Connection& connection, const ContainerRequest& request);
+
+// All of these ask for full access.
+
+/// Takes containers out of their places and stages them for deletion. One that is not there is passed over in silence;
+/// list again to see what is left. Fails with 38, before anything is touched, for a user that does not fit the class.
+[[nodiscard]] Result<void> stageForDeletion(Connection& connection, const std::vector<ContainerReference>& containers);
+
+/// Stages the container of that identifier, which must be given, for deletion. Fails with 21 when it is not there, with
+/// 11 or 38 as above. A transient container is thrown away when the daemon looks it up, and 21 is then the answer:
+/// stage it by its UUID instead.
+[[nodiscard]] Result<void> deleteContainer(Connection& connection, const ContainerRequest& request);
+
+/// Destroys what is staged for deletion, and returns when that is done. Fails with 17 when something could not be
+/// destroyed, or with the errno of what had to be parked under /tmp.
+[[nodiscard]] Result<void> destroyDeathRow(Connection& connection);
+
+/// Puts the new container in the place of the old one, which is staged for deletion; without an old one, makes a
+/// transient container a lasting one. The two must differ in being transient, since the new one keeps its directory's
+/// name. Fails with 21 when one of them is not there, 27 when the place is taken, 22, 23 or 56 when they do not go
+/// together.
+[[nodiscard]] Result<void> replace(Connection& connection, const std::optional<ContainerReference>& oldContainer,
+                                   const ContainerReference& newContainer);
 
 } // namespace ostrand

@@ -27,6 +27,19 @@ std::string inUsage(const Option& option) {
     return {};
 }
 
+std::string inUsage(const Operand& operand) {
+    const std::string name(operand.name);
+    switch (operand.count) {
+    case Operand::Count::optional:
+        return "[" + name + "]";
+    case Operand::Count::required:
+        return name;
+    case Operand::Count::several:
+        return name + "...";
+    }
+    return {};
+}
+
 /// What the usage line and the help of every level begin with.
 std::string usageOf(const CommandTable& table, std::string_view rest) {
     std::string line = "usage: " + std::string(table.program);
@@ -140,8 +153,11 @@ private:
     std::string _takeWord(std::string_view word) {
         if (!_command)
             return _takeCommandWord(word);
-        if (_operandsSeen == _command->operands.size())
-            return "unexpected argument \"" + escaped(word) + "\"";
+        if (_operandsSeen == _command->operands.size()) {
+            if (_operandsSeen == 0 || _command->operands.back().count != Operand::Count::several)
+                return "unexpected argument \"" + escaped(word) + "\"";
+            --_operandsSeen;
+        }
         _arguments.add(_command->operands[_operandsSeen++].name, std::string(word));
         return {};
     }
@@ -162,7 +178,7 @@ private:
         if (!_command)
             return _group.empty() ? "no command given" : "\"" + _group + "\" needs a further word";
         for (std::size_t i = _operandsSeen; i < _command->operands.size(); ++i)
-            if (_command->operands[i].count == Operand::Count::required)
+            if (_command->operands[i].count != Operand::Count::optional)
                 return "missing " + std::string(_command->operands[i].name);
         for (const auto& option : _command->options)
             if (option.count == Option::Count::required && !_arguments.has(option.name))
@@ -218,8 +234,7 @@ std::string usageLine(const CommandTable& table, const Command& command) {
     for (const auto& option : command.options)
         rest += " " + inUsage(option);
     for (const auto& operand : command.operands)
-        rest += operand.count == Operand::Count::required ? " " + std::string(operand.name)
-                                                          : " [" + std::string(operand.name) + "]";
+        rest += " " + inUsage(operand);
     return usageOf(table, rest);
 }
 

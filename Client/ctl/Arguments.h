@@ -24,11 +24,11 @@ struct Option {
 
 /// One argument without a name.
 struct Operand {
-    enum class Count : std::uint8_t { optional, required };
+    enum class Count : std::uint8_t { optional, required, several };
 
     std::string_view name; ///< "FILE"
     std::string_view help;
-    Count count = Count::required;
+    Count count = Count::required; ///< several: one at least; only the last operand
 };
 
 /// What the user typed behind a command, checked against its options and operands.
@@ -36,7 +36,7 @@ class Arguments {
 public:
     /// The value of an option or operand, when it was given; of a repeated option, the last.
     [[nodiscard]] std::optional<std::string> value(std::string_view name) const;
-    /// All values of a repeated option, in order.
+    /// All values of a repeated option, or of an operand of which there are several, in order.
     [[nodiscard]] std::vector<std::string> values(std::string_view name) const;
     [[nodiscard]] bool has(std::string_view name) const { return _values.contains(name); }
 

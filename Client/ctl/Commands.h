@@ -4,12 +4,14 @@
 #include "Client/ctl/Arguments.h"
 
 #include <string>
+#include <type_traits>
 #include <vector>
 
 namespace ostrand::ctl {
 
 /// The rows of the command table, by what they are about.
 [[nodiscard]] std::vector<Command> containerCommands();
+[[nodiscard]] std::vector<Command> codeSigningCommands();
 [[nodiscard]] std::vector<Command> signingCommands();
 [[nodiscard]] std::vector<Command> deviceCommands();
 
@@ -27,7 +29,10 @@ template<typename T>
 [[nodiscard]] std::expected<T, Failure> orFailure(Result<T> result) {
     if (!result)
         return std::unexpected(Failure::of(result.error()));
-    return *std::move(result);
+    if constexpr (std::is_void_v<T>)
+        return {};
+    else
+        return *std::move(result);
 }
 
 } // namespace ostrand::ctl

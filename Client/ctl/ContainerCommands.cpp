@@ -1,11 +1,11 @@
 #include "Client/Containers.h"
 #include "Client/ctl/Commands.h"
+#include "Client/ctl/Values.h"
 #include "platform/Try.h"
 
-#include <charconv>
+#include <algorithm>
+#include <chrono>
 #include <cstdio>
-#include <memory>
-#include <pwd.h>
 
 namespace ostrand::ctl {
 
@@ -17,6 +17,12 @@ constexpr Option userOption{"user", "U", "the user: a number, or the name of one
 constexpr Option identifierOption{"identifier", "ID", "the container's identifier; without it, the program's own"};
 constexpr Option transientOption{"transient", "", "ask for a transient container"};
 constexpr Operand identifierOperand{"ID", "another way to give the identifier", Operand::Count::optional};
+constexpr Operand identifierOperands{"ID", "the containers' identifiers", Operand::Count::several};
+constexpr Option oldOption{"old", "ID", "the container that goes; without it, the new one is moved to a free place"};
+constexpr Option newOption{"new", "ID", "the container that takes its place", Option::Count::required};
+constexpr Option newTransientOption{"new-transient", "", "the new container is a transient one"};
+constexpr Option oldUUIDOption{"old-uuid", "UUID", "its UUID; else that of the container that is listed"};
+constexpr Option newUUIDOption{"new-uuid", "UUID", "likewise"};
 
 constexpr std::string_view classesAndUsers =
     "Classes:\n"
@@ -27,40 +33,13 @@ constexpr std::string_view classesAndUsers =
     "  13 Shared/SystemGroup\n"
     "Without --user, bundles belong to user 33, system containers to 499 and all others to the current user (1).";
 
-std::optional<std::uint64_t> numberIn(std::string_view text) {
-    std::uint64_t number = 0;
-    const auto [end, problem] = std::from_chars(text.data(), text.data() + text.size(), number);
-    return problem == std::errc{} && end == text.data() + text.size() ? std::optional(number) : std::nullopt;
-}
-
 std::expected<ContainerClass, Failure> classOf(const Arguments& arguments) {
-    const auto text = *arguments.value(classOption.name);
-    if (const auto number = numberIn(text))
-        return static_cast<ContainerClass>(*number);
-    if (const auto named = containerClassNamed(text))
-        return *named;
-    return std::unexpected(Failure::usage("no container class is called \"" + escaped(text) + "\""));
-}
-
-/// The user id of an account of the device, from the device's own list and not the host's.
-std::expected<std::uint64_t, Failure> userOfAccount(const std::string& device, const std::string& name) {
-    const std::string path = device + "/etc/passwd";
-    const std::unique_ptr<FILE, int (*)(FILE*)> accounts(std::fopen(path.c_str(), "re"), &std::fclose);
-    if (!accounts)
-        return std::unexpected(Failure::system("cannot read " + path, errno));
-    while (const passwd* account = fgetpwent(accounts.get()))
-        if (name == account->pw_name)
-            return account->pw_uid;
-    return std::unexpected(Failure::usage("the device has no account \"" + escaped(name) + "\""));
+    return classNamed(*arguments.value(classOption.name));
 }
 
 std::expected<std::uint64_t, Failure> userOf(const Arguments& arguments, ContainerClass containerClass) {
     const auto text = arguments.value(userOption.name);
-    if (!text)
-        return usualUserOf(containerClass);
-    if (const auto number = numberIn(*text))
-        return *number;
-    return userOfAccount(deviceDirectory(arguments), *text);
+    return text ? userNamed(*text, deviceDirectory(arguments)) : usualUserOf(containerClass);
 }
 
 std::expected<ContainerRequest, Failure> containerRequestOf(const Arguments& arguments) {
@@ -71,6 +50,31 @@ std::expected<ContainerRequest, Failure> containerRequestOf(const Arguments& arg
     const auto identifier =
         arguments.value(arguments.has(identifierOption.name) ? identifierOption.name : identifierOperand.name);
     return ContainerRequest{containerClass, user, identifier, arguments.has(transientOption.name)};
+}
+
+ost::OSTDictionary jsonOf(const std::string& identifier, const std::string& uuid) {
+    ost::OSTDictionary json;
+    json.set("identifier", identifier);
+    json.set("uuid", uuid);
+    return json;
+}
+
+/// The containers of these identifiers, found by listing, because a look-up would throw a transient one away.
+std::expected<std::vector<ContainerReference>, Failure>
+listedContainers(Connection& connection, const ContainerRequest& about, const std::vector<std::string>& identifiers) {
+    constexpr std::uint64_t noSuchContainer = 21;
+    const auto listed = OST_TRY(orFailure(ostrand::list(connection, about)));
+    std::vector<ContainerReference> containers;
+    for (const auto& identifier : identifiers) {
+        const auto found = std::ranges::find(listed, identifier, &ListedContainer::identifier);
+        if (found == listed.end()) {
+            auto failure = Failure::of(Error::failed(noSuchContainer));
+            failure.message += ": " + escaped(identifier);
+            return std::unexpected(std::move(failure));
+        }
+        containers.push_back({about.containerClass, about.user, identifier, found->uuid});
+    }
+    return containers;
 }
 
 Outcome createOrLookup(const Arguments& arguments, WhenMissing whenMissing) {
@@ -101,12 +105,100 @@ Outcome list(const Arguments& arguments) {
     for (const auto& container : listed) {
         const auto uuid = container.uuid.string();
         report.text += uuid + "  " + escaped(container.identifier) + "\n";
-        ost::OSTDictionary entry;
-        entry.set("identifier", container.identifier);
-        entry.set("uuid", uuid);
-        containers.emplace_back(std::move(entry));
+        containers.emplace_back(jsonOf(container.identifier, uuid));
     }
     report.json.set("containers", std::move(containers));
+    return report;
+}
+
+Outcome deleteOne(const Arguments& arguments) {
+    const auto request = OST_TRY(containerRequestOf(arguments));
+    if (!request.identifier)
+        return std::unexpected(Failure::usage("no identifier given"));
+    auto connection = OST_TRY(connectToDevice(arguments));
+    if (request.transient) {
+        const auto container = OST_TRY(listedContainers(connection, request, {*request.identifier}));
+        OST_TRY(orFailure(stageForDeletion(connection, container)));
+    } else {
+        OST_TRY(orFailure(deleteContainer(connection, request)));
+    }
+    Report report;
+    report.text = "deleted " + escaped(*request.identifier) + "\n";
+    report.json.set("deleted", *request.identifier);
+    return report;
+}
+
+Outcome stage(const Arguments& arguments) {
+    const auto containerClass = OST_TRY(classOf(arguments));
+    const auto user = OST_TRY(userOf(arguments, containerClass));
+    auto connection = OST_TRY(connectToDevice(arguments));
+    const auto containers =
+        OST_TRY(listedContainers(connection, {containerClass, user, {}, arguments.has(transientOption.name)},
+                                 arguments.values(identifierOperands.name)));
+    OST_TRY(orFailure(stageForDeletion(connection, containers)));
+    Report report;
+    ost::OSTArray staged;
+    for (const auto& container : containers) {
+        const auto uuid = container.uuid.string();
+        report.text += "staged " + uuid + "  " + escaped(container.identifier) + "\n";
+        staged.emplace_back(jsonOf(container.identifier, uuid));
+    }
+    report.json.set("staged", std::move(staged));
+    return report;
+}
+
+Outcome purge(const Arguments& arguments) {
+    auto connection = OST_TRY(connectToDevice(arguments));
+    if (!arguments.has("json"))
+        std::fputs("waiting until everything on death row is destroyed\n", stderr);
+    const auto begin = std::chrono::steady_clock::now();
+    OST_TRY(orFailure(destroyDeathRow(connection)));
+    const std::chrono::duration<double> passed = std::chrono::steady_clock::now() - begin;
+    char seconds[32];
+    std::snprintf(seconds, sizeof seconds, "%.3f", passed.count());
+    Report report;
+    report.text = std::string("death row is empty after ") + seconds + " s\n";
+    report.json.set("seconds", passed.count());
+    return report;
+}
+
+/// One side of a replacement, with its UUID as given or as listed.
+std::expected<ContainerReference, Failure> sideOf(const Arguments& arguments, Connection& connection,
+                                                  const ContainerRequest& about, const Option& uuidOption) {
+    const auto text = arguments.value(uuidOption.name);
+    if (!text)
+        return OST_TRY(listedContainers(connection, about, {*about.identifier}))
+    .front();
+    const auto uuid = ost::platform::UUID::parse(*text);
+    if (!uuid)
+        return std::unexpected(Failure::usage("\"" + escaped(*text) + "\" is no UUID"));
+    return ContainerReference{about.containerClass, about.user, *about.identifier, *uuid};
+}
+
+Outcome replace(const Arguments& arguments) {
+    const auto containerClass = OST_TRY(classOf(arguments));
+    const auto user = OST_TRY(userOf(arguments, containerClass));
+    const auto oldIdentifier = arguments.value(oldOption.name);
+    if (!oldIdentifier && arguments.has(oldUUIDOption.name))
+        return std::unexpected(Failure::usage("--old-uuid needs --old"));
+    auto connection = OST_TRY(connectToDevice(arguments));
+    std::optional<ContainerReference> oldContainer;
+    if (oldIdentifier)
+        oldContainer = OST_TRY(sideOf(arguments, connection, {containerClass, user, oldIdentifier}, oldUUIDOption));
+    const auto newContainer =
+        OST_TRY(sideOf(arguments, connection,
+                       {containerClass, user, arguments.value(newOption.name), arguments.has(newTransientOption.name)},
+                       newUUIDOption));
+    OST_TRY(orFailure(ostrand::replace(connection, oldContainer, newContainer)));
+    Report report;
+    const auto tell = [&](const char* side, const ContainerReference& container) {
+        const auto uuid = container.uuid.string();
+        report.text += std::string(side) + "  " + uuid + "  " + escaped(container.identifier) + "\n";
+        report.json.set(side, jsonOf(container.identifier, uuid));
+    };
+    if (oldContainer)
+        tell("old", *oldContainer);
+    tell("new", newContainer);
     return report;
 }
 
@@ -128,6 +220,20 @@ std::vector<Command> containerCommands() {
          {classOption, userOption, transientOption},
          classesAndUsers,
          list},
+        {"delete", "stages a container for deletion", {identifierOperand}, ofOneContainer, classesAndUsers, deleteOne},
+        {"stage",
+         "stages containers for deletion, all of them or none when one is not there",
+         {identifierOperands},
+         {classOption, userOption, transientOption},
+         classesAndUsers,
+         stage},
+        {"purge", "destroys everything that is staged for deletion, and waits for it", {}, {}, "", purge},
+        {"replace",
+         "puts a container in the place of another one",
+         {},
+         {classOption, userOption, oldOption, newOption, newTransientOption, oldUUIDOption, newUUIDOption},
+         classesAndUsers,
+         replace},
     };
 }
 

@@ -89,6 +89,39 @@ struct Appender {
 
 void appendValue(std::string& out, const ost::OSTValue& value) { std::visit(Appender{out}, value.variant()); }
 
+/// A value behind its key or dash: on the same line, or as lines of its own below.
+void appendTree(std::string& out, const ost::OSTValue& value, std::size_t depth);
+
+void appendIndented(std::string& out, std::string_view text, std::size_t depth) {
+    constexpr std::size_t columns = 4;
+    out.append(depth * columns, ' ').append(text);
+}
+
+void appendTree(std::string& out, const ost::OSTDictionary& dictionary, std::size_t depth) {
+    for (const auto& [key, value] : dictionary) {
+        appendIndented(out, escaped(key), depth);
+        appendTree(out, value, depth);
+    }
+}
+
+void appendTree(std::string& out, const ost::OSTValue& value, std::size_t depth) {
+    const auto* const dictionary = value.asDictionary();
+    const auto* const array = value.asArray();
+    if (dictionary && !dictionary->empty()) {
+        out += '\n';
+        appendTree(out, *dictionary, depth + 1);
+    } else if (array && !array->empty()) {
+        out += '\n';
+        for (const auto& element : *array) {
+            appendIndented(out, "-", depth + 1);
+            appendTree(out, element, depth + 1);
+        }
+    } else {
+        const bool hasWords = value.asData() || value.asDate();
+        out += ' ' + (hasWords ? value.description() : jsonText(value)) + '\n';
+    }
+}
+
 std::string_view nameOf(Error::Kind kind) {
     switch (kind) {
     case Error::Kind::refused:
@@ -136,6 +169,12 @@ std::string escaped(std::string_view text) {
 std::string jsonText(const ost::OSTValue& value) {
     std::string out;
     appendValue(out, value);
+    return out;
+}
+
+std::string treeText(const ost::OSTDictionary& dictionary) {
+    std::string out;
+    appendTree(out, dictionary, 0);
     return out;
 }
 

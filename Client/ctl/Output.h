@@ -43,4 +43,8 @@ using Outcome = std::expected<Report, Failure>;
 /// null.
 [[nodiscard]] std::string jsonText(const ost::OSTValue& value);
 
+/// A dictionary as an indented tree, for people: one line for each key or element, strings in quotes and escaped as in
+/// JSON, data as `<hex>`, dates in ISO 8601.
+[[nodiscard]] std::string treeText(const ost::OSTDictionary& dictionary);
+
 } // namespace ostrand::ctl

@@ -1,11 +1,9 @@
 #include "Client/ctl/Commands.h"
+#include "Client/ctl/Values.h"
 #include "platform/CodeSignature.h"
-#include "platform/PropertyList.h"
 #include "platform/Try.h"
 
 #include <cerrno>
-#include <cstdio>
-#include <memory>
 #include <sys/stat.h>
 
 namespace ostrand::ctl {
@@ -25,29 +23,10 @@ constexpr Option entitlementsOption{"entitlements", "PLIST",
 constexpr Option entitlementOption{"entitlement", "KEY", "an entitlement that is true", Option::Count::repeated};
 constexpr Option forceOption{"force", "", "give private entitlements even to a program that others may execute"};
 
-/// All that is left in a file, as far as it could still be part of a signature.
-std::expected<std::string, Failure> contentOf(const std::string& path) {
-    const bool isStandardInput = path == "-";
-    const std::unique_ptr<FILE, int (*)(FILE*)> file(isStandardInput ? stdin : std::fopen(path.c_str(), "re"),
-                                                     &std::fclose);
-    std::string content(ost::platform::maximumCodeSignature * 16 + 1, '\0'); // XML is longer than what becomes of it
-    if (file)
-        content.resize(std::fread(content.data(), 1, content.size(), file.get()));
-    if (!file || std::ferror(file.get()))
-        return std::unexpected(Failure::system("cannot read " + path, errno));
-    return content;
-}
-
 std::expected<OSTDictionary, Failure> entitlementsOf(const Arguments& arguments) {
     OSTDictionary entitlements;
-    if (const auto path = arguments.value(entitlementsOption.name)) {
-        const auto content = OST_TRY(contentOf(*path));
-        const auto value = ost::platform::parsePropertyList(content);
-        if (!value || !value->asDictionary())
-            return std::unexpected(Failure::local(escaped(*path) + " is no property-list dictionary" +
-                                                  (value ? "" : ": " + escaped(value.error().reason))));
-        entitlements = *value->asDictionary();
-    }
+    if (const auto path = arguments.value(entitlementsOption.name))
+        entitlements = OST_TRY(dictionaryIn(*path, ost::platform::maximumCodeSignature * 16));
     for (auto& key : arguments.values(entitlementOption.name))
         entitlements.set(std::move(key), true);
     return entitlements;

@@ -18,9 +18,7 @@ bool truthValue(const OSTDictionary& dictionary, const char* key) {
     return value && value->truthValue();
 }
 
-char yesOrNo(bool value) {
-    return value ? 'Y' : 'N';
-}
+char yesOrNo(bool value) { return value ? 'Y' : 'N'; }
 
 } // namespace
 
@@ -48,7 +46,8 @@ OSTDictionary OSTCodeSigningEntry::serialize() const {
     if (codeSigningInfo)
         entries.emplace_back(codeSigningInfoKey, codeSigningInfo);
     if (childBundleIdentifiers)
-        entries.emplace_back(childBundleIdsKey, OSTArray(childBundleIdentifiers->begin(), childBundleIdentifiers->end()));
+        entries.emplace_back(childBundleIdsKey,
+                             OSTArray(childBundleIdentifiers->begin(), childBundleIdentifiers->end()));
     entries.emplace_back(invalidKey, invalid);
     entries.emplace_back(placeholderKey, placeholder);
     entries.emplace_back(registeredByCallerKey, registeredByCaller);

@@ -21,19 +21,20 @@ inline constexpr const char* OSTSystemContainerKey = "com.tamarok.security.syste
 ///
 /// A value type. The mapping holds entries shared and unchanging; a change is a new entry.
 ///
-/// On disk: a dictionary with "Invalid", "Placeholder", "RegisteredByCaller" (booleans), "DataContainerClass" (number) and, when
-/// present, "CodeSigningInfo" (dictionary) and "ChildBundleIds" (array of strings).
+/// On disk: a dictionary with "Invalid", "Placeholder", "RegisteredByCaller" (booleans), "DataContainerClass" (number)
+/// and, when present, "CodeSigningInfo" (dictionary) and "ChildBundleIds" (array of strings).
 struct OSTCodeSigningEntry {
     /// The registered information; null stands for no entry at all.
     std::shared_ptr<const OSTDictionary> codeSigningInfo = nullptr;
     /// Identifiers registered with this one as their parent, in the order they were added.
     std::optional<std::vector<std::string>> childBundleIdentifiers = std::nullopt;
-    bool invalid = false;            ///< stale; requests from outside treat it as absent
-    bool placeholder = false;        ///< of a placeholder install; requests from outside treat it as absent
-    bool registeredByCaller = false; ///< registered by a client directly, not from a signed bundle
+    bool invalid = false;                 ///< stale; requests from outside treat it as absent
+    bool placeholder = false;             ///< of a placeholder install; requests from outside treat it as absent
+    bool registeredByCaller = false;      ///< registered by a client directly, not from a signed bundle
     std::uint64_t dataContainerClass = 0; ///< class of the identifier's data container, 0 when none is known
 
-    /// Builds an entry from its serialized form. What is missing is absent, false or 0; a list of children keeps its strings.
+    /// Builds an entry from its serialized form. What is missing is absent, false or 0; a list of children keeps its
+    /// strings.
     [[nodiscard]] static OSTCodeSigningEntry withSerializedDictionary(const OSTDictionary& dictionary);
 
     [[nodiscard]] OSTDictionary serialize() const;

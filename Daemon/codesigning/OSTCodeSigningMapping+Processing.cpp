@@ -1,6 +1,7 @@
 #include "codesigning/OSTCodeSigningMapping.h"
 #include "codesigning/OSTGroupManager.h"
 #include "model/OSTFailureReport.h"
+#include "platform/Assert.h"
 #include "platform/Log.h"
 #include "store/OSTClientConnection.h"
 #include "store/OSTContainerCache.h"
@@ -11,9 +12,6 @@
 namespace ost {
 
 namespace {
-
-/// What a mapping that is unavailable gives for a result.
-constexpr OSTErrorCode noResult{0};
 
 const OSTDictionary* entitlementsOf(const std::shared_ptr<const OSTDictionary>& info) {
     const auto* const value = info ? info->find(OSTEntitlementsKey) : nullptr;
@@ -37,14 +35,11 @@ OSTErrorCode OSTCodeSigningMapping::processCodeSigningInfo(std::shared_ptr<const
                                                            std::optional<std::string_view> identifier,
                                                            const OSTRegistrationOptions& options) {
     if (!_available)
-        return noResult;
+        return OSTNoProcessingResult;
     if (!identifier)
         return OSTErrorCode::noIdentifier;
     const OSTAllIdentifiersLock lock(OSTLockKind::writing);
-    const auto result = OSTGuarded([&] {
-        return _codeSignQueue.sync(
-            [&] { return _onQueue_processCodeSigningInfo(std::move(info), *identifier, options); });
-    });
+    const auto result = _sync([&] { return _onQueue_processCodeSigningInfo(std::move(info), *identifier, options); });
     return result ? OSTErrorCode::success : result.error().code();
 }
 
@@ -60,6 +55,13 @@ OSTCodeSigningMapping::processCallerRegisteredEntitlements(std::shared_ptr<const
 OSTResult<void> OSTCodeSigningMapping::_onQueue_processCodeSigningInfo(std::shared_ptr<const OSTDictionary> info,
                                                                        std::string_view identifier,
                                                                        const OSTRegistrationOptions& options) {
+    // Containers are staged for deletion without locking.
+    OST_ASSERT(OSTHoldsAllIdentifiersLock());
+    return OSTGuarded([&] { return _process(std::move(info), identifier, options); });
+}
+
+OSTResult<void> OSTCodeSigningMapping::_process(std::shared_ptr<const OSTDictionary> info, std::string_view identifier,
+                                                const OSTRegistrationOptions& options) {
     Batch batch;
     const auto stored = _entry(identifier);
     OSTCodeSigningEntry entry{.codeSigningInfo = info,
@@ -70,7 +72,8 @@ OSTResult<void> OSTCodeSigningMapping::_onQueue_processCodeSigningInfo(std::shar
         entry.childBundleIdentifiers = stored->childBundleIdentifiers;
         std::erase_if(*entry.childBundleIdentifiers, [&](const std::string& child) { return !_entry(child); });
     }
-    if (options.parentBundleIdentifier)
+    // Nobody is its own child: the entry that is staged last would not have the link.
+    if (options.parentBundleIdentifier && *options.parentBundleIdentifier != identifier)
         _linkToParent(identifier, *options.parentBundleIdentifier, batch);
     if (!stored || *stored != entry) {
         // While the mapping still holds what is stored: the references that go are counted in it.

@@ -43,23 +43,22 @@ OSTCodeSigningMapping::OSTCodeSigningMapping() {
 // The public operations
 
 bool OSTCodeSigningMapping::codeSigningInfoExistForIdentifier(std::string_view identifier) {
-    return _codeSignQueue.sync(
-        [&] { return _onQueue_codeSigningInfoForIdentifier(identifier, Request::internal) != nullptr; });
+    return _sync([&] { return _onQueue_codeSigningInfoForIdentifier(identifier, Request::internal) != nullptr; });
 }
 
 bool OSTCodeSigningMapping::identifierHasCallerRegisteredEntitlements(std::string_view identifier) {
-    return _codeSignQueue.sync([&] {
+    return _sync([&] {
         const auto entry = _entry(identifier);
         return entry && entry->registeredByCaller;
     });
 }
 
 bool OSTCodeSigningMapping::identifierHasSystemContainer(std::string_view identifier) {
-    return _codeSignQueue.sync([&] { return _onQueue_identifierHasSystemContainer(identifier); });
+    return _sync([&] { return _onQueue_identifierHasSystemContainer(identifier); });
 }
 
 std::uint64_t OSTCodeSigningMapping::dataContainerTypeForIdentifier(std::string_view identifier) {
-    return _codeSignQueue.sync([&] {
+    return _sync([&] {
         const auto entry = _entry(identifier);
         return entry ? entry->dataContainerClass : 0;
     });
@@ -67,25 +66,27 @@ std::uint64_t OSTCodeSigningMapping::dataContainerTypeForIdentifier(std::string_
 
 std::optional<std::vector<std::string>>
 OSTCodeSigningMapping::appGroupIdentifiersForIdentifier(std::string_view identifier) {
-    return _codeSignQueue.sync([&] { return _onQueue_appGroupIdentifiersForIdentifier(identifier); });
+    return _sync([&] { return _onQueue_appGroupIdentifiersForIdentifier(identifier); });
 }
 
 std::optional<std::vector<std::string>>
 OSTCodeSigningMapping::systemGroupIdentifiersForIdentifier(std::string_view identifier) {
-    return _codeSignQueue.sync([&] { return _onQueue_systemGroupIdentifiersForIdentifier(identifier); });
+    return _sync([&] { return _onQueue_systemGroupIdentifiersForIdentifier(identifier); });
 }
 
 std::shared_ptr<const OSTDictionary>
 OSTCodeSigningMapping::getCodeSigningInfoForIdentifier(std::string_view identifier) {
     const OSTAllIdentifiersLock lock(OSTLockKind::writing);
-    return _codeSignQueue.sync([&]() -> std::shared_ptr<const OSTDictionary> {
+    return _sync([&]() -> std::shared_ptr<const OSTDictionary> {
         const auto entry = _onQueue_codeSigningInfoForIdentifier(identifier, Request::external);
         return entry ? entry->codeSigningInfo : nullptr;
     });
 }
 
 void OSTCodeSigningMapping::removeCodeSigningDictionariesForIdentifierAndItsChildren(std::string_view identifier) {
-    _codeSignQueue.sync([&] {
+    if (!_available)
+        return;
+    _sync([&] {
         for (const auto& each : _childrenAndIdentifier(identifier))
             if (const auto removed = _onQueue_processCodeSigningInfo(nullptr, each, {}); !removed)
                 platform::logAs(platform::LogLevel::error,
@@ -96,30 +97,35 @@ void OSTCodeSigningMapping::removeCodeSigningDictionariesForIdentifierAndItsChil
 
 OSTResult<void>
 OSTCodeSigningMapping::invalidateCodeSigningInfoForIdentifierAndItsChildren(std::string_view identifier) {
-    return _codeSignQueue.sync([&]() -> OSTResult<void> {
+    return _sync([&]() -> OSTResult<void> {
         if (!_available)
             return {};
-        for (const auto& each : _childrenAndIdentifier(identifier)) {
+        const auto invalidate = [&](const std::string& each) {
             const auto stored = _entry(each);
             if (!stored)
-                continue;
+                return false;
             auto entry = *stored;
             entry.invalid = true;
-            _codeSigningMappingDict.insert_or_assign(each, std::make_shared<const OSTCodeSigningEntry>(std::move(entry)));
-            if (each == identifier)
-                platform::logDebug("Invalidating code signing info for %@", identifier);
-            else
-                platform::logDebug("Invalidating code signing info for %@ child: %@", identifier, each);
-        }
+            _codeSigningMappingDict.insert_or_assign(each,
+                                                     std::make_shared<const OSTCodeSigningEntry>(std::move(entry)));
+            return true;
+        };
+        auto children = _childrenAndIdentifier(identifier);
+        if (invalidate(children.back()))
+            platform::logDebug("Invalidating code signing info for %@", identifier);
+        children.pop_back();
+        for (const auto& child : children)
+            if (invalidate(child))
+                platform::logDebug("Invalidating code signing info for %@ child: %@", identifier, child);
         return _writeCodeSigningMappingToDisk();
     });
 }
 
 OSTErrorCode OSTCodeSigningMapping::invalidateCodeSigningInfoForAppsWithoutBundleContainer() {
+    if (!_available)
+        return OSTNoProcessingResult;
     const OSTAllIdentifiersLock lock(OSTLockKind::writing);
-    const auto result = _codeSignQueue.sync([&]() -> OSTResult<void> {
-        if (!_available)
-            return {};
+    const auto result = _sync([&]() -> OSTResult<void> {
         for (auto& [identifier, entry] : _codeSigningMappingDict) {
             if (entry->registeredByCaller || _hasBundleContainer(identifier))
                 continue;
@@ -136,14 +142,15 @@ OSTErrorCode OSTCodeSigningMapping::invalidateCodeSigningInfoForAppsWithoutBundl
 bool OSTCodeSigningMapping::_hasBundleContainer(std::string_view identifier) const {
     using enum OSTContainerClass;
     return std::ranges::any_of(std::array{bundleApplication, bundleLoomworkPlugin, bundleVPNPlugin}, [&](auto bundle) {
-        return OSTContainerCache::sharedInstance().containerForUser(OSTInstallerUserId, bundle, identifier, false)
+        return OSTContainerCache::sharedInstance()
+            .containerForUser(OSTInstallerUserId, bundle, identifier, false)
             .has_value();
     });
 }
 
 std::vector<std::pair<std::string, OSTCodeSigningMapping::EntryRecord>>
 OSTCodeSigningMapping::entriesOfIdentifierAndItsChildren(std::string_view identifier) {
-    return _codeSignQueue.sync([&] {
+    return _sync([&] {
         std::vector<std::pair<std::string, EntryRecord>> entries;
         for (auto& each : _childrenAndIdentifier(identifier)) {
             auto entry = _entry(each);
@@ -156,21 +163,24 @@ OSTCodeSigningMapping::entriesOfIdentifierAndItsChildren(std::string_view identi
 void OSTCodeSigningMapping::restoreEntries(const std::vector<std::pair<std::string, EntryRecord>>& entries) {
     if (!_available)
         return;
-    std::vector<std::string> identifiers;
-    std::vector<EntryRecord> records;
-    for (const auto& [identifier, entry] : entries) {
-        identifiers.push_back(identifier);
-        records.push_back(entry);
-    }
-    // What fails is in the log; memory has the entries, and the next successful write stores them.
-    _codeSignQueue.sync([&] { (void)_setCodeSigningDictionaryValues(records, identifiers); });
+    _sync([&] {
+        // As they were, those without information too, which staging would drop.
+        for (const auto& [identifier, entry] : entries)
+            if (entry)
+                _codeSigningMappingDict.insert_or_assign(identifier, entry);
+            else
+                _codeSigningMappingDict.erase(identifier);
+        // What fails is in the log; memory has the entries, and the next successful write stores them.
+        (void)_writeCodeSigningMappingToDisk();
+    });
 }
 
 // On the queue
 
 std::vector<std::string> OSTCodeSigningMapping::_childrenAndIdentifier(std::string_view identifier) const {
     const auto entry = _entry(identifier);
-    auto identifiers = entry ? entry->childBundleIdentifiers.value_or(std::vector<std::string>()) : std::vector<std::string>();
+    auto identifiers =
+        entry ? entry->childBundleIdentifiers.value_or(std::vector<std::string>()) : std::vector<std::string>();
     identifiers.emplace_back(identifier);
     return identifiers;
 }
@@ -203,14 +213,16 @@ OSTCodeSigningMapping::EntryRecord OSTCodeSigningMapping::_migrateFromBundleCont
     OSTDictionary info = *cached->asDictionary();
     if (const auto* const entitlements = info.find(cachedEntitlementsKey))
         info.set(OSTEntitlementsKey, OSTValue(*entitlements));
+    else
+        info.remove(OSTEntitlementsKey);
     auto entry = std::make_shared<const OSTCodeSigningEntry>(
         OSTCodeSigningEntry{.codeSigningInfo = std::make_shared<const OSTDictionary>(std::move(info)),
                             .dataContainerClass = static_cast<std::uint64_t>(OSTContainerClass::dataApplication)});
     _codeSigningMappingDict.insert_or_assign((*bundle)->identifier, entry);
+    _unreadableEntries.erase((*bundle)->identifier);
     if (const auto written = _writeCodeSigningMappingToDisk(); !written)
-        platform::logError(
-            "Failed to write code signing mapping to disk during current identifier migration of %@: %@",
-            (*bundle)->identifier, written.error());
+        platform::logError("Failed to write code signing mapping to disk during current identifier migration of %@: %@",
+                           (*bundle)->identifier, written.error());
     return entry;
 }
 
@@ -252,8 +264,10 @@ OSTCodeSigningMapping::GroupList OSTCodeSigningMapping::_groupList(std::string_v
 }
 
 void OSTCodeSigningMapping::iterateGroupIds(
-    const OSTGroupKeys& keys, const std::function<void(const std::string& identifier, const GroupList& groups)>& block) {
-    OST_ASSERT(_codeSignQueue.isCurrent());
+    const OSTGroupKeys& keys,
+    const std::function<void(const std::string& identifier, const GroupList& groups)>& block) {
+    if (!_codeSignQueue.isCurrent())
+        return _sync([&] { iterateGroupIds(keys, block); });
     for (const auto& [identifier, entry] : _codeSigningMappingDict)
         block(identifier, _groupList(identifier, entry->entitlements(), keys));
 }

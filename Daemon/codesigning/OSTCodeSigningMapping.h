@@ -4,7 +4,9 @@
 #include "model/OSTError.h"
 #include "platform/OSTValue.h"
 #include "platform/WorkQueue.h"
+#include "store/OSTLocks.h"
 
+#include <concepts>
 #include <cstdint>
 #include <functional>
 #include <map>
@@ -25,6 +27,9 @@ struct OSTRegistrationOptions {
     bool placeholder = false;
 };
 
+/// What an operation that processes registrations gives when the mapping is unavailable.
+inline constexpr OSTErrorCode OSTNoProcessingResult{0};
+
 /// The entitlements that list an identifier's groups: the second one counts where the first lists none.
 struct OSTGroupKeys {
     const char* key;
@@ -36,16 +41,20 @@ struct OSTGroupKeys {
 
 /// What every identifier is entitled to: one entry for each that the installer or a client registered.
 ///
-/// The shared instance reads the mapping file when it is first used; from then on memory is the authority and the file is only
-/// written: whole, atomically, and durable before the change is answered. A file that cannot be read is never overwritten:
-/// the mapping is then unavailable, every query answers as for an unknown identifier, and nothing is processed.
+/// The shared instance reads the mapping file when it is first used; from then on memory is the authority and the file
+/// is only written: whole, atomically, and durable before the change is answered. A file that cannot be read is never
+/// overwritten: the mapping is then unavailable, every query answers as for an unknown identifier, and nothing is
+/// processed.
 ///
-/// Threads: any. All work runs on one serial queue. Operations that may change entries take the all-identifiers write lock
-/// first; the order is always the lock, then the queue.
-/// On disk: "ost_code_signing_info.plist" in the library directory, a dictionary from identifier to serialized entry.
+/// Threads: any. All work runs on one serial queue. Operations that may change entries take the all-identifiers write
+/// lock first; the order is always the lock, then the queue, where taking a lock stops the process. On disk:
+/// "ost_code_signing_info.plist" in the library directory, a dictionary from identifier to serialized entry.
 class OSTCodeSigningMapping {
 public:
     static OSTCodeSigningMapping& sharedInstance();
+
+    /// Whether the mapping file could be read.
+    [[nodiscard]] bool isAvailable() const { return _available; }
 
     /// Whether the identifier has code-signing information, an invalid or placeholder one included.
     [[nodiscard]] bool codeSigningInfoExistForIdentifier(std::string_view identifier);
@@ -55,7 +64,8 @@ public:
     [[nodiscard]] std::uint64_t dataContainerTypeForIdentifier(std::string_view identifier);
     /// The identifier's groups, each once; none when there are none or the entitlement is malformed, which is logged.
     [[nodiscard]] std::optional<std::vector<std::string>> appGroupIdentifiersForIdentifier(std::string_view identifier);
-    [[nodiscard]] std::optional<std::vector<std::string>> systemGroupIdentifiersForIdentifier(std::string_view identifier);
+    [[nodiscard]] std::optional<std::vector<std::string>>
+    systemGroupIdentifiersForIdentifier(std::string_view identifier);
     /// The identifier's code-signing information as a request from outside sees it.
     [[nodiscard]] std::shared_ptr<const OSTDictionary> getCodeSigningInfoForIdentifier(std::string_view identifier);
 
@@ -68,22 +78,22 @@ public:
     [[nodiscard]] OSTErrorCode processCallerRegisteredEntitlements(std::shared_ptr<const OSTDictionary> entitlements,
                                                                    std::optional<std::string_view> identifier);
 
-    /// Marks every entry invalid that the installer registered and whose application has no bundle container. Gives `success`
-    /// or `mappingWriteFailed`.
+    /// Marks every entry invalid that the installer registered and whose application has no bundle container. Gives
+    /// `success`, `mappingWriteFailed`, or 0 when the mapping is unavailable.
     [[nodiscard]] OSTErrorCode invalidateCodeSigningInfoForAppsWithoutBundleContainer();
 
     using GroupList = std::optional<std::vector<std::string>>;
-    /// Calls `block` with the group list of every identifier, which may be absent. Only from work that runs on the mapping's
-    /// queue already, which is why it does not enter it.
+    /// Calls `block`, on the mapping's queue, with the group list of every identifier, which may be absent. From work
+    /// that runs on the queue already, too.
     void iterateGroupIds(const OSTGroupKeys& keys,
                          const std::function<void(const std::string& identifier, const GroupList& groups)>& block);
 
-    /// Removes the entries of an identifier and of its children, and writes the mapping. Failures are logged. The caller holds
-    /// the all-identifiers lock for writing.
+    /// Removes the entries of an identifier and of its children, and writes the mapping. Failures are logged. The
+    /// caller holds the all-identifiers lock for writing.
     void removeCodeSigningDictionariesForIdentifierAndItsChildren(std::string_view identifier);
 
-    /// Marks the entries of an identifier and of its children invalid and writes the mapping, also when there are none. Fails
-    /// with `mappingWriteFailed`.
+    /// Marks the entries of an identifier and of its children invalid and writes the mapping, also when there are none.
+    /// Fails with `mappingWriteFailed`.
     [[nodiscard]] OSTResult<void> invalidateCodeSigningInfoForIdentifierAndItsChildren(std::string_view identifier);
 
     using EntryRecord = std::shared_ptr<const OSTCodeSigningEntry>;
@@ -100,11 +110,20 @@ private:
 
     OSTCodeSigningMapping();
 
+    /// Runs work on the queue.
+    template<std::invocable Work>
+    std::invoke_result_t<Work> _sync(Work&& work) {
+        return _codeSignQueue.sync([&] {
+            const OSTNoFurtherLocks noFurtherLocks;
+            return std::invoke(std::forward<Work>(work));
+        });
+    }
+
     [[nodiscard]] static std::string _mappingFileURL();
     [[nodiscard]] OSTResult<void> _readCodeSigningMappingFromDisk();
     [[nodiscard]] OSTResult<void> _writeCodeSigningMappingToDisk();
-    /// Stores entries under identifiers, matched by index, and writes the mapping if that changed anything. An entry that is
-    /// null or has no information removes its identifier. Fails with `countsDiffer` or `mappingWriteFailed`.
+    /// Stores entries under identifiers, matched by index, and writes the mapping if that changed anything. An entry
+    /// that is null or has no information removes its identifier. Fails with `countsDiffer` or `mappingWriteFailed`.
     [[nodiscard]] OSTResult<void> _setCodeSigningDictionaryValues(const std::vector<EntryRecord>& entries,
                                                                   const std::vector<std::string>& identifiers);
     [[nodiscard]] static GroupList _copyApplicationGroupEntitlementForIdentifier(std::string_view identifier,
@@ -124,16 +143,19 @@ private:
     [[nodiscard]] bool _hasBundleContainer(std::string_view identifier) const;
     [[nodiscard]] GroupList _onQueue_appGroupIdentifiersForIdentifier(std::string_view identifier);
     [[nodiscard]] GroupList _onQueue_systemGroupIdentifiersForIdentifier(std::string_view identifier);
+    /// The same, with an exception as an error.
     [[nodiscard]] OSTResult<void> _onQueue_processCodeSigningInfo(std::shared_ptr<const OSTDictionary> info,
                                                                   std::string_view identifier,
                                                                   const OSTRegistrationOptions& options);
+    [[nodiscard]] OSTResult<void> _process(std::shared_ptr<const OSTDictionary> info, std::string_view identifier,
+                                           const OSTRegistrationOptions& options);
     struct Batch;
     void _linkToParent(std::string_view identifier, const std::string& parent, Batch& batch);
     void _releaseSystemContainer(std::string_view identifier, const OSTDictionary* newEntitlements);
     void _releaseGroups(std::string_view identifier, const OSTDictionary* newEntitlements);
 
     platform::WorkQueue _codeSignQueue{"com.tamarok.Ostrand.EntitlementQueue"};
-    bool _available; ///< constant after construction
+    bool _available = false; ///< constant after construction
     // On the queue only.
     Entries _codeSigningMappingDict;
     /// What the file holds under identifiers but is no entry: kept and written back until the identifier is registered.

@@ -9,12 +9,13 @@ bool OSTCodeSigningStoreDelegate::identifierHasSystemContainer(std::string_view 
     return OSTCodeSigningMapping::sharedInstance().identifierHasSystemContainer(identifier);
 }
 
-std::optional<std::string>
-OSTCodeSigningStoreDelegate::wellknownContainerForId(std::string_view identifier, OSTContainerClass containerClass) {
+std::optional<std::string> OSTCodeSigningStoreDelegate::wellknownContainerForId(std::string_view identifier,
+                                                                                OSTContainerClass containerClass) {
     return OSTWhitelist::sharedWhitelist().wellknownContainerForId(identifier, containerClass);
 }
 
-void OSTCodeSigningStoreDelegate::removeCodeSigningDictionariesForIdentifierAndItsChildren(std::string_view identifier) {
+void OSTCodeSigningStoreDelegate::removeCodeSigningDictionariesForIdentifierAndItsChildren(
+    std::string_view identifier) {
     OSTCodeSigningMapping::sharedInstance().removeCodeSigningDictionariesForIdentifierAndItsChildren(identifier);
 }
 

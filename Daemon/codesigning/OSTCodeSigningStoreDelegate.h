@@ -4,8 +4,8 @@
 
 namespace ost {
 
-/// Answers the store's questions from the code-signing mapping and the table of well-known containers. The mapping is made at
-/// the first question that needs it.
+/// Answers the store's questions from the code-signing mapping and the table of well-known containers. The mapping is
+/// made at the first question that needs it.
 ///
 /// Threads: any. Without state.
 class OSTCodeSigningStoreDelegate final : public OSTStoreDelegate {

@@ -3,6 +3,7 @@
 #include "codesigning/OSTCodeSigningMapping.h"
 #include "model/OSTFailureReport.h"
 #include "model/OSTGlobalConfiguration.h"
+#include "platform/Assert.h"
 #include "platform/Log.h"
 #include "store/OSTContainerCache.h"
 #include "store/OSTLocks.h"
@@ -67,8 +68,8 @@ OSTGroupManager::groupContainerPathsForUser(std::uint32_t userId, OSTClientConne
             if (record)
                 found.emplace(group, (*record)->url);
             else
-                platform::logError("Failed to create or lookup group container-userId: %u, ID: %@ : %llu", userId, group,
-                                   record.error());
+                platform::logError("Failed to create or lookup group container-userId: %u, ID: %@ : %llu", userId,
+                                   group, record.error());
         }
         return found;
     });
@@ -106,18 +107,23 @@ void OSTGroupManager::handleChangeFromOldGroupContainerIds(const GroupList& oldG
     _removeReferenceForGroupIdentifiers(left, type);
 }
 
-OSTGroupManager::ReferenceCounts OSTGroupManager::copyReferenceCountSetOfType(OSTGroupType type) {
+std::optional<OSTGroupManager::ReferenceCounts> OSTGroupManager::_copyReferenceCountSetOfType(OSTGroupType type) {
+    auto& mapping = OSTCodeSigningMapping::sharedInstance();
+    if (!mapping.isAvailable()) {
+        platform::logError("Failed to get reference count information for group type: %ld", type);
+        return std::nullopt;
+    }
     ReferenceCounts counts;
-    OSTCodeSigningMapping::sharedInstance().iterateGroupIds(
-        type == OSTGroupType::system ? OSTGroupKeys::system : OSTGroupKeys::application,
-        [&](const std::string& identifier, const GroupList& groups) {
-            if (!groups)
-                return;
-            platform::logAs(platform::LogLevel::debug, "_copyReferenceCountSetOfType",
-                            "Entitlements for identifier %@ references container IDs: %@", identifier, *groups);
-            for (const auto& group : *groups)
-                ++counts[group];
-        });
+    mapping.iterateGroupIds(type == OSTGroupType::system ? OSTGroupKeys::system : OSTGroupKeys::application,
+                            [&](const std::string& identifier, const GroupList& groups) {
+                                if (!groups)
+                                    return;
+                                platform::logAs(platform::LogLevel::debug, "_copyReferenceCountSetOfType",
+                                                "Entitlements for identifier %@ references container IDs: %@",
+                                                identifier, *groups);
+                                for (const auto& group : *groups)
+                                    ++counts[group];
+                            });
     return counts;
 }
 
@@ -125,9 +131,9 @@ void OSTGroupManager::_removeReferenceForGroupIdentifiers(const std::vector<std:
     if (groups.empty())
         return;
     const auto [userId, containerClass] = placeOf(type);
-    auto counts = copyReferenceCountSetOfType(type);
-    if (type == OSTGroupType::system || userHasHome(userId))
-        _removeGroupContainersIfNeededforUser(userId, containerClass, groups, std::move(counts));
+    auto counts = _copyReferenceCountSetOfType(type);
+    if (counts && (type == OSTGroupType::system || userHasHome(userId)))
+        _removeGroupContainersIfNeededforUser(userId, containerClass, groups, *std::move(counts));
 }
 
 void OSTGroupManager::_removeGroupContainersIfNeededforUser(std::uint32_t userId, OSTContainerClass groupContainerClass,
@@ -139,16 +145,9 @@ void OSTGroupManager::_removeGroupContainersIfNeededforUser(std::uint32_t userId
             platform::logDebug("Reference count for user: %u, ID: %@ is %ld", userId, group, count);
         } else if (const auto container = OSTContainerCache::sharedInstance().containerForUser(
                        userId, groupContainerClass, group, false)) {
-            platform::logNotice("Last reference to group container %@ for %u is going away; removing it.", group, userId);
-            const auto staged = OSTClientConnection::sharedClientConnection().stageForDeleteContainersWithUsers(
-                {.userIds = {userId},
-                 .uuids = {(*container)->uuid},
-                 .identifiers = {group},
-                 .classes = {(*container)->containerClass},
-                 .useLocking = false});
-            if (!staged)
-                platform::logError("Failed to destroy group container with identifier %@ for %u: %llu", group, userId,
-                                   staged.error());
+            platform::logNotice("Last reference to group container %@ for %u is going away; removing it.", group,
+                                userId);
+            _stageForDeletion(userId, **container);
         } else {
             platform::logDebug("Failed to retrieve group container %@ for %u : %@.  May not exist for this user", group,
                                userId, container.error());
@@ -156,6 +155,42 @@ void OSTGroupManager::_removeGroupContainersIfNeededforUser(std::uint32_t userId
         if (count > 0)
             --count;
     }
+}
+
+void OSTGroupManager::reconcileGroupContainersOfType(OSTGroupType type) const {
+    OST_ASSERT(OSTHoldsAllIdentifiersLock());
+    OST_ASSERT(type == OSTGroupType::application);
+    const auto [userId, containerClass] = placeOf(type);
+    const auto counts = _copyReferenceCountSetOfType(type);
+    if (counts && userHasHome(userId))
+        _cleanupUnreferencedGroupContainersForUser(userId, containerClass, *counts);
+}
+
+void OSTGroupManager::_cleanupUnreferencedGroupContainersForUser(std::uint32_t userId, OSTContainerClass containerClass,
+                                                                 const ReferenceCounts& referenceCounts) {
+    const auto containers = OSTContainerCache::sharedInstance().allContainersForUser(userId, containerClass, false);
+    if (!containers) {
+        platform::logError("Failed to fetch group container list for %u: %@", userId, containers.error());
+        return;
+    }
+    for (const auto& container : *containers) {
+        if (referenceCounts.contains(container->identifier))
+            continue;
+        platform::logError("Removing group container with identifier %@ for %u", container->identifier, userId);
+        _stageForDeletion(userId, *container);
+    }
+}
+
+void OSTGroupManager::_stageForDeletion(std::uint32_t userId, const OSTMetadata& container) {
+    const auto staged = OSTClientConnection::sharedClientConnection().stageForDeleteContainersWithUsers(
+        {.userIds = {userId},
+         .uuids = {container.uuid},
+         .identifiers = {container.identifier},
+         .classes = {container.containerClass},
+         .useLocking = false});
+    if (!staged)
+        platform::logError("Failed to destroy group container with identifier %@ for %u: %llu", container.identifier,
+                           userId, staged.error());
 }
 
 } // namespace ost

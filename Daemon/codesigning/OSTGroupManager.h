@@ -2,6 +2,7 @@
 
 #include "model/OSTContainerClass.h"
 #include "model/OSTError.h"
+#include "model/OSTMetadata.h"
 #include "store/OSTClientConnection.h"
 
 #include <cstdint>
@@ -21,11 +22,11 @@ enum class OSTGroupType : std::uint8_t {
     system = 1,      ///< of the system user 499, class 13
 };
 
-/// Finds and makes the group containers that an identifier is entitled to, and deletes those that nobody references any more.
-/// References are not stored: they are counted in the whole mapping whenever they are needed.
+/// Finds and makes the group containers that an identifier is entitled to, and deletes those that nobody references any
+/// more. References are not stored: they are counted in the whole mapping whenever they are needed.
 ///
-/// Threads: any; the shared instance has no state. Everything runs with the all-identifiers write lock held: the queries take
-/// it, the rest is called by whoever holds it.
+/// Threads: any; the shared instance has no state. Everything runs with the all-identifiers write lock held: the
+/// queries take it, the rest is called by whoever holds it.
 class OSTGroupManager {
 public:
     using GroupList = std::optional<std::vector<std::string>>;
@@ -33,9 +34,9 @@ public:
 
     static const OSTGroupManager& defaultManager();
 
-    /// The paths of an identifier's group containers, by group identifier: of its system groups for user 499, else of its
-    /// application groups. Missing containers are made; one that cannot be made is logged and left out. The client's
-    /// `allowGroupIdLookup` stays set. Codes: `invalidObject` without an identifier.
+    /// The paths of an identifier's group containers, by group identifier: of its system groups for user 499, else of
+    /// its application groups. Missing containers are made; one that cannot be made is logged and left out. The
+    /// client's `allowGroupIdLookup` stays set. Codes: `invalidObject` without an identifier.
     [[nodiscard]] std::expected<Paths, OSTErrorCode>
     groupContainerPathsForUser(std::uint32_t userId, OSTClientConnection& client,
                                std::optional<std::string_view> identifier) const;
@@ -44,22 +45,31 @@ public:
     [[nodiscard]] std::expected<std::vector<std::string>, OSTErrorCode>
     groupContainerIdentifiersForUser(std::uint32_t userId, std::optional<std::string_view> identifier) const;
 
-    /// Releases the groups that an identifier leaves when its list changes from one to the other. Runs on the mapping's queue,
-    /// while the mapping still has the old list.
+    /// Releases the groups that an identifier leaves when its list changes from one to the other. Runs on the mapping's
+    /// queue, while the mapping still has the old list.
     void handleChangeFromOldGroupContainerIds(const GroupList& oldGroups, const GroupList& newGroups,
                                               OSTGroupType type) const;
 
-    /// How many identifiers of the mapping reference each group. Runs on the mapping's queue.
-    using ReferenceCounts = std::unordered_map<std::string, std::size_t>;
-    [[nodiscard]] static ReferenceCounts copyReferenceCountSetOfType(OSTGroupType type);
+    /// Deletes every application group container that nobody references. The caller holds the all-identifiers lock for
+    /// writing. Failures are logged.
+    void reconcileGroupContainersOfType(OSTGroupType type) const;
 
 private:
+    using ReferenceCounts = std::unordered_map<std::string, std::size_t>;
+
     OSTGroupManager() = default;
+
+    /// How many identifiers of the mapping reference each group, whatever state their entries are in. None, which is
+    /// logged, when the mapping is unavailable: nobody knows then who references what.
+    [[nodiscard]] static std::optional<ReferenceCounts> _copyReferenceCountSetOfType(OSTGroupType type);
 
     static void _removeReferenceForGroupIdentifiers(const std::vector<std::string>& groups, OSTGroupType type);
     static void _removeGroupContainersIfNeededforUser(std::uint32_t userId, OSTContainerClass groupContainerClass,
                                                       const std::vector<std::string>& groups,
                                                       ReferenceCounts referenceCounts);
+    static void _cleanupUnreferencedGroupContainersForUser(std::uint32_t userId, OSTContainerClass containerClass,
+                                                           const ReferenceCounts& referenceCounts);
+    static void _stageForDeletion(std::uint32_t userId, const OSTMetadata& container);
 };
 
 } // namespace ost

@@ -63,9 +63,7 @@ bool OSTWhitelist::containerIdIsWellknown(std::string_view identifier, OSTContai
     return wellknownContainerForId(identifier, containerClass).has_value();
 }
 
-std::vector<std::string> OSTWhitelist::wellknownSystemContainers() const {
-    return identifiersOf(_systemWhitelist);
-}
+std::vector<std::string> OSTWhitelist::wellknownSystemContainers() const { return identifiersOf(_systemWhitelist); }
 
 std::vector<std::string> OSTWhitelist::wellknownSystemGroupContainers() const {
     return identifiersOf(_systemGroupWhitelist);

@@ -11,9 +11,10 @@
 
 namespace ost {
 
-/// The fixed table of system containers (class 12) and system group containers (class 13) that belong to services of every
-/// device. Such a container lies in the directory named by its container identifier instead of a UUID. Identifiers are
-/// compared exactly. These names come from the table alone, so no path is ever built from an identifier that a client chose.
+/// The fixed table of system containers (class 12) and system group containers (class 13) that belong to services of
+/// every device. Such a container lies in the directory named by its container identifier instead of a UUID.
+/// Identifiers are compared exactly. These names come from the table alone, so no path is ever built from an identifier
+/// that a client chose.
 ///
 /// Threads: any; immutable. One shared instance.
 class OSTWhitelist {

@@ -9,11 +9,16 @@
 #include <sys/vfs.h>
 #include <sys/xattr.h>
 
+#include <algorithm>
 #include <cerrno>
 
 namespace ost::platform {
 
 namespace {
+
+/// What ordinary signatures fit into. The kernel allocates and clears as much as its caller has room for, so the first
+/// question has room for little.
+constexpr std::size_t ordinarySignature = 1024;
 
 bool isTrustworthy(const struct stat& status) {
     return S_ISREG(status.st_mode) && status.st_uid == 0 && (status.st_mode & (S_IWGRP | S_IWOTH)) == 0;
@@ -28,7 +33,10 @@ std::expected<RawCodeSignature, int> readCodeSignature(int fd, std::span<char> b
     RawCodeSignature signature{.bytes = {}, .device = status.st_dev};
     if (!isTrustworthy(status))
         return signature;
-    const auto size = ::fgetxattr(fd, codeSignatureAttribute, buffer.data(), buffer.size());
+    const auto ordinary = std::min(ordinarySignature, buffer.size());
+    auto size = ::fgetxattr(fd, codeSignatureAttribute, buffer.data(), ordinary);
+    if (size < 0 && errno == ERANGE)
+        size = ::fgetxattr(fd, codeSignatureAttribute, buffer.data(), buffer.size());
     if (size < 0 && errno != ENODATA && errno != ENOTSUP)
         return std::unexpected(errno);
     if (size > 0)

@@ -332,7 +332,9 @@ void IPCConnection::_close() {
     }
     if (!_hungUp)
         discardReceived(socket.get());
+    // All descriptors first: whoever waits for some is told by the registry.
     socket.reset();
+    _peer.unpin();
     _surroundings.registry.remove(*this);
 
     _messageHandler = nullptr;

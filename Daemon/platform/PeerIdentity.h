@@ -33,6 +33,9 @@ public:
     /// next call. Fails with an errno when the program cannot be determined: ESRCH when the process has ended.
     [[nodiscard]] std::expected<const CodeSigningIdentity*, int> codeSigningIdentity();
 
+    /// Gives the descriptor back; no program can be determined any more.
+    void unpin() { _process.reset(); }
+
 private:
     PeerIdentity(pid_t processId, uid_t effectiveUserId, FileDescriptor process)
         : _processId(processId), _effectiveUserId(effectiveUserId), _process(std::move(process)) {}

@@ -32,6 +32,19 @@ std::string escapedName(std::string_view key) {
     return name;
 }
 
+/// Makes a link under a name that nothing else has, and gives the name. A crash may have left such a link behind, made by a
+/// process that had our number.
+std::expected<std::string, int> makeTemporaryLink(int directory, const std::string& path) {
+    static std::atomic<unsigned> links = 0;
+    for (;;) {
+        auto name = "." + std::to_string(::getpid()) + "." + std::to_string(links++);
+        if (::symlinkat(path.c_str(), directory, name.c_str()) == 0)
+            return name;
+        if (errno != EEXIST)
+            return std::unexpected(errno);
+    }
+}
+
 std::expected<FileDescriptor, int> openOrMake(int parent, const std::string& name) {
     constexpr mode_t searchable = 0755;
     constexpr int flags = O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
@@ -59,10 +72,7 @@ std::expected<void, int> setSandboxUserStateItem(std::uint32_t userId, std::uint
             return std::unexpected(errno);
         return {};
     }
-    static std::atomic<unsigned> links = 0;
-    const auto temporary = "." + std::to_string(::getpid()) + "." + std::to_string(links++);
-    if (::symlinkat(std::string(*path).c_str(), items.get(), temporary.c_str()) != 0)
-        return std::unexpected(errno);
+    const auto temporary = OST_TRY(makeTemporaryLink(items.get(), std::string(*path)));
     if (::renameat(items.get(), temporary.c_str(), items.get(), name.c_str()) != 0) {
         const int error = errno;
         ::unlinkat(items.get(), temporary.c_str(), 0);

@@ -22,8 +22,8 @@ constexpr const char* placeholderOption = "com.tamarok.Ostrand.PlaceholderEntitl
 /// The user of a request about application groups, resolved for the client.
 std::expected<std::uint32_t, OSTErrorCode> groupUser(const platform::IPCRequest& request,
                                                      const OSTClientConnection& client) {
-    return validateUserId(static_cast<std::uint32_t>(request.unsignedValue("UserID")), OSTContainerClass::sharedAppGroup,
-                          client.identity().clientUserId);
+    return validateUserId(static_cast<std::uint32_t>(request.unsignedValue("UserID")),
+                          OSTContainerClass::sharedAppGroup, client.identity().clientUserId);
 }
 
 OSTErrorCode replyWithGroupPaths(const platform::IPCRequest& request, platform::IPCReply& reply,
@@ -142,9 +142,10 @@ OSTErrorCode OSTSystemGroupContainerPathCommand(const platform::IPCRequest& requ
     const auto& clientIdentifier = client.identity().clientBundleIdentifier;
     const auto named = request.stringValue("GroupIdentifier");
     const std::string group(named.value_or(std::string_view()));
-    const auto granted = clientIdentifier
-                             ? OSTCodeSigningMapping::sharedInstance().systemGroupIdentifiersForIdentifier(*clientIdentifier)
-                             : std::nullopt;
+    const auto granted =
+        clientIdentifier
+            ? OSTCodeSigningMapping::sharedInstance().systemGroupIdentifiersForIdentifier(*clientIdentifier)
+            : std::nullopt;
     std::optional<std::string> path;
     if (named && granted && std::ranges::find(*granted, group) != granted->end()) {
         path = grantedGroupPath(identifier, group, client);
@@ -179,8 +180,8 @@ OSTErrorCode OSTRegisterCodeSigningCommand(const platform::IPCRequest& request, 
 OSTErrorCode OSTCodeSigningInfoCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
                                        OSTClientConnection& /*client*/) {
     const auto identifier = request.stringValue("Identifier");
-    const auto info = identifier ? OSTCodeSigningMapping::sharedInstance().getCodeSigningInfoForIdentifier(*identifier)
-                                 : nullptr;
+    const auto info =
+        identifier ? OSTCodeSigningMapping::sharedInstance().getCodeSigningInfoForIdentifier(*identifier) : nullptr;
     if (!info)
         return OSTErrorCode::notFound;
     auto encoder = reply.encoder("ReplyInfoDictionary");

@@ -4,8 +4,8 @@
 
 namespace ost {
 
-/// Command 13: paths of the identifier's application group containers. Reads "UserID", "Identifier" (the client's own when
-/// missing); sets "ReplyGroupContainerDict".
+/// Command 13: paths of the identifier's application group containers. Reads "UserID", "Identifier" (the client's own
+/// when missing); sets "ReplyGroupContainerDict".
 [[nodiscard]] OSTErrorCode OSTGroupContainerPathsCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
                                                          OSTClientConnection& client);
 
@@ -25,8 +25,8 @@ namespace ost {
 [[nodiscard]] OSTErrorCode OSTSystemGroupContainerPathCommand(const platform::IPCRequest& request,
                                                               platform::IPCReply& reply, OSTClientConnection& client);
 
-/// Command 18: registers code-signing information. Reads "CodeSigningInfo" (none: the identifier is removed), "Identifier",
-/// "OptionsDictionary".
+/// Command 18: registers code-signing information. Reads "CodeSigningInfo" (none: the identifier is removed),
+/// "Identifier", "OptionsDictionary".
 [[nodiscard]] OSTErrorCode OSTRegisterCodeSigningCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
                                                          OSTClientConnection& client);
 

@@ -24,6 +24,10 @@ constexpr std::string_view parkingDirectory = "/tmp";
 /// what it has listed, once, so more than a few losses in a row have another cause.
 constexpr int movesToDeathRow = 16;
 
+/// How often a removal is tried in all when something came into the item behind the removal's back: a unique directory gets its
+/// item, and an application may still be at work in its container.
+constexpr int removals = 8;
+
 } // namespace
 
 platform::WorkQueue& OSTDeathRowQueue() {
@@ -149,7 +153,8 @@ void OSTClientConnection::deleteContainersOnDeathRowWithCompletion(DeathRowCompl
 }
 
 std::optional<OSTError> OSTClientConnection::_emptyDeathRow() {
-    const auto deathRow = OSTGlobalConfiguration::sharedInstance().deathrowDirectory();
+    // Asked for once: a pass does not make the directory again, so one that has gone is reported.
+    static const std::string deathRow = OSTGlobalConfiguration::sharedInstance().deathrowDirectory();
     const auto items = OSTFileManager::defaultManager().urlsForItemsInDirectoryAtURL(deathRow);
     if (!items) {
         if (items.error().isPOSIX(ENOENT))
@@ -172,7 +177,9 @@ std::optional<OSTError> OSTClientConnection::_emptyDeathRow() {
 
 OSTResult<std::optional<OSTError>> OSTClientConnection::_removeItemOrMoveToTempAtURL(const std::string& url) {
     const auto& files = OSTFileManager::defaultManager();
-    const auto removed = files.removeItemAtURL(url);
+    auto removed = files.removeItemAtURL(url);
+    for (int tries = 1; tries < removals && !removed && removed.error().isPOSIX(ENOTEMPTY); ++tries)
+        removed = files.removeItemAtURL(url);
     if (removed || removed.error().isPOSIX(ENOENT))
         return std::nullopt;
     platform::logDebug("Couldn't remove, so moving item to /tmp: %@ : %@", url, removed.error());

@@ -148,10 +148,9 @@ OSTResult<void> OSTClientConnection::_checkNothingLives(const OSTReplacement& re
 
 OSTResult<void> OSTClientConnection::_parkOldContainer(const OSTReplacement& replacement,
                                                        ReplaceOperation& operation) const {
-    auto& layout = OSTGlobalConfiguration::sharedInstance();
     const auto token = platform::UUID::generate().string();
-    operation.replaceFileURL = pathByAppending(layout.replaceDirectory(), token + ".plist");
-    operation.stagingURL = pathByAppending(layout.stagingDirectory(), token);
+    operation.replaceFileURL = OSTReplaceFile::urlOfToken(token);
+    operation.stagingURL = pathByAppending(OSTGlobalConfiguration::sharedInstance().stagingDirectory(), token);
     const auto& old = *operation.oldContainer;
 
     const auto written = OSTReplaceFile{.oldURL = old.url,

@@ -2,6 +2,7 @@
 #include "platform/Path.h"
 #include "store/OSTClientConnection.h"
 #include "store/OSTFileManager.h"
+#include "store/OSTReplaceFile.h"
 
 #include <cerrno>
 
@@ -22,11 +23,13 @@ void OSTClientConnection::containerManagerSetup() const {
 
 void OSTClientConnection::containerManagerCleanup() const {
     const auto staging = OSTGlobalConfiguration::sharedInstance().stagingDirectory();
-    const auto items = OSTFileManager::defaultManager().urlsForItemsInDirectoryAtURL(staging);
+    const auto& files = OSTFileManager::defaultManager();
+    const auto items = files.urlsForItemsInDirectoryAtURL(staging);
     if (items) {
-        // An item that cannot be moved stays for the next start.
+        // What cannot be moved stays for the next start, and so does a container that could not be put back in its place.
         for (const auto& item : *items)
-            (void)_moveItemAtURLToDeathRow(platform::pathByAppending(staging, item.name), StartPass::no);
+            if (!files.itemExistsAtURL(OSTReplaceFile::urlOfToken(item.name)))
+                (void)_moveItemAtURLToDeathRow(platform::pathByAppending(staging, item.name), StartPass::no);
     } else if (!items.error().isPOSIX(ENOENT)) {
         platform::logError("Failed to get items at staging URL%@ : %@", staging, items.error());
     }

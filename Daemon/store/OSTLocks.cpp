@@ -22,7 +22,7 @@ namespace {
 /// The lock of one identifier.
 struct LockRecord {
     std::shared_mutex lock;
-    std::uint64_t refCount = 0;            ///< holders and waiters; guarded by the table's mutex
+    std::uint64_t refCount = 0;             ///< holders and waiters; guarded by the table's mutex
     std::atomic<std::int32_t> lockState{0}; ///< 0 free, -1 held for writing, n > 0 held by n readers
 };
 
@@ -44,12 +44,13 @@ LockTable gOSTLocks;
 /// The all-identifiers lock is not re-entrant: remembering the holder turns a deadlock into an assertion.
 thread_local bool holdsAllIdentifiers = false;
 
-const char* nameOf(OSTLockKind kind) {
-    return kind == OSTLockKind::writing ? "writing" : "reading";
-}
+/// A wrong order deadlocks only when two threads meet; this finds it whenever it is taken.
+thread_local bool furtherLocksForbidden = false;
 
-/// How long a waiter may keep its worker to itself: longer than a look-up holds the lock, so that a busy daemon does not wake
-/// one worker after another only to see them wait too.
+const char* nameOf(OSTLockKind kind) { return kind == OSTLockKind::writing ? "writing" : "reading"; }
+
+/// How long a waiter may keep its worker to itself: longer than a look-up holds the lock, so that a busy daemon does
+/// not wake one worker after another only to see them wait too.
 constexpr std::chrono::microseconds shortWait{500};
 
 /// Waits for `condition`; a wait that is no longer short does not keep a listener's worker from serving others.
@@ -61,9 +62,7 @@ void wait(std::condition_variable& condition, std::unique_lock<std::mutex>& lock
     condition.wait(lock, predicate);
 }
 
-bool noIdentifierLocks() {
-    return gOSTLocks.identifierReaderCount == 0 && gOSTLocks.identifierWriterCount == 0;
-}
+bool noIdentifierLocks() { return gOSTLocks.identifierReaderCount == 0 && gOSTLocks.identifierWriterCount == 0; }
 
 void acquire(LockRecord& record, OSTLockKind kind) {
     if (kind == OSTLockKind::writing) {
@@ -117,6 +116,7 @@ std::vector<std::string_view> distinct(std::vector<std::string_view> identifiers
 
 void take_one_lock(std::string_view identifier, OSTLockKind kind) {
     OST_ASSERT(!holdsAllIdentifiers);
+    OST_ASSERT(!furtherLocksForbidden);
     LockRecord* record = nullptr;
     {
         std::unique_lock lock(gOSTLocks.mutex);
@@ -166,6 +166,7 @@ void unlock_identifier(std::vector<std::string_view> identifiers) {
 
 void _lock_all_identifiers(OSTLockKind kind) {
     OST_ASSERT(!holdsAllIdentifiers);
+    OST_ASSERT(!furtherLocksForbidden);
     platform::logDebug("Waiting to lock all identifiers for %s", nameOf(kind));
     std::unique_lock lock(gOSTLocks.mutex);
     if (kind == OSTLockKind::writing) {
@@ -204,13 +205,18 @@ void unlock_all_identifiers() {
     platform::logDebug("Unlocked all identifiers");
 }
 
-bool OSTHoldsAllIdentifiersLock() {
-    return holdsAllIdentifiers;
-}
+bool OSTHoldsAllIdentifiersLock() { return holdsAllIdentifiers; }
 
 std::size_t OSTLockRecordCount() {
     const std::lock_guard lock(gOSTLocks.mutex);
     return gOSTLocks.identifierToLockMap.size();
 }
+
+OSTNoFurtherLocks::OSTNoFurtherLocks() {
+    OST_ASSERT(!furtherLocksForbidden);
+    furtherLocksForbidden = true;
+}
+
+OSTNoFurtherLocks::~OSTNoFurtherLocks() { furtherLocksForbidden = false; }
 
 } // namespace ost

@@ -9,15 +9,17 @@ namespace ost {
 
 /// Reader/writer locks on identifiers, and one daemon-wide reader/writer lock on all of them.
 ///
-/// A writer of all identifiers excludes every other holder; a reader of all identifiers excludes identifier writers. Locks of
-/// different identifiers do not meet. Not re-entrant in any combination: a thread that holds the all-identifiers lock takes
-/// neither it nor an identifier lock. Identifiers of one call are taken in ascending order and given back in descending order,
-/// which rules out deadlock between two callers.
+/// A writer of all identifiers excludes every other holder; a reader of all identifiers excludes identifier writers.
+/// Locks of different identifiers do not meet. Not re-entrant in any combination: a thread that holds the
+/// all-identifiers lock takes neither it nor an identifier lock. Identifiers of one call are taken in ascending order
+/// and given back in descending order, which rules out deadlock between two callers.
 ///
-/// The all-identifiers write lock is taken before the code-signing mapping's queue is entered, never after.
+/// Whoever enters something that is entered with these locks held, as the code-signing mapping's queue is, forbids
+/// itself to take one there: the order is always the lock first.
 ///
-/// Threads: any. Misuse (unlocking what is not locked, taking the all-identifiers lock twice) stops the process. Code takes
-/// the locks through the two guards at the end; the functions are what the guards are made of.
+/// Threads: any. Misuse (unlocking what is not locked, taking the all-identifiers lock twice, taking a lock where that
+/// is forbidden) stops the process. Code takes the locks through the guards at the end; the functions are what the
+/// guards are made of.
 enum class OSTLockKind : bool { reading, writing };
 
 void take_one_lock(std::string_view identifier, OSTLockKind kind);
@@ -73,6 +75,16 @@ private:
     [[nodiscard]] std::vector<std::string_view> _views() const { return {_identifiers.begin(), _identifiers.end()}; }
 
     const std::vector<std::string> _identifiers;
+};
+
+/// Forbids the calling thread to take any of these locks, from construction to destruction; giving one back stays
+/// allowed. Not to be nested.
+class OSTNoFurtherLocks {
+public:
+    OSTNoFurtherLocks();
+    OSTNoFurtherLocks(const OSTNoFurtherLocks&) = delete;
+    OSTNoFurtherLocks& operator=(const OSTNoFurtherLocks&) = delete;
+    ~OSTNoFurtherLocks();
 };
 
 } // namespace ost

@@ -29,6 +29,11 @@ bool isStagingURL(const std::string& url) {
 
 } // namespace
 
+std::string OSTReplaceFile::urlOfToken(std::string_view token) {
+    return platform::pathByAppending(OSTGlobalConfiguration::sharedInstance().replaceDirectory(),
+                                     platform::formatMessage("%@.plist", token));
+}
+
 OSTResult<void> OSTReplaceFile::writeToDisk(const std::string& url) const {
     if (oldURL.empty() || newURL.empty() || stagingURL.empty() || destinationURL.empty())
         return std::unexpected(OSTCreateError(OSTErrorCode::replaceDescriptionIncomplete,

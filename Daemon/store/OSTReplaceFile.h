@@ -3,6 +3,7 @@
 #include "model/OSTError.h"
 
 #include <string>
+#include <string_view>
 
 namespace ost {
 
@@ -15,6 +16,9 @@ struct OSTReplaceFile {
     std::string newURL;         ///< where the new container was before
     std::string stagingURL;     ///< where the old container is parked
     std::string destinationURL; ///< where the new container ends up
+
+    /// The file of the replacement with that token.
+    [[nodiscard]] static std::string urlOfToken(std::string_view token);
 
     /// Writes the file, durably. Fails with `replaceDescriptionIncomplete` or `dictionaryWriteFailed`.
     [[nodiscard]] OSTResult<void> writeToDisk(const std::string& url) const;

@@ -22,6 +22,7 @@ const CommandTable table{
          nullptr},
         {"lamp on", "lights the lamp", {}, {}, "", nullptr},
         {"lamp off", "puts it out", {}, {}, "", nullptr},
+        {"drop", "drops things", {{"NAME", "their names", Operand::Count::several}}, {}, "", nullptr},
     }};
 
 /// What a command line comes to, in one line.
@@ -57,6 +58,8 @@ TEST(Arguments, comeFromTheTableAlone) {
         {"make --colour c -- --help", "make colour=c NAME=--help"},
         {"make --colour c -", "make colour=c NAME=-"},
         {"lamp --loud off", "lamp off loud="},
+        {"drop x --loud y z", "drop loud= NAME=x NAME=y NAME=z"},
+        {"drop", "missing NAME | usage: tool [--where DIR] [--loud] drop NAME..."},
         {"--help", "help: usage: tool [--where DIR] [--loud] COMMAND ..."},
         {"lamp -h", "help: usage: tool [--where DIR] [--loud] lamp COMMAND ..."},
         {"make --help", "help: " + usageOfMake},

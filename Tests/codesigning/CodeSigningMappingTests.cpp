@@ -1,44 +1,22 @@
-#include "codesigning/OSTCodeSigningMapping.h"
+#include "codesigning/CodeSigningTest.h"
+
 #include "codesigning/OSTWhitelist.h"
-
-#include "model/OSTDictionaryFile.h"
-#include "platform/PropertyList.h"
-#include "store/OSTClientConnection.h"
 #include "store/OSTContainerCache.h"
-#include "support/DeviceTest.h"
-
-#include <gtest/gtest.h>
 
 #include <filesystem>
 
 namespace ost {
 namespace {
 
-constexpr const char* mappingFile = "/private/var/root/Library/Ostrand/ost_code_signing_info.plist";
+using test::entryWith;
+using test::mappingFile;
+using test::strings;
+
+using CodeSigningMapping = test::CodeSigningTest;
 
 std::shared_ptr<const OSTDictionary> shared(OSTDictionary dictionary) {
     return std::make_shared<const OSTDictionary>(std::move(dictionary));
 }
-
-OSTDictionary entryWith(OSTDictionary entitlements) {
-    return OSTCodeSigningEntry{.codeSigningInfo = shared(OSTDictionary({{OSTEntitlementsKey, std::move(entitlements)}}))}
-        .serialize();
-}
-
-OSTArray strings(std::initializer_list<const char*> values) {
-    return OSTArray(values.begin(), values.end());
-}
-
-class CodeSigningMapping : public test::DeviceTest {
-protected:
-    static OSTCodeSigningMapping& mapping() { return OSTCodeSigningMapping::sharedInstance(); }
-    static void writeMapping(const OSTDictionary& dictionary) {
-        test::writeFile(mappingFile, platform::serializeBinaryPropertyList(dictionary));
-    }
-    static OSTDictionary onDisk() {
-        return *OST_dictionaryWithContentsOfURL(mappingFile, OSTLargeDictionaryFileSize);
-    }
-};
 
 TEST_F(CodeSigningMapping, EntrySurvivesItsSerializedForm) {
     EXPECT_EQ(4U, OSTCodeSigningEntry{}.serialize().size());
@@ -57,9 +35,12 @@ TEST_F(CodeSigningMapping, EntrySurvivesItsSerializedForm) {
     other.childBundleIdentifiers.reset();
     EXPECT_NE(entry, other) << "no children is not an empty list of them";
 
-    const auto strange = OSTCodeSigningEntry::withSerializedDictionary(
-        OSTDictionary({{"Invalid", std::uint64_t{0}}, {"Placeholder", "yes"}, {"CodeSigningInfo", "no dictionary"},
-                       {"ChildBundleIds", OSTDictionary()}, {"DataContainerClass", OSTArray()}}));
+    const auto strange =
+        OSTCodeSigningEntry::withSerializedDictionary(OSTDictionary({{"Invalid", std::uint64_t{0}},
+                                                                     {"Placeholder", "yes"},
+                                                                     {"CodeSigningInfo", "no dictionary"},
+                                                                     {"ChildBundleIds", OSTDictionary()},
+                                                                     {"DataContainerClass", OSTArray()}}));
     EXPECT_EQ(OSTCodeSigningEntry{}, strange);
 }
 
@@ -99,7 +80,8 @@ TEST_F(CodeSigningMapping, GroupListsAreReadFromTheEntitlements) {
         {OSTDictionary({{app, strings({"b", "a", "b"})}}), List({"a", "b"}), {}},
         {OSTDictionary({{app, OSTArray{"a", OSTValue(std::uint64_t{1})}}}), {}, {}},
         {OSTDictionary({{app, std::uint64_t{1}}}), {}, {}},
-        {OSTDictionary({{system, strings({"systemgroup.a", "other", "systemgroup.c"})}}), {},
+        {OSTDictionary({{system, strings({"systemgroup.a", "other", "systemgroup.c"})}}),
+         {},
          List({"systemgroup.a", "systemgroup.c"})},
         {OSTDictionary({{system, OSTArray()}, {older, "systemgroup.old"}}), {}, List({"systemgroup.old"})},
         {OSTDictionary({{system, "systemgroup.new"}, {older, "systemgroup.old"}}), {}, List({"systemgroup.new"})},
@@ -120,7 +102,8 @@ TEST_F(CodeSigningMapping, PlaceholderAndInvalidEntriesAreHiddenFromOutside) {
     placeholder.set("DataContainerClass", std::uint64_t{4});
     auto invalid = entryWith({});
     invalid.set("Invalid", true);
-    writeMapping(OSTDictionary({{"p", placeholder}, {"i", invalid}, {"good", entryWith({})}, {"broken", "no dictionary"}}));
+    writeMapping(
+        OSTDictionary({{"p", placeholder}, {"i", invalid}, {"good", entryWith({})}, {"broken", "no dictionary"}}));
     EXPECT_FALSE(mapping().getCodeSigningInfoForIdentifier("p"));
     EXPECT_FALSE(mapping().getCodeSigningInfoForIdentifier("i"));
     EXPECT_TRUE(mapping().getCodeSigningInfoForIdentifier("good"));

@@ -7,6 +7,7 @@
 #include "store/OSTLocks.h"
 #include "store/OSTStoreDelegate.h"
 #include "support/DeviceTest.h"
+#include "support/StoreTest.h"
 
 #include <gtest/gtest.h>
 
@@ -40,10 +41,8 @@ protected:
                                                        .createIfNecessary = create});
     }
     static auto create(std::uint32_t userId, OSTContainerClass containerClass, std::string_view identifier) {
-        return store().createOrLookupContainerForUser({.userId = userId,
-                                                       .identifier = identifier,
-                                                       .containerClass = containerClass,
-                                                       .createIfNecessary = true});
+        return store().createOrLookupContainerForUser(
+            {.userId = userId, .identifier = identifier, .containerClass = containerClass, .createIfNecessary = true});
     }
     static OSTClientConnection& store() { return OSTClientConnection::sharedClientConnection(); }
 
@@ -56,12 +55,11 @@ protected:
     static bool isEmpty(const fs::path& directory) { return !fs::exists(directory) || fs::is_empty(directory); }
 
     static void plant(const fs::path& item, std::string_view identifier) {
-        test::writeFile(item / OSTMetadataFileName,
-                        platform::serializeBinaryPropertyList(
-                            OSTDictionary({{"OSTMetadataIdentifier", std::string(identifier)},
-                                           {"OSTMetadataUUID", platform::UUID::generate().string()},
-                                           {"OSTMetadataContentClass", std::uint64_t{2}},
-                                           {"OSTMetadataPersona", std::uint64_t{501}}})));
+        test::writeFile(item / OSTMetadataFileName, platform::serializeBinaryPropertyList(OSTDictionary(
+                                                        {{"OSTMetadataIdentifier", std::string(identifier)},
+                                                         {"OSTMetadataUUID", platform::UUID::generate().string()},
+                                                         {"OSTMetadataContentClass", std::uint64_t{2}},
+                                                         {"OSTMetadataPersona", std::uint64_t{501}}})));
     }
 };
 
@@ -97,7 +95,8 @@ TEST_F(ContainerStore, MakesEveryClassAsItShouldBe) {
         EXPECT_FALSE((*made)->existed);
         EXPECT_EQ(c.directory, fs::path((*made)->url).parent_path());
         EXPECT_TRUE(platform::UUID::parse(platform::lastPathComponent((*made)->url)));
-        EXPECT_NE((*made)->uuid.string(), platform::lastPathComponent((*made)->url)) << "the internal UUID is another one";
+        EXPECT_NE((*made)->uuid.string(), platform::lastPathComponent((*made)->url))
+            << "the internal UUID is another one";
         EXPECT_EQ(metadata + c.content, test::tree((*made)->url)) << c.directory;
         struct stat status{};
         ASSERT_EQ(0, ::stat((*made)->url.c_str(), &status));
@@ -115,7 +114,7 @@ TEST_F(ContainerStore, MakesEveryClassAsItShouldBe) {
 }
 
 TEST_F(ContainerStore, SystemContainersBelongToNobodyAndUseWellknownNames) {
-    class Delegate final : public OSTStoreDelegate {
+    class Delegate final : public test::StoreDelegate {
         bool identifierHasSystemContainer(std::string_view identifier) override { return identifier == "entitled"; }
         std::optional<std::string> wellknownContainerForId(std::string_view identifier, OSTContainerClass) override {
             return identifier == "well.known" ? std::optional<std::string>("known.name") : std::nullopt;
@@ -154,13 +153,14 @@ TEST_F(ContainerStore, RefusesWhatFitsNoContainerBeforeAnyLock) {
     };
     for (const auto& c : {Case{501, 2, {}}, Case{501, 0, "a"}, Case{501, 14, "a"}, Case{501, 1, "a"}, Case{500, 2, "a"},
                           Case{501, 12, "a"}, Case{501, std::uint64_t{1} << 32U | 2U, "a"}})
-        EXPECT_EQ(OSTErrorCode::invalidObject,
-                  store()
-                      .createOrLookupContainerForUser({.userId = c.user,
-                                                       .identifier = c.identifier,
-                                                       .containerClass = static_cast<OSTContainerClass>(c.containerClass),
-                                                       .createIfNecessary = true})
-                      .error());
+        EXPECT_EQ(
+            OSTErrorCode::invalidObject,
+            store()
+                .createOrLookupContainerForUser({.userId = c.user,
+                                                 .identifier = c.identifier,
+                                                 .containerClass = static_cast<OSTContainerClass>(c.containerClass),
+                                                 .createIfNecessary = true})
+                .error());
 }
 
 TEST_F(ContainerStore, LooksUpWithoutMaking) {
@@ -172,7 +172,8 @@ TEST_F(ContainerStore, LooksUpWithoutMaking) {
 TEST_F(ContainerStore, TransientContainersAreNeverReused) {
     const auto first = lookUp("org.example.app", true, true);
     ASSERT_TRUE(first);
-    EXPECT_TRUE((*first)->url.starts_with("/private/var/mobile/Library/Caches/com.tamarok.ostrandd/Temp/Data/Application/"));
+    EXPECT_TRUE(
+        (*first)->url.starts_with("/private/var/mobile/Library/Caches/com.tamarok.ostrandd/Temp/Data/Application/"));
     const auto second = lookUp("org.example.app", true, true);
     ASSERT_TRUE(second);
     EXPECT_FALSE((*second)->existed);

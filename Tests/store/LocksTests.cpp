@@ -144,6 +144,9 @@ TEST(LocksDeathTest, MisuseStopsTheProcess) {
             take_one_lock("a", reading);
         },
         "holdsAllIdentifiers");
+    const OSTNoFurtherLocks noFurtherLocks;
+    EXPECT_DEATH(_lock_all_identifiers(reading), "furtherLocksForbidden");
+    EXPECT_DEATH(take_one_lock("a", reading), "furtherLocksForbidden");
 }
 
 } // namespace

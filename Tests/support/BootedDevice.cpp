@@ -38,18 +38,35 @@ bool runsDaemon(pid_t process) {
 }
 
 /// The daemon that a launcher has started, held so that its number cannot mean another process any more.
-FileDescriptor openDaemonOf(pid_t launcher) {
+struct Daemon {
+    pid_t id = 0;
+    FileDescriptor handle;
+};
+
+Daemon findDaemonOf(pid_t launcher) {
     for (const auto& entry : std::filesystem::directory_iterator("/proc")) {
         const std::string name = entry.path().filename();
         pid_t process = 0;
         if (std::from_chars(name.data(), name.data() + name.size(), process).ec != std::errc{} ||
             parentOf(process) != launcher || !runsDaemon(process))
             continue;
-        FileDescriptor daemon(static_cast<int>(::syscall(SYS_pidfd_open, process, 0)));
-        if (daemon && parentOf(process) == launcher)
-            return daemon;
+        FileDescriptor handle(static_cast<int>(::syscall(SYS_pidfd_open, process, 0)));
+        if (handle && parentOf(process) == launcher)
+            return {process, std::move(handle)};
     }
     return {};
+}
+
+/// The launcher may be just about to start it.
+Daemon awaitDaemonOf(pid_t launcher) {
+    const auto deadline = std::chrono::steady_clock::now() + patience;
+    for (;;) {
+        if (auto daemon = findDaemonOf(launcher); daemon.id != 0)
+            return daemon;
+        if (std::chrono::steady_clock::now() > deadline)
+            throw std::runtime_error("There is no daemon");
+        ::sched_yield();
+    }
 }
 
 } // namespace
@@ -103,16 +120,12 @@ BootedDevice::Outcome BootedDevice::ostrandctl(std::vector<std::string> argument
     return {client.wait(), std::move(output)};
 }
 
-void BootedDevice::killDaemon() {
-    const auto deadline = std::chrono::steady_clock::now() + patience;
-    FileDescriptor daemon;
-    while (!(daemon = openDaemonOf(_launcher->id()))) { // The launcher is just about to start it.
-        if (std::chrono::steady_clock::now() > deadline)
-            throw std::runtime_error("No daemon to kill: " + complaints());
-        ::sched_yield();
-    }
-    ::syscall(SYS_pidfd_send_signal, daemon.get(), SIGKILL, nullptr, 0);
-    pollfd ended{daemon.get(), POLLIN, 0};
+pid_t BootedDevice::daemonId() const { return awaitDaemonOf(_launcher->id()).id; }
+
+void BootedDevice::killDaemon(int signal) {
+    const auto daemon = awaitDaemonOf(_launcher->id());
+    ::syscall(SYS_pidfd_send_signal, daemon.handle.get(), signal, nullptr, 0);
+    pollfd ended{daemon.handle.get(), POLLIN, 0};
     ::poll(&ended, 1, -1);
 }
 

@@ -36,9 +36,12 @@ public:
     /// Runs a copy of the client program that may use every command: `ostrandctl({"lookup", "--class", "2", ...})`.
     Outcome ostrandctl(std::vector<std::string> arguments);
 
-    /// Kills the daemon as a crash would, and returns when it is gone. The launcher starts another one; clients that
-    /// connect in the meantime wait.
-    void killDaemon();
+    /// The process id of the daemon that runs now.
+    [[nodiscard]] pid_t daemonId() const;
+
+    /// Ends the daemon with a signal, SIGKILL as a crash would, and returns when it is gone. The launcher starts
+    /// another one; clients that connect in the meantime wait.
+    void killDaemon(int signal = SIGKILL);
 
     /// Ends the daemon in order and boots the same image again.
     void reboot();

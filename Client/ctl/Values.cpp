@@ -1,0 +1,78 @@
+#include "Client/ctl/Values.h"
+
+#include "platform/PropertyList.h"
+#include "platform/Try.h"
+
+#include <cerrno>
+#include <charconv>
+#include <cstdio>
+#include <memory>
+#include <optional>
+#include <pwd.h>
+
+namespace ostrand::ctl {
+
+namespace {
+
+using File = std::unique_ptr<FILE, int (*)(FILE*)>;
+
+/// How deep a property list may be to go into a request, which is a level of its own.
+constexpr std::size_t deepestValue = 63;
+
+std::optional<std::uint64_t> numberIn(std::string_view text) {
+    std::uint64_t number = 0;
+    const auto [end, problem] = std::from_chars(text.data(), text.data() + text.size(), number);
+    return problem == std::errc{} && end == text.data() + text.size() ? std::optional(number) : std::nullopt;
+}
+
+std::expected<std::string, Failure> contentOf(const std::string& path, std::size_t largest) {
+    const File file(path == "-" ? stdin : std::fopen(path.c_str(), "re"), &std::fclose);
+    std::string content;
+    char buffer[1U << 16U];
+    while (file && content.size() <= largest) {
+        const auto count = std::fread(buffer, 1, sizeof buffer, file.get());
+        if (count == 0)
+            break;
+        content.append(buffer, count);
+    }
+    if (!file || std::ferror(file.get()))
+        return std::unexpected(Failure::system("cannot read " + path, errno));
+    if (content.size() > largest)
+        return std::unexpected(Failure::local(escaped(path) + " is too large"));
+    return content;
+}
+
+} // namespace
+
+std::expected<ContainerClass, Failure> classNamed(const std::string& text) {
+    if (const auto number = numberIn(text))
+        return static_cast<ContainerClass>(*number);
+    if (const auto named = containerClassNamed(text))
+        return *named;
+    return std::unexpected(Failure::usage("no container class is called \"" + escaped(text) + "\""));
+}
+
+std::expected<std::uint64_t, Failure> userNamed(const std::string& text, const std::string& device) {
+    if (const auto number = numberIn(text))
+        return *number;
+    const std::string path = device + "/etc/passwd";
+    const File accounts(std::fopen(path.c_str(), "re"), &std::fclose);
+    if (!accounts)
+        return std::unexpected(Failure::system("cannot read " + path, errno));
+    while (const passwd* account = fgetpwent(accounts.get()))
+        if (text == account->pw_name)
+            return account->pw_uid;
+    return std::unexpected(Failure::usage("the device has no account \"" + escaped(text) + "\""));
+}
+
+std::expected<ost::OSTDictionary, Failure> dictionaryIn(const std::string& path, std::size_t largest) {
+    const auto content = OST_TRY(contentOf(path, largest));
+    const auto value =
+        ost::platform::parsePropertyList(content, {.depth = deepestValue, .objectCount = content.size()});
+    if (!value || !value->asDictionary())
+        return std::unexpected(Failure::local(escaped(path) + " is no property-list dictionary" +
+                                              (value ? "" : ": " + escaped(value.error().reason))));
+    return *value->asDictionary();
+}
+
+} // namespace ostrand::ctl
