@@ -128,7 +128,7 @@ std::vector<std::string> GatedDevice::openFilesOfDaemon() const {
     std::error_code closed;
     for (const auto& entry : std::filesystem::directory_iterator("/proc/" + std::to_string(_daemon->id()) + "/fd")) {
         auto path = std::filesystem::read_symlink(entry, closed).string();
-        if (path.starts_with(image().native()))
+        if (path.starts_with(onHost("/private").native()))
             paths.push_back(std::move(path));
     }
     std::ranges::sort(paths);

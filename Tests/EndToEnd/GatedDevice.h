@@ -31,7 +31,7 @@ public:
     [[nodiscard]] bool waitForFirstPass() const;
     [[nodiscard]] GatedProcess& daemon() { return *_daemon; }
     [[nodiscard]] bool daemonIsUp() const;
-    /// The paths of the device's files and directories that the daemon has open, sorted.
+    /// The files and directories in which the device keeps things and which the daemon has open, sorted.
     [[nodiscard]] std::vector<std::string> openFilesOfDaemon() const;
 
     /// A new connection of a client that may use every command. It gives up on a daemon that does not answer.

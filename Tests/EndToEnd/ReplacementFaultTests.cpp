@@ -125,11 +125,13 @@ protected:
             return Place::old;
         if (at(_destination) == _new.content && at(newPath).empty() && (!separate || at(oldPath).empty()))
             return Place::replaced;
+        const auto log = device().onHost("/private/var/root/Library/Logs/Ostrand/ostrandd.log");
         ADD_FAILURE() << "In the old one's place:\n"
                       << at(oldPath) << "\nin the new one's place:\n"
                       << at(newPath) << "\nin the destination:\n"
                       << (separate ? at(_destination) : "the same") << "\nin all:\n"
-                      << tree(device().onHost("/private/var"));
+                      << tree(device().onHost("/private/var")) << "\nlog:\n"
+                      << readFile(log);
         return std::nullopt;
     }
 

@@ -117,7 +117,8 @@ TEST_F(CodeSigningProcessing, TheSystemContainerGoesWithItsEntitlement) {
         {"a true number",
          OSTDictionary({{OSTEntitlementsKey, OSTDictionary({{OSTSystemContainerKey, std::uint64_t{7}}})}}), true},
         {"false", OSTDictionary({{OSTEntitlementsKey, OSTDictionary({{OSTSystemContainerKey, false}})}}), false},
-        {"a string", OSTDictionary({{OSTEntitlementsKey, OSTDictionary({{OSTSystemContainerKey, "true"}})}}), false},
+        {"a string",
+         OSTDictionary({{OSTEntitlementsKey, OSTDictionary({{OSTSystemContainerKey, std::string("true")}})}}), false},
         {"no such entitlement", OSTDictionary({{OSTEntitlementsKey, OSTDictionary()}}), false},
         {"entitlements of another type", OSTDictionary({{OSTEntitlementsKey, OSTArray{OSTSystemContainerKey}}}), false},
         {"no entitlements", OSTDictionary(), false},
@@ -139,7 +140,7 @@ TEST_F(CodeSigningProcessing, EntitlementsOfTheWrongTypeGiveNothingAndHarmNothin
     const OSTDictionary infos[] = {
         OSTDictionary(),
         OSTDictionary({{OSTEntitlementsKey, true}}),
-        OSTDictionary({{OSTEntitlementsKey, "com.tamarok.security.application-groups"}}),
+        OSTDictionary({{OSTEntitlementsKey, std::string(appGroupsKey)}}),
         OSTDictionary({{OSTEntitlementsKey, OSTArray{appGroups({"g"})}}}),
         OSTDictionary({{OSTEntitlementsKey, OSTDictionary({{OSTSystemContainerKey, OSTData{"1"}}})}}),
         OSTDictionary({{OSTEntitlementsKey, OSTDictionary({{appGroupsKey, OSTDictionary({{"g", true}})}})}}),
@@ -298,8 +299,7 @@ TEST_F(CodeSigningProcessing, ApplicationsWithoutABundleAreInvalidatedUnlessThei
     for (const auto& row : rows) {
         ASSERT_EQ(OSTErrorCode::success,
                   registerEntitlements(row.identifier, OSTDictionary(), {.registeredByCaller = row.byCaller}));
-        if (row.bundle != undefined)
-            ASSERT_NE("", makeContainer(row.bundle, row.identifier));
+        EXPECT_EQ(row.bundle == undefined, makeContainer(row.bundle, row.identifier).empty());
     }
     ASSERT_EQ(OSTErrorCode::success, mapping().invalidateCodeSigningInfoForAppsWithoutBundleContainer());
     for (const auto& row : rows) {

@@ -62,7 +62,7 @@ TEST_F(GroupManager, AnApplicationGroupGoesWithItsLastReference) {
                                 {"placeholder", withFlag(entryWith(appGroups({"of placeholder"})), "Placeholder")},
                                 {"malformed", entryWith(OSTDictionary({{appGroupsKey, OSTArray{"own", true}}}))},
                                 {"system", entryWith(systemGroups({"own"}))}}));
-    const auto one = OSTDictionary({{appGroupsKey, "own"}});
+    const auto one = OSTDictionary({{appGroupsKey, std::string("own")}});
     const Change changes[] = {
         {"one of two leaves", appGroups({"own", "shared"}), appGroups({"own"}), {}},
         {"the last leaves", appGroups({"own", "shared"}), appGroups({"shared"}), {"own"}},

@@ -13,6 +13,7 @@
 #include <sys/un.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
 #include <chrono>
 #include <filesystem>
@@ -211,6 +212,13 @@ private:
 
 std::ptrdiff_t threadsOfThisProcess() {
     return std::distance(std::filesystem::directory_iterator("/proc/self/task"), {});
+}
+
+rlim_t highestDescriptor() {
+    rlim_t highest = 0;
+    for (const auto& entry : std::filesystem::directory_iterator("/proc/self/fd"))
+        highest = std::max<rlim_t>(highest, std::stoul(entry.path().filename()));
+    return highest;
 }
 
 TEST(IPC, AnswersPipelinedRequestsInOrderHoweverTheyArriveCut) {
@@ -477,7 +485,7 @@ TEST(IPC, AcceptingPausesWithoutDescriptorsAndGoesOnWhenTheyAreBack) {
         rlimit all{};
         ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &all), 0);
         EXPECT_EQ(all.rlim_cur, all.rlim_max) << "the listener takes what it may";
-        const rlimit few{.rlim_cur = 64, .rlim_max = all.rlim_max};
+        const rlimit few{.rlim_cur = highestDescriptor() + 8, .rlim_max = all.rlim_max};
         ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &few), 0);
         std::vector<FileDescriptor> fillers;
         do
