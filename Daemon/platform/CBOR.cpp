@@ -162,16 +162,8 @@ public:
     }
 
     std::expected<void, CBORError> run() {
-        if (static_cast<std::size_t>(_end - _begin) > std::numeric_limits<std::uint32_t>::max())
-            return _fail(_begin, "too long");
-        if (_at == _end || static_cast<std::uint8_t>(*_at) >> 5 != mapItem)
-            return _fail(_at, "not a map");
-        do {
-            OST_TRY(_item());
-            OST_TRY(_closeFinishedLevels());
-        } while (_depth > 0);
-        if (_at != _end)
-            return _fail(_at, "bytes after the item");
+        if (!_root())
+            return std::unexpected(_error);
         return {};
     }
 
@@ -191,12 +183,27 @@ private:
     [[nodiscard]] std::string_view _text(Key key) const { return stringAt(_begin + static_cast<std::uint32_t>(key)); }
     [[nodiscard]] static std::uint64_t _hash(Key key) { return key >> 32; }
 
-    [[nodiscard]] std::unexpected<CBORError> _fail(const char* at, const char* reason) const {
-        return std::unexpected(CBORError{reason, static_cast<std::size_t>(at - _begin)});
+    // Each check gives whether all is well; what is not is in _error. A message has many items, and this is what costs
+    // least.
+    [[nodiscard]] bool _fail(const char* at, const char* reason) {
+        _error = {reason, static_cast<std::size_t>(at - _begin)};
+        return false;
     }
     [[nodiscard]] std::size_t _left() const { return static_cast<std::size_t>(_end - _at); }
 
-    std::expected<Head, CBORError> _readHead() {
+    [[nodiscard]] bool _root() {
+        if (static_cast<std::size_t>(_end - _begin) > std::numeric_limits<std::uint32_t>::max())
+            return _fail(_begin, "too long");
+        if (_at == _end || static_cast<std::uint8_t>(*_at) >> 5 != mapItem)
+            return _fail(_at, "not a map");
+        do {
+            if (!_item() || !_closeFinishedLevels())
+                return false;
+        } while (_depth > 0);
+        return _at == _end || _fail(_at, "bytes after the item");
+    }
+
+    [[nodiscard]] bool _readHead(Head& head) {
         if (_at == _end)
             return _fail(_at, "ends early");
         const unsigned information = static_cast<std::uint8_t>(*_at) & 0x1fU;
@@ -204,15 +211,17 @@ private:
             return _fail(_at, "indefinite length or reserved encoding");
         if (_left() < 1 + argumentWidth(information))
             return _fail(_at, "ends early");
-        const auto head = readHead(_at);
+        head = readHead(_at);
         _at = head.next;
-        return head;
+        return true;
     }
 
     /// Checks one item, opening a level for an array or map.
-    std::expected<void, CBORError> _item() {
+    [[nodiscard]] bool _item() {
         const char* const start = _at;
-        const auto head = OST_TRY(_readHead());
+        Head head;
+        if (!_readHead(head))
+            return false;
         if (_depth > 0) {
             auto& level = _levels[_depth - 1];
             const bool isKey = level.isMap && level.itemsLeft % 2 == 0;
@@ -230,36 +239,38 @@ private:
         case tag:
             return _tagged(start, head);
         case simple:
-            if (head.information < falseValue || head.information == oneByteArgument || _isUndefined(head))
-                return _fail(start, "unknown simple value");
-            return {};
+            return _simple(start, head);
         default:
-            return {};
+            return true;
         }
     }
-    [[nodiscard]] static bool _isUndefined(const Head& head) {
-        return head.information > nullValue && head.information < oneByteArgument;
+
+    [[nodiscard]] bool _simple(const char* start, const Head& head) {
+        const bool isFloat = head.information >= halfFloat;
+        const bool isKnown = head.information >= falseValue && head.information <= nullValue;
+        return isFloat || isKnown || _fail(start, "unknown simple value");
     }
 
-    std::expected<void, CBORError> _string(const char* start, const Head& head) {
+    [[nodiscard]] bool _string(const char* start, const Head& head) {
         if (head.argument > _left())
             return _fail(start, "ends early");
         if (head.major == textString && !isValidText({_at, head.argument}))
             return _fail(start, "invalid text");
         _at += head.argument;
-        return {};
+        return true;
     }
 
-    std::expected<void, CBORError> _key(const char* start, const Head& head) {
+    [[nodiscard]] bool _key(const char* start, const Head& head) {
         if (head.major != textString)
             return _fail(start, "a key that is no text");
-        OST_TRY(_string(start, head));
+        if (!_string(start, head))
+            return false;
         const std::uint64_t hash = std::hash<std::string_view>{}({head.next, head.argument});
         _keys.push_back(hash << 32 | static_cast<std::uint32_t>(start - _begin));
-        return {};
+        return true;
     }
 
-    std::expected<void, CBORError> _open(const char* start, const Head& head) {
+    [[nodiscard]] bool _open(const char* start, const Head& head) {
         const bool isMap = head.major == mapItem;
         // Every item takes a byte at least, so a claim beyond that is refused before anything is done for it.
         if (head.argument > _left() / (isMap ? 2 : 1))
@@ -267,11 +278,13 @@ private:
         if (_depth == maximumDepth)
             return _fail(start, "nested too deeply");
         _levels[_depth++] = {head.argument * (isMap ? 2 : 1), _keys.size(), isMap};
-        return {};
+        return true;
     }
 
-    std::expected<void, CBORError> _tagged(const char* start, const Head& head) {
-        const auto content = OST_TRY(_readHead());
+    [[nodiscard]] bool _tagged(const char* start, const Head& head) {
+        Head content;
+        if (!_readHead(content))
+            return false;
         if (head.argument == uuidTag) {
             if (content.major != byteString || content.argument != UUID::size)
                 return _fail(start, "a UUID that is not 16 bytes");
@@ -279,19 +292,17 @@ private:
         }
         if (head.argument != dateTag)
             return _fail(start, "unknown tag");
-        if (content.major > negativeInteger && !realValue(content))
-            return _fail(start, "a date that is no number");
-        return {};
+        return content.major <= negativeInteger || realValue(content) || _fail(start, "a date that is no number");
     }
 
-    std::expected<void, CBORError> _closeFinishedLevels() {
+    [[nodiscard]] bool _closeFinishedLevels() {
         while (_depth > 0 && _levels[_depth - 1].itemsLeft == 0) {
             const auto first = _levels[--_depth].firstKey;
             if (const auto twice = _keyStandingTwice(std::span(_keys).subspan(first)))
                 return _fail(_begin + static_cast<std::uint32_t>(*twice), "a key stands twice");
             _keys.resize(first);
         }
-        return {};
+        return true;
     }
 
     [[nodiscard]] std::optional<Key> _keyStandingTwice(std::span<Key> keys) const {
@@ -323,6 +334,7 @@ private:
     const char* const _begin;
     const char* _at;
     const char* const _end;
+    CBORError _error{};
     std::size_t _depth = 0;
     std::array<Level, maximumDepth> _levels; // the first _depth are in use
     std::array<std::byte, keysOnStack * sizeof(Key)> _storage;

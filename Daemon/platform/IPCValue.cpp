@@ -1,5 +1,6 @@
 #include "platform/IPCValue.h"
 
+#include <algorithm>
 #include <memory>
 
 namespace ost::platform {
@@ -13,17 +14,27 @@ public:
         if (++_objects > maximumConvertedObjects)
             return std::nullopt;
         switch (item.type()) {
-        case CBORType::unsignedNumber: return OSTValue(*item.asUnsigned());
-        case CBORType::negativeNumber: return _negative(item);
-        case CBORType::boolean: return OSTValue(*item.asBoolean());
-        case CBORType::real: return OSTValue(*item.asReal());
-        case CBORType::text: return OSTValue(std::string(*item.asText()));
-        case CBORType::data: return OSTValue(OSTData{std::string(*item.asData())});
-        case CBORType::date: return OSTValue(OSTDate{*item.asDate()});
-        case CBORType::array: return _array(item);
-        case CBORType::map: return _dictionary(item);
+        case CBORType::unsignedNumber:
+            return OSTValue(*item.asUnsigned());
+        case CBORType::negativeNumber:
+            return _negative(item);
+        case CBORType::boolean:
+            return OSTValue(*item.asBoolean());
+        case CBORType::real:
+            return OSTValue(*item.asReal());
+        case CBORType::text:
+            return OSTValue(std::string(*item.asText()));
+        case CBORType::data:
+            return OSTValue(OSTData{std::string(*item.asData())});
+        case CBORType::date:
+            return OSTValue(OSTDate{*item.asDate()});
+        case CBORType::array:
+            return _array(item);
+        case CBORType::map:
+            return _dictionary(item);
         case CBORType::null:
-        case CBORType::uuid: return std::nullopt;
+        case CBORType::uuid:
+            return std::nullopt;
         }
         return std::nullopt;
     }
@@ -37,6 +48,7 @@ private:
     }
     std::optional<OSTValue> _array(const CBORItem& item) {
         OSTArray array;
+        array.reserve(std::min(item.count(), maximumConvertedObjects - _objects));
         for (const auto element : item.elements())
             if (auto value = convert(element))
                 array.push_back(*std::move(value));
@@ -68,7 +80,9 @@ struct Encode {
         for (const auto& element : *value)
             encodePropertyListValue(encoder, element);
     }
-    void operator()(const std::shared_ptr<const OSTDictionary>& value) const { encodePropertyListValue(encoder, *value); }
+    void operator()(const std::shared_ptr<const OSTDictionary>& value) const {
+        encodePropertyListValue(encoder, *value);
+    }
 };
 
 } // namespace

@@ -74,6 +74,52 @@ TEST_F(CommandLine, createsFindsAndListsContainers) {
         << "without an identifier the program asks for its own container";
 }
 
+TEST_F(CommandLine, deletesStagesDestroysAndReplacesContainers) {
+    const auto make = [&](const std::string& identifier, bool transient = false) {
+        auto words = std::vector<std::string>{"create", "--class", "2", identifier};
+        if (transient)
+            words.emplace_back("--transient");
+        return ostrandctl(words).output;
+    };
+    const auto pathOf = [&](const std::string& made) { return device->onHost(field(made, "path")); };
+    const auto b = make("com.example.b"), c = make("com.example.c");
+    make("com.example.a");
+    EXPECT_EQ(ostrandctl({"delete", "--class", "2", "com.example.a"}).output, "deleted com.example.a\n");
+    EXPECT_EQ(ostrandctl({"delete", "--class", "2", "com.example.a"}).status, 1) << "it is gone";
+    make("com.example.a", true);
+    EXPECT_EQ(ostrandctl({"delete", "--class", "2", "--transient", "--json", "com.example.a"}).output,
+              "{\"deleted\": \"com.example.a\"}\n");
+
+    const auto missing = ostrandctl({"stage", "--class", "2", "com.example.b", "com.example.none"});
+    EXPECT_NE(missing.errors.find("error 21: no such container: com.example.none"), std::string::npos)
+        << missing.errors;
+    EXPECT_TRUE(std::filesystem::exists(pathOf(b))) << "all or none";
+    EXPECT_EQ(ostrandctl({"stage", "--class", "2", "com.example.b", "com.example.c"}).output,
+              "staged " + field(b, "uuid") + "  com.example.b\nstaged " + field(c, "uuid") + "  com.example.c\n");
+
+    const auto old = make("com.example.old"), fresh = make("com.example.new", true);
+    const std::vector<std::string> replace{"replace",         "--class",         "2",     "--new",
+                                           "com.example.new", "--new-transient", "--old", "com.example.old"};
+    EXPECT_EQ(ostrandctl(replace).output,
+              "old  " + field(old, "uuid") + "  com.example.old\nnew  " + field(fresh, "uuid") + "  com.example.new\n");
+    EXPECT_EQ(ostrandctl(replace).status, 1) << "neither is there any more";
+    EXPECT_EQ(ostrandctl({"list", "--class", "2"}).output, field(fresh, "uuid") + "  com.example.new\n");
+    const auto other = make("com.example.other", true);
+    const auto placed = ostrandctl(
+        {"replace", "--class", "2", "--new", "com.example.other", "--new-uuid", field(other, "uuid"), "--json"});
+    EXPECT_EQ(placed.output,
+              "{\"new\": {\"identifier\": \"com.example.other\", \"uuid\": \"" + field(other, "uuid") + "\"}}\n");
+    EXPECT_EQ(ostrandctl({"list", "--class", "2", "--transient"}).output, "");
+
+    const auto deathRow = device->onHost("/private/var/root/Library/Caches/com.tamarok.ostrandd/Dead");
+    EXPECT_FALSE(std::filesystem::is_empty(deathRow));
+    const auto purged = ostrandctl({"purge"});
+    EXPECT_TRUE(purged.output.starts_with("death row is empty after ")) << purged.output;
+    EXPECT_EQ(purged.errors, "waiting until everything on death row is destroyed\n");
+    EXPECT_TRUE(std::filesystem::is_empty(deathRow)) << "the reply comes when it is done";
+    EXPECT_TRUE(ostrandctl({"purge", "--json"}).output.starts_with("{\"seconds\": "));
+}
+
 TEST_F(CommandLine, saysHowARequestFailedAndLeavesTheDeviceAlone) {
     const struct {
         std::string program;
@@ -88,6 +134,10 @@ TEST_F(CommandLine, saysHowARequestFailedAndLeavesTheDeviceAlone) {
         {unsignedProgram, {"create", "--class", "2", "com.example.b"}, 1, "the daemon refused the request"},
         {unsignedProgram, {"list", "--class", "2"}, 1, "the daemon refused the request"},
         {signedProgram, {"create", "--class", "2", "--user", "nobody-here", "com.example.b"}, 2, "has no account"},
+        {signedProgram, {"delete", "--class", "2"}, 2, "no identifier given"},
+        {signedProgram, {"replace", "--class", "2", "--new", "a", "--new-uuid", "x"}, 2, "\"x\" is no UUID"},
+        {signedProgram, {"replace", "--class", "2", "--new", "a", "--old-uuid", "x"}, 2, "--old-uuid needs --old"},
+        {unsignedProgram, {"purge"}, 1, "the daemon refused the request"},
         {signedProgram, {"create", "com.example.b"}, 2, "missing --class C\nusage: ostrandctl "},
     };
     for (const auto& [program, words, status, complaint] : rows) {

@@ -189,13 +189,14 @@ void Connection::sendSome(std::string_view bytes) {
 
 void Connection::finish() { ::shutdown(_socket.get(), SHUT_WR); }
 
-/// Whole, or nothing at all at the end of the connection; an end in the middle is an exception.
+/// Whole, or nothing at all at the end of the connection; an end in the middle is an exception. A daemon that dies with
+/// requests unread resets the connection.
 std::optional<std::string> Connection::_receive(std::size_t size) {
     std::string bytes(size, '\0');
     std::size_t received = 0;
     while (received < size) {
         const auto count = ::recv(_socket.get(), bytes.data() + received, size - received, 0);
-        if (count == 0 && received == 0)
+        if (received == 0 && (count == 0 || (count < 0 && errno == ECONNRESET)))
             return std::nullopt;
         require(count >= 0, "receive");
         if (count == 0)
@@ -216,9 +217,12 @@ std::optional<Reply> Connection::receive() {
     return Reply(parsed.requestNumber, *std::move(payload));
 }
 
-std::optional<Reply> Connection::call(std::string_view request) {
+Reply Connection::call(std::string_view request) {
     send(request);
-    return receive();
+    auto reply = receive();
+    if (!reply)
+        throw std::runtime_error("The daemon closes the connection instead of a reply");
+    return *std::move(reply);
 }
 
 Client::Client(std::filesystem::path socket, const Identity& identity)

@@ -79,10 +79,16 @@ public:
 
     /// The next reply; none when the daemon has closed the connection.
     [[nodiscard]] std::optional<Reply> receive();
-    /// Sends a request and gives its reply.
-    std::optional<Reply> call(std::string_view request);
     /// Whether the daemon closes the connection without a further reply.
     [[nodiscard]] bool isClosed() { return !receive(); }
+
+    /// Sends a request and gives its reply. Throws when the daemon closes the connection instead.
+    Reply call(std::string_view request);
+    /// Sends a request that should not be replied to, and gives whether the daemon closes the connection instead.
+    [[nodiscard]] bool isRefused(std::string_view request) {
+        send(request);
+        return isClosed();
+    }
 
     /// Gives the socket up.
     platform::FileDescriptor release() { return std::move(_socket); }

@@ -348,35 +348,31 @@ TEST_F(Replacement, InterruptedByACrashIsUndoneAtTheNextStart) {
 }
 
 TEST_F(Replacement, OldContainerThatCannotBePutBackWaitsForTheNextStart) {
-    const auto old = make(bundleApplication, "old");
     const auto fresh = make(bundleApplication, "new", true);
-    const auto before = places();
-    const auto occupied = fs::path(old->url) / "occupied";
-    const auto expectRestoredByTheNextStart = [&] {
+    const auto occupy = [](const OSTMetadataRecord& record) { test::writeFile(record->url + "/occupied", ""); };
+    for (const bool raises : {false, true}) {
+        const auto old = make(bundleApplication, raises ? "raises" : "fails");
+        const auto before = places();
+        midway.act = [&]() -> OSTResult<void> {
+            occupy(old);
+            if (raises)
+                throw std::runtime_error("midway");
+            return std::unexpected(OSTCreateError(OSTErrorCode::mappingWriteFailed, "unwritable"));
+        };
+        if (raises)
+            EXPECT_EXIT(replace(old, fresh), testing::KilledBySignal(SIGABRT), "Failed to recover replace move");
+        else
+            EXPECT_EQ(59, replace(old, fresh));
+        EXPECT_TRUE(fs::exists(old->url + "/occupied"));
         EXPECT_EQ(1U, names(replaceDirectory).size());
-        EXPECT_EQ(1U, names(staging).size());
         store().containerManagerCleanup();
         EXPECT_EQ(1, passCode());
         EXPECT_EQ(1U, names(staging).size()) << "what has a replace file is not thrown away";
         fs::remove_all(old->url);
         store().containerManagerSetup();
         EXPECT_EQ(before, places());
-    };
-    midway.act = [&] {
-        test::writeFile(occupied, "");
-        return std::unexpected(OSTCreateError(OSTErrorCode::mappingWriteFailed, "unwritable"));
-    };
-    EXPECT_EQ(59, replace(old, fresh));
-    EXPECT_TRUE(fs::exists(occupied));
-    expectRestoredByTheNextStart();
-
-    ASSERT_TRUE(OSTClientConnection::sharedClientConnection().containersForUser(33, bundleApplication, false));
-    midway.act = [&]() -> OSTResult<void> {
-        test::writeFile(occupied, "");
-        throw std::runtime_error("midway");
-    };
-    EXPECT_EXIT(replace(make(bundleApplication, "old"), fresh), testing::KilledBySignal(SIGABRT),
-                "Failed to recover replace move");
+        expectNothingUnderWay();
+    }
 }
 
 class ReplaceRecovery : public Replacement {

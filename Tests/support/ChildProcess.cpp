@@ -54,7 +54,7 @@ ChildProcess::ChildProcess(std::vector<std::string> commandLine, const std::file
     for (std::string& argument : commandLine)
         arguments.push_back(argument.data());
     arguments.push_back(nullptr);
-    require(::posix_spawn(&_id, arguments[0], &spawn.actions, nullptr, arguments.data(), environ), arguments[0]);
+    require(::posix_spawnp(&_id, arguments[0], &spawn.actions, nullptr, arguments.data(), environ), arguments[0]);
     _input = std::move(input.writing);
     _output = std::move(output.reading);
 }

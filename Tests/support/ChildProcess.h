@@ -11,8 +11,8 @@
 
 namespace ost::test {
 
-/// A program started by a test, with pipes for its standard input and output and a file for its standard error.
-/// Ended by force, if need be, when the object goes. Failures of the system are thrown.
+/// A program, found in PATH unless it is a path, started by a test with pipes for its standard input and output and a
+/// file for its standard error. Ended by force, if need be, when the object goes. Failures of the system are thrown.
 class ChildProcess {
 public:
     ChildProcess(std::vector<std::string> commandLine, const std::filesystem::path& errorFile);

@@ -1,0 +1,157 @@
+#include "EndToEnd/DeviceLog.h"
+#include "EndToEnd/StoreView.h"
+#include "EndToEnd/Wire.h"
+#include "support/BootedDevice.h"
+#include "support/DeviceTest.h"
+
+#include <gtest/gtest.h>
+
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <map>
+
+namespace ost::test::wire {
+
+using platform::FileDescriptor;
+
+namespace {
+
+class DeviceStateTest : public BootedDeviceTest {
+protected:
+    void SetUp() override {
+        BootedDeviceTest::SetUp();
+        if (!IsSkipped())
+            _caller.emplace(device().socket(), allowed());
+    }
+
+    [[nodiscard]] Connection connect() const { return _caller->connect(); }
+
+private:
+    std::optional<Client> _caller;
+};
+
+/// A message of the kernel's: 13 words and no region.
+using Upcall = std::array<std::uint32_t, 13>;
+using UpcallReply = std::vector<std::int32_t>;
+
+/// Sends a message to the upcall port and gives the words of its reply.
+UpcallReply upcall(const std::filesystem::path& port, const Upcall& message) {
+    const FileDescriptor socket(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0));
+    sockaddr_un address{.sun_family = AF_UNIX, .sun_path = {}};
+    port.native().copy(address.sun_path, sizeof address.sun_path - 1);
+    if (::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0 ||
+        ::send(socket.get(), message.data(), sizeof message, MSG_NOSIGNAL) != sizeof message)
+        return {};
+    UpcallReply reply(64);
+    const auto size = ::recv(socket.get(), reply.data(), reply.size() * sizeof reply[0], 0);
+    reply.resize(size < 0 ? 0 : static_cast<std::size_t>(size) / sizeof reply[0]);
+    return reply;
+}
+
+} // namespace
+
+TEST_F(DeviceStateTest, TheLockStateDoesNotDisturbService) {
+    const auto stateFile = device().onHost("/private/var/run/device-lock-state");
+    const auto newFile = device().onHost("/private/var/run/device-lock-state.new");
+    DeviceLog log(device());
+    int count = 0;
+    for (const char* state : {"1\n", "1", "0\n", "0", "2\n", "", "-1", "1 0", "99999999999999999999", "locked", "1\n"})
+        for (const bool replaced : {false, true}) {
+            writeFile(replaced ? newFile : stateFile, state);
+            if (replaced)
+                std::filesystem::rename(newFile, stateFile);
+            const auto made = connect().call(creation(1, "com.example." + std::to_string(count++)));
+            EXPECT_EQ(made.error(), 1U) << state;
+        }
+    std::filesystem::remove(stateFile);
+    ASSERT_EQ(::mkfifo(stateFile.c_str(), 0600), 0); // Nobody ever writes into it.
+    EXPECT_EQ(connect().call(creation(1, "com.example.pipe")).error(), 1U);
+    std::filesystem::remove(stateFile);
+    EXPECT_EQ(connect().call(creation(1, "com.example.last")).error(), 1U);
+    EXPECT_EQ(log.takeErrors(), std::vector<std::string>());
+    EXPECT_EQ(containersOnDisk(device().onHost("/private/var/mobile/Containers/Data/Application")).size(),
+              static_cast<std::size_t>(count + 2));
+}
+
+TEST_F(DeviceStateTest, FirstBootWorkIsDoneOncePerBoot) {
+    const auto expectFirstBoots = [&](std::size_t boots) {
+        EXPECT_EQ(connect().call(creation(1, "com.example.a")).error(), 1U);
+        EXPECT_EQ(linesInLogFile(device(), "<Notice>"), linesInLogFile(device(), "] main: ostrandd ") +
+                                                            linesInLogFile(device(), "No code signing info file"));
+        EXPECT_EQ(linesInLogFile(device(), "main: ostrandd performing first boot initialization"), boots);
+        EXPECT_EQ(linesInLogFile(device(), "main: ostrandd first boot cleanup complete"), boots);
+    };
+    expectFirstBoots(1);
+    device().killDaemon(SIGKILL);
+    expectFirstBoots(1);
+    device().killDaemon(SIGTERM);
+    expectFirstBoots(1);
+    device().reboot();
+    expectFirstBoots(2);
+}
+
+TEST_F(DeviceStateTest, TheUpcallPortAnswersAndOutlivesADaemon) {
+    const auto port = device().socket().concat(".upcall");
+    constexpr std::uint32_t forgottenRequest = 322514901;
+    const Upcall message{0x80001513, 52, 0x1234, 0x5678, 0, forgottenRequest, 1};
+    const UpcallReply failure{0x13, 36, 0x1234, 0, 0, forgottenRequest + 100, 0, 1, -303};
+    EXPECT_EQ(upcall(port, message), failure);
+    for (int signal : {SIGKILL, SIGTERM}) {
+        device().killDaemon(signal);
+        EXPECT_EQ(upcall(port, message), failure);
+    }
+}
+
+TEST_F(DeviceStateTest, AnOrderlyEndFinishesWhatIsUnderWay) {
+    const auto deathRow = device().image() / "private/var/root/Library/Caches/com.tamarok.ostrandd/Dead";
+    for (int directory = 0; directory < 50; ++directory)
+        for (int file = 0; file < 100; ++file)
+            writeFile(deathRow / std::to_string(directory) / std::to_string(file), "");
+    auto connection = connect();
+    connection.send(request(1, {{"Command", number(4)}}) + creation(2, "com.example.a"));
+    std::map<std::uint32_t, std::uint64_t> replies;
+    const auto take = [&] {
+        const auto reply = connection.receive();
+        return reply && replies.emplace(reply->requestNumber(), reply->error()).second;
+    };
+    while (!replies.contains(2)) // By then the destruction has been ordered.
+        ASSERT_TRUE(take());
+    const auto daemon = device().daemonId();
+    device().killDaemon(SIGTERM);
+    while (take())
+        continue;
+    EXPECT_EQ(replies, (std::map<std::uint32_t, std::uint64_t>{{1, 1}, {2, 1}}));
+    EXPECT_EQ(namesIn(deathRow), std::vector<std::string>());
+    EXPECT_EQ(connect().call(creation(3, "com.example.a", false)).error(), 1U);
+    EXPECT_NE(device().daemonId(), daemon);
+    EXPECT_NE(device().complaints().find("The daemon ended with status 0, starting it again"), std::string::npos);
+}
+
+TEST_F(DeviceStateTest, AnOrderlyEndAnswersEveryRequestThatHasBegun) {
+    for (int round = 0; round < 5; ++round) {
+        auto connection = connect();
+        std::string requests;
+        for (std::uint32_t i = 0; i < 200; ++i)
+            requests += creation(i, "com.example." + std::to_string(round) + "." + std::to_string(i));
+        connection.send(requests);
+        ASSERT_TRUE(connection.receive());
+        device().killDaemon(SIGTERM);
+        std::uint32_t answered = 1;
+        while (const auto reply = connection.receive()) {
+            EXPECT_EQ(reply->requestNumber(), answered++);
+            EXPECT_EQ(reply->error(), 1U);
+        }
+        const auto made = containersOnDisk(device().onHost("/private/var/mobile/Containers/Data/Application"));
+        const auto ofThisRound = std::ranges::count_if(made, [&](const auto& entry) {
+            return entry.first.starts_with("com.example." + std::to_string(round) + ".");
+        });
+        EXPECT_EQ(ofThisRound, answered) << "a container was made for a request without reply";
+    }
+}
+
+} // namespace ost::test::wire
