@@ -5,6 +5,7 @@
 #include "platform/Log.h"
 #include "platform/Path.h"
 
+#include <cerrno>
 #include <climits>
 #include <cstdlib>
 
@@ -27,16 +28,18 @@ std::string canonical(const char* path) {
 constexpr std::string_view cachesName = "Library/Caches/com.tamarok.ostrandd";
 constexpr std::string_view transientName = "Temp";
 
-/// Whether `base` holds class directories of real users.
-bool isBaseOfAUser(std::string_view base) {
-    return platform::accountMatching([&](const platform::Account& account) {
-               if (account.uid <= OSTHighestSystemUserId)
-                   return false;
-               const auto home = canonical(account.home.c_str());
-               return base == pathByAppending(home, OSTUserBaseDirectoryName) ||
-                      base == pathByAppending(home, OSTUserTransientDirectoryName);
-           })
-        .has_value();
+/// Whether `base` holds class directories of real users. Fails with the errno of reading the accounts.
+std::expected<bool, int> isBaseOfAUser(std::string_view base) {
+    const auto user = platform::accountMatching([&](const platform::Account& account) {
+        if (account.uid <= OSTHighestSystemUserId)
+            return false;
+        const auto home = canonical(account.home.c_str());
+        return base == pathByAppending(home, OSTUserBaseDirectoryName) ||
+               base == pathByAppending(home, OSTUserTransientDirectoryName);
+    });
+    if (!user && user.error() != ENOENT)
+        return std::unexpected(user.error());
+    return user.has_value();
 }
 
 } // namespace
@@ -145,7 +148,7 @@ std::optional<std::string> OSTGlobalConfiguration::containerDirectoryURLForUser(
                             "Failed to create container dir at \"%@\": %@");
 }
 
-bool OSTGlobalConfiguration::isContainerURL(std::string_view url) const {
+std::expected<bool, int> OSTGlobalConfiguration::isContainerURL(std::string_view url) const {
     const auto name = platform::lastPathComponent(url);
     if (!url.starts_with('/') || name.empty() || name == "." || name == "..")
         return false;

@@ -5,6 +5,7 @@
 
 #include <array>
 #include <cstdint>
+#include <expected>
 #include <map>
 #include <memory>
 #include <mutex>
@@ -47,8 +48,8 @@ public:
                                                                           OSTContainerClass contentClass, bool transient);
 
     /// Whether `url` could be the path of a container: a name directly inside the class directory of a class and user. Makes no
-    /// directory.
-    [[nodiscard]] bool isContainerURL(std::string_view url) const;
+    /// directory. Fails with the errno of reading the accounts.
+    [[nodiscard]] std::expected<bool, int> isContainerURL(std::string_view url) const;
 
     /// The items at the top of an application's data container that belong to the user's data.
     [[nodiscard]] static const std::array<std::string_view, 4>& appUserDataItemNames();

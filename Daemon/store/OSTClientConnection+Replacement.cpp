@@ -12,6 +12,8 @@
 #include "store/OSTReplaceFile.h"
 #include "store/OSTStoreDelegate.h"
 
+#include <algorithm>
+#include <array>
 #include <cerrno>
 
 namespace ost {
@@ -20,6 +22,17 @@ using platform::lastPathComponent;
 using platform::pathByAppending;
 using platform::pathByDeletingLastComponent;
 
+namespace {
+
+/// Whether a file could not be read for a reason that says nothing about the file.
+bool mayBeReadLater(const OSTError& error) {
+    constexpr std::array passing{EIO, EACCES, ENOMEM, EMFILE, ENFILE};
+    const auto& cause = error.underlyingError();
+    return cause && std::ranges::any_of(passing, [&](int errnoValue) { return cause->isPOSIX(errnoValue); });
+}
+
+} // namespace
+
 /// How far one replacement has come, and so what has to be undone or cleaned up when it stops.
 struct OSTClientConnection::ReplaceOperation {
     OSTMetadataRecord oldContainer; ///< null when there is none
@@ -27,7 +40,7 @@ struct OSTClientConnection::ReplaceOperation {
     std::string destination;
     bool transient = false; ///< of the container at the destination
 
-    std::string replaceFileURL; ///< empty until there may be a replace file
+    std::string replaceFileURL; ///< empty while there is none to be discarded
     std::string stagingURL;     ///< where the old container is parked
     bool oldIsParked = false;
     bool oldIsForgotten = false; ///< by the cache
@@ -215,9 +228,12 @@ OSTResult<void> OSTClientConnection::_putNewContainerInPlace(const OSTReplacemen
         return std::unexpected(OSTCreateError(OSTErrorCode::cacheAddFailed, added.error(),
                                               "Failed to add to cache: %@, url: %@, transient: %d", metadata, destination,
                                               operation.transient));
-    // Before the replace file goes, which would otherwise be gone after a power cut while the move had not happened.
-    if (const auto durable = files.makeDirectoryDurable(pathByDeletingLastComponent(destination)); !durable)
+    // Before the replace file goes, which would otherwise be gone after a power cut while the move had not happened. When that
+    // fails the file stays, and the next start decides by what has reached the disk.
+    if (const auto durable = files.makeDirectoryDurable(pathByDeletingLastComponent(destination)); !durable) {
+        operation.replaceFileURL.clear();
         return std::unexpected(failedMove(durable.error()));
+    }
     return {};
 }
 
@@ -274,12 +290,20 @@ OSTResult<void> OSTClientConnection::_recoverFromReplaceOperations() const {
 
 OSTResult<void> OSTClientConnection::_recoverFromReplaceFile(const std::string& url) const {
     const auto& files = OSTFileManager::defaultManager();
+    const auto file = OSTReplaceFile::readAndValidateAtURL(url);
+    // What is parked in staging waits with its file until that can be read again.
+    if (!file && mayBeReadLater(file.error()))
+        return {};
     // A file that is not valid is in the log, and is only discarded.
-    if (const auto file = OSTReplaceFile::readAndValidateAtURL(url)) {
+    if (file) {
         platform::logDebug("Doing a replace of %@ with info: %@", url, *file);
         if (!files.itemExistsAtURL(file->oldURL) && !files.itemExistsAtURL(file->destinationURL)) {
             platform::logDebug("Recovering from failed replace by moving: %@ to %@", file->stagingURL, file->oldURL);
-            auto moved = files.moveItemAtURL(file->stagingURL, file->oldURL);
+            // Neither was seen, but one that could not be looked for may be there.
+            auto moved = files.itemDoesNotExistAtURL(file->oldURL) && files.itemDoesNotExistAtURL(file->destinationURL)
+                             ? files.moveItemAtURL(file->stagingURL, file->oldURL)
+                             : std::unexpected(OSTCreatePOSIXError(EAGAIN, "%@ or %@ may exist", file->oldURL,
+                                                                   file->destinationURL));
             if (moved)
                 moved = files.makeDirectoryDurable(pathByDeletingLastComponent(file->oldURL));
             if (!moved)

@@ -28,7 +28,7 @@ void OSTClientConnection::containerManagerCleanup() const {
     if (items) {
         // What cannot be moved stays for the next start, and so does a container that could not be put back in its place.
         for (const auto& item : *items)
-            if (!files.itemExistsAtURL(OSTReplaceFile::urlOfToken(item.name)))
+            if (files.itemDoesNotExistAtURL(OSTReplaceFile::urlOfToken(item.name)))
                 (void)_moveItemAtURLToDeathRow(platform::pathByAppending(staging, item.name), StartPass::no);
     } else if (!items.error().isPOSIX(ENOENT)) {
         platform::logError("Failed to get items at staging URL%@ : %@", staging, items.error());

@@ -3,8 +3,12 @@
 #include "model/OSTDictionaryFile.h"
 #include "model/OSTGlobalConfiguration.h"
 #include "platform/Path.h"
+#include "platform/Try.h"
 #include "store/OSTFileManager.h"
 
+#include <cerrno>
+#include <cstring>
+#include <expected>
 #include <optional>
 
 namespace ost {
@@ -17,14 +21,29 @@ constexpr const char* stagingKey = "OSTReplaceOperationStagingURL";
 constexpr const char* destinationKey = "OSTReplaceOperationDestURL";
 
 /// Whether a container may be parked there: directly in the staging directory. What is there must not be a link or a file.
-bool isStagingURL(const std::string& url) {
+/// Fails with the errno of looking.
+std::expected<bool, int> isStagingURL(const std::string& url) {
     const auto name = platform::lastPathComponent(url);
     const auto directory = platform::pathByDeletingLastComponent(url);
     if (name.empty() || name == "." || name == ".." ||
         directory != OSTGlobalConfiguration::sharedInstance().stagingDirectory())
         return false;
     const auto& files = OSTFileManager::defaultManager();
-    return files.itemDoesNotExistAtURL(url) || files.openDirectoryAtURL(url).has_value();
+    if (files.itemDoesNotExistAtURL(url))
+        return true;
+    const auto parked = files.openDirectoryAtURL(url);
+    if (parked || parked.error().isPOSIX(ENOTDIR) || parked.error().isPOSIX(ELOOP))
+        return parked.has_value();
+    return std::unexpected(static_cast<int>(parked.error().code()));
+}
+
+/// Whether all the paths are such as a replacement has. Fails with the errno of looking.
+std::expected<bool, int> isPlausible(const OSTReplaceFile& file) {
+    const auto& layout = OSTGlobalConfiguration::sharedInstance();
+    for (const auto* const url : {&file.oldURL, &file.newURL, &file.destinationURL})
+        if (!OST_TRY(layout.isContainerURL(*url)))
+            return false;
+    return isStagingURL(file.stagingURL);
 }
 
 } // namespace
@@ -61,12 +80,17 @@ OSTResult<OSTReplaceFile> OSTReplaceFile::readAndValidateAtURL(const std::string
         return found && found->asString() ? *found->asString() : std::string();
     };
     OSTReplaceFile file{path(oldKey), path(newKey), path(stagingKey), path(destinationKey)};
-    const auto& layout = OSTGlobalConfiguration::sharedInstance();
-    if (!layout.isContainerURL(file.oldURL) || !layout.isContainerURL(file.newURL) || !isStagingURL(file.stagingURL) ||
-        !layout.isContainerURL(file.destinationURL))
-        return std::unexpected(OSTCreateError(OSTErrorCode::replaceFileInvalid,
+    const auto plausible = isPlausible(file);
+    if (!plausible || !*plausible) {
+        std::optional<OSTError> cause;
+        if (!plausible)
+            cause = OSTCreatePOSIXError(plausible.error(), "check of the paths in %@ failed: %s", url,
+                                        std::strerror(plausible.error()));
+        return std::unexpected(OSTCreateError(OSTErrorCode::replaceFileInvalid, OSTLogging::logged,
+                                              cause ? &*cause : nullptr,
                                               "Invalid replace data: Old: %@, New: %@, Staging: %@, Dest: %@",
                                               value(oldKey), value(newKey), value(stagingKey), value(destinationKey)));
+    }
     return file;
 }
 
