@@ -21,8 +21,8 @@ constexpr Operand identifierOperands{"ID", "the containers' identifiers", Operan
 constexpr Option oldOption{"old", "ID", "the container that goes; without it, the new one is moved to a free place"};
 constexpr Option newOption{"new", "ID", "the container that takes its place", Option::Count::required};
 constexpr Option newTransientOption{"new-transient", "", "the new container is a transient one"};
-constexpr Option oldUUIDOption{"old-uuid", "UUID", "its UUID; else that of the container that is listed"};
-constexpr Option newUUIDOption{"new-uuid", "UUID", "likewise"};
+constexpr Option oldUUIDOption{"old-uuid", "UUID", "the old container's UUID; else found by listing the live ones"};
+constexpr Option newUUIDOption{"new-uuid", "UUID", "the new container's UUID; else found by listing"};
 
 constexpr std::string_view classesAndUsers =
     "Classes:\n"

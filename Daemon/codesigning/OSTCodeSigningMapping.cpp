@@ -257,47 +257,58 @@ OSTCodeSigningMapping::_onQueue_systemGroupIdentifiersForIdentifier(std::string_
 OSTCodeSigningMapping::GroupList OSTCodeSigningMapping::_groupList(std::string_view identifier,
                                                                    const OSTDictionary* entitlements,
                                                                    const OSTGroupKeys& keys) {
-    auto groups = _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements, keys.key);
-    if (keys.fallbackKey && (!groups || groups->empty()))
-        groups = _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements, keys.fallbackKey);
-    return groups;
+    GroupViews groups;
+    if (!_findGroups(identifier, entitlements, keys, groups))
+        return std::nullopt;
+    return std::vector<std::string>(groups.begin(), groups.end());
+}
+
+bool OSTCodeSigningMapping::_findGroups(std::string_view identifier, const OSTDictionary* entitlements,
+                                        const OSTGroupKeys& keys, GroupViews& groups) {
+    const bool found = _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements, keys.key, groups);
+    if (!keys.fallbackKey || (found && !groups.empty()))
+        return found;
+    return _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements, keys.fallbackKey, groups);
 }
 
 void OSTCodeSigningMapping::iterateGroupIds(
     const OSTGroupKeys& keys,
-    const std::function<void(const std::string& identifier, const GroupList& groups)>& block) {
+    const std::function<void(const std::string& identifier, const GroupViews* groups)>& block) {
     if (!_codeSignQueue.isCurrent())
         return _sync([&] { iterateGroupIds(keys, block); });
+    GroupViews groups; // One for all: copies would be most of the work.
     for (const auto& [identifier, entry] : _codeSigningMappingDict)
-        block(identifier, _groupList(identifier, entry->entitlements(), keys));
+        block(identifier, _findGroups(identifier, entry->entitlements(), keys, groups) ? &groups : nullptr);
 }
 
-OSTCodeSigningMapping::GroupList OSTCodeSigningMapping::_copyApplicationGroupEntitlementForIdentifier(
-    std::string_view identifier, const OSTDictionary* entitlements, const char* groupKey) {
+bool OSTCodeSigningMapping::_copyApplicationGroupEntitlementForIdentifier(std::string_view identifier,
+                                                                          const OSTDictionary* entitlements,
+                                                                          const char* groupKey, GroupViews& groups) {
+    groups.clear();
     const auto* const value = entitlements ? entitlements->find(groupKey) : nullptr;
     if (!value)
-        return std::nullopt;
-    if (const auto* const group = value->asString())
-        return std::vector<std::string>{*group};
+        return false;
+    if (const auto* const group = value->asString()) {
+        groups.emplace_back(*group);
+        return true;
+    }
     const auto* const array = value->asArray();
     if (!array) {
         platform::logError("Entitlement %@ for %@ does not contain supported types; ignoring.", groupKey, identifier);
-        return std::nullopt;
+        return false;
     }
-    std::vector<std::string> groups;
-    groups.reserve(array->size());
     for (const auto& element : *array) {
         const auto* const group = element.asString();
         if (!group) {
             platform::logError("Entitlement %@ for %@ contains non-string values; ignoring.", groupKey, identifier);
-            return std::nullopt;
+            return false;
         }
-        groups.push_back(*group);
+        groups.emplace_back(*group);
     }
     std::ranges::sort(groups);
     const auto repeated = std::ranges::unique(groups);
     groups.erase(repeated.begin(), repeated.end());
-    return groups;
+    return true;
 }
 
 // The file

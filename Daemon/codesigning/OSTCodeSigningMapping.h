@@ -82,11 +82,12 @@ public:
     /// `success`, `mappingWriteFailed`, or 0 when the mapping is unavailable.
     [[nodiscard]] OSTErrorCode invalidateCodeSigningInfoForAppsWithoutBundleContainer();
 
-    using GroupList = std::optional<std::vector<std::string>>;
-    /// Calls `block`, on the mapping's queue, with the group list of every identifier, which may be absent. From work
-    /// that runs on the queue already, too.
+    /// Groups of an identifier, each once, as its entitlements hold them.
+    using GroupViews = std::vector<std::string_view>;
+    /// Calls `block`, on the mapping's queue, with the groups of every identifier, or with null where they are absent.
+    /// They are there for the call alone. From work that runs on the queue already, too.
     void iterateGroupIds(const OSTGroupKeys& keys,
-                         const std::function<void(const std::string& identifier, const GroupList& groups)>& block);
+                         const std::function<void(const std::string& identifier, const GroupViews* groups)>& block);
 
     /// Removes the entries of an identifier and of its children, and writes the mapping. Failures are logged. The
     /// caller holds the all-identifiers lock for writing.
@@ -126,10 +127,14 @@ private:
     /// that is null or has no information removes its identifier. Fails with `countsDiffer` or `mappingWriteFailed`.
     [[nodiscard]] OSTResult<void> _setCodeSigningDictionaryValues(const std::vector<EntryRecord>& entries,
                                                                   const std::vector<std::string>& identifiers);
-    [[nodiscard]] static GroupList _copyApplicationGroupEntitlementForIdentifier(std::string_view identifier,
-                                                                                 const OSTDictionary* entitlements,
-                                                                                 const char* groupKey);
-    /// The list of the first key, or where that is absent or empty of the second.
+    using GroupList = std::optional<std::vector<std::string>>;
+    /// Puts the groups that the entitlements list under a key into `groups`. False when they are absent.
+    static bool _copyApplicationGroupEntitlementForIdentifier(std::string_view identifier,
+                                                              const OSTDictionary* entitlements, const char* groupKey,
+                                                              GroupViews& groups);
+    /// The same with the first key, or where that lists none with the second.
+    static bool _findGroups(std::string_view identifier, const OSTDictionary* entitlements, const OSTGroupKeys& keys,
+                            GroupViews& groups);
     [[nodiscard]] static GroupList _groupList(std::string_view identifier, const OSTDictionary* entitlements,
                                               const OSTGroupKeys& keys);
 

@@ -107,22 +107,26 @@ void OSTGroupManager::handleChangeFromOldGroupContainerIds(const GroupList& oldG
     _removeReferenceForGroupIdentifiers(left, type);
 }
 
-std::optional<OSTGroupManager::ReferenceCounts> OSTGroupManager::_copyReferenceCountSetOfType(OSTGroupType type) {
+std::optional<OSTGroupManager::ReferenceCounts>
+OSTGroupManager::_copyReferenceCountSetOfType(OSTGroupType type, const std::vector<std::string>& groups) {
     auto& mapping = OSTCodeSigningMapping::sharedInstance();
     if (!mapping.isAvailable()) {
         platform::logError("Failed to get reference count information for group type: %ld", type);
         return std::nullopt;
     }
     ReferenceCounts counts;
+    for (const auto& group : groups)
+        counts.emplace(group, 0);
     mapping.iterateGroupIds(type == OSTGroupType::system ? OSTGroupKeys::system : OSTGroupKeys::application,
-                            [&](const std::string& identifier, const GroupList& groups) {
-                                if (!groups)
+                            [&](const std::string& identifier, const OSTCodeSigningMapping::GroupViews* referenced) {
+                                if (!referenced)
                                     return;
                                 platform::logAs(platform::LogLevel::debug, "_copyReferenceCountSetOfType",
                                                 "Entitlements for identifier %@ references container IDs: %@",
-                                                identifier, *groups);
-                                for (const auto& group : *groups)
-                                    ++counts[group];
+                                                identifier, *referenced);
+                                for (const auto group : *referenced)
+                                    if (const auto found = counts.find(group); found != counts.end())
+                                        ++found->second;
                             });
     return counts;
 }
@@ -131,7 +135,7 @@ void OSTGroupManager::_removeReferenceForGroupIdentifiers(const std::vector<std:
     if (groups.empty())
         return;
     const auto [userId, containerClass] = placeOf(type);
-    auto counts = _copyReferenceCountSetOfType(type);
+    auto counts = _copyReferenceCountSetOfType(type, groups);
     if (counts && (type == OSTGroupType::system || userHasHome(userId)))
         _removeGroupContainersIfNeededforUser(userId, containerClass, groups, *std::move(counts));
 }
@@ -161,20 +165,25 @@ void OSTGroupManager::reconcileGroupContainersOfType(OSTGroupType type) const {
     OST_ASSERT(OSTHoldsAllIdentifiersLock());
     OST_ASSERT(type == OSTGroupType::application);
     const auto [userId, containerClass] = placeOf(type);
-    const auto counts = _copyReferenceCountSetOfType(type);
-    if (counts && userHasHome(userId))
-        _cleanupUnreferencedGroupContainersForUser(userId, containerClass, *counts);
-}
-
-void OSTGroupManager::_cleanupUnreferencedGroupContainersForUser(std::uint32_t userId, OSTContainerClass containerClass,
-                                                                 const ReferenceCounts& referenceCounts) {
+    if (!userHasHome(userId))
+        return;
     const auto containers = OSTContainerCache::sharedInstance().allContainersForUser(userId, containerClass, false);
     if (!containers) {
         platform::logError("Failed to fetch group container list for %u: %@", userId, containers.error());
         return;
     }
-    for (const auto& container : *containers) {
-        if (referenceCounts.contains(container->identifier))
+    std::vector<std::string> groups;
+    for (const auto& container : *containers)
+        groups.push_back(container->identifier);
+    if (const auto counts = _copyReferenceCountSetOfType(type, groups))
+        _cleanupUnreferencedGroupContainersForUser(userId, *containers, *counts);
+}
+
+void OSTGroupManager::_cleanupUnreferencedGroupContainersForUser(std::uint32_t userId,
+                                                                 const std::vector<OSTMetadataRecord>& containers,
+                                                                 const ReferenceCounts& referenceCounts) {
+    for (const auto& container : containers) {
+        if (referenceCounts.at(container->identifier) > 0)
             continue;
         platform::logError("Removing group container with identifier %@ for %u", container->identifier, userId);
         _stageForDeletion(userId, *container);

@@ -7,6 +7,7 @@
 
 #include <cstdint>
 #include <expected>
+#include <functional>
 #include <map>
 #include <optional>
 #include <string>
@@ -55,19 +56,25 @@ public:
     void reconcileGroupContainersOfType(OSTGroupType type) const;
 
 private:
-    using ReferenceCounts = std::unordered_map<std::string, std::size_t>;
+    struct Hash {
+        using is_transparent = void;
+        std::size_t operator()(std::string_view group) const { return std::hash<std::string_view>{}(group); }
+    };
+    using ReferenceCounts = std::unordered_map<std::string, std::size_t, Hash, std::equal_to<>>;
 
     OSTGroupManager() = default;
 
-    /// How many identifiers of the mapping reference each group, whatever state their entries are in. None, which is
-    /// logged, when the mapping is unavailable: nobody knows then who references what.
-    [[nodiscard]] static std::optional<ReferenceCounts> _copyReferenceCountSetOfType(OSTGroupType type);
+    /// How many identifiers of the mapping reference each of these groups, whatever state their entries are in. None,
+    /// which is logged, when the mapping is unavailable: nobody knows then who references what.
+    [[nodiscard]] static std::optional<ReferenceCounts>
+    _copyReferenceCountSetOfType(OSTGroupType type, const std::vector<std::string>& groups);
 
     static void _removeReferenceForGroupIdentifiers(const std::vector<std::string>& groups, OSTGroupType type);
     static void _removeGroupContainersIfNeededforUser(std::uint32_t userId, OSTContainerClass groupContainerClass,
                                                       const std::vector<std::string>& groups,
                                                       ReferenceCounts referenceCounts);
-    static void _cleanupUnreferencedGroupContainersForUser(std::uint32_t userId, OSTContainerClass containerClass,
+    static void _cleanupUnreferencedGroupContainersForUser(std::uint32_t userId,
+                                                           const std::vector<OSTMetadataRecord>& containers,
                                                            const ReferenceCounts& referenceCounts);
     static void _stageForDeletion(std::uint32_t userId, const OSTMetadata& container);
 };

@@ -32,8 +32,8 @@ std::string escapedName(std::string_view key) {
     return name;
 }
 
-/// Makes a link under a name that nothing else has, and gives the name. A crash may have left such a link behind, made by a
-/// process that had our number.
+/// Makes a link under a name that nothing else has, and gives the name. A crash may have left such a link behind, made
+/// by a process that had our number.
 std::expected<std::string, int> makeTemporaryLink(int directory, const std::string& path) {
     static std::atomic<unsigned> links = 0;
     for (;;) {

@@ -34,9 +34,7 @@ bool isArray(const platform::IPCRequest& request, std::string_view key) {
     return item && item->type() == platform::CBORType::array;
 }
 
-std::uint64_t numberOf(const platform::CBORItem& element) {
-    return element.asUnsigned().value_or(0);
-}
+std::uint64_t numberOf(const platform::CBORItem& element) { return element.asUnsigned().value_or(0); }
 
 } // namespace
 
@@ -70,9 +68,8 @@ OSTErrorCode OSTStageForDeleteCommand(const platform::IPCRequest& request, platf
     });
     deletion.uuids = elementsOf<std::optional<platform::UUID>>(request, "UUIDsArray",
                                                                [](const auto& element) { return element.asUUID(); });
-    const auto userIds = elementsOf<std::uint32_t>(request, "UserIDsArray", [](const auto& element) {
-        return static_cast<std::uint32_t>(numberOf(element));
-    });
+    const auto userIds = elementsOf<std::uint32_t>(
+        request, "UserIDsArray", [](const auto& element) { return static_cast<std::uint32_t>(numberOf(element)); });
     // A user without a class could not be validated.
     if (userIds.size() > deletion.classes.size())
         return OSTErrorCode::invalidObject;

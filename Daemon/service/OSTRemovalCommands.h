@@ -4,13 +4,13 @@
 
 namespace ost {
 
-/// Command 2: puts one container in another's place. Reads "OldContainerUUID" (none: there is no old one), "OldContainerClass",
-/// "OldContainerUserID", "OldIdentifier" and the same four with "New".
+/// Command 2: puts one container in another's place. Reads "OldContainerUUID" (none: there is no old one),
+/// "OldContainerClass", "OldContainerUserID", "OldIdentifier" and the same four with "New".
 [[nodiscard]] OSTErrorCode OSTReplaceCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
                                              OSTClientConnection& client);
 
-/// Command 3: stages containers for deletion. Reads "ContainerClassesArray", "UUIDsArray", "UserIDsArray", "IdentifiersArray",
-/// one container for each index.
+/// Command 3: stages containers for deletion. Reads "ContainerClassesArray", "UUIDsArray", "UserIDsArray",
+/// "IdentifiersArray", one container for each index.
 [[nodiscard]] OSTErrorCode OSTStageForDeleteCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
                                                     OSTClientConnection& client);
 

@@ -20,12 +20,12 @@ namespace {
 /// Where items go that cannot be removed.
 constexpr std::string_view parkingDirectory = "/tmp";
 
-/// How often a move to death row is tried again when a pass removed the unique directory that was made for it. A pass removes
-/// what it has listed, once, so more than a few losses in a row have another cause.
+/// How often a move to death row is tried again when a pass removed the unique directory that was made for it. A pass
+/// removes what it has listed, once, so more than a few losses in a row have another cause.
 constexpr int movesToDeathRow = 16;
 
-/// How often a removal is tried in all when something came into the item behind the removal's back: a unique directory gets its
-/// item, and an application may still be at work in its container.
+/// How often a removal is tried in all when something came into the item behind the removal's back: a unique directory
+/// gets its item, and an application may still be at work in its container.
 constexpr int removals = 8;
 
 } // namespace
@@ -99,10 +99,9 @@ OSTResult<void> OSTClientConnection::_stageContainer(std::uint32_t userId, const
     return {};
 }
 
-std::expected<void, OSTErrorCode> OSTClientConnection::deleteContainerForUser(std::uint32_t userId,
-                                                                              std::optional<std::string_view> identifier,
-                                                                              OSTContainerClass containerClass,
-                                                                              bool transient) const {
+std::expected<void, OSTErrorCode>
+OSTClientConnection::deleteContainerForUser(std::uint32_t userId, std::optional<std::string_view> identifier,
+                                            OSTContainerClass containerClass, bool transient) const {
     const auto record = createOrLookupContainerForUser(
         {.userId = userId, .identifier = identifier, .containerClass = containerClass, .transient = transient});
     if (!record) {
@@ -121,8 +120,8 @@ OSTResult<void> OSTClientConnection::_moveItemAtURLToDeathRow(const std::string&
     const auto& files = OSTFileManager::defaultManager();
     for (int attempt = 1;; ++attempt) {
         // A directory of its own keeps two items of the same name from colliding.
-        const auto unique = files.createTemporaryDirectoryInDirectoryURL(
-            OSTGlobalConfiguration::sharedInstance().deathrowDirectory());
+        const auto unique =
+            files.createTemporaryDirectoryInDirectoryURL(OSTGlobalConfiguration::sharedInstance().deathrowDirectory());
         if (!unique)
             return std::unexpected(OSTCreateError(OSTErrorCode::moveToDeathRowFailed, unique.error(),
                                                   "Failed to create unique directory at: %@", url));
@@ -167,8 +166,8 @@ std::optional<OSTError> OSTClientConnection::_emptyDeathRow() {
         const auto path = pathByAppending(deathRow, item.name);
         const auto removed = _removeItemOrMoveToTempAtURL(path);
         if (!removed)
-            passError = OSTCreateError(OSTErrorCode::destructionFailed, removed.error(),
-                                       "Failed to destroy item at: %@", path);
+            passError =
+                OSTCreateError(OSTErrorCode::destructionFailed, removed.error(), "Failed to destroy item at: %@", path);
         else if (*removed)
             passError = *removed;
     }

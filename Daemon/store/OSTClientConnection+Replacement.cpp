@@ -93,8 +93,8 @@ OSTResult<void> OSTClientConnection::_checkReplacement(const OSTReplacement& rep
                                               oldSide.containerClass, newSide.containerClass));
     if (oldSide.userId != newSide.userId)
         return std::unexpected(OSTCreateError(OSTErrorCode::usersDiffer,
-                                              "Can't replace containers of different userIds: %u and %u", oldSide.userId,
-                                              newSide.userId));
+                                              "Can't replace containers of different userIds: %u and %u",
+                                              oldSide.userId, newSide.userId));
     return {};
 }
 
@@ -213,6 +213,11 @@ OSTResult<void> OSTClientConnection::_putNewContainerInPlace(const OSTReplacemen
     };
     if (const auto moved = files.moveItemAtURL(operation.newContainer->url, destination); !moved)
         return std::unexpected(failedMove(moved.error()));
+    // Before the replace file goes, which would otherwise be gone after a power cut while the move had not happened. A move
+    // that cannot be made sure of is taken back.
+    const auto durable = files.makeDirectoryDurable(pathByDeletingLastComponent(destination));
+    if (!durable && files.moveItemAtURL(destination, operation.newContainer->url))
+        return std::unexpected(failedMove(durable.error()));
     operation.newIsInPlace = true;
 
     OST_TRY(_forgetContainer(side, *operation.newContainer));
@@ -226,11 +231,9 @@ OSTResult<void> OSTClientConnection::_putNewContainerInPlace(const OSTReplacemen
                                                                                 operation.transient);
     if (!added)
         return std::unexpected(OSTCreateError(OSTErrorCode::cacheAddFailed, added.error(),
-                                              "Failed to add to cache: %@, url: %@, transient: %d", metadata, destination,
-                                              operation.transient));
-    // Before the replace file goes, which would otherwise be gone after a power cut while the move had not happened. When that
-    // fails the file stays, and the next start decides by what has reached the disk.
-    if (const auto durable = files.makeDirectoryDurable(pathByDeletingLastComponent(destination)); !durable) {
+                                              "Failed to add to cache: %@, url: %@, transient: %d", metadata,
+                                              destination, operation.transient));
+    if (!durable) { // and could not be taken back: the next start decides by what has reached the disk
         operation.replaceFileURL.clear();
         return std::unexpected(failedMove(durable.error()));
     }
@@ -245,16 +248,18 @@ OSTResult<void> OSTClientConnection::_restoreOldContainer(ReplaceOperation& oper
     auto restored = files.itemExistsAtURL(old.url)
                         ? OSTResult<void>(std::unexpected(OSTCreatePOSIXError(EEXIST, "%@ is occupied", old.url)))
                         : files.moveItemAtURL(operation.stagingURL, old.url);
-    if (restored)
+    if (restored) {
+        if (operation.restoreCodeSigning)
+            operation.restoreCodeSigning();
+        if (operation.oldIsForgotten)
+            static_cast<void>(
+                OSTContainerCache::sharedInstance().addContainerMetadata(old, old.uid, old.url, operation.transient));
         restored = files.makeDirectoryDurable(pathByDeletingLastComponent(old.url));
+    }
     if (!restored)
         return std::unexpected(OSTCreateError(OSTErrorCode::replaceFileInvalid, restored.error(),
-                                              "Failed to recover replace move: %@ to %@", operation.stagingURL, old.url));
-    if (operation.restoreCodeSigning)
-        operation.restoreCodeSigning();
-    if (operation.oldIsForgotten)
-        static_cast<void>(
-            OSTContainerCache::sharedInstance().addContainerMetadata(old, old.uid, old.url, operation.transient));
+                                              "Failed to recover replace move: %@ to %@", operation.stagingURL,
+                                              old.url));
     return {};
 }
 
@@ -265,12 +270,20 @@ OSTResult<void> OSTClientConnection::_cleanUpReplacement(const OSTReplacement& r
         error = OSTCreateError(OSTErrorCode::replaceCleanupFailed, removed.error(), "Failed to remove staging dir: %@",
                                operation.stagingURL);
     const auto start = replacement.startDeletionThread ? StartPass::yes : StartPass::no;
-    if (const auto removed = _moveItemAtURLToDeathRow(operation.replaceFileURL, start); !removed)
+    if (const auto removed = _discardReplaceFile(operation.replaceFileURL, start); !removed)
         error = OSTCreateError(OSTErrorCode::replaceCleanupFailed, removed.error(), "Failed to remove replace file: %@",
                                operation.replaceFileURL);
     if (error)
         return std::unexpected(*error);
     return {};
+}
+
+OSTResult<void> OSTClientConnection::_discardReplaceFile(const std::string& url, StartPass startDeletionThread) const {
+    const auto moved = _moveItemAtURLToDeathRow(url, startDeletionThread);
+    // One that stayed would speak for containers that live on, and mislead a later start when these have gone.
+    if (!moved)
+        static_cast<void>(OSTFileManager::defaultManager().removeItemAtURL(url));
+    return moved;
 }
 
 OSTResult<void> OSTClientConnection::_recoverFromReplaceOperations() const {
@@ -312,7 +325,7 @@ OSTResult<void> OSTClientConnection::_recoverFromReplaceFile(const std::string& 
                                                       file->oldURL));
         }
     }
-    if (const auto removed = _moveItemAtURLToDeathRow(url, StartPass::no); !removed)
+    if (const auto removed = _discardReplaceFile(url, StartPass::no); !removed)
         return std::unexpected(OSTCreateError(OSTErrorCode::replaceCleanupFailed, removed.error(),
                                               "Failed to remove replace file at %@", url));
     return {};

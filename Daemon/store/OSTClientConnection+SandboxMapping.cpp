@@ -19,7 +19,8 @@ SandboxItem itemOf(std::uint32_t userId, OSTContainerClass containerClass) {
         return {OSTRootUserId, SandboxItemType::system};
     if (containerClass == OSTContainerClass::sharedSystemGroup)
         return {OSTRootUserId, SandboxItemType::systemGroup};
-    return {userId, containerClass == OSTContainerClass::sharedAppGroup ? SandboxItemType::appGroup : SandboxItemType::data};
+    return {userId,
+            containerClass == OSTContainerClass::sharedAppGroup ? SandboxItemType::appGroup : SandboxItemType::data};
 }
 
 } // namespace
@@ -37,16 +38,16 @@ bool OSTClientConnection::_setSandboxContainerMappingForUser(std::uint32_t userI
     const auto type = static_cast<std::uint64_t>(item.type);
     if (const auto removed = platform::setSandboxUserStateItem(item.userId, type, identifier, std::nullopt); !removed) {
         platform::logError(
-            "Failed to remove mapping for user: %u, itemType: %llu, identifier: %s, class: %llu, path: %s : %d", item.userId,
-            type, identifier, containerClass, nullptr, removed.error());
+            "Failed to remove mapping for user: %u, itemType: %llu, identifier: %s, class: %llu, path: %s : %d",
+            item.userId, type, identifier, containerClass, nullptr, removed.error());
         return false;
     }
     if (!url)
         return true;
     if (const auto set = platform::setSandboxUserStateItem(item.userId, type, identifier, url); !set) {
         platform::logError(
-            "Failed to set mapping for user: %u, itemType: %llu, identifier %s, class: %llu, path: %s : %d", item.userId,
-            type, identifier, containerClass, *url, set.error());
+            "Failed to set mapping for user: %u, itemType: %llu, identifier %s, class: %llu, path: %s : %d",
+            item.userId, type, identifier, containerClass, *url, set.error());
         return false;
     }
     return true;

@@ -26,7 +26,8 @@ void OSTClientConnection::containerManagerCleanup() const {
     const auto& files = OSTFileManager::defaultManager();
     const auto items = files.urlsForItemsInDirectoryAtURL(staging);
     if (items) {
-        // What cannot be moved stays for the next start, and so does a container that could not be put back in its place.
+        // What cannot be moved stays for the next start, and so does a container that could not be put back in its
+        // place.
         for (const auto& item : *items)
             if (files.itemDoesNotExistAtURL(OSTReplaceFile::urlOfToken(item.name)))
                 (void)_moveItemAtURLToDeathRow(platform::pathByAppending(staging, item.name), StartPass::no);

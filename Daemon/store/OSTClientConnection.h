@@ -171,6 +171,8 @@ private:
     [[nodiscard]] static OSTResult<void> _restoreOldContainer(ReplaceOperation& operation);
     [[nodiscard]] OSTResult<void> _cleanUpReplacement(const OSTReplacement& replacement,
                                                       const ReplaceOperation& operation) const;
+    /// Moves the file to death row, or removes it where it is; the latter is a failure all the same.
+    [[nodiscard]] OSTResult<void> _discardReplaceFile(const std::string& url, StartPass startDeletionThread) const;
     [[nodiscard]] OSTResult<void> _recoverFromReplaceOperations() const;
     [[nodiscard]] OSTResult<void> _recoverFromReplaceFile(const std::string& url) const;
 

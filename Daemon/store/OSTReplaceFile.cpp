@@ -20,8 +20,8 @@ constexpr const char* newKey = "OSTReplaceOperationNewURL";
 constexpr const char* stagingKey = "OSTReplaceOperationStagingURL";
 constexpr const char* destinationKey = "OSTReplaceOperationDestURL";
 
-/// Whether a container may be parked there: directly in the staging directory. What is there must not be a link or a file.
-/// Fails with the errno of looking.
+/// Whether a container may be parked there: directly in the staging directory. What is there must not be a link or a
+/// file. Fails with the errno of looking.
 std::expected<bool, int> isStagingURL(const std::string& url) {
     const auto name = platform::lastPathComponent(url);
     const auto directory = platform::pathByDeletingLastComponent(url);
@@ -56,8 +56,8 @@ std::string OSTReplaceFile::urlOfToken(std::string_view token) {
 OSTResult<void> OSTReplaceFile::writeToDisk(const std::string& url) const {
     if (oldURL.empty() || newURL.empty() || stagingURL.empty() || destinationURL.empty())
         return std::unexpected(OSTCreateError(OSTErrorCode::replaceDescriptionIncomplete,
-                                              "Invalid Replace File Info: old: %@, new: %@, staging: %@, dest: %@", oldURL,
-                                              newURL, stagingURL, destinationURL));
+                                              "Invalid Replace File Info: old: %@, new: %@, staging: %@, dest: %@",
+                                              oldURL, newURL, stagingURL, destinationURL));
     const OSTDictionary dictionary(
         {{oldKey, oldURL}, {newKey, newURL}, {stagingKey, stagingURL}, {destinationKey, destinationURL}});
     if (const auto written = OST_writeToURL(dictionary, url, OSTSmallDictionaryFileSize); !written)

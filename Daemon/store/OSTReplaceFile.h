@@ -9,8 +9,8 @@ namespace ost {
 
 /// What a replacement is about to move, written down before the first move so that the next start can undo it.
 ///
-/// A value. On disk: one file in the replace directory, named by the replacement's token, a binary property list with the four
-/// paths as strings under "OSTReplaceOperationOldURL", "...NewURL", "...StagingURL" and "...DestURL".
+/// A value. On disk: one file in the replace directory, named by the replacement's token, a binary property list with
+/// the four paths as strings under "OSTReplaceOperationOldURL", "...NewURL", "...StagingURL" and "...DestURL".
 struct OSTReplaceFile {
     std::string oldURL;         ///< where the old container lived
     std::string newURL;         ///< where the new container was before
@@ -23,8 +23,8 @@ struct OSTReplaceFile {
     /// Writes the file, durably. Fails with `replaceDescriptionIncomplete` or `dictionaryWriteFailed`.
     [[nodiscard]] OSTResult<void> writeToDisk(const std::string& url) const;
 
-    /// Reads the file, in either property-list encoding. One that asks for a move outside the directories of containers, or of
-    /// anything but a directory in staging, is invalid. Fails with `replaceFileInvalid`.
+    /// Reads the file, in either property-list encoding. One that asks for a move outside the directories of
+    /// containers, or of anything but a directory in staging, is invalid. Fails with `replaceFileInvalid`.
     [[nodiscard]] static OSTResult<OSTReplaceFile> readAndValidateAtURL(const std::string& url);
 
     [[nodiscard]] std::string description() const;

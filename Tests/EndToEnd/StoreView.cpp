@@ -52,7 +52,7 @@ std::vector<std::string> leftovers(const std::filesystem::path& image) {
     std::vector<std::string> items;
     const auto home = image / "private/var/root/Library";
     for (const auto& directory : {home / "Caches/com.tamarok.ostrandd/Staging",
-                                  home / "Caches/com.tamarok.ostrandd/Dead", home / "Ostrand/Replace", image / "tmp"})
+                                  home / "Caches/com.tamarok.ostrandd/Dead", home / "Ostrand/Replace"})
         for (const auto& name : namesIn(directory))
             items.push_back(directory.filename() / name);
     return items;

@@ -37,6 +37,32 @@ TEST(Output, writesJSONThatHoldsWhateverTheValuesHold) {
         EXPECT_EQ(jsonText(value), json);
 }
 
+TEST(Output, writesATreeThatIsPlainToReadWhateverTheValuesHold) {
+    const ost::OSTDictionary inner({{"k\n", std::string("\x1b[\"")}});
+    const ost::OSTDictionary dictionary(
+        {{"array", ost::OSTArray{std::int64_t{-1}, ost::OSTArray{true, inner}, ost::OSTArray{}}},
+         {"data", ost::OSTData{std::string("\x00\xff", 2)}},
+         {"date", ost::OSTDate{0}},
+         {"dictionary", inner},
+         {"empty", ost::OSTDictionary()},
+         {"real", 0.5}});
+    EXPECT_EQ(treeText(dictionary), R"(array
+    - -1
+    -
+        - true
+        -
+            k\n "\u001b[\""
+    - []
+data <00ff>
+date 1970-01-01T00:00:00Z
+dictionary
+    k\n "\u001b[\""
+empty {}
+real 0.5
+)");
+    EXPECT_EQ(treeText({}), "");
+}
+
 TEST(Output, saysOfAFailureWhatProgramsAndPeopleNeed) {
     const struct {
         Failure failure;
