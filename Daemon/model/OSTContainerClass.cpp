@@ -9,21 +9,9 @@ namespace ost {
 namespace {
 
 constexpr std::array<std::string_view, 15> pathComponents = {
-    "Undefined",
-    "Bundle/Application",
-    "Data/Application",
-    "Bundle/LoomworkPlugin",
-    "Data/LoomworkPlugin",
-    "Bundle/VPNPlugin",
-    "Data/VPNPlugin",
-    "Shared/AppGroup",
-    "Bundle/Framework",
-    "Data/VexelService",
-    "Data/InternalDaemon",
-    "Data/TempDir",
-    "Data/System",
-    "Shared/SystemGroup",
-    "MAX",
+    "Undefined",           "Bundle/Application", "Data/Application", "Bundle/LoomworkPlugin", "Data/LoomworkPlugin",
+    "Bundle/VPNPlugin",    "Data/VPNPlugin",     "Shared/AppGroup",  "Bundle/Framework",      "Data/VexelService",
+    "Data/InternalDaemon", "Data/TempDir",       "Data/System",      "Shared/SystemGroup",    "MAX",
 };
 
 } // namespace

@@ -5,8 +5,8 @@
 
 namespace ost {
 
-/// What kind of directory a container is. Travels as an unsigned 64-bit number (requests, metadata files, upcalls), so a value
-/// of this type may be any number until `isValidContainerClass` has accepted it.
+/// What kind of directory a container is. Travels as an unsigned 64-bit number (requests, metadata files, upcalls), so
+/// a value of this type may be any number until `isValidContainerClass` has accepted it.
 enum class OSTContainerClass : std::uint64_t {
     undefined = 0,
     bundleApplication = 1,
@@ -55,8 +55,8 @@ inline constexpr std::uint32_t OSTDefaultUserId = 501;        ///< assumed for p
     return (static_cast<std::uint64_t>(value) & ~std::uint64_t{1}) == 12;
 }
 
-/// Whether containers of the class may belong to the user: bundle classes to 33, system classes to 499, per-user classes to
-/// any user above 500. False for every value outside 1 to 13.
+/// Whether containers of the class may belong to the user: bundle classes to 33, system classes to 499, per-user
+/// classes to any user above 500. False for every value outside 1 to 13.
 [[nodiscard]] constexpr bool OSTUserIdFitsClass(OSTContainerClass containerClass, std::uint32_t userId) {
     return (isBundleClass(containerClass) && userId == OSTInstallerUserId) ||
            (isSystemClass(containerClass) && userId == OSTSystemUserId) ||

@@ -9,8 +9,8 @@ namespace ost {
 
 namespace {
 
-/// Deeper than any value that comes from a request or a program's signature, which are at most 64 deep, and is then stored
-/// some levels down: whatever is written can be read again. No object takes less than a byte.
+/// Deeper than any value that comes from a request or a program's signature, which are at most 64 deep, and is then
+/// stored some levels down: whatever is written can be read again. No object takes less than a byte.
 constexpr std::size_t maximumDepth = 128;
 
 } // namespace

@@ -26,8 +26,8 @@ inline constexpr std::size_t OSTLargeDictionaryFileSize = std::size_t{64} << 20U
 [[nodiscard]] OSTResult<std::string> OST_contentsOfDictionary(const OSTDictionary& dictionary, std::string_view path,
                                                               std::size_t maximumSize);
 
-/// Writes a dictionary file: atomically, without data protection, and durable when this returns. Fails as above or with the
-/// write error.
+/// Writes a dictionary file: atomically, without data protection, and durable when this returns. Fails as above or with
+/// the write error.
 [[nodiscard]] OSTResult<void> OST_writeToURL(const OSTDictionary& dictionary, std::string_view path,
                                              std::size_t maximumSize);
 

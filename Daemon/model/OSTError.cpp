@@ -6,9 +6,12 @@ namespace {
 
 std::string_view nameOf(OSTError::Domain domain) {
     switch (domain) {
-    case OSTError::Domain::ost: return "OSTErrorDomain";
-    case OSTError::Domain::posix: return "POSIX";
-    case OSTError::Domain::general: return "general";
+    case OSTError::Domain::ost:
+        return "OSTErrorDomain";
+    case OSTError::Domain::posix:
+        return "POSIX";
+    case OSTError::Domain::general:
+        return "general";
     }
     return "general";
 }
@@ -36,8 +39,8 @@ OSTError makeError(OSTError::Domain domain, OSTErrorCode code, const std::source
             platform::logAs(platform::LogLevel::error, name, "%d: %@", where.line(), *message);
     }
     return OSTError({domain, code, std::move(message),
-                     underlyingError ? std::make_shared<const OSTError>(*underlyingError) : nullptr, std::move(function),
-                     where.line()});
+                     underlyingError ? std::make_shared<const OSTError>(*underlyingError) : nullptr,
+                     std::move(function), where.line()});
 }
 
 } // namespace ost

@@ -14,8 +14,8 @@
 
 namespace ost {
 
-/// The number that tells a caller how an operation ended. What leaves the daemon is this number alone: one of the system's
-/// own codes below, or the errno of an error of the POSIX domain.
+/// The number that tells a caller how an operation ended. What leaves the daemon is this number alone: one of the
+/// system's own codes below, or the errno of an error of the POSIX domain.
 enum class OSTErrorCode : std::int64_t {
     success = 1,
     moveAsideFailed = 4,
@@ -62,8 +62,8 @@ enum class OSTErrorCode : std::int64_t {
 
 /// A failure: its domain and code, the message, what caused it, and the place that raised it.
 ///
-/// A value, cheap to copy; immutable and safe to share between threads. `OSTCreateError` and `OSTCreatePOSIXError` are the
-/// only makers.
+/// A value, cheap to copy; immutable and safe to share between threads. `OSTCreateError` and `OSTCreatePOSIXError` are
+/// the only makers.
 class OSTError {
 public:
     enum class Domain : std::uint8_t {
@@ -117,8 +117,8 @@ enum class OSTLogging : bool { silent, logged };
 [[nodiscard]] OSTError makeError(OSTError::Domain domain, OSTErrorCode code, const std::source_location& where,
                                  const OSTError* underlyingError, bool log, std::optional<std::string> message);
 
-/// Makes an error of the system's own domain and, unless `logging` says otherwise, writes it to the log at error level as
-/// "line: message" or "line: message (underlying error)". Function name and line are those of the calling statement.
+/// Makes an error of the system's own domain and, unless `logging` says otherwise, writes it to the log at error level
+/// as "line: message" or "line: message (underlying error)". Function name and line are those of the calling statement.
 template<typename... Arguments>
 [[nodiscard]] OSTError OSTCreateError(OSTErrorCode code, OSTLogging logging, const OSTError* underlyingError,
                                       platform::Message<Arguments...> format, const Arguments&... arguments) {
@@ -156,9 +156,10 @@ template<typename... Arguments>
 
 /// Makes the error for a file whose content is not the property list that was expected; never logged.
 template<typename... Arguments>
-[[nodiscard]] OSTError OSTCreatePropertyListError(platform::Message<Arguments...> format, const Arguments&... arguments) {
-    return makeError(OSTError::Domain::general, static_cast<OSTErrorCode>(OSTError::corruptPropertyList), format.where(),
-                     nullptr, false, platform::formatMessage<Arguments...>(format, arguments...));
+[[nodiscard]] OSTError OSTCreatePropertyListError(platform::Message<Arguments...> format,
+                                                  const Arguments&... arguments) {
+    return makeError(OSTError::Domain::general, static_cast<OSTErrorCode>(OSTError::corruptPropertyList),
+                     format.where(), nullptr, false, platform::formatMessage<Arguments...>(format, arguments...));
 }
 
 } // namespace ost

@@ -56,8 +56,8 @@ std::string OSTUncaughtExceptionReport(const OSTCaughtException& exception) {
 
 OSTError OSTErrorFromCurrentException(const std::source_location& where) {
     const auto exception = OSTCaughtException::current();
-    OSTError error = OSTCreateErrorAt(where, OSTErrorCode::exceptionCaught, nullptr, "Got exception: %@ : %@", exception,
-                                      exception.callStackSymbols);
+    OSTError error = OSTCreateErrorAt(where, OSTErrorCode::exceptionCaught, nullptr, "Got exception: %@ : %@",
+                                      exception, exception.callStackSymbols);
     if (platform::deviceCapability("InternalBuild"))
         platform::crashWithMessage(OSTUncaughtExceptionReport(exception));
     return error;

@@ -141,7 +141,8 @@ std::optional<std::string> OSTGlobalConfiguration::containerDirectoryURLForUser(
         owner = OSTInstallerUserId;
     } else {
         auto* const configuration = getPerUserConfigurationForUserId(userId);
-        return configuration ? configuration->containerDirectoryURLForContentClass(contentClass, transient) : std::nullopt;
+        return configuration ? configuration->containerDirectoryURLForContentClass(contentClass, transient)
+                             : std::nullopt;
     }
     return OSTMadeDirectory(pathByAppending(base, pathComponentForContainerClass(contentClass)),
                             {.withIntermediateDirectories = true, .mode = 0755, .owner = owner},

@@ -15,9 +15,9 @@
 
 namespace ost {
 
-/// Names every directory that all users share and makes each at every access, so one that was removed reappears at its next
-/// use. All other code asks here and never builds a root of the layout itself. No accessor fails: what cannot be made is
-/// logged, and the operation that then uses the directory fails.
+/// Names every directory that all users share and makes each at every access, so one that was removed reappears at its
+/// next use. All other code asks here and never builds a root of the layout itself. No accessor fails: what cannot be
+/// made is logged, and the operation that then uses the directory fails.
 ///
 /// Threads: any. One shared instance for the life of the process.
 class OSTGlobalConfiguration {
@@ -44,11 +44,11 @@ public:
     [[nodiscard]] OSTPerUserConfiguration* getPerUserConfigurationForUserId(std::uint32_t userId);
 
     /// The directory that holds all containers of the class for the user; none when there is no such directory.
-    [[nodiscard]] std::optional<std::string> containerDirectoryURLForUser(std::uint32_t userId,
-                                                                          OSTContainerClass contentClass, bool transient);
+    [[nodiscard]] std::optional<std::string>
+    containerDirectoryURLForUser(std::uint32_t userId, OSTContainerClass contentClass, bool transient);
 
-    /// Whether `url` could be the path of a container: a name directly inside the class directory of a class and user. Makes no
-    /// directory. Fails with the errno of reading the accounts.
+    /// Whether `url` could be the path of a container: a name directly inside the class directory of a class and user.
+    /// Makes no directory. Fails with the errno of reading the accounts.
     [[nodiscard]] std::expected<bool, int> isContainerURL(std::string_view url) const;
 
     /// The items at the top of an application's data container that belong to the user's data.
@@ -60,7 +60,8 @@ public:
 private:
     OSTGlobalConfiguration();
 
-    // Constant after construction. Roots of the layout are made canonical here, once; no path below them may pass a link.
+    // Constant after construction. Roots of the layout are made canonical here, once; no path below them may pass a
+    // link.
     const std::string _homeDirectory;
     const std::string _tessalydHomeDirectory;
     const std::string _sharedContainersDirectory;

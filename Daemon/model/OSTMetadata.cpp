@@ -17,9 +17,7 @@ constexpr const char* personaKey = "OSTMetadataPersona";
 constexpr const char* infoKey = "OSTMetadataInfo";
 
 /// A value of a dictionary as messages show it.
-std::optional<OSTValue> shown(const OSTValue* value) {
-    return value ? std::optional(*value) : std::nullopt;
-}
+std::optional<OSTValue> shown(const OSTValue* value) { return value ? std::optional(*value) : std::nullopt; }
 
 /// Every class directory lies two levels below its base, and the container directory one below that.
 bool liesInDirectoryOfClass(std::string_view url, OSTContainerClass containerClass) {
@@ -59,16 +57,17 @@ OSTResult<OSTMetadata> OSTMetadata::readAndValidateMetadataAtUrl(const OSTResult
                                               shown(uuidText), url));
     const auto uuid = platform::UUID::parse(*uuidText->asString());
     if (!uuid)
-        return std::unexpected(OSTCreateError(OSTErrorCode::metadataInvalid, "Invalid metadata UUID: %@ at %@", nullptr, url));
+        return std::unexpected(
+            OSTCreateError(OSTErrorCode::metadataInvalid, "Invalid metadata UUID: %@ at %@", nullptr, url));
 
     const OSTValue* const classNumber = dictionary->find(contentClassKey);
     if (!classNumber || !classNumber->isNumber())
-        return std::unexpected(OSTCreateError(OSTErrorCode::metadataInvalid, "Invalid metadata Class: %@ at %@",
-                                              shown(classNumber), url));
+        return std::unexpected(
+            OSTCreateError(OSTErrorCode::metadataInvalid, "Invalid metadata Class: %@ at %@", shown(classNumber), url));
     const auto containerClass = static_cast<OSTContainerClass>(*classNumber->unsignedValue());
     if (!isValidContainerClass(containerClass))
-        return std::unexpected(OSTCreateError(OSTErrorCode::metadataInvalid, "Invalid metadata Content Class: %ld at %@",
-                                              containerClass, url));
+        return std::unexpected(OSTCreateError(OSTErrorCode::metadataInvalid,
+                                              "Invalid metadata Content Class: %ld at %@", containerClass, url));
 
     // A file that names no user was written when there was one user for each class: it belongs to whoever is expected.
     const OSTValue* const persona = dictionary->find(personaKey);
@@ -128,13 +127,9 @@ OSTResult<OSTNewFile> OSTMetadata::writeMetadataToNewDirectory() const {
                              : std::unexpected(contents.error()));
 }
 
-OSTResult<void> OSTMetadata::makeMetadataDurable(OSTNewFile file) const {
-    return _written(file.makeDurable());
-}
+OSTResult<void> OSTMetadata::makeMetadataDurable(OSTNewFile file) const { return _written(file.makeDurable()); }
 
-std::string OSTMetadata::metadataFileURL() const {
-    return platform::pathByAppending(url, OSTMetadataFileName);
-}
+std::string OSTMetadata::metadataFileURL() const { return platform::pathByAppending(url, OSTMetadataFileName); }
 
 std::string OSTMetadata::description() const {
     return platform::formatMessage("<OSTMetadata user: %u, class: %llu, identifier: %@, uuid: %@, url: %@>", uid,

@@ -24,18 +24,20 @@ enum class OSTCheckClassPath : bool { no, yes };
 ///
 /// A value type. Records that are shared (`OSTMetadataRecord`) never change; whoever has to change one makes a copy.
 ///
-/// On disk: a binary property list with "OSTMetadataIdentifier", "OSTMetadataUUID" (canonical text), "OSTMetadataContentClass",
-/// "OSTMetadataPersona" (the user id) and, when there is info, "OSTMetadataInfo". Old files lack the user id.
+/// On disk: a binary property list with "OSTMetadataIdentifier", "OSTMetadataUUID" (canonical text),
+/// "OSTMetadataContentClass", "OSTMetadataPersona" (the user id) and, when there is info, "OSTMetadataInfo". Old files
+/// lack the user id.
 struct OSTMetadata {
     std::uint32_t uid = 0;
     platform::UUID uuid = {}; ///< the internal UUID, which is not the directory's name
     OSTContainerClass containerClass = OSTContainerClass::undefined;
     std::string identifier = {};
     std::shared_ptr<const OSTDictionary> info = nullptr; ///< null when there is none
-    std::string url = {};                      ///< path of the container directory
-    bool transient = false;                    ///< lies in a transient directory; not in the file
-    bool existed = false;                      ///< was found, not made, by the look-up that gave this record; not in the file
-    /// True while the rename that put the container in place may still be lost in a power cut; null for one read from disk.
+    std::string url = {};                                ///< path of the container directory
+    bool transient = false;                              ///< lies in a transient directory; not in the file
+    bool existed = false; ///< was found, not made, by the look-up that gave this record; not in the file
+    /// True while the rename that put the container in place may still be lost in a power cut; null for one read from
+    /// disk.
     std::shared_ptr<std::atomic<bool>> pendingPlacement = nullptr;
 
     /// Reads the metadata file of the container at `url` and validates it for the user.
@@ -43,15 +45,17 @@ struct OSTMetadata {
     [[nodiscard]] static OSTResult<OSTMetadata> readAndValidateMetadataAtUrl(std::string_view url, std::uint32_t userId,
                                                                              OSTCheckClassPath checkClassPath);
 
-    /// The second half of the above, for a caller that has the file's bytes: `contents` is what was read, or why it was not.
-    [[nodiscard]] static OSTResult<OSTMetadata> readAndValidateMetadataAtUrl(const OSTResult<std::string_view>& contents,
-                                                                 std::string_view url, std::uint32_t userId,
-                                                                 OSTCheckClassPath checkClassPath);
+    /// The second half of the above, for a caller that has the file's bytes: `contents` is what was read, or why it was
+    /// not.
+    [[nodiscard]] static OSTResult<OSTMetadata>
+    readAndValidateMetadataAtUrl(const OSTResult<std::string_view>& contents, std::string_view url,
+                                 std::uint32_t userId, OSTCheckClassPath checkClassPath);
 
     /// The dictionary that the file holds.
     [[nodiscard]] OSTDictionary dictionary() const;
 
-    /// Writes the metadata file at `url`, atomically; durable when this returns. Fails with `dictionaryWriteFailed`, logged.
+    /// Writes the metadata file at `url`, atomically; durable when this returns. Fails with `dictionaryWriteFailed`,
+    /// logged.
     [[nodiscard]] OSTResult<void> writeMetadataToDisk() const;
 
     /// The same for a directory that nobody else can see yet; what it returns still has to be made durable.

@@ -68,9 +68,7 @@ std::optional<std::string> OSTPerUserConfiguration::oldLibraryDirectoryPath() co
     return _inHome("Library/Ostrand");
 }
 
-std::optional<std::string> OSTPerUserConfiguration::oldLoggingPath() const {
-    return _inHome("Library/Logs/Ostrand");
-}
+std::optional<std::string> OSTPerUserConfiguration::oldLoggingPath() const { return _inHome("Library/Logs/Ostrand"); }
 
 std::optional<std::string> OSTPerUserConfiguration::containerDirectoryURLForContentClass(OSTContainerClass contentClass,
                                                                                          bool transient) {

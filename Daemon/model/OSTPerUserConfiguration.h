@@ -16,8 +16,9 @@ namespace ost {
 inline constexpr std::string_view OSTUserBaseDirectoryName = "Containers";
 inline constexpr std::string_view OSTUserTransientDirectoryName = "Library/Caches/com.tamarok.ostrandd/Temp";
 
-/// Names the directories inside one real user's home, and makes each at every access. A user without a home directory has no
-/// paths. No accessor fails: what cannot be made is logged, and the operation that then uses the directory fails.
+/// Names the directories inside one real user's home, and makes each at every access. A user without a home directory
+/// has no paths. No accessor fails: what cannot be made is logged, and the operation that then uses the directory
+/// fails.
 ///
 /// Threads: any. Owned by `OSTGlobalConfiguration`, never dropped.
 class OSTPerUserConfiguration {

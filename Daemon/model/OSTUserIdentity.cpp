@@ -32,10 +32,12 @@ std::uint32_t getCurrentMobileUserId() {
     static const std::uint32_t mobileUserId = [] {
         const auto account = platform::accountForName("mobile");
         if (!account) {
-            platform::logAs(platform::LogLevel::error, "getCurrentMobileUserId", "Failed to get mobile uid. This is bad");
+            platform::logAs(platform::LogLevel::error, "getCurrentMobileUserId",
+                            "Failed to get mobile uid. This is bad");
             return std::uint32_t{0};
         }
-        platform::logAs(platform::LogLevel::error, "getCurrentMobileUserId", "Current mobile user ID is %u", account->uid);
+        platform::logAs(platform::LogLevel::error, "getCurrentMobileUserId", "Current mobile user ID is %u",
+                        account->uid);
         return std::uint32_t{account->uid};
     }();
     return mobileUserId;

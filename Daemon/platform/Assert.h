@@ -9,6 +9,6 @@ namespace ost::platform {
 
 } // namespace ost::platform
 
-/// Stops the process when an invariant of the program itself is broken, in every build. Client input, disk content and errno
-/// never trip one.
+/// Stops the process when an invariant of the program itself is broken, in every build. Client input, disk content and
+/// errno never trip one.
 #define OST_ASSERT(condition) ((condition) ? static_cast<void>(0) : ::ost::platform::assertionFailed(#condition))

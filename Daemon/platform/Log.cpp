@@ -17,9 +17,12 @@ namespace {
 
 const char* nameOf(LogLevel level) {
     switch (level) {
-    case LogLevel::error: return "Error";
-    case LogLevel::notice: return "Notice";
-    case LogLevel::debug: return "Debug";
+    case LogLevel::error:
+        return "Error";
+    case LogLevel::notice:
+        return "Notice";
+    case LogLevel::debug:
+        return "Debug";
     }
     return "Error";
 }
@@ -62,8 +65,8 @@ std::expected<void, int> Log::open(LogLevel level, DiskFile file) {
 }
 
 std::expected<void, int> Log::_openFile() {
-    _file.reset(::open(_disk.path.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY,
-                       0644));
+    _file.reset(::open(_disk.path.c_str(),
+                       O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY, 0644));
     struct stat status{};
     if (!_file || ::fstat(_file.get(), &status) != 0) {
         _file.reset();

@@ -17,8 +17,8 @@ enum class LogLevel : int { error = 3, notice = 5, debug = 7 };
 /// The process's leveled, rotating log. One line is
 /// `2026-11-22T19:46:01.123456Z <Error> [PID:TID] function: message`, written with one `write`.
 ///
-/// Threads: any. Before `open`, and while the disk file cannot be written, lines are lost and nothing else happens; error
-/// lines still reach standard error, which is never waited for.
+/// Threads: any. Before `open`, and while the disk file cannot be written, lines are lost and nothing else happens;
+/// error lines still reach standard error, which is never waited for.
 class Log {
 public:
     struct DiskFile {
@@ -29,8 +29,8 @@ public:
 
     static Log& shared();
 
-    /// Writes lines of `level` and below to `file` from now on. Fails with the errno of opening the file; the file is then
-    /// tried again at each line.
+    /// Writes lines of `level` and below to `file` from now on. Fails with the errno of opening the file; the file is
+    /// then tried again at each line.
     std::expected<void, int> open(LogLevel level, DiskFile file);
 
     [[nodiscard]] bool accepts(LogLevel level) const { return level <= _level.load(std::memory_order_relaxed); }

@@ -43,9 +43,15 @@ void appendEscaped(std::string& out, std::string_view text) {
             constexpr char digits[] = "0123456789abcdef";
             const auto byte = static_cast<unsigned char>(text[0]);
             switch (byte) {
-            case '\n': out += "\\n"; break;
-            case '\t': out += "\\t"; break;
-            case '\r': out += "\\r"; break;
+            case '\n':
+                out += "\\n";
+                break;
+            case '\t':
+                out += "\\t";
+                break;
+            case '\r':
+                out += "\\r";
+                break;
             default:
                 out += "\\x";
                 out += digits[byte >> 4];
@@ -67,9 +73,15 @@ MessageArgument::MessageArgument(double value) : _kind(Kind::text), _unsigned(0)
 void MessageArgument::appendTo(std::string& out, char conversion) const {
     const int base = conversion == 'x' || conversion == 'p' ? 16 : 10;
     switch (_kind) {
-    case Kind::text: appendEscaped(out, _text); break;
-    case Kind::signedNumber: appendNumber(out, _signed, base); break;
-    case Kind::unsignedNumber: appendNumber(out, _unsigned, base); break;
+    case Kind::text:
+        appendEscaped(out, _text);
+        break;
+    case Kind::signedNumber:
+        appendNumber(out, _signed, base);
+        break;
+    case Kind::unsignedNumber:
+        appendNumber(out, _unsigned, base);
+        break;
     case Kind::pointer:
         out += "0x";
         appendNumber(out, _unsigned, 16);

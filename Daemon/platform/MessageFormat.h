@@ -19,8 +19,8 @@ namespace ost::platform {
 void appendEscaped(std::string& out, std::string_view text);
 
 /// One argument of a message, erased to what the formatter prints. Strings are borrowed: the argument must not outlive
-/// them. Any type with a `description()` member, or that an `std::optional`, a smart pointer or an `std::vector` makes of
-/// one, is an argument too.
+/// them. Any type with a `description()` member, or that an `std::optional`, a smart pointer or an `std::vector` makes
+/// of one, is an argument too.
 class MessageArgument {
 public:
     MessageArgument(bool value) : _kind(Kind::unsignedNumber), _unsigned(value ? 1 : 0) {}
@@ -132,16 +132,19 @@ template<typename... Arguments>
 using Message = MessageFormat<std::type_identity_t<Arguments>...>;
 
 /// Replaces the placeholders of `format`, in order, by the arguments. Their numbers must match.
-[[nodiscard]] std::string formatMessage(std::string_view format, std::initializer_list<const MessageArgument*> arguments);
+[[nodiscard]] std::string formatMessage(std::string_view format,
+                                        std::initializer_list<const MessageArgument*> arguments);
 
 template<typename... Arguments>
 [[nodiscard]] std::string formatMessage(Message<Arguments...> format, const Arguments&... arguments) {
     // The temporaries live until the end of the full expression, which is all that the formatter needs.
-    return [&](const auto&... erased) { return formatMessage(format.text(), {&erased...}); }(MessageArgument(arguments)...);
+    return [&](const auto&... erased) {
+        return formatMessage(format.text(), {&erased...});
+    }(MessageArgument(arguments)...);
 }
 
-/// The qualified name of the function at `where`, without namespaces `ost` and `platform`, result, arguments or lambdas:
-/// "OSTMetadata::writeMetadataToDisk".
+/// The qualified name of the function at `where`, without namespaces `ost` and `platform`, result, arguments or
+/// lambdas: "OSTMetadata::writeMetadataToDisk".
 [[nodiscard]] std::string qualifiedFunctionName(const std::source_location& where);
 
 /// The last part of a qualified name: "writeMetadataToDisk".

@@ -9,8 +9,8 @@ namespace ost {
 /// The serial queue of data-protection changes that wait until the device is unlocked. Suspended while it is locked.
 [[nodiscard]] platform::WorkQueue& OSTLockStateQueue();
 
-/// Keeps the lock-state queue in step with the device: suspends it once when the device is locked and resumes it once when it
-/// is unlocked, however often either is reported.
+/// Keeps the lock-state queue in step with the device: suspends it once when the device is locked and resumes it once
+/// when it is unlocked, however often either is reported.
 ///
 /// Threads: the main thread alone.
 class OSTLockStateFollower {

@@ -21,11 +21,11 @@ const std::array<OSTCommandEntry, OSTCommandCount> OSTCommandTable = {{
     {2, OSTReplaceCommand, allowed, OSTReplyBy::dispatcher},
     {3, OSTStageForDeleteCommand, allowed, OSTReplyBy::dispatcher},
     {4, OSTDestroyDeathRowCommand, allowed, OSTReplyBy::handler},
-    {5, nullptr, allowed, OSTReplyBy::dispatcher},        // set an info value of a container
-    {6, nullptr, allowed, OSTReplyBy::dispatcher},        // get an info value of a container
-    {7, nullptr, allowed, OSTReplyBy::dispatcher},        // get a container's path, transient flag and info
-    {8, nullptr, allowed, OSTReplyBy::dispatcher},        // recreate a container's default structure
-    {9, nullptr, allowed, OSTReplyBy::dispatcher},        // regenerate a container's directory UUID
+    {5, nullptr, allowed, OSTReplyBy::dispatcher}, // set an info value of a container
+    {6, nullptr, allowed, OSTReplyBy::dispatcher}, // get an info value of a container
+    {7, nullptr, allowed, OSTReplyBy::dispatcher}, // get a container's path, transient flag and info
+    {8, nullptr, allowed, OSTReplyBy::dispatcher}, // recreate a container's default structure
+    {9, nullptr, allowed, OSTReplyBy::dispatcher}, // regenerate a container's directory UUID
     {10, OSTDeleteCommand, allowed, OSTReplyBy::dispatcher},
     {11, nullptr, wipeContainer, OSTReplyBy::dispatcher}, // wipe an entitled plug-in data container
     {12, nullptr, allowed, OSTReplyBy::dispatcher},       // wipe a data container

@@ -17,8 +17,8 @@ inline constexpr const char* OSTEntitlementOtherIdLookup = "com.tamarok.private.
 inline constexpr const char* OSTEntitlementWipeContainer = "com.tamarok.private.Ostrand.wipeContainer";
 inline constexpr const char* OSTEntitlementDataMigration = "com.tamarok.private.Ostrand.dataMigration";
 
-/// Carries a command out: reads its keys from the request, acts for the client, puts the results into the reply. Gives the
-/// reply's code.
+/// Carries a command out: reads its keys from the request, acts for the client, puts the results into the reply. Gives
+/// the reply's code.
 using OSTCommandHandler = OSTErrorCode (*)(const platform::IPCRequest& request, platform::IPCReply& reply,
                                            OSTClientConnection& client);
 

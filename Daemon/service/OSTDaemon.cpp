@@ -73,8 +73,7 @@ bool OSTDaemon::start() {
     store.containerManagerSetup();
 
     if (_startRunLoop())
-        _upcallPort =
-            OSTKernServerStart(*_runLoop, _sockets.takeListener(OSTKernServiceName, SOCK_SEQPACKET));
+        _upcallPort = OSTKernServerStart(*_runLoop, _sockets.takeListener(OSTKernServiceName, SOCK_SEQPACKET));
     if (!_upcallPort) {
         logAs(LogLevel::error, "main", "Failed to initialize kernel upcall interface. THIS IS BAD! Exiting.");
         return false;

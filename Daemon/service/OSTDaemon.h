@@ -23,12 +23,12 @@ public:
     OSTDaemon& operator=(const OSTDaemon&) = delete;
     ~OSTDaemon();
 
-    /// Brings the daemon up, holding a transaction, until clients are served. False, with the reason in the log, when it
-    /// cannot go on.
+    /// Brings the daemon up, holding a transaction, until clients are served. False, with the reason in the log, when
+    /// it cannot go on.
     [[nodiscard]] bool start();
 
-    /// Serves until SIGTERM or SIGINT, then finishes what is under way. Does not return when something is still open after
-    /// the time there is for that: it then ends the process with status 0.
+    /// Serves until SIGTERM or SIGINT, then finishes what is under way. Does not return when something is still open
+    /// after the time there is for that: it then ends the process with status 0.
     void run();
 
 private:

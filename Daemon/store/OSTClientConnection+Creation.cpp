@@ -18,7 +18,8 @@ using platform::pathByDeletingLastComponent;
 
 namespace {
 
-/// Owner and group of everything inside a system container; what its services may do there, an access-control list says.
+/// Owner and group of everything inside a system container; what its services may do there, an access-control list
+/// says.
 constexpr std::uint32_t systemContentOwner = 4294967294;
 
 constexpr std::array<std::string_view, 5> dataSubDirectories = {"Documents", "Library", "Library/Caches",
@@ -33,8 +34,9 @@ std::span<const std::string_view> subDirectoriesOf(OSTContainerClass containerCl
     return dataSubDirectories;
 }
 
-/// Waits until the renames that put the records' containers in place have reached the disk. Whoever made a container does so
-/// after the locks are released; whoever finds one that is not there yet does it too, since it is going to be answered.
+/// Waits until the renames that put the records' containers in place have reached the disk. Whoever made a container
+/// does so after the locks are released; whoever finds one that is not there yet does it too, since it is going to be
+/// answered.
 OSTResult<void> makePlacesDurable(std::span<const OSTMetadataRecord> records) {
     for (const auto& record : records) {
         if (!record->pendingPlacement || !*record->pendingPlacement)
@@ -121,8 +123,9 @@ OSTResult<OSTMetadataRecord> OSTClientConnection::_createContainer(const OSTCont
     OSTMetadata metadata = OST_TRY(_buildInStaging(lookup, stagingURL));
 
     const auto liveParent = layout.containerDirectoryURLForUser(lookup.userId, lookup.containerClass, lookup.transient);
-    const auto liveName =
-        OSTStoreDelegate::shared().wellknownContainerForId(*lookup.identifier, lookup.containerClass).value_or(directoryUUID);
+    const auto liveName = OSTStoreDelegate::shared()
+                              .wellknownContainerForId(*lookup.identifier, lookup.containerClass)
+                              .value_or(directoryUUID);
     const auto liveURL = pathByAppending(liveParent.value_or(std::string()), liveName);
     if (const auto moved = OSTFileManager::defaultManager().moveItemAtURL(stagingURL, liveURL); !moved)
         return std::unexpected(OSTCreateError(OSTErrorCode::moveToLiveFailed, moved.error(),
@@ -131,8 +134,8 @@ OSTResult<OSTMetadataRecord> OSTClientConnection::_createContainer(const OSTCont
 
     metadata.url = liveURL;
     metadata.pendingPlacement = std::make_shared<std::atomic<bool>>(true);
-    const auto added = OSTContainerCache::sharedInstance().addContainerMetadata(metadata, lookup.userId, liveURL,
-                                                                                lookup.transient);
+    const auto added =
+        OSTContainerCache::sharedInstance().addContainerMetadata(metadata, lookup.userId, liveURL, lookup.transient);
     if (!added)
         return std::unexpected(OSTCreateError(OSTErrorCode::cacheAddFailed, added.error(),
                                               "Failed to add to cache for %u : %@, url: %@, transient: %d",
@@ -197,8 +200,8 @@ OSTClientConnection::containersForUser(std::uint32_t userId, OSTContainerClass c
                                                   "Can't act on an invalid container-userId: %u, class: %ld", userId,
                                                   containerClass));
         OSTAllIdentifiersLock lock(OSTLockKind::reading);
-        auto records = OST_TRY(
-            OSTContainerCache::sharedInstance().allContainersForUser(userId, containerClass, transient));
+        auto records =
+            OST_TRY(OSTContainerCache::sharedInstance().allContainersForUser(userId, containerClass, transient));
         lock.unlock();
         OST_TRY(makePlacesDurable(records));
         return records;

@@ -213,8 +213,8 @@ OSTResult<void> OSTClientConnection::_putNewContainerInPlace(const OSTReplacemen
     };
     if (const auto moved = files.moveItemAtURL(operation.newContainer->url, destination); !moved)
         return std::unexpected(failedMove(moved.error()));
-    // Before the replace file goes, which would otherwise be gone after a power cut while the move had not happened. A move
-    // that cannot be made sure of is taken back.
+    // Before the replace file goes, which would otherwise be gone after a power cut while the move had not happened. A
+    // move that cannot be made sure of is taken back.
     const auto durable = files.makeDirectoryDurable(pathByDeletingLastComponent(destination));
     if (!durable && files.moveItemAtURL(destination, operation.newContainer->url))
         return std::unexpected(failedMove(durable.error()));

@@ -63,13 +63,13 @@ struct OSTReplacement {
 /// The serial queue on which every death-row pass runs, at background priority.
 [[nodiscard]] platform::WorkQueue& OSTDeathRowQueue();
 
-/// The object through which every store operation runs, with one client's identity and rights. A new one is made for each
-/// request and dies with it; the daemon's own work uses `sharedClientConnection`.
+/// The object through which every store operation runs, with one client's identity and rights. A new one is made for
+/// each request and dies with it; the daemon's own work uses `sharedClientConnection`.
 ///
-/// Threads: any, one at a time for an object whose rights change. Operations serialise themselves with the locks of OSTLocks.
-/// On disk: a container is built in the staging directory and put in place with one rename, so a live one is never half made.
-/// What is thrown away is moved to death row with one rename and destroyed by a later pass.
-/// Failures leave as a code alone; the error behind it is in the log. An exception becomes `exceptionCaught`.
+/// Threads: any, one at a time for an object whose rights change. Operations serialise themselves with the locks of
+/// OSTLocks. On disk: a container is built in the staging directory and put in place with one rename, so a live one is
+/// never half made. What is thrown away is moved to death row with one rename and destroyed by a later pass. Failures
+/// leave as a code alone; the error behind it is in the log. An exception becomes `exceptionCaught`.
 class OSTClientConnection {
 public:
     explicit OSTClientConnection(OSTClientIdentity identity) : _identity(std::move(identity)) {}
@@ -84,8 +84,9 @@ public:
 
     // Creation and look-up
 
-    /// Gives the container that the look-up names, making it when it is missing and may be made; `existed` tells which. A
-    /// transient container is never reused: one that is found is thrown away first. What is answered has reached the disk.
+    /// Gives the container that the look-up names, making it when it is missing and may be made; `existed` tells which.
+    /// A transient container is never reused: one that is found is thrown away first. What is answered has reached the
+    /// disk.
     ///
     /// Codes: `invalidObject` (no identifier, or a class or user that do not fit), `notEntitled`, `notFound`,
     /// `transientRemovalFailed`, `stagingCreationFailed`, `dictionaryWriteFailed`, `accessControlListFailed`,
@@ -99,10 +100,12 @@ public:
 
     // Deletion
 
-    /// Takes containers out of their places, the cache and the sandbox's mapping, and leaves them on death row. An entry that
-    /// names no container is passed over; one whose container cannot be moved or removed is logged, and keeps its place.
-    /// Codes: `invalidObject` when UUIDs, identifiers and classes differ in number, `cacheRemoveFailed`.
-    [[nodiscard]] std::expected<void, OSTErrorCode> stageForDeleteContainersWithUsers(const OSTDeletion& deletion) const;
+    /// Takes containers out of their places, the cache and the sandbox's mapping, and leaves them on death row. An
+    /// entry that names no container is passed over; one whose container cannot be moved or removed is logged, and
+    /// keeps its place. Codes: `invalidObject` when UUIDs, identifiers and classes differ in number,
+    /// `cacheRemoveFailed`.
+    [[nodiscard]] std::expected<void, OSTErrorCode>
+    stageForDeleteContainersWithUsers(const OSTDeletion& deletion) const;
 
     /// Looks one container up and stages it for deletion. Codes: those of the look-up and of the staging.
     [[nodiscard]] std::expected<void, OSTErrorCode> deleteContainerForUser(std::uint32_t userId,
@@ -118,22 +121,24 @@ public:
 
     // Replacement
 
-    /// Puts the new container in the place of the old one, which is discarded, or, without an old one, into its live class
-    /// directory. A crash at any moment leaves one of the two in its place. When a step fails the old container is
-    /// put back, unless the new one has taken its place already.
+    /// Puts the new container in the place of the old one, which is discarded, or, without an old one, into its live
+    /// class directory. A crash at any moment leaves one of the two in its place. When a step fails the old container
+    /// is put back, unless the new one has taken its place already.
     ///
-    /// Codes: `invalidObject`, `classesDiffer`, `usersDiffer`, `notFound`, `replacedByItself`, `unexpectedPath`, `alreadyExists`,
-    /// `replaceDescriptionIncomplete`, `dictionaryWriteFailed`, `moveOldToStagingFailed`, `cacheRemoveFailed`,
-    /// `mappingWriteFailed`, `replacingMoveFailed`, `cacheAddFailed`, `replaceCleanupFailed`, those of the cache.
+    /// Codes: `invalidObject`, `classesDiffer`, `usersDiffer`, `notFound`, `replacedByItself`, `unexpectedPath`,
+    /// `alreadyExists`, `replaceDescriptionIncomplete`, `dictionaryWriteFailed`, `moveOldToStagingFailed`,
+    /// `cacheRemoveFailed`, `mappingWriteFailed`, `replacingMoveFailed`, `cacheAddFailed`, `replaceCleanupFailed`,
+    /// those of the cache.
     [[nodiscard]] std::expected<void, OSTErrorCode> replaceContainer(const OSTReplacement& replacement) const;
 
     // Start-up
 
-    /// Finishes or undoes the replacements that a crash interrupted. Failures are logged. Runs first, and takes no locks.
+    /// Finishes or undoes the replacements that a crash interrupted. Failures are logged. Runs first, and takes no
+    /// locks.
     void containerManagerSetup() const;
 
-    /// Brings the store to order before anybody is served: what a crash left in staging goes to death row, and a first pass
-    /// destroys it. Failures are logged. Runs before requests are accepted, and so takes no locks.
+    /// Brings the store to order before anybody is served: what a crash left in staging goes to death row, and a first
+    /// pass destroys it. Failures are logged. Runs before requests are accepted, and so takes no locks.
     void containerManagerCleanup() const;
 
 private:
@@ -148,9 +153,8 @@ private:
                                                                 std::optional<std::string>& staging) const;
     [[nodiscard]] static OSTResult<OSTMetadata> _buildInStaging(const OSTContainerLookup& lookup,
                                                                 const std::string& staging);
-    [[nodiscard]] static OSTResult<void> _createTopLevelContainerDirectory(const std::string& url,
-                                                                           OSTContainerClass containerClass,
-                                                                           std::uint32_t owner);
+    [[nodiscard]] static OSTResult<void>
+    _createTopLevelContainerDirectory(const std::string& url, OSTContainerClass containerClass, std::uint32_t owner);
     [[nodiscard]] static OSTResult<void> _createSubDirectories(const std::string& url, std::uint32_t userId,
                                                                OSTContainerClass containerClass);
     [[nodiscard]] static OSTResult<void> _createDefaultDirectory(const std::string& url, std::uint16_t mode,
@@ -164,7 +168,8 @@ private:
     [[nodiscard]] static OSTResult<void> _findSides(const OSTReplacement& replacement, ReplaceOperation& operation);
     [[nodiscard]] static OSTResult<void> _checkNothingLives(const OSTReplacement& replacement,
                                                             const ReplaceOperation& operation);
-    [[nodiscard]] OSTResult<void> _parkOldContainer(const OSTReplacement& replacement, ReplaceOperation& operation) const;
+    [[nodiscard]] OSTResult<void> _parkOldContainer(const OSTReplacement& replacement,
+                                                    ReplaceOperation& operation) const;
     [[nodiscard]] OSTResult<void> _putNewContainerInPlace(const OSTReplacement& replacement,
                                                           ReplaceOperation& operation) const;
     [[nodiscard]] static OSTResult<void> _forgetContainer(const OSTReplacementSide& side, const OSTMetadata& metadata);
@@ -177,8 +182,8 @@ private:
     [[nodiscard]] OSTResult<void> _recoverFromReplaceFile(const std::string& url) const;
 
     // +SandboxMapping
-    /// Tells the sandbox where the container of an identifier lies, or with no URL that there is none. False, with the reason in
-    /// the log, when that failed. Bundle classes are not the sandbox's business.
+    /// Tells the sandbox where the container of an identifier lies, or with no URL that there is none. False, with the
+    /// reason in the log, when that failed. Bundle classes are not the sandbox's business.
     static bool _setSandboxContainerMappingForUser(std::uint32_t userId, std::string_view identifier,
                                                    OSTContainerClass containerClass,
                                                    std::optional<std::string_view> url);

@@ -17,11 +17,10 @@ using platform::pathByAppending;
 
 namespace {
 
-std::string_view suffix(bool transient) {
-    return transient ? "(transient)" : "";
-}
+std::string_view suffix(bool transient) { return transient ? "(transient)" : ""; }
 
-/// A scan of a large class directory holds the mutex for long; a listener's worker that waits for it lets others be served.
+/// A scan of a large class directory holds the mutex for long; a listener's worker that waits for it lets others be
+/// served.
 std::unique_lock<std::mutex> lockCache(std::mutex& mutex) {
     std::unique_lock lock(mutex, std::try_to_lock);
     if (!lock) {
@@ -32,7 +31,8 @@ std::unique_lock<std::mutex> lockCache(std::mutex& mutex) {
 }
 
 OSTError invalidContentClass(OSTContainerClass contentClass, std::source_location where) {
-    return OSTCreateErrorAt(where, OSTErrorCode::invalidCacheInput, nullptr, "Invalid Content Class: %ld", contentClass);
+    return OSTCreateErrorAt(where, OSTErrorCode::invalidCacheInput, nullptr, "Invalid Content Class: %ld",
+                            contentClass);
 }
 
 /// Checks a record that the cache holds against the disk.
@@ -40,8 +40,8 @@ OSTResult<void> checkOnDisk(const OSTMetadata& record, bool transient, std::sour
     const auto className = pathComponentForContainerClass(record.containerClass);
     if (record.url.empty())
         return std::unexpected(OSTCreateErrorAt(where, OSTErrorCode::invalidCacheInput, nullptr,
-                                                "Cache: %@%@: Invalid URL path string: %@", className, suffix(transient),
-                                                record.url));
+                                                "Cache: %@%@: Invalid URL path string: %@", className,
+                                                suffix(transient), record.url));
     const auto metadataFile = record.metadataFileURL();
     if (!OSTFileManager::defaultManager().itemExistsAtURL(metadataFile))
         return std::unexpected(OSTCreateErrorAt(where, OSTErrorCode::cacheInconsistent, nullptr,
@@ -115,8 +115,9 @@ OSTContainerCache::allContainersForUser(std::uint32_t userId, OSTContainerClass 
     });
 }
 
-OSTResult<std::vector<std::string>>
-OSTContainerCache::allContainerIdentifiersForUser(std::uint32_t userId, OSTContainerClass contentClass, bool transient) {
+OSTResult<std::vector<std::string>> OSTContainerCache::allContainerIdentifiersForUser(std::uint32_t userId,
+                                                                                      OSTContainerClass contentClass,
+                                                                                      bool transient) {
     const auto here = std::source_location::current();
     return OSTGuarded([&]() -> OSTResult<std::vector<std::string>> {
         if (!isValidContainerClass(contentClass))
@@ -137,8 +138,8 @@ OSTResult<OSTMetadataRecord> OSTContainerCache::addContainerMetadata(OSTMetadata
     return OSTGuarded([&]() -> OSTResult<OSTMetadataRecord> {
         const auto contentClass = metadata.containerClass;
         if (!isValidContainerClass(contentClass))
-            return std::unexpected(OSTCreateError(OSTErrorCode::invalidCacheInput,
-                                                  "Invalid Metadata Content Class: %lld", contentClass));
+            return std::unexpected(
+                OSTCreateError(OSTErrorCode::invalidCacheInput, "Invalid Metadata Content Class: %lld", contentClass));
         if (url.empty())
             return std::unexpected(OSTCreateError(OSTErrorCode::invalidCacheInput, "Invalid input: URL: %@", url));
         metadata.url = url;
@@ -175,7 +176,8 @@ OSTResult<void> OSTContainerCache::removeContainerForUser(std::uint32_t userId, 
 
 OSTResult<OSTContainerCache::ClassTable*> OSTContainerCache::_tableForUserId(std::uint32_t userId,
                                                                              OSTContainerClass contentClass,
-                                                                             bool transient, std::source_location where) {
+                                                                             bool transient,
+                                                                             std::source_location where) {
     auto table = _getCacheForUserId(userId, contentClass, transient);
     if (!table)
         return std::unexpected(OSTCreateErrorAt(where, OSTErrorCode::cacheRebuildFailed, &table.error(),
@@ -194,8 +196,8 @@ OSTContainerCache::_getCacheForUserId(std::uint32_t userId, OSTContainerClass co
     if (const auto found = tables.find(key); found != tables.end())
         return &found->second;
 
-    platform::logDebug("Rebuilding container class cache: %u-%@%@", userId, pathComponentForContainerClass(contentClass),
-                       suffix(transient));
+    platform::logDebug("Rebuilding container class cache: %u-%@%@", userId,
+                       pathComponentForContainerClass(contentClass), suffix(transient));
     const auto directory =
         OSTGlobalConfiguration::sharedInstance().containerDirectoryURLForUser(userId, contentClass, transient);
     if (!directory)
@@ -203,8 +205,8 @@ OSTContainerCache::_getCacheForUserId(std::uint32_t userId, OSTContainerClass co
     return &tables.emplace(key, OST_TRY(_readClassDirectory(*directory, userId, transient))).first->second;
 }
 
-OSTResult<OSTContainerCache::ClassTable>
-OSTContainerCache::_readClassDirectory(const std::string& directory, std::uint32_t userId, bool transient) {
+OSTResult<OSTContainerCache::ClassTable> OSTContainerCache::_readClassDirectory(const std::string& directory,
+                                                                                std::uint32_t userId, bool transient) {
     const auto& files = OSTFileManager::defaultManager();
     const auto items = OST_TRY(files.urlsForItemsInDirectoryAtURL(directory));
     const auto open = OST_TRY(files.openDirectoryAtURL(directory));
@@ -217,7 +219,8 @@ OSTContainerCache::_readClassDirectory(const std::string& directory, std::uint32
                                          OSTSmallDictionaryFileSize, buffer);
         auto metadata = OSTMetadata::readAndValidateMetadataAtUrl(
             read ? OSTResult<std::string_view>(buffer)
-                 : std::unexpected(OSTCreatePOSIXError(read.error(), "read of %@ failed: %s", url, std::strerror(read.error()))),
+                 : std::unexpected(
+                       OSTCreatePOSIXError(read.error(), "read of %@ failed: %s", url, std::strerror(read.error()))),
             url, userId, OSTCheckClassPath::yes);
         // An item that is no valid container is passed over; the log has the reason.
         if (!metadata)

@@ -8,8 +8,8 @@
 #include <functional>
 #include <map>
 #include <mutex>
-#include <string>
 #include <source_location>
+#include <string>
 #include <string_view>
 #include <unordered_set>
 #include <utility>
@@ -17,20 +17,22 @@
 
 namespace ost {
 
-/// The metadata records of all containers, by user, class and identifier, so that a look-up does not scan a class directory.
+/// The metadata records of all containers, by user, class and identifier, so that a look-up does not scan a class
+/// directory.
 ///
-/// The table of a user and class is read from disk at its first use and then lives as long as the daemon; whoever makes, moves
-/// or deletes a container tells the cache. One record for each identifier: a later one takes the place of an earlier one.
-/// Records are shared and never change; a change is a new record, added in place of the old one.
+/// The table of a user and class is read from disk at its first use and then lives as long as the daemon; whoever
+/// makes, moves or deletes a container tells the cache. One record for each identifier: a later one takes the place of
+/// an earlier one. Records are shared and never change; a change is a new record, added in place of the old one.
 ///
-/// Threads: any. A mutex guards the tables, the scan of a class directory included; checks on disk of what was found run
-/// outside it. An exception inside an operation becomes `exceptionCaught`.
+/// Threads: any. A mutex guards the tables, the scan of a class directory included; checks on disk of what was found
+/// run outside it. An exception inside an operation becomes `exceptionCaught`.
 class OSTContainerCache {
 public:
     static OSTContainerCache& sharedInstance();
 
-    /// Finds a container by its identifier. Fails with `invalidCacheInput`, `cacheRebuildFailed`, `notFound` (not logged), or
-    /// `cacheInconsistent` when the container's metadata file has gone from the disk; the record then stays.
+    /// Finds a container by its identifier. Fails with `invalidCacheInput`, `cacheRebuildFailed`, `notFound` (not
+    /// logged), or `cacheInconsistent` when the container's metadata file has gone from the disk; the record then
+    /// stays.
     [[nodiscard]] OSTResult<OSTMetadataRecord> containerForUser(std::uint32_t userId, OSTContainerClass contentClass,
                                                                 std::string_view identifier, bool transient);
 
@@ -46,8 +48,8 @@ public:
     [[nodiscard]] OSTResult<std::vector<std::string>>
     allContainerIdentifiersForUser(std::uint32_t userId, OSTContainerClass contentClass, bool transient);
 
-    /// Puts `metadata`, found at `url` from now on, into the table of the user and the record's class. Gives the record as it
-    /// is held. Fails with `invalidCacheInput` or `cacheRebuildFailed`.
+    /// Puts `metadata`, found at `url` from now on, into the table of the user and the record's class. Gives the record
+    /// as it is held. Fails with `invalidCacheInput` or `cacheRebuildFailed`.
     [[nodiscard]] OSTResult<OSTMetadataRecord> addContainerMetadata(OSTMetadata metadata, std::uint32_t userId,
                                                                     std::string_view url, bool transient);
 

@@ -29,8 +29,6 @@ OSTStoreDelegate& OSTStoreDelegate::shared() {
     return delegate ? *delegate : nobody;
 }
 
-void OSTStoreDelegate::join(OSTStoreDelegate& delegate) {
-    joined = &delegate;
-}
+void OSTStoreDelegate::join(OSTStoreDelegate& delegate) { joined = &delegate; }
 
 } // namespace ost

@@ -23,8 +23,8 @@ public:
     [[nodiscard]] virtual std::optional<std::string> wellknownContainerForId(std::string_view identifier,
                                                                              OSTContainerClass containerClass) = 0;
 
-    /// Forgets the code signing of an identifier and of its children: its bundle is being deleted. Failures are logged. The
-    /// caller holds the all-identifiers lock for writing.
+    /// Forgets the code signing of an identifier and of its children: its bundle is being deleted. Failures are logged.
+    /// The caller holds the all-identifiers lock for writing.
     virtual void removeCodeSigningDictionariesForIdentifierAndItsChildren(std::string_view identifier) = 0;
 
     /// Puts back what was remembered.

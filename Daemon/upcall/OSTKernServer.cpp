@@ -11,7 +11,8 @@ namespace {
 
 static_assert(std::endian::native == std::endian::little, "messages are in native byte order");
 
-constexpr std::uint32_t replyPortDisposition = 0x1f; ///< bits of the header that name the kind of the reply port's right
+constexpr std::uint32_t replyPortDisposition =
+    0x1f; ///< bits of the header that name the kind of the reply port's right
 constexpr std::uint32_t replyIdOffset = 100;
 constexpr std::int32_t unknownRequest = -303;
 
@@ -58,7 +59,8 @@ platform::UpcallReply failureReply(const platform::UpcallMessage& message, std::
 std::unique_ptr<platform::UpcallPort> OSTKernServerStart(platform::RunLoop& loop,
                                                          std::expected<platform::FileDescriptor, int> receiveRight) {
     if (!receiveRight) {
-        platform::logError("Failed to check in service %s: %s", OSTKernServiceName, std::strerror(receiveRight.error()));
+        platform::logError("Failed to check in service %s: %s", OSTKernServiceName,
+                           std::strerror(receiveRight.error()));
         return nullptr;
     }
     auto port = platform::UpcallPort::open(loop, *std::move(receiveRight), [](const platform::UpcallMessage& message) {

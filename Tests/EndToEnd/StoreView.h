@@ -23,8 +23,8 @@ using Containers = std::map<std::string, std::string>;
 /// The names in a directory, sorted; none when it is missing.
 [[nodiscard]] std::vector<std::string> namesIn(const std::filesystem::path& directory);
 
-/// What lies where nothing lies while a device is idle: in staging, on death row, among the replace files. `image` is the
-/// device's directory on the host.
+/// What lies where nothing lies while a device is idle: in staging, on death row, among the replace files. `image` is
+/// the device's directory on the host.
 [[nodiscard]] std::vector<std::string> leftovers(const std::filesystem::path& image);
 
 } // namespace ost::test

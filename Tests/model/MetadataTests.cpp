@@ -14,7 +14,8 @@
 namespace ost {
 namespace {
 
-constexpr const char* container = "/private/var/mobile/Containers/Data/Application/6D8EE0B1-0000-4000-8000-000000000001";
+constexpr const char* container =
+    "/private/var/mobile/Containers/Data/Application/6D8EE0B1-0000-4000-8000-000000000001";
 constexpr const char* uuid = "0AF3C3F1-93C5-4B9F-9C3E-0123456789AB";
 
 class Metadata : public test::DeviceTest {
@@ -27,7 +28,8 @@ protected:
     }
     static OSTResult<OSTMetadata> read(const OSTDictionary& file, std::uint32_t user = 501,
                                        std::string_view url = container) {
-        test::writeFile(platform::pathByAppending(url, OSTMetadataFileName), platform::serializeBinaryPropertyList(file));
+        test::writeFile(platform::pathByAppending(url, OSTMetadataFileName),
+                        platform::serializeBinaryPropertyList(file));
         return OSTMetadata::readAndValidateMetadataAtUrl(url, user, OSTCheckClassPath::yes);
     }
 };
@@ -80,7 +82,8 @@ TEST_F(Metadata, EachInvalidValueIsRefused) {
         {"OSTMetadataContentClass", OSTValue("2"), "Invalid metadata Class: 2 at "},
         {"OSTMetadataContentClass", OSTValue(std::uint64_t{0}), "Invalid metadata Content Class: 0 at "},
         {"OSTMetadataContentClass", OSTValue(std::uint64_t{14}), "Invalid metadata Content Class: 14 at "},
-        {"OSTMetadataPersona", OSTValue(std::uint64_t{502}), "Incorrect UserId: 502, expecting: 501 for org.example.app at "},
+        {"OSTMetadataPersona", OSTValue(std::uint64_t{502}),
+         "Incorrect UserId: 502, expecting: 501 for org.example.app at "},
         {"OSTMetadataPersona", OSTValue("501"), "Incorrect UserId: 501, expecting: 501 for org.example.app at "},
         {"OSTMetadataInfo", OSTValue(OSTArray{}), "Invalid metadata Info: () at "},
         {"OSTMetadataContentClass", OSTValue(std::uint64_t{4}), "Invalid metadata-URLs should match: "},
@@ -112,11 +115,16 @@ TEST_F(Metadata, WhatIsNoReadableDictionaryFileIsRefusedAtOnce) {
         [] {},
         [&] { test::writeFile(file, "garbage"); },
         [&] { test::writeFile(file, "<plist><array/></plist>"); },
-        [&] { test::writeFile(file, ""); std::filesystem::resize_file(file, std::uintmax_t{10} << 30U); },
+        [&] {
+            test::writeFile(file, "");
+            std::filesystem::resize_file(file, std::uintmax_t{10} << 30U);
+        },
         [&] { ASSERT_EQ(0, ::mkfifo(file.c_str(), 0666)); },
         [&] { std::filesystem::create_directory(file); },
-        [&] { test::writeFile("/elsewhere", platform::serializeBinaryPropertyList(valid()));
-              std::filesystem::create_symlink("/elsewhere", file); },
+        [&] {
+            test::writeFile("/elsewhere", platform::serializeBinaryPropertyList(valid()));
+            std::filesystem::create_symlink("/elsewhere", file);
+        },
     };
     for (const auto& place : cases) {
         std::filesystem::remove_all(container);

@@ -18,19 +18,19 @@ TEST_F(UserIdentity, IsResolvedByTheFirstRuleThatApplies) {
         std::optional<std::uint32_t> resolved;
     };
     const Case cases[] = {
-        {33, 1, 501, 33},                // bundle classes: 33, from anybody
+        {33, 1, 501, 33}, // bundle classes: 33, from anybody
         {33, 8, 0, 33},
         {1, 1, 0, std::nullopt},
         {501, 1, 501, std::nullopt},
-        {499, 12, 501, 499},             // system classes: 499
+        {499, 12, 501, 499}, // system classes: 499
         {499, 13, 0, 499},
         {1, 12, 0, std::nullopt},
-        {501, 2, 501, 501},              // a user process acts for itself
+        {501, 2, 501, 501}, // a user process acts for itself
         {1, 2, 501, 501},
         {502, 2, 501, std::nullopt},
-        {1, 0, 501, 501},                // and the class is not tested
+        {1, 0, 501, 501}, // and the class is not tested
         {501, 14, 501, 501},
-        {1, 2, 0, 501},                  // a system client: the placeholder is the mobile user
+        {1, 2, 0, 501}, // a system client: the placeholder is the mobile user
         {1, 0, 0, 501},
         {501, 2, 500, 501},
         {600, 7, 33, 600},
