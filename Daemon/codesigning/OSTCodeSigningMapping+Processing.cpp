@@ -31,7 +31,7 @@ struct OSTCodeSigningMapping::Batch {
     }
 };
 
-OSTErrorCode OSTCodeSigningMapping::processCodeSigningInfo(std::shared_ptr<const OSTDictionary> info,
+OSTErrorCode OSTCodeSigningMapping::processCodeSigningInfo(const std::shared_ptr<const OSTDictionary>& info,
                                                            std::optional<std::string_view> identifier,
                                                            const OSTRegistrationOptions& options) {
     if (!_available)
@@ -39,7 +39,7 @@ OSTErrorCode OSTCodeSigningMapping::processCodeSigningInfo(std::shared_ptr<const
     if (!identifier)
         return OSTErrorCode::noIdentifier;
     const OSTAllIdentifiersLock lock(OSTLockKind::writing);
-    const auto result = _sync([&] { return _onQueue_processCodeSigningInfo(std::move(info), *identifier, options); });
+    const auto result = _sync([&] { return _onQueue_processCodeSigningInfo(info, *identifier, options); });
     return result ? OSTErrorCode::success : result.error().code();
 }
 
@@ -52,16 +52,16 @@ OSTCodeSigningMapping::processCallerRegisteredEntitlements(std::shared_ptr<const
                                   {.registeredByCaller = true});
 }
 
-OSTResult<void> OSTCodeSigningMapping::_onQueue_processCodeSigningInfo(std::shared_ptr<const OSTDictionary> info,
+OSTResult<void> OSTCodeSigningMapping::_onQueue_processCodeSigningInfo(const std::shared_ptr<const OSTDictionary>& info,
                                                                        std::string_view identifier,
                                                                        const OSTRegistrationOptions& options) {
     // Containers are staged for deletion without locking.
     OST_ASSERT(OSTHoldsAllIdentifiersLock());
-    return OSTGuarded([&] { return _process(std::move(info), identifier, options); });
+    return OSTGuarded([&] { return _process(info, identifier, options); });
 }
 
-OSTResult<void> OSTCodeSigningMapping::_process(std::shared_ptr<const OSTDictionary> info, std::string_view identifier,
-                                                const OSTRegistrationOptions& options) {
+OSTResult<void> OSTCodeSigningMapping::_process(const std::shared_ptr<const OSTDictionary>& info,
+                                                std::string_view identifier, const OSTRegistrationOptions& options) {
     Batch batch;
     const auto stored = _entry(identifier);
     OSTCodeSigningEntry entry{.codeSigningInfo = info,

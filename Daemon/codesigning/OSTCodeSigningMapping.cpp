@@ -22,6 +22,13 @@ constexpr std::string_view systemGroupPrefix = "systemgroup.";
 constexpr const char* cachedInfoKey = "com.tamarok.Tessaly.CachedCodeSigningInfo";
 constexpr const char* cachedEntitlementsKey = "Entitlements";
 
+/// Whether a client that carries the entitlements would change nothing by registering itself again.
+bool isOwnRegistration(const OSTCodeSigningEntry& entry, const std::shared_ptr<const OSTDictionary>& entitlements) {
+    const auto* const held = entry.codeSigningInfo->size() == 1 ? entry.entitlements() : nullptr;
+    return held && entitlements && (held == entitlements.get() || *held == *entitlements) && !entry.invalid &&
+           !entry.placeholder && !entry.childBundleIdentifiers && entry.dataContainerClass == 0;
+}
+
 } // namespace
 
 constinit const OSTGroupKeys OSTGroupKeys::application{"com.tamarok.security.application-groups", nullptr};
@@ -50,6 +57,14 @@ bool OSTCodeSigningMapping::identifierHasCallerRegisteredEntitlements(std::strin
     return _sync([&] {
         const auto entry = _entry(identifier);
         return entry && entry->registeredByCaller;
+    });
+}
+
+bool OSTCodeSigningMapping::callerIsToBeRegistered(std::string_view identifier,
+                                                   const std::shared_ptr<const OSTDictionary>& entitlements) {
+    return _sync([&] {
+        const auto entry = _onQueue_codeSigningInfoForIdentifier(identifier, Request::internal);
+        return !entry || (entry->registeredByCaller && !isOwnRegistration(*entry, entitlements));
     });
 }
 

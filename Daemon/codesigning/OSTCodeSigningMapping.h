@@ -59,6 +59,11 @@ public:
     /// Whether the identifier has code-signing information, an invalid or placeholder one included.
     [[nodiscard]] bool codeSigningInfoExistForIdentifier(std::string_view identifier);
     [[nodiscard]] bool identifierHasCallerRegisteredEntitlements(std::string_view identifier);
+    /// Whether `processCallerRegisteredEntitlements` is to be called for a client, and would change anything: nobody
+    /// has registered the identifier, or the client itself did so, with other entitlements. One turn on the queue, and
+    /// no lock, for what every request asks.
+    [[nodiscard]] bool callerIsToBeRegistered(std::string_view identifier,
+                                              const std::shared_ptr<const OSTDictionary>& entitlements);
     [[nodiscard]] bool identifierHasSystemContainer(std::string_view identifier);
     /// The class of the identifier's data container, 0 when none is known.
     [[nodiscard]] std::uint64_t dataContainerTypeForIdentifier(std::string_view identifier);
@@ -71,7 +76,7 @@ public:
 
     /// Registers code-signing information, or with none removes the identifier. Gives `success`, `noIdentifier`,
     /// `mappingWriteFailed` (memory keeps the change), `exceptionCaught`, or 0 when the mapping is unavailable.
-    [[nodiscard]] OSTErrorCode processCodeSigningInfo(std::shared_ptr<const OSTDictionary> info,
+    [[nodiscard]] OSTErrorCode processCodeSigningInfo(const std::shared_ptr<const OSTDictionary>& info,
                                                       std::optional<std::string_view> identifier,
                                                       const OSTRegistrationOptions& options);
     /// Registers the entitlements that a client carries. Codes as above.
@@ -149,11 +154,11 @@ private:
     [[nodiscard]] GroupList _onQueue_appGroupIdentifiersForIdentifier(std::string_view identifier);
     [[nodiscard]] GroupList _onQueue_systemGroupIdentifiersForIdentifier(std::string_view identifier);
     /// The same, with an exception as an error.
-    [[nodiscard]] OSTResult<void> _onQueue_processCodeSigningInfo(std::shared_ptr<const OSTDictionary> info,
+    [[nodiscard]] OSTResult<void> _onQueue_processCodeSigningInfo(const std::shared_ptr<const OSTDictionary>& info,
                                                                   std::string_view identifier,
                                                                   const OSTRegistrationOptions& options);
-    [[nodiscard]] OSTResult<void> _process(std::shared_ptr<const OSTDictionary> info, std::string_view identifier,
-                                           const OSTRegistrationOptions& options);
+    [[nodiscard]] OSTResult<void> _process(const std::shared_ptr<const OSTDictionary>& info,
+                                           std::string_view identifier, const OSTRegistrationOptions& options);
     struct Batch;
     void _linkToParent(std::string_view identifier, const std::string& parent, Batch& batch);
     void _releaseSystemContainer(std::string_view identifier, const OSTDictionary* newEntitlements);

@@ -34,14 +34,14 @@ OSTCaughtException OSTCaughtException::current() {
     } catch (const std::exception& exception) {
         caught.reason = exception.what();
     } catch (...) {
-        // An exception of another kind has no reason to give.
+        caught.reason.clear(); // one of another kind has no reason to give
     }
     return caught;
 }
 
 std::string OSTUncaughtExceptionReport(const OSTCaughtException& exception) {
     std::string report = "** INTERNAL ERROR: Uncaught Exception **\nException: ";
-    if (const std::string thread = platform::currentThreadName(); !thread.empty())
+    if (const auto thread = platform::currentThreadName(); !thread.empty())
         report += "<" + thread + "> ";
     if (!exception.name.empty())
         report += exception.name + ": ";

@@ -30,6 +30,10 @@ std::expected<RawCodeSignature, int> readCodeSignature(int fd, std::span<char> b
     struct stat status{};
     if (::fstat(fd, &status) != 0)
         return std::unexpected(errno);
+    return readCodeSignature(fd, status, buffer);
+}
+
+std::expected<RawCodeSignature, int> readCodeSignature(int fd, const struct stat& status, std::span<char> buffer) {
     RawCodeSignature signature{.bytes = {}, .device = status.st_dev};
     if (!isTrustworthy(status))
         return signature;

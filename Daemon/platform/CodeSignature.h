@@ -3,6 +3,7 @@
 #include "platform/FileDescriptor.h"
 #include "platform/OSTValue.h"
 
+#include <sys/stat.h>
 #include <sys/types.h>
 
 #include <cstddef>
@@ -37,6 +38,9 @@ struct RawCodeSignature {
 /// Reads the signature of the open program `fd` into `buffer`. It does not count unless the file is a regular one of
 /// root that nobody else may write. Fails with the errno of reading it.
 [[nodiscard]] std::expected<RawCodeSignature, int> readCodeSignature(int fd, std::span<char> buffer);
+/// The same for a caller that has just asked for the file's status.
+[[nodiscard]] std::expected<RawCodeSignature, int> readCodeSignature(int fd, const struct stat& status,
+                                                                     std::span<char> buffer);
 
 /// Whether the open file `fd` lies on a file system whose content, owners and attributes included, is what an
 /// unprivileged user says: one mounted by a user with the help of FUSE.

@@ -28,7 +28,7 @@ class IPCConnectionRegistry;
 
 /// What a client may cost before it loses its connection.
 struct IPCLimits {
-    std::size_t connections = 4096;         ///< in all: two descriptors each
+    std::size_t connections = 4096;         ///< in all: three descriptors each
     std::size_t connectionsOfOneUser = 256; ///< of a user id above 0, so that no user can take them all
     std::uint32_t payload = IPCFrameHeader::maximumPayload;
     std::size_t unreadReplies = 64 * 1024 * 1024;                   ///< bytes kept for a client that does not read

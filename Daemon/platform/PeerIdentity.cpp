@@ -60,19 +60,32 @@ std::expected<PeerIdentity, int> PeerIdentity::ofSocket(int socket) {
 }
 
 std::expected<const CodeSigningIdentity*, int> PeerIdentity::codeSigningIdentity() {
-    if (!_process)
-        return std::unexpected(ESRCH);
-    const FileDescriptor program(::openat(_process.get(), "exe", O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY));
-    if (!program)
-        return std::unexpected(errno);
+    const auto status = OST_TRY(_holdProgram());
     std::array<char, maximumCodeSignature> buffer;
-    const auto signature = OST_TRY(readCodeSignature(program.get(), buffer));
+    const auto signature = OST_TRY(readCodeSignature(_program.get(), status, buffer));
     if (signature.bytes != _raw || signature.device != _device) {
-        _identity = isOnUserFileSystem(program.get()) ? CodeSigningIdentity{} : parseCodeSignature(signature.bytes);
+        _identity = isOnUserFileSystem(_program.get()) ? CodeSigningIdentity{} : parseCodeSignature(signature.bytes);
         _raw = signature.bytes;
         _device = signature.device;
     }
     return &_identity;
+}
+
+/// Holds the program that the process runs now, and gives its status. Opening it at every request would cost more than
+/// the rest of this file; a file that is held open keeps its number, so looking at that tells whether it is still the
+/// one.
+std::expected<struct stat, int> PeerIdentity::_holdProgram() {
+    if (!_process)
+        return std::unexpected(ESRCH);
+    struct stat status{};
+    if (::fstatat(_process.get(), "exe", &status, 0) != 0)
+        return std::unexpected(errno);
+    if (_program && status.st_dev == _programStatus.st_dev && status.st_ino == _programStatus.st_ino)
+        return status;
+    _program.reset(::openat(_process.get(), "exe", O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY));
+    if (!_program || ::fstat(_program.get(), &_programStatus) != 0)
+        return std::unexpected(errno);
+    return _programStatus;
 }
 
 } // namespace ost::platform

@@ -3,6 +3,7 @@
 #include "platform/CodeSignature.h"
 #include "platform/FileDescriptor.h"
 
+#include <sys/stat.h>
 #include <sys/types.h>
 
 #include <cstdint>
@@ -18,7 +19,7 @@ namespace ost::platform {
 /// The process is pinned when the connection is accepted: an open directory of /proc names that very process for as
 /// long as it is open, so an id that is given to another process is never mistaken for the peer.
 ///
-/// Threads: one at a time. Ownership: a value that owns its descriptor.
+/// Threads: one at a time. Ownership: a value that owns its descriptors.
 class PeerIdentity {
 public:
     /// Pins the peer of a connected Unix socket. A peer that has gone already is pinned to nobody. Fails with an errno
@@ -33,16 +34,23 @@ public:
     /// next call. Fails with an errno when the program cannot be determined: ESRCH when the process has ended.
     [[nodiscard]] std::expected<const CodeSigningIdentity*, int> codeSigningIdentity();
 
-    /// Gives the descriptor back; no program can be determined any more.
-    void unpin() { _process.reset(); }
+    /// Gives the descriptors back; no program can be determined any more.
+    void unpin() {
+        _process.reset();
+        _program.reset();
+    }
 
 private:
     PeerIdentity(pid_t processId, uid_t effectiveUserId, FileDescriptor process)
         : _processId(processId), _effectiveUserId(effectiveUserId), _process(std::move(process)) {}
 
+    [[nodiscard]] std::expected<struct stat, int> _holdProgram();
+
     pid_t _processId;
     uid_t _effectiveUserId;
     FileDescriptor _process; ///< the process's directory in /proc; empty when it had ended
+    FileDescriptor _program; ///< the program that was last asked for, open
+    struct stat _programStatus{};
     // The signature last read, where from, and what it says.
     std::string _raw;
     dev_t _device = 0;

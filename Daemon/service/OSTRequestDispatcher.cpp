@@ -75,8 +75,7 @@ Grant grantFor(const OSTDictionary& entitlements, std::string_view required) {
 void registerCaller(const platform::CodeSigningIdentity& caller) {
     auto& mapping = OSTCodeSigningMapping::sharedInstance();
     const auto& identifier = caller.identifier;
-    if (identifier && !mapping.identifierHasCallerRegisteredEntitlements(*identifier) &&
-        mapping.codeSigningInfoExistForIdentifier(*identifier))
+    if (identifier && !mapping.callerIsToBeRegistered(*identifier, caller.entitlements))
         return;
     const auto code = mapping.processCallerRegisteredEntitlements(caller.entitlements, identifier);
     if (code != OSTErrorCode::success)

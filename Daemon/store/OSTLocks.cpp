@@ -14,6 +14,7 @@
 #include <memory>
 #include <mutex>
 #include <shared_mutex>
+#include <thread>
 
 namespace ost {
 
@@ -49,6 +50,22 @@ thread_local bool furtherLocksForbidden = false;
 
 const char* nameOf(OSTLockKind kind) { return kind == OSTLockKind::writing ? "writing" : "reading"; }
 
+/// How often a waiter looks again before it sleeps. A look-up holds the lock for a few microseconds, for less than it
+/// takes to fall asleep and be woken; on a single processor nobody gives it back meanwhile.
+const unsigned looksBeforeSleep = std::thread::hardware_concurrency() > 1 ? 16 : 0;
+
+template<typename Predicate>
+bool comesSoon(std::unique_lock<std::mutex>& lock, Predicate predicate) {
+    for (unsigned look = 0; look < looksBeforeSleep; ++look) {
+        lock.unlock();
+        std::this_thread::yield();
+        lock.lock();
+        if (predicate())
+            return true;
+    }
+    return false;
+}
+
 /// How long a waiter may keep its worker to itself: longer than a look-up holds the lock, so that a busy daemon does
 /// not wake one worker after another only to see them wait too.
 constexpr std::chrono::microseconds shortWait{500};
@@ -56,7 +73,7 @@ constexpr std::chrono::microseconds shortWait{500};
 /// Waits for `condition`; a wait that is no longer short does not keep a listener's worker from serving others.
 template<typename Predicate>
 void wait(std::condition_variable& condition, std::unique_lock<std::mutex>& lock, Predicate predicate) {
-    if (predicate() || condition.wait_for(lock, shortWait, predicate))
+    if (predicate() || comesSoon(lock, predicate) || condition.wait_for(lock, shortWait, predicate))
         return;
     const platform::BlockingSection blocking;
     condition.wait(lock, predicate);

@@ -93,8 +93,12 @@ TEST_F(CodeSigningProcessing, ChildrenAreLinkedToTheirParentAndDroppedWithTheirE
     ASSERT_EQ(OSTErrorCode::success, registerEntitlements(app, appGroups({"g"}), {.parentBundleIdentifier = app}));
     EXPECT_EQ(Identifiers({"b", "a", "early"}), childrenOnDisk(app)) << "carried over; nobody is its own child";
 
+    EXPECT_FALSE(writes([] { return registerEntitlements(app, appGroups({"g"}), {.parentBundleIdentifier = app}); }));
+    ASSERT_EQ(OSTErrorCode::success, registerEntitlements("other", OSTDictionary(), {.parentBundleIdentifier = app}));
+    ASSERT_EQ(OSTErrorCode::success, remove("other"));
+
     ASSERT_EQ(OSTErrorCode::success, remove("a"));
-    EXPECT_EQ(Identifiers({"b", "a", "early"}), childrenOnDisk(app));
+    EXPECT_EQ(Identifiers({"b", "a", "early", "other"}), childrenOnDisk(app));
     ASSERT_EQ(OSTErrorCode::success, registerEntitlements(app, appGroups({"g"})));
     EXPECT_EQ(Identifiers({"b", "early"}), childrenOnDisk(app)) << "dropped the next time the parent is processed";
     for (const auto* child : {"b", "early"})
