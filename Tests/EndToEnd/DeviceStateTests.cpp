@@ -109,11 +109,15 @@ TEST_F(DeviceStateTest, TheUpcallPortAnswersAndOutlivesADaemon) {
 
 TEST_F(DeviceStateTest, AnOrderlyEndFinishesWhatIsUnderWay) {
     const auto deathRow = device().image() / "private/var/root/Library/Caches/com.tamarok.ostrandd/Dead";
+    const auto heap = device().image() / "heap";
     for (int directory = 0; directory < 50; ++directory)
         for (int file = 0; file < 100; ++file)
-            writeFile(deathRow / std::to_string(directory) / std::to_string(file), "");
+            writeFile(heap / std::to_string(directory) / std::to_string(file), "");
     auto connection = connect();
-    connection.send(request(1, {{"Command", number(4)}}) + creation(2, "com.example.a"));
+    const auto destroy = request(1, {{"Command", number(4)}});
+    EXPECT_EQ(connection.call(destroy).error(), 1U) << "the first pass is over";
+    std::filesystem::rename(heap, deathRow / "heap");
+    connection.send(destroy + creation(2, "com.example.a"));
     std::map<std::uint32_t, std::uint64_t> replies;
     const auto take = [&] {
         const auto reply = connection.receive();
