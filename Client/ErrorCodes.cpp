@@ -14,6 +14,7 @@ struct CodeMeaning {
 };
 
 constexpr CodeMeaning codeMeanings[] = {
+    {0, "the daemon could not read its code-signing file, and did nothing"},
     {1, "success"},
     {4, "an item could not be moved out of the way before removal"},
     {5, "a transient container could not be removed"},

@@ -18,6 +18,12 @@ const OSTDictionary* entitlementsOf(const std::shared_ptr<const OSTDictionary>& 
     return value ? value->asDictionary() : nullptr;
 }
 
+/// The lines of all its steps go by the operation's name.
+template<typename... Arguments>
+void logOfProcessing(platform::Message<Arguments...> format, const Arguments&... arguments) {
+    platform::logAs<Arguments...>(platform::LogLevel::error, "_onQueue_processCodeSigningInfo", format, arguments...);
+}
+
 } // namespace
 
 /// Entries to be staged together, matched by position.
@@ -81,7 +87,7 @@ OSTResult<void> OSTCodeSigningMapping::_process(const std::shared_ptr<const OSTD
         _releaseGroups(identifier, entitlementsOf(info));
         batch.stage(info ? std::move(entry) : OSTCodeSigningEntry(), identifier);
     }
-    if (batch.entries.empty())
+    if (batch.entries.empty() && !_unwritten)
         return {};
     return _setCodeSigningDictionaryValues(batch.entries, batch.identifiers);
 }
@@ -105,10 +111,10 @@ void OSTCodeSigningMapping::_releaseSystemContainer(std::string_view identifier,
     const auto container = OSTContainerCache::sharedInstance().containerForUser(
         OSTSystemUserId, OSTContainerClass::dataSystem, identifier, false);
     if (!container) {
-        platform::logError("Failed to retrieve system container %@: %@", identifier, container.error());
+        logOfProcessing("Failed to retrieve system container %@: %@", identifier, container.error());
         return;
     }
-    platform::logError("Deleting system container for ID: %@ because it is no longer in the entitlements", identifier);
+    logOfProcessing("Deleting system container for ID: %@ because it is no longer in the entitlements", identifier);
     const auto staged = OSTClientConnection::sharedClientConnection().stageForDeleteContainersWithUsers(
         {.userIds = {OSTSystemUserId},
          .uuids = {(*container)->uuid},
@@ -116,7 +122,7 @@ void OSTCodeSigningMapping::_releaseSystemContainer(std::string_view identifier,
          .classes = {(*container)->containerClass},
          .useLocking = false});
     if (!staged)
-        platform::logError("Failed to destroy system container with identifier %@: %llu", identifier, staged.error());
+        logOfProcessing("Failed to destroy system container with identifier %@: %llu", identifier, staged.error());
 }
 
 void OSTCodeSigningMapping::_releaseGroups(std::string_view identifier, const OSTDictionary* newEntitlements) {

@@ -224,7 +224,8 @@ OSTCodeSigningMapping::EntryRecord OSTCodeSigningMapping::_migrateFromBundleCont
     const auto* const cached = bundle && (*bundle)->info ? (*bundle)->info->find(cachedInfoKey) : nullptr;
     if (!cached || !cached->asDictionary())
         return nullptr;
-    platform::logNotice("Migrating code signing info from bundle container upon request for %@", (*bundle)->identifier);
+    platform::logAs(platform::LogLevel::notice, "_onQueue_codeSigningInfoForIdentifier",
+                    "Migrating code signing info from bundle container upon request for %@", (*bundle)->identifier);
     OSTDictionary info = *cached->asDictionary();
     if (const auto* const entitlements = info.find(cachedEntitlementsKey))
         info.set(OSTEntitlementsKey, OSTValue(*entitlements));
@@ -236,8 +237,9 @@ OSTCodeSigningMapping::EntryRecord OSTCodeSigningMapping::_migrateFromBundleCont
     _codeSigningMappingDict.insert_or_assign((*bundle)->identifier, entry);
     _unreadableEntries.erase((*bundle)->identifier);
     if (const auto written = _writeCodeSigningMappingToDisk(); !written)
-        platform::logError("Failed to write code signing mapping to disk during current identifier migration of %@: %@",
-                           (*bundle)->identifier, written.error());
+        platform::logAs(platform::LogLevel::error, "_onQueue_codeSigningInfoForIdentifier",
+                        "Failed to write code signing mapping to disk during current identifier migration of %@: %@",
+                        (*bundle)->identifier, written.error());
     return entry;
 }
 
@@ -286,11 +288,11 @@ bool OSTCodeSigningMapping::_findGroups(std::string_view identifier, const OSTDi
     return _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements, keys.fallbackKey, groups);
 }
 
-void OSTCodeSigningMapping::iterateGroupIds(
+void OSTCodeSigningMapping::iterateGroupIdsWithKey(
     const OSTGroupKeys& keys,
     const std::function<void(const std::string& identifier, const GroupViews* groups)>& block) {
     if (!_codeSignQueue.isCurrent())
-        return _sync([&] { iterateGroupIds(keys, block); });
+        return _sync([&] { iterateGroupIdsWithKey(keys, block); });
     GroupViews groups; // One for all: copies would be most of the work.
     for (const auto& [identifier, entry] : _codeSigningMappingDict)
         block(identifier, _findGroups(identifier, entry->entitlements(), keys, groups) ? &groups : nullptr);
@@ -367,6 +369,7 @@ OSTResult<void> OSTCodeSigningMapping::_writeCodeSigningMappingToDisk() {
     const OSTDictionary dictionary(std::move(serialized));
     const auto url = _mappingFileURL();
     const auto written = OST_writeToURL(dictionary, url, OSTLargeDictionaryFileSize);
+    _unwritten = !written;
     if (!written)
         return std::unexpected(OSTCreateError(OSTErrorCode::mappingWriteFailed, written.error(),
                                               "Failed to write entitlement mapping file at %@ : %@", url, dictionary));
@@ -393,7 +396,7 @@ OSTResult<void> OSTCodeSigningMapping::_setCodeSigningDictionaryValues(const std
         platform::logDebug("Staging Code Signing Mapping for ID: %@ : %@", identifiers[i], entry);
         changed = true;
     }
-    if (!changed)
+    if (!changed && !_unwritten)
         return {};
     const auto written = _writeCodeSigningMappingToDisk();
     if (!written)

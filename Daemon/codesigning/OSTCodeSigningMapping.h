@@ -91,8 +91,9 @@ public:
     using GroupViews = std::vector<std::string_view>;
     /// Calls `block`, on the mapping's queue, with the groups of every identifier, or with null where they are absent.
     /// They are there for the call alone. From work that runs on the queue already, too.
-    void iterateGroupIds(const OSTGroupKeys& keys,
-                         const std::function<void(const std::string& identifier, const GroupViews* groups)>& block);
+    void
+    iterateGroupIdsWithKey(const OSTGroupKeys& keys,
+                           const std::function<void(const std::string& identifier, const GroupViews* groups)>& block);
 
     /// Removes the entries of an identifier and of its children, and writes the mapping. Failures are logged. The
     /// caller holds the all-identifiers lock for writing.
@@ -168,6 +169,8 @@ private:
     bool _available = false; ///< constant after construction
     // On the queue only.
     Entries _codeSigningMappingDict;
+    /// The last write failed: the next registration writes even if it changes nothing, because it is answered.
+    bool _unwritten = false;
     /// What the file holds under identifiers but is no entry: kept and written back until the identifier is registered.
     std::map<std::string, OSTValue, std::less<>> _unreadableEntries;
 };

@@ -117,17 +117,17 @@ OSTGroupManager::_copyReferenceCountSetOfType(OSTGroupType type, const std::vect
     ReferenceCounts counts;
     for (const auto& group : groups)
         counts.emplace(group, 0);
-    mapping.iterateGroupIds(type == OSTGroupType::system ? OSTGroupKeys::system : OSTGroupKeys::application,
-                            [&](const std::string& identifier, const OSTCodeSigningMapping::GroupViews* referenced) {
-                                if (!referenced)
-                                    return;
-                                platform::logAs(platform::LogLevel::debug, "_copyReferenceCountSetOfType",
-                                                "Entitlements for identifier %@ references container IDs: %@",
-                                                identifier, *referenced);
-                                for (const auto group : *referenced)
-                                    if (const auto found = counts.find(group); found != counts.end())
-                                        ++found->second;
-                            });
+    mapping.iterateGroupIdsWithKey(
+        type == OSTGroupType::system ? OSTGroupKeys::system : OSTGroupKeys::application,
+        [&](const std::string& identifier, const OSTCodeSigningMapping::GroupViews* referenced) {
+            if (!referenced)
+                return;
+            platform::logAs(platform::LogLevel::debug, "_copyReferenceCountSetOfType",
+                            "Entitlements for identifier %@ references container IDs: %@", identifier, *referenced);
+            for (const auto group : *referenced)
+                if (const auto found = counts.find(group); found != counts.end())
+                    ++found->second;
+        });
     return counts;
 }
 
@@ -151,7 +151,7 @@ void OSTGroupManager::_removeGroupContainersIfNeededforUser(std::uint32_t userId
                        userId, groupContainerClass, group, false)) {
             platform::logNotice("Last reference to group container %@ for %u is going away; removing it.", group,
                                 userId);
-            _stageForDeletion(userId, **container);
+            _stageForDeletion(userId, **container, "_removeGroupContainersIfNeededforUser");
         } else {
             platform::logDebug("Failed to retrieve group container %@ for %u : %@.  May not exist for this user", group,
                                userId, container.error());
@@ -186,11 +186,12 @@ void OSTGroupManager::_cleanupUnreferencedGroupContainersForUser(std::uint32_t u
         if (referenceCounts.at(container->identifier) > 0)
             continue;
         platform::logError("Removing group container with identifier %@ for %u", container->identifier, userId);
-        _stageForDeletion(userId, *container);
+        _stageForDeletion(userId, *container, "_cleanupUnreferencedGroupContainersForUser");
     }
 }
 
-void OSTGroupManager::_stageForDeletion(std::uint32_t userId, const OSTMetadata& container) {
+void OSTGroupManager::_stageForDeletion(std::uint32_t userId, const OSTMetadata& container,
+                                        std::string_view operation) {
     const auto staged = OSTClientConnection::sharedClientConnection().stageForDeleteContainersWithUsers(
         {.userIds = {userId},
          .uuids = {container.uuid},
@@ -198,8 +199,9 @@ void OSTGroupManager::_stageForDeletion(std::uint32_t userId, const OSTMetadata&
          .classes = {container.containerClass},
          .useLocking = false});
     if (!staged)
-        platform::logError("Failed to destroy group container with identifier %@ for %u: %llu", container.identifier,
-                           userId, staged.error());
+        platform::logAs(platform::LogLevel::error, operation,
+                        "Failed to destroy group container with identifier %@ for %u: %llu", container.identifier,
+                        userId, staged.error());
 }
 
 } // namespace ost

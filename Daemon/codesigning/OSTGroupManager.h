@@ -76,7 +76,8 @@ private:
     static void _cleanupUnreferencedGroupContainersForUser(std::uint32_t userId,
                                                            const std::vector<OSTMetadataRecord>& containers,
                                                            const ReferenceCounts& referenceCounts);
-    static void _stageForDeletion(std::uint32_t userId, const OSTMetadata& container);
+    /// `operation` is whose name a failure is logged under.
+    static void _stageForDeletion(std::uint32_t userId, const OSTMetadata& container, std::string_view operation);
 };
 
 } // namespace ost

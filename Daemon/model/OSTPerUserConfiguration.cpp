@@ -5,6 +5,7 @@
 #include "platform/Log.h"
 #include "platform/Path.h"
 
+#include <cerrno>
 #include <climits>
 #include <cstdlib>
 
@@ -27,10 +28,14 @@ std::unique_ptr<OSTPerUserConfiguration> OSTPerUserConfiguration::withUserId(std
         return nullptr;
     }
     std::optional<std::string> home;
-    if (const auto account = platform::accountForUserId(userId))
+    if (const auto account = platform::accountForUserId(userId)) {
         home = realPath(account->home);
-    else
+    } else {
         platform::logError("Failed to getpwuid for uid: %u", userId);
+        // Accounts that cannot be read now, for want of a descriptor, say nothing for good.
+        if (account.error() != ENOENT)
+            return nullptr;
+    }
     return std::unique_ptr<OSTPerUserConfiguration>(new OSTPerUserConfiguration(userId, std::move(home)));
 }
 

@@ -3,6 +3,8 @@
 #include "platform/Accounts.h"
 #include "platform/Log.h"
 
+#include <cerrno>
+#include <mutex>
 #include <optional>
 
 namespace ost {
@@ -29,18 +31,22 @@ std::optional<std::uint32_t> resolvedUserId(std::uint32_t userId, OSTContainerCl
 } // namespace
 
 std::uint32_t getCurrentMobileUserId() {
-    static const std::uint32_t mobileUserId = [] {
-        const auto account = platform::accountForName("mobile");
-        if (!account) {
-            platform::logAs(platform::LogLevel::error, "getCurrentMobileUserId",
-                            "Failed to get mobile uid. This is bad");
-            return std::uint32_t{0};
-        }
+    static std::mutex mutex;
+    static std::optional<std::uint32_t> mobileUserId;
+    const std::lock_guard lock(mutex);
+    if (mobileUserId)
+        return *mobileUserId;
+    const auto account = platform::accountForName("mobile");
+    if (account) {
         platform::logAs(platform::LogLevel::error, "getCurrentMobileUserId", "Current mobile user ID is %u",
                         account->uid);
-        return std::uint32_t{account->uid};
-    }();
-    return mobileUserId;
+    } else {
+        platform::logAs(platform::LogLevel::error, "getCurrentMobileUserId", "Failed to get mobile uid. This is bad");
+        // Accounts that cannot be read now, for want of a descriptor, say nothing for good.
+        if (account.error() != ENOENT)
+            return 0;
+    }
+    return mobileUserId.emplace(account ? account->uid : 0);
 }
 
 std::expected<std::uint32_t, OSTErrorCode> validateUserId(std::uint32_t userId, OSTContainerClass containerClass,

@@ -163,10 +163,10 @@ void IPCConnection::_checkDeadlines() {
     {
         const std::lock_guard lock(_mutex);
         frame = passed(_frameDeadline);
-        if (passed(_replyDeadline))
+        if (passed(_replyDeadline)) {
             logError("connection of pid %d closed: it does not take its replies", _peer.processId());
-        if (passed(_replyDeadline) || passed(_endDeadline))
             _endWith(End::broken);
+        }
     }
     if (frame)
         _refuse("a frame that does not arrive");
@@ -294,18 +294,15 @@ void IPCConnection::_endWith(End end) {
         return;
     _end.store(end);
     _frameDeadline.reset();
-    if (end >= End::cancelled) {
+    if (end >= End::cancelled)
         _repliesEnd = std::min(_repliesEnd, _firstUnhandled.load());
-        if (!_endDeadline)
-            _endDeadline = Clock::now() + _surroundings.limits.end;
-    }
     _updateDeadline();
     _surroundings.pool.post(shared_from_this(), attentionEvent);
 }
 
 void IPCConnection::_updateDeadline() {
     std::optional<Time> earliest;
-    for (const auto& deadline : {_frameDeadline, _replyDeadline, _endDeadline})
+    for (const auto& deadline : {_frameDeadline, _replyDeadline})
         if (deadline && (!earliest || *deadline < *earliest))
             earliest = deadline;
     if (earliest == _deadline)
@@ -324,7 +321,7 @@ void IPCConnection::_close() {
             return;
         if (_watch != WorkerPool::Watch::none)
             _surroundings.pool.remove(_watch, _socket.get());
-        _frameDeadline = _replyDeadline = _endDeadline = std::nullopt;
+        _frameDeadline = _replyDeadline = std::nullopt;
         _updateDeadline();
         _unsent.clear();
         _end.store(End::broken);

@@ -35,7 +35,6 @@ struct IPCLimits {
     std::chrono::milliseconds takeReply = std::chrono::seconds(30); ///< to take a reply that the socket cannot hold
     std::chrono::milliseconds completeFrame =
         std::chrono::seconds(30);                                    ///< to send a frame whose first byte has arrived
-    std::chrono::milliseconds end = std::chrono::seconds(30);        ///< for replies to earlier requests after a cancel
     std::chrono::milliseconds acceptAgain = std::chrono::seconds(1); ///< pause when the process is out of descriptors
 };
 
@@ -153,7 +152,6 @@ private:
     std::size_t _sentOfFirst = 0; ///< bytes of the first one that the socket has taken
     std::optional<Time> _frameDeadline;
     std::optional<Time> _replyDeadline;
-    std::optional<Time> _endDeadline;
     std::optional<Time> _deadline; ///< the earliest, as the timer knows it
 };
 

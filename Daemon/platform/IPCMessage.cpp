@@ -69,6 +69,16 @@ void IPCReply::set(std::string_view key, std::span<const UUID> values) {
         value.uuid(uuid);
 }
 
+void IPCReply::clear() {
+    _frame.resize(headerRoom);
+    _count = 0;
+}
+
+bool IPCReply::fits() const {
+    constexpr std::size_t longestMapHead = 9;
+    return _frame.size() - headerRoom <= IPCFrameHeader::maximumPayload - longestMapHead;
+}
+
 void IPCReply::send() {
     OST_ASSERT(_connection);
     std::string head;

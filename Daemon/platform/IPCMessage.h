@@ -81,6 +81,12 @@ public:
     /// else with the reply.
     [[nodiscard]] CBOREncoder encoder(std::string_view key);
 
+    /// Takes back what was set.
+    void clear();
+
+    /// Whether a frame holds what was set.
+    [[nodiscard]] bool fits() const;
+
     /// Sends the reply, once; never waits. Does nothing when the connection is gone, or was cancelled by this request
     /// or an earlier one.
     void send();

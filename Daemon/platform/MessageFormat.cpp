@@ -1,6 +1,8 @@
 #include "platform/MessageFormat.h"
 
 #include "platform/Assert.h"
+
+#include <algorithm>
 #include <charconv>
 
 namespace ost::platform {
@@ -24,6 +26,26 @@ std::size_t printableSequence(std::string_view text) {
     const bool overlong = (first == 0xe0 && second < 0xa0) || (first == 0xf0 && second < 0x90);
     const bool outOfRange = (first == 0xed && second >= 0xa0) || (first == 0xf4 && second >= 0x90);
     return secondControlBlock || overlong || outOfRange ? 0 : length;
+}
+
+/// What a message shows of one text: every path and identifier of ordinary length, and not so much that a client could
+/// fill the log with a few requests.
+constexpr std::size_t longestText = 8192;
+
+/// Appends as much of `text`, escaped, as a message shows.
+void appendShown(std::string& out, std::string_view text) {
+    const auto begin = out.size();
+    appendEscaped(out, text.substr(0, longestText));
+    if (out.size() - begin <= longestText && text.size() <= longestText)
+        return;
+    // Not within a sequence that stands for one character.
+    auto end = std::min(out.size(), begin + longestText);
+    while (end > begin && (static_cast<unsigned char>(out[end - 1]) & 0xc0) == 0x80)
+        --end;
+    if (end > begin && static_cast<unsigned char>(out[end - 1]) >= 0xc0)
+        --end;
+    out.resize(end);
+    out += "...";
 }
 
 void appendNumber(std::string& out, auto value, int base) {
@@ -74,7 +96,7 @@ void MessageArgument::appendTo(std::string& out, char conversion) const {
     const int base = conversion == 'x' || conversion == 'p' ? 16 : 10;
     switch (_kind) {
     case Kind::text:
-        appendEscaped(out, _text);
+        appendShown(out, _text);
         break;
     case Kind::signedNumber:
         appendNumber(out, _signed, base);

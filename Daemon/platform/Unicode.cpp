@@ -48,6 +48,15 @@ std::optional<char32_t> takeCodePoint(std::string_view& text) {
     return valid ? std::optional(codePoint) : std::nullopt;
 }
 
+bool isValidUTF8(std::string_view text) {
+    if (isASCII(text))
+        return true;
+    while (!text.empty())
+        if (!takeCodePoint(text))
+            return false;
+    return true;
+}
+
 void appendUTF8(std::string& out, char32_t codePoint) {
     const auto append = [&](char32_t byte) { out += static_cast<char>(byte); };
     const auto appendTail = [&](unsigned shift) { append(0x80 | (codePoint >> shift & 0x3f)); };

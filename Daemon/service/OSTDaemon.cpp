@@ -57,7 +57,7 @@ OSTDaemon::OSTDaemon() : _sockets(platform::ActivatedSockets::fromEnvironment())
 OSTDaemon::~OSTDaemon() = default;
 
 bool OSTDaemon::start() {
-    const platform::Transaction transaction("start-up");
+    platform::Transaction transaction("start-up");
     _openLog();
     logAs(LogLevel::debug, "main", "ostrandd built at %s %s started", __DATE__, __TIME__);
     if (!_createQueues()) {
@@ -84,6 +84,7 @@ bool OSTDaemon::start() {
         set_first_boot_work_completed();
     }
     store.containerManagerCleanup();
+    transaction.end();
     _startListener();
     return true;
 }
@@ -166,8 +167,10 @@ void OSTDaemon::_finish() {
     OSTLockStateQueue().stop();
     if (platform::Transactions::shared().waitUntilNone(deadline) && requestsDone)
         return;
-    logAs(LogLevel::error, "main", "Ending although still open: %@%s", platform::Transactions::shared().describeOpen(),
-          requestsDone ? "" : ", a client's request");
+    auto open = platform::Transactions::shared().describeOpen();
+    if (!requestsDone)
+        open += open.empty() ? "a client's request" : ", a client's request";
+    logAs(LogLevel::error, "main", "Ending although still open: %@", open);
     ::_exit(0);
 }
 

@@ -4,6 +4,7 @@
 #include "model/OSTFailureReport.h"
 #include "platform/Log.h"
 
+#include <cerrno>
 #include <cstring>
 #include <string_view>
 
@@ -83,6 +84,19 @@ void registerCaller(const platform::CodeSigningIdentity& caller) {
                         "Error processing entitlements for %@ : %llu", identifier, code);
 }
 
+/// Sends the reply with the handler's code, or with the reason why there is no more to it than a code.
+void answer(platform::IPCReply& reply, const OSTResult<OSTErrorCode>& code) {
+    if (!code) // an exception may have left half an entry
+        reply.clear();
+    reply.set("ReplyError", static_cast<std::uint64_t>(code ? *code : code.error().code()));
+    if (!reply.fits()) {
+        logError("A reply is too long to be sent");
+        reply.clear();
+        reply.set("ReplyError", std::uint64_t{EMSGSIZE});
+    }
+    reply.send();
+}
+
 } // namespace
 
 std::optional<OSTClientConnection> checkEntitlementsAndInitClientObject(platform::PeerIdentity& peer,
@@ -93,6 +107,8 @@ std::optional<OSTClientConnection> checkEntitlementsAndInitClientObject(platform
     if (!identity)
         logError("Failed to copy signing ID for pid %d : %@", peer.processId(), std::strerror(identity.error()));
     const auto& caller = identity ? **identity : nobody;
+    if (caller.entitlements && !caller.identifier)
+        logError("Failed to copy signing ID for pid %d : %@", peer.processId(), "its signature has none");
 
     if (!caller.entitlements && required == OSTEntitlementNone)
         return std::nullopt;
@@ -125,10 +141,10 @@ void OSTProcessVexelEvent(const std::shared_ptr<platform::IPCConnection>& connec
     }
     const auto code =
         OSTGuarded([&]() -> OSTResult<OSTErrorCode> { return command->handler(request, *reply, *client); });
-    if (command->replyBy == OSTReplyBy::dispatcher) {
-        reply->set("ReplyError", static_cast<std::uint64_t>(code ? *code : code.error().code()));
-        reply->send();
-    }
+    if (command->replyBy == OSTReplyBy::dispatcher)
+        answer(*reply, code);
+    else if (!code) // the handler took the reply with it
+        connection->cancel();
 }
 
 } // namespace ost

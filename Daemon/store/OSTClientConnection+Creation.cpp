@@ -3,6 +3,7 @@
 #include "platform/Path.h"
 #include "platform/UUID.h"
 #include "store/OSTClientConnection.h"
+#include "store/OSTCommitSharing.h"
 #include "store/OSTContainerCache.h"
 #include "store/OSTFileManager.h"
 #include "store/OSTLocks.h"
@@ -34,16 +35,19 @@ std::span<const std::string_view> subDirectoriesOf(OSTContainerClass containerCl
     return dataSubDirectories;
 }
 
-/// Waits until the renames that put the records' containers in place have reached the disk. Whoever made a container
-/// does so after the locks are released; whoever finds one that is not there yet does it too, since it is going to be
+bool placeIsPending(const OSTMetadata& record) { return record.pendingPlacement && *record.pendingPlacement; }
+
+/// Waits until the rename that put the record's container in place has reached the disk. Whoever made a container does
+/// so after the locks are released; whoever finds one that is not there yet does it too, since it is going to be
 /// answered.
-OSTResult<void> makePlacesDurable(std::span<const OSTMetadataRecord> records) {
-    for (const auto& record : records) {
-        if (!record->pendingPlacement || !*record->pendingPlacement)
-            continue;
-        OST_TRY(OSTFileManager::defaultManager().makeDirectoryDurable(pathByDeletingLastComponent(record->url)));
-        *record->pendingPlacement = false;
-    }
+OSTResult<void> makePlaceDurable(const OSTMetadata& record) {
+    if (!placeIsPending(record))
+        return {};
+    const auto durable = OSTFileManager::defaultManager().makeDirectoryDurable(pathByDeletingLastComponent(record.url));
+    if (!durable)
+        return std::unexpected(OSTCreateError(OSTErrorCode::moveToLiveFailed, durable.error(),
+                                              "Failed to make sure of live dir: %@", record.url));
+    *record.pendingPlacement = false;
     return {};
 }
 
@@ -60,6 +64,9 @@ std::expected<OSTMetadataRecord, OSTErrorCode>
 OSTClientConnection::createOrLookupContainerForUser(const OSTContainerLookup& lookup) const {
     const auto result = OSTGuarded([&]() -> OSTResult<OSTMetadataRecord> {
         OST_TRY(_checkLookup(lookup));
+        std::optional<OSTCommitSharing::Creation> underWay;
+        if (lookup.createIfNecessary)
+            underWay.emplace();
         OSTAllIdentifiersLock lock(OSTLockKind::writing, lookup.useLocking);
         std::optional<std::string> staging;
         auto record = OSTGuarded([&] { return _lookUpOrCreate(lookup, staging); });
@@ -69,8 +76,11 @@ OSTClientConnection::createOrLookupContainerForUser(const OSTContainerLookup& lo
                                                         "Failed to remove staging dir: %@", *staging));
         }
         lock.unlock();
+        underWay.reset();
+        if (record && placeIsPending(**record) && lookup.useLocking)
+            OSTCommitSharing::sharedInstance().letOthersCommit();
         if (record)
-            OST_TRY(makePlacesDurable({&*record, 1}));
+            OST_TRY(makePlaceDurable(**record));
         return record;
     });
     if (!result)
@@ -159,6 +169,7 @@ OSTResult<OSTMetadata> OSTClientConnection::_buildInStaging(const OSTContainerLo
     OST_TRY(_createSubDirectories(staging, lookup.userId, lookup.containerClass));
     // Last, so that one commit of the file system's journal carries the sub-directories as well.
     OST_TRY(metadata.makeMetadataDurable(std::move(pendingFile)));
+    OSTCommitSharing::sharedInstance().didCommit();
     return metadata;
 }
 
@@ -203,7 +214,8 @@ OSTClientConnection::containersForUser(std::uint32_t userId, OSTContainerClass c
         auto records =
             OST_TRY(OSTContainerCache::sharedInstance().allContainersForUser(userId, containerClass, transient));
         lock.unlock();
-        OST_TRY(makePlacesDurable(records));
+        // What may be forgotten in a power cut is not said to be there; the log has the reason.
+        std::erase_if(records, [](const OSTMetadataRecord& record) { return !makePlaceDurable(*record); });
         return records;
     });
     if (!result)

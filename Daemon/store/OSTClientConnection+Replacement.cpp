@@ -170,7 +170,7 @@ OSTResult<void> OSTClientConnection::_parkOldContainer(const OSTReplacement& rep
                                         .newURL = operation.newContainer->url,
                                         .stagingURL = operation.stagingURL,
                                         .destinationURL = operation.destination}
-                             .writeToDisk(operation.replaceFileURL);
+                             ._writeToDiskReplaceAt(operation.replaceFileURL);
     if (!written) {
         platform::logError("Failed to write replace file: %@", written.error());
         return written;
@@ -215,10 +215,12 @@ OSTResult<void> OSTClientConnection::_putNewContainerInPlace(const OSTReplacemen
         return std::unexpected(failedMove(moved.error()));
     // Before the replace file goes, which would otherwise be gone after a power cut while the move had not happened. A
     // move that cannot be made sure of is taken back.
-    const auto durable = files.makeDirectoryDurable(pathByDeletingLastComponent(destination));
-    if (!durable && files.moveItemAtURL(destination, operation.newContainer->url))
-        return std::unexpected(failedMove(durable.error()));
     operation.newIsInPlace = true;
+    const auto durable = files.makeDirectoryDurable(pathByDeletingLastComponent(destination));
+    if (!durable && files.moveItemAtURL(destination, operation.newContainer->url)) {
+        operation.newIsInPlace = false;
+        return std::unexpected(failedMove(durable.error()));
+    }
 
     OST_TRY(_forgetContainer(side, *operation.newContainer));
     if (!_setSandboxContainerMappingForUser(side.userId, *side.identifier, side.containerClass, destination))
@@ -265,6 +267,10 @@ OSTResult<void> OSTClientConnection::_restoreOldContainer(ReplaceOperation& oper
 
 OSTResult<void> OSTClientConnection::_cleanUpReplacement(const OSTReplacement& replacement,
                                                          const ReplaceOperation& operation) const {
+    // What was never made needs no place on death row, which a full disk may not have.
+    const auto& files = OSTFileManager::defaultManager();
+    if (!operation.oldIsParked && files.itemDoesNotExistAtURL(operation.replaceFileURL))
+        return {};
     std::optional<OSTError> error;
     if (const auto removed = _moveItemAtURLToDeathRow(operation.stagingURL, StartPass::no); !removed)
         error = OSTCreateError(OSTErrorCode::replaceCleanupFailed, removed.error(), "Failed to remove staging dir: %@",
@@ -303,7 +309,7 @@ OSTResult<void> OSTClientConnection::_recoverFromReplaceOperations() const {
 
 OSTResult<void> OSTClientConnection::_recoverFromReplaceFile(const std::string& url) const {
     const auto& files = OSTFileManager::defaultManager();
-    const auto file = OSTReplaceFile::readAndValidateAtURL(url);
+    const auto file = OSTReplaceFile::_readAndValidateReplaceFileAtUrl(url);
     // What is parked in staging waits with its file until that can be read again.
     if (!file && mayBeReadLater(file.error()))
         return {};

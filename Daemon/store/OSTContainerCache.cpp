@@ -6,10 +6,14 @@
 #include "platform/BlockingSection.h"
 #include "platform/Log.h"
 #include "platform/Path.h"
+#include "platform/Unicode.h"
 #include "store/OSTFileManager.h"
 
 #include <cerrno>
 #include <cstring>
+#include <future>
+#include <system_error>
+#include <thread>
 
 namespace ost {
 
@@ -48,6 +52,46 @@ OSTResult<void> checkOnDisk(const OSTMetadata& record, bool transient, std::sour
                                                 "Cache: %@%@: INCONSISTENT-No Metadata at: %@", className,
                                                 suffix(transient), metadataFile));
     return {};
+}
+
+/// The record of an item of a class directory; null, with the reason in the log, when the item is no valid container.
+OSTMetadataRecord readItem(int open, const std::string& directory, const std::string& name, std::uint32_t userId,
+                           bool transient, std::string& buffer) {
+    if (!platform::isValidUTF8(name)) { // no answer could hold its path
+        platform::logError("Skipping %@ in %@, whose name is not UTF-8", name, directory);
+        return nullptr;
+    }
+    const auto url = pathByAppending(directory, name);
+    const auto read = OSTFileManager::defaultManager().readFile(open, pathByAppending(name, OSTMetadataFileName),
+                                                                OSTSmallDictionaryFileSize, buffer);
+    auto metadata = OSTMetadata::readAndValidateMetadataAtUrl(
+        read ? OSTResult<std::string_view>(buffer)
+             : std::unexpected(
+                   OSTCreatePOSIXError(read.error(), "read of %@ failed: %s", url, std::strerror(read.error()))),
+        url, userId, OSTCheckClassPath::yes);
+    if (!metadata)
+        return nullptr;
+    metadata->transient = transient;
+    return std::make_shared<const OSTMetadata>(*std::move(metadata));
+}
+
+/// Below that many items, starting a thread takes longer than it saves.
+constexpr std::size_t itemsWorthAThread = 512;
+
+/// Calls `work` with the bounds of two halves of `count` items, side by side where that is worth it.
+void inTwoHalves(std::size_t count, const std::function<void(std::size_t first, std::size_t last)>& work) {
+    std::future<void> secondHalf;
+    const auto middle = count / 2;
+    if (count >= itemsWorthAThread && std::thread::hardware_concurrency() > 1) {
+        try {
+            secondHalf = std::async(std::launch::async, work, middle, count);
+        } catch (const std::system_error&) {
+            // No thread is to be had: one after the other, then.
+        }
+    }
+    work(0, secondHalf.valid() ? middle : count);
+    if (secondHalf.valid())
+        secondHalf.get();
 }
 
 } // namespace
@@ -210,24 +254,19 @@ OSTResult<OSTContainerCache::ClassTable> OSTContainerCache::_readClassDirectory(
     const auto& files = OSTFileManager::defaultManager();
     const auto items = OST_TRY(files.urlsForItemsInDirectoryAtURL(directory));
     const auto open = OST_TRY(files.openDirectoryAtURL(directory));
+    std::vector<OSTMetadataRecord> records(items.size());
+    const auto read = [&](std::size_t first, std::size_t last) {
+        std::string buffer;
+        for (; first < last; ++first)
+            records[first] = readItem(open.get(), directory, items[first].name, userId, transient, buffer);
+    };
+    inTwoHalves(items.size(), read);
+
     ClassTable table;
     table.reserve(items.size());
-    std::string buffer;
-    for (const auto& item : items) {
-        const auto url = pathByAppending(directory, item.name);
-        const auto read = files.readFile(open.get(), pathByAppending(item.name, OSTMetadataFileName),
-                                         OSTSmallDictionaryFileSize, buffer);
-        auto metadata = OSTMetadata::readAndValidateMetadataAtUrl(
-            read ? OSTResult<std::string_view>(buffer)
-                 : std::unexpected(
-                       OSTCreatePOSIXError(read.error(), "read of %@ failed: %s", url, std::strerror(read.error()))),
-            url, userId, OSTCheckClassPath::yes);
-        // An item that is no valid container is passed over; the log has the reason.
-        if (!metadata)
-            continue;
-        metadata->transient = transient;
-        _put(table, std::make_shared<const OSTMetadata>(*std::move(metadata)));
-    }
+    for (auto& record : records)
+        if (record)
+            _put(table, std::move(record));
     return table;
 }
 

@@ -23,14 +23,15 @@ namespace {
 /// What happens to an item that is at the destination of a copy.
 enum class Existing : unsigned { stays = RENAME_NOREPLACE, isReplaced = 0 };
 
-/// A directory beside a destination that only root enters: a copy is built there and appears in one rename. Its name is
-/// hidden, so no listing shows it. It is removed with what is left in it.
+/// A directory beside an item that only root enters. A copy is built there and appears in one rename; what has been
+/// copied disappears into one in one rename. Its name is hidden, so no listing shows it. It is removed with what is
+/// left in it.
 class Workshop {
 public:
-    static std::expected<Workshop, int> make(std::string_view destination, int parent) {
+    static std::expected<Workshop, int> make(std::string_view item, int parent) {
         auto name = OST_TRY(
             OSTMakeUnique(".temp.", [&](const char* candidate) { return ::mkdirat(parent, candidate, S_IRWXU) == 0; }));
-        std::string path = platform::pathByAppending(platform::pathByDeletingLastComponent(destination), name);
+        std::string path = platform::pathByAppending(platform::pathByDeletingLastComponent(item), name);
         auto directory = OSTOpenItem(parent, name, O_RDONLY | O_DIRECTORY);
         if (!directory) {
             ::unlinkat(parent, name.c_str(), AT_REMOVEDIR);
@@ -46,6 +47,7 @@ public:
     }
 
     [[nodiscard]] int directory() const { return _directory.get(); }
+    [[nodiscard]] const std::string& path() const { return _path; }
 
 private:
     Workshop(std::string path, FileDescriptor directory) : _path(std::move(path)), _directory(std::move(directory)) {}
@@ -54,20 +56,43 @@ private:
     FileDescriptor _directory;
 };
 
-std::expected<void, int> copy(std::string_view source, std::string_view destination, Existing existing) {
-    const auto from = OST_TRY(OSTItemPlace::find(source));
-    const auto to = OST_TRY(OSTItemPlace::find(destination));
-    const auto workshop = OST_TRY(Workshop::make(destination, to.directory()));
-    OST_TRY(OSTCopyTree(from.directory(), from.name(), workshop.directory(), to.name()));
-    if (existing == Existing::isReplaced) {
-        // A move: what a power cut may take must not be visible yet, since the source is about to go.
-        const platform::BlockingSection blocking;
-        if (::syncfs(workshop.directory()) != 0)
-            return std::unexpected(errno);
-    }
-    if (::renameat2(workshop.directory(), to.name(), to.directory(), to.name(), static_cast<unsigned>(existing)) != 0)
+/// What is on disk before the copy becomes visible, and the directory it is visible in before the source goes, survive
+/// a power cut that the removal of the source survives.
+std::expected<void, int> makeDurable(int fd, int (*sync)(int)) {
+    const platform::BlockingSection blocking;
+    if (sync(fd) != 0)
         return std::unexpected(errno);
     return {};
+}
+
+std::expected<void, int> copy(std::string_view source, std::string_view destination, Existing existing) {
+    const auto from = OST_TRY(OSTItemPlace::find(source));
+    const auto to = OST_TRY(OSTItemPlace::find(destination, O_RDONLY));
+    const auto workshop = OST_TRY(Workshop::make(destination, to.directory()));
+    OST_TRY(OSTCopyTree(from.directory(), from.name(), workshop.directory(), to.name()));
+    const bool isMove = existing == Existing::isReplaced;
+    if (isMove)
+        OST_TRY(makeDurable(workshop.directory(), ::syncfs));
+    if (::renameat2(workshop.directory(), to.name(), to.directory(), to.name(), static_cast<unsigned>(existing)) != 0)
+        return std::unexpected(errno);
+    if (isMove) {
+        const auto durable = makeDurable(to.directory(), ::fsync);
+        if (!durable) // the source stays the only one
+            ::renameat(to.directory(), to.name(), workshop.directory(), to.name());
+        return durable;
+    }
+    return {};
+}
+
+/// Removes what has been copied elsewhere: first from its place, in one step, so that whoever is interrupted leaves all
+/// of it there or nothing.
+OSTResult<void> removeSource(std::string_view source) {
+    const auto& files = OSTFileManager::defaultManager();
+    const auto from = OSTItemPlace::find(source);
+    const auto workshop = from ? Workshop::make(source, from->directory()) : std::unexpected(from.error());
+    if (!workshop || ::renameat(from->directory(), from->name(), workshop->directory(), from->name()) != 0)
+        return files.removeItemAtURL(source);
+    return files.removeItemAtURL(platform::pathByAppending(workshop->path(), from->name()));
 }
 
 OSTResult<void> copied(std::string_view source, std::string_view destination, Existing existing) {
@@ -114,7 +139,7 @@ OSTResult<void> OSTFileManager::_moveItemAtURL(std::string_view source, std::str
         return std::unexpected(OSTCreatePOSIXError(renamed.error(), "rename of %@ to %@ failed: %s", source,
                                                    destination, std::strerror(renamed.error())));
     OST_TRY(copied(source, destination, Existing::isReplaced));
-    if (const auto removed = removeItemAtURL(source); !removed)
+    if (const auto removed = removeSource(source); !removed)
         platform::logError("Failed to remove source %@ : %s", source,
                            std::strerror(static_cast<int>(removed.error().code())));
     return {};

@@ -13,7 +13,9 @@
 #include <map>
 #include <memory>
 #include <mutex>
+#include <optional>
 #include <shared_mutex>
+#include <source_location>
 #include <thread>
 
 namespace ost {
@@ -42,23 +44,45 @@ struct LockTable {
 
 LockTable gOSTLocks;
 
-/// The all-identifiers lock is not re-entrant: remembering the holder turns a deadlock into an assertion.
-thread_local bool holdsAllIdentifiers = false;
+/// The all-identifiers lock is not re-entrant: remembering what the thread holds turns a deadlock into an assertion.
+thread_local std::optional<OSTLockKind> heldOfAllIdentifiers;
 
 /// A wrong order deadlocks only when two threads meet; this finds it whenever it is taken.
 thread_local bool furtherLocksForbidden = false;
 
+/// An assertion of one of the lock functions, by whose name it goes.
+void check(bool holds, const char* condition, std::source_location function) {
+    if (!holds)
+        platform::assertionFailed(condition, function);
+}
+
 const char* nameOf(OSTLockKind kind) { return kind == OSTLockKind::writing ? "writing" : "reading"; }
 
 /// How often a waiter looks again before it sleeps. A look-up holds the lock for a few microseconds, for less than it
-/// takes to fall asleep and be woken; on a single processor nobody gives it back meanwhile.
-const unsigned looksBeforeSleep = std::thread::hardware_concurrency() > 1 ? 16 : 0;
+/// takes to fall asleep and be woken. At first the holder is taken to run on another processor, then to wait for this
+/// one; on a single processor nobody gives the lock back meanwhile.
+const unsigned looksBeforeSleep = std::thread::hardware_concurrency() > 1 ? 24 : 0;
+constexpr unsigned looksBeforeYield = 8;
+constexpr unsigned pausesInALook = 8;
+
+void pauseBeforeLook(unsigned look) {
+    if (look >= looksBeforeYield)
+        return std::this_thread::yield();
+    for (unsigned pause = 0; pause < pausesInALook; ++pause)
+#if defined(__x86_64__)
+        __builtin_ia32_pause();
+#elif defined(__aarch64__)
+        asm volatile("yield");
+#else
+        std::atomic_signal_fence(std::memory_order_seq_cst);
+#endif
+}
 
 template<typename Predicate>
 bool comesSoon(std::unique_lock<std::mutex>& lock, Predicate predicate) {
     for (unsigned look = 0; look < looksBeforeSleep; ++look) {
         lock.unlock();
-        std::this_thread::yield();
+        pauseBeforeLook(look);
         lock.lock();
         if (predicate())
             return true;
@@ -81,30 +105,32 @@ void wait(std::condition_variable& condition, std::unique_lock<std::mutex>& lock
 
 bool noIdentifierLocks() { return gOSTLocks.identifierReaderCount == 0 && gOSTLocks.identifierWriterCount == 0; }
 
-void acquire(LockRecord& record, OSTLockKind kind) {
+void acquire(LockRecord& record, OSTLockKind kind, std::source_location function) {
     if (kind == OSTLockKind::writing) {
         if (!record.lock.try_lock()) {
             const platform::BlockingSection blocking;
             record.lock.lock();
         }
         std::int32_t expected = 0;
-        OST_ASSERT(record.lockState.compare_exchange_strong(expected, -1));
+        check(record.lockState.compare_exchange_strong(expected, -1),
+              "AtomicCompareAndSwap32Barrier(0, -1, &lockPtr->lockState)", function);
     } else {
         if (!record.lock.try_lock_shared()) {
             const platform::BlockingSection blocking;
             record.lock.lock_shared();
         }
-        OST_ASSERT(++record.lockState > 0);
+        check(++record.lockState > 0, "AtomicIncrement32Barrier(&lockPtr->lockState) > 0", function);
     }
 }
 
 /// Called with the table's mutex held. Releasing never waits, so it may happen under the mutex.
-void release(LockRecord& record) {
+void release(LockRecord& record, std::source_location function) {
     if (record.lockState == -1) {
         std::int32_t expected = -1;
-        OST_ASSERT(record.lockState.compare_exchange_strong(expected, 0));
-        OST_ASSERT(gOSTLocks.allReaderWriterState == 0);
-        OST_ASSERT(gOSTLocks.identifierWriterCount > 0);
+        check(record.lockState.compare_exchange_strong(expected, 0),
+              "AtomicCompareAndSwap32Barrier(-1, 0, &lockPtr->lockState)", function);
+        check(gOSTLocks.allReaderWriterState == 0, "gOSTLocks.allReaderWriterState == 0", function);
+        check(gOSTLocks.identifierWriterCount > 0, "gOSTLocks.identifierWriterCount > 0", function);
         --gOSTLocks.identifierWriterCount;
         if (noIdentifierLocks())
             gOSTLocks.allWriterCondition.notify_one();
@@ -112,9 +138,9 @@ void release(LockRecord& record) {
             gOSTLocks.allReaderCondition.notify_all();
         record.lock.unlock();
     } else {
-        OST_ASSERT(--record.lockState >= 0);
-        OST_ASSERT(gOSTLocks.allReaderWriterState >= 0);
-        OST_ASSERT(gOSTLocks.identifierReaderCount > 0);
+        check(--record.lockState >= 0, "AtomicDecrement32Barrier(&lockPtr->lockState) >= 0", function);
+        check(gOSTLocks.allReaderWriterState >= 0, "gOSTLocks.allReaderWriterState >= 0", function);
+        check(gOSTLocks.identifierReaderCount > 0, "gOSTLocks.identifierReaderCount > 0", function);
         --gOSTLocks.identifierReaderCount;
         if (noIdentifierLocks() && gOSTLocks.allReaderWriterState == 0)
             gOSTLocks.allWriterCondition.notify_one();
@@ -132,48 +158,58 @@ std::vector<std::string_view> distinct(std::vector<std::string_view> identifiers
 } // namespace
 
 void take_one_lock(std::string_view identifier, OSTLockKind kind) {
-    OST_ASSERT(!holdsAllIdentifiers);
+    // Readers of one identifier and of all identifiers go together.
+    OST_ASSERT(!heldOfAllIdentifiers || (heldOfAllIdentifiers == OSTLockKind::reading && kind == OSTLockKind::reading));
     OST_ASSERT(!furtherLocksForbidden);
     LockRecord* record = nullptr;
     {
         std::unique_lock lock(gOSTLocks.mutex);
-        if (kind == OSTLockKind::writing) {
+        auto& count = kind == OSTLockKind::writing ? gOSTLocks.identifierWriterCount : gOSTLocks.identifierReaderCount;
+        if (kind == OSTLockKind::writing)
             wait(gOSTLocks.identifierWriterCondition, lock, [] { return gOSTLocks.allReaderWriterState == 0; });
-            ++gOSTLocks.identifierWriterCount;
-        } else {
+        else
             wait(gOSTLocks.identifierReaderCondition, lock, [] { return gOSTLocks.allReaderWriterState != -1; });
-            ++gOSTLocks.identifierReaderCount;
-        }
         auto found = gOSTLocks.identifierToLockMap.find(identifier);
         if (found == gOSTLocks.identifierToLockMap.end())
             found = gOSTLocks.identifierToLockMap.emplace(identifier, std::make_unique<LockRecord>()).first;
         record = found->second.get();
+        // Nothing fails from here on, so what is counted is also given back.
+        ++count;
         ++record->refCount;
     }
     platform::logDebug("Waiting to lock %@ for %s", identifier, nameOf(kind));
-    acquire(*record, kind);
+    acquire(*record, kind, std::source_location::current());
     platform::logDebug("Got lock on identifier %@", identifier);
 }
 
 void unlock_one_lock(std::string_view identifier) {
+    const auto here = std::source_location::current();
     const std::lock_guard lock(gOSTLocks.mutex);
     const auto found = gOSTLocks.identifierToLockMap.find(identifier);
-    OST_ASSERT(found != gOSTLocks.identifierToLockMap.end());
+    check(found != gOSTLocks.identifierToLockMap.end(), "lockPtr", here);
     LockRecord& record = *found->second;
-    OST_ASSERT(record.lockState != 0);
-    release(record);
+    check(record.lockState != 0, "lockPtr->lockState != 0", here);
+    release(record, here);
     --record.refCount;
     platform::logDebug("Unlocked identifier %@", identifier);
     if (record.refCount == 0) {
         platform::logDebug("Destroying lock for identifier %@", identifier);
-        OST_ASSERT(0 == record.lockState);
+        check(record.lockState == 0, "0 == lockPtr->lockState", here);
         gOSTLocks.identifierToLockMap.erase(found);
     }
 }
 
 void _lock_identifier(std::vector<std::string_view> identifiers, OSTLockKind kind) {
-    for (const auto identifier : distinct(std::move(identifiers), std::less<>()))
-        take_one_lock(identifier, kind);
+    const auto inOrder = distinct(std::move(identifiers), std::less<>());
+    std::size_t taken = 0;
+    try {
+        for (; taken < inOrder.size(); ++taken)
+            take_one_lock(inOrder[taken], kind);
+    } catch (...) {
+        while (taken > 0)
+            unlock_one_lock(inOrder[--taken]);
+        throw;
+    }
 }
 
 void unlock_identifier(std::vector<std::string_view> identifiers) {
@@ -182,7 +218,7 @@ void unlock_identifier(std::vector<std::string_view> identifiers) {
 }
 
 void _lock_all_identifiers(OSTLockKind kind) {
-    OST_ASSERT(!holdsAllIdentifiers);
+    OST_ASSERT(!heldOfAllIdentifiers);
     OST_ASSERT(!furtherLocksForbidden);
     platform::logDebug("Waiting to lock all identifiers for %s", nameOf(kind));
     std::unique_lock lock(gOSTLocks.mutex);
@@ -195,15 +231,17 @@ void _lock_all_identifiers(OSTLockKind kind) {
              [] { return gOSTLocks.identifierWriterCount == 0 && gOSTLocks.allReaderWriterState != -1; });
         ++gOSTLocks.allReaderWriterState;
     }
-    holdsAllIdentifiers = true;
+    heldOfAllIdentifiers = kind;
     platform::logDebug("Locked all identifiers for %s", nameOf(kind));
 }
 
 void unlock_all_identifiers() {
     {
         const std::lock_guard lock(gOSTLocks.mutex);
-        OST_ASSERT(holdsAllIdentifiers);
-        holdsAllIdentifiers = false;
+        check(gOSTLocks.allReaderWriterState != 0, "gOSTLocks.allReaderWriterState > 0",
+              std::source_location::current());
+        OST_ASSERT(heldOfAllIdentifiers);
+        heldOfAllIdentifiers.reset();
         if (gOSTLocks.allReaderWriterState == -1) {
             gOSTLocks.allReaderWriterState = 0;
             gOSTLocks.allWriterCondition.notify_one();
@@ -211,7 +249,6 @@ void unlock_all_identifiers() {
             gOSTLocks.identifierWriterCondition.notify_all();
             gOSTLocks.identifierReaderCondition.notify_all();
         } else {
-            OST_ASSERT(gOSTLocks.allReaderWriterState > 0);
             if (--gOSTLocks.allReaderWriterState == 0) {
                 gOSTLocks.identifierWriterCondition.notify_all();
                 if (noIdentifierLocks())
@@ -222,7 +259,7 @@ void unlock_all_identifiers() {
     platform::logDebug("Unlocked all identifiers");
 }
 
-bool OSTHoldsAllIdentifiersLock() { return holdsAllIdentifiers; }
+bool OSTHoldsAllIdentifiersLock() { return heldOfAllIdentifiers.has_value(); }
 
 std::size_t OSTLockRecordCount() {
     const std::lock_guard lock(gOSTLocks.mutex);

@@ -11,8 +11,8 @@ namespace ost {
 ///
 /// A writer of all identifiers excludes every other holder; a reader of all identifiers excludes identifier writers.
 /// Locks of different identifiers do not meet. Not re-entrant in any combination: a thread that holds the
-/// all-identifiers lock takes neither it nor an identifier lock. Identifiers of one call are taken in ascending order
-/// and given back in descending order, which rules out deadlock between two callers.
+/// all-identifiers lock takes neither it again nor an identifier lock of a conflicting kind. Identifiers of one call
+/// are taken in ascending order and given back in descending order, which rules out deadlock between two callers.
 ///
 /// Whoever enters something that is entered with these locks held, as the code-signing mapping's queue is, forbids
 /// itself to take one there: the order is always the lock first.

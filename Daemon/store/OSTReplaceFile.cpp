@@ -50,10 +50,10 @@ std::expected<bool, int> isPlausible(const OSTReplaceFile& file) {
 
 std::string OSTReplaceFile::urlOfToken(std::string_view token) {
     return platform::pathByAppending(OSTGlobalConfiguration::sharedInstance().replaceDirectory(),
-                                     platform::formatMessage("%@.plist", token));
+                                     std::string(token) + ".plist");
 }
 
-OSTResult<void> OSTReplaceFile::writeToDisk(const std::string& url) const {
+OSTResult<void> OSTReplaceFile::_writeToDiskReplaceAt(const std::string& url) const {
     if (oldURL.empty() || newURL.empty() || stagingURL.empty() || destinationURL.empty())
         return std::unexpected(OSTCreateError(OSTErrorCode::replaceDescriptionIncomplete,
                                               "Invalid Replace File Info: old: %@, new: %@, staging: %@, dest: %@",
@@ -66,7 +66,7 @@ OSTResult<void> OSTReplaceFile::writeToDisk(const std::string& url) const {
     return {};
 }
 
-OSTResult<OSTReplaceFile> OSTReplaceFile::readAndValidateAtURL(const std::string& url) {
+OSTResult<OSTReplaceFile> OSTReplaceFile::_readAndValidateReplaceFileAtUrl(const std::string& url) {
     const auto dictionary = OST_dictionaryWithContentsOfURL(url, OSTSmallDictionaryFileSize);
     if (!dictionary)
         return std::unexpected(OSTCreateError(OSTErrorCode::replaceFileInvalid, dictionary.error(),

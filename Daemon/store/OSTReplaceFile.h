@@ -21,11 +21,11 @@ struct OSTReplaceFile {
     [[nodiscard]] static std::string urlOfToken(std::string_view token);
 
     /// Writes the file, durably. Fails with `replaceDescriptionIncomplete` or `dictionaryWriteFailed`.
-    [[nodiscard]] OSTResult<void> writeToDisk(const std::string& url) const;
+    [[nodiscard]] OSTResult<void> _writeToDiskReplaceAt(const std::string& url) const;
 
     /// Reads the file, in either property-list encoding. One that asks for a move outside the directories of
     /// containers, or of anything but a directory in staging, is invalid. Fails with `replaceFileInvalid`.
-    [[nodiscard]] static OSTResult<OSTReplaceFile> readAndValidateAtURL(const std::string& url);
+    [[nodiscard]] static OSTResult<OSTReplaceFile> _readAndValidateReplaceFileAtUrl(const std::string& url);
 
     [[nodiscard]] std::string description() const;
 };

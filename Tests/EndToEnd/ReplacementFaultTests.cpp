@@ -169,7 +169,7 @@ protected:
                                          .newURL = _new.container.path,
                                          .stagingURL = staging,
                                          .destinationURL = _destination}
-                         .writeToDisk(file)));
+                         ._writeToDiskReplaceAt(file)));
         if (moves > 0)
             std::filesystem::rename(onHost(_old.container.path), onHost(staging));
         if (moves > 1)

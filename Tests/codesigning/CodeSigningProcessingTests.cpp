@@ -339,7 +339,7 @@ using CodeSigningProcessingDeathTest = CodeSigningProcessing;
 TEST_F(CodeSigningProcessingDeathTest, LocksInTheWrongOrderStopTheProcess) {
     ASSERT_EQ(OSTErrorCode::success, registerEntitlements(app, OSTDictionary()));
     const auto onTheQueue = [](const std::function<void()>& work) {
-        mapping().iterateGroupIds(OSTGroupKeys::application, [&](const auto&, const auto*) { work(); });
+        mapping().iterateGroupIdsWithKey(OSTGroupKeys::application, [&](const auto&, const auto*) { work(); });
     };
     EXPECT_DEATH(onTheQueue([] { makeContainer(dataApplication, app); }), "furtherLocksForbidden");
     EXPECT_DEATH(onTheQueue([] { const OSTIdentifierLock lock({app}, OSTLockKind::reading); }),

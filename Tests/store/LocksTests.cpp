@@ -143,7 +143,7 @@ TEST(LocksDeathTest, MisuseStopsTheProcess) {
             const OSTAllIdentifiersLock lock(writing);
             take_one_lock("a", reading);
         },
-        "holdsAllIdentifiers");
+        "heldOfAllIdentifiers");
     const OSTNoFurtherLocks noFurtherLocks;
     EXPECT_DEATH(_lock_all_identifiers(reading), "furtherLocksForbidden");
     EXPECT_DEATH(take_one_lock("a", reading), "furtherLocksForbidden");

@@ -125,7 +125,7 @@ TEST_F(Replacement, IsWrittenDownBeforeTheFirstMove) {
         EXPECT_TRUE(UUID::parse(parked.front()));
         const auto url = fs::path(replaceDirectory) / files.front();
         EXPECT_TRUE(test::readFile(url).starts_with("bplist00"));
-        const auto file = OSTReplaceFile::readAndValidateAtURL(url);
+        const auto file = OSTReplaceFile::_readAndValidateReplaceFileAtUrl(url);
         EXPECT_EQ(old->url, file->oldURL);
         EXPECT_EQ(fresh->url, file->newURL);
         EXPECT_EQ(fs::path(staging) / parked.front(), file->stagingURL);
@@ -138,7 +138,7 @@ TEST_F(Replacement, IsWrittenDownBeforeTheFirstMove) {
     EXPECT_FALSE(midway.restored);
 
     const OSTReplaceFile incomplete{.oldURL = "/a", .newURL = "/b", .stagingURL = "/c", .destinationURL = ""};
-    EXPECT_TRUE(incomplete.writeToDisk("/x.plist").error().is(OSTErrorCode::replaceDescriptionIncomplete));
+    EXPECT_TRUE(incomplete._writeToDiskReplaceAt("/x.plist").error().is(OSTErrorCode::replaceDescriptionIncomplete));
     EXPECT_FALSE(fs::exists("/x.plist"));
 }
 
