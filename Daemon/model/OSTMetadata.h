@@ -35,7 +35,7 @@ struct OSTMetadata {
     std::shared_ptr<const OSTDictionary> info = nullptr; ///< null when there is none
     std::string url = {};                                ///< path of the container directory
     bool transient = false;                              ///< lies in a transient directory; not in the file
-    bool existed = false; ///< was found, not made, by the look-up that gave this record; not in the file
+    bool existed = true; ///< false when the look-up that gave this record made the container; not in the file
     /// True while the rename that put the container in place may still be lost in a power cut; null for one read from
     /// disk.
     std::shared_ptr<std::atomic<bool>> pendingPlacement = nullptr;

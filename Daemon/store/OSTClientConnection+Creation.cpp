@@ -51,10 +51,10 @@ OSTResult<void> makePlaceDurable(const OSTMetadata& record) {
     return {};
 }
 
-/// A record as an answer: the shared one stays as it is.
-OSTMetadataRecord answer(const OSTMetadata& record, bool existed) {
+/// The record of a container as the answer of the look-up that made it: later ones get the shared record.
+OSTMetadataRecord asMadeNow(const OSTMetadata& record) {
     auto copy = std::make_shared<OSTMetadata>(record);
-    copy->existed = existed;
+    copy->existed = false;
     return copy;
 }
 
@@ -109,7 +109,7 @@ OSTResult<OSTMetadataRecord> OSTClientConnection::_lookUpOrCreate(const OSTConta
     const auto found = OSTContainerCache::sharedInstance().containerForUser(lookup.userId, lookup.containerClass,
                                                                             *lookup.identifier, lookup.transient);
     if (found && !lookup.transient)
-        return answer(**found, true);
+        return *found;
     if (found) {
         // A transient container is never reused.
         if (const auto removed = _moveItemAtURLToDeathRow((*found)->url, StartPass::yes); !removed)
@@ -150,7 +150,7 @@ OSTResult<OSTMetadataRecord> OSTClientConnection::_createContainer(const OSTCont
         return std::unexpected(OSTCreateError(OSTErrorCode::cacheAddFailed, added.error(),
                                               "Failed to add to cache for %u : %@, url: %@, transient: %d",
                                               lookup.userId, metadata, liveURL, lookup.transient));
-    return *added;
+    return asMadeNow(**added);
 }
 
 OSTResult<OSTMetadata> OSTClientConnection::_buildInStaging(const OSTContainerLookup& lookup,
