@@ -1,8 +1,8 @@
 #include "store/OSTFileManager.h"
 
-#include "platform/BlockingSection.h"
 #include "platform/Log.h"
 #include "platform/Path.h"
+#include "store/OSTDurability.h"
 #include "store/OSTPathResolution.h"
 #include "store/OSTTreeCopy.h"
 #include "store/OSTUniqueName.h"
@@ -56,27 +56,20 @@ private:
     FileDescriptor _directory;
 };
 
-/// What is on disk before the copy becomes visible, and the directory it is visible in before the source goes, survive
-/// a power cut that the removal of the source survives.
-std::expected<void, int> makeDurable(int fd, int (*sync)(int)) {
-    const platform::BlockingSection blocking;
-    if (sync(fd) != 0)
-        return std::unexpected(errno);
-    return {};
-}
-
 std::expected<void, int> copy(std::string_view source, std::string_view destination, Existing existing) {
     const auto from = OST_TRY(OSTItemPlace::find(source));
     const auto to = OST_TRY(OSTItemPlace::find(destination, O_RDONLY));
     const auto workshop = OST_TRY(Workshop::make(destination, to.directory()));
     OST_TRY(OSTCopyTree(from.directory(), from.name(), workshop.directory(), to.name()));
+    // A copy that is on disk before it is visible, in a directory that is on disk before the source goes, survives
+    // whatever the removal of the source survives.
     const bool isMove = existing == Existing::isReplaced;
     if (isMove)
-        OST_TRY(makeDurable(workshop.directory(), ::syncfs));
+        OST_TRY(OSTWaitForDisk(workshop.directory(), ::syncfs));
     if (::renameat2(workshop.directory(), to.name(), to.directory(), to.name(), static_cast<unsigned>(existing)) != 0)
         return std::unexpected(errno);
     if (isMove) {
-        const auto durable = makeDurable(to.directory(), ::fsync);
+        const auto durable = OSTWaitForDisk(to.directory(), ::fsync);
         if (!durable) // the source stays the only one
             ::renameat(to.directory(), to.name(), workshop.directory(), to.name());
         return durable;

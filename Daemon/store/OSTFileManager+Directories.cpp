@@ -1,9 +1,9 @@
 #include "store/OSTFileManager.h"
 
 #include "platform/AccessControlList.h"
-#include "platform/BlockingSection.h"
 #include "platform/Path.h"
 #include "platform/ProtectionClass.h"
+#include "store/OSTDurability.h"
 #include "store/OSTPathResolution.h"
 #include "store/OSTUniqueName.h"
 
@@ -76,13 +76,6 @@ void giveDirectory(int directory, std::uint32_t owner) {
 bool belongsTo(int directory, std::uint32_t owner) {
     struct stat status{};
     return ::fstat(directory, &status) == 0 && status.st_uid == owner && status.st_gid == owner;
-}
-
-OSTResult<void> makeDurable(int directory, std::string_view path) {
-    const platform::BlockingSection blocking;
-    if (::fsync(directory) != 0)
-        return std::unexpected(OSTCreatePOSIXError(errno, "fsync of %@ failed: %s", path, std::strerror(errno)));
-    return {};
 }
 
 } // namespace
@@ -162,7 +155,10 @@ OSTResult<std::string> OSTFileManager::createTemporaryDirectoryInDirectoryURL(st
 
 OSTResult<void> OSTFileManager::makeDirectoryDurable(std::string_view path) const {
     const FileDescriptor directory = OST_TRY(openDirectoryAtURL(path));
-    return makeDurable(directory.get(), path);
+    if (const auto durable = OSTWaitForDisk(directory.get(), ::fsync); !durable)
+        return std::unexpected(
+            OSTCreatePOSIXError(durable.error(), "fsync of %@ failed: %s", path, std::strerror(durable.error())));
+    return {};
 }
 
 } // namespace ost

@@ -1,8 +1,8 @@
 #include "store/OSTFileManager.h"
 
 #include "platform/AccessControlList.h"
-#include "platform/BlockingSection.h"
 #include "platform/ProtectionClass.h"
+#include "store/OSTDurability.h"
 #include "store/OSTPathResolution.h"
 #include "store/OSTUniqueName.h"
 
@@ -79,13 +79,6 @@ std::expected<void, int> finish(int file, std::string_view bytes, const OSTFileA
     return {};
 }
 
-std::expected<void, int> waitForDisk(int file, int (*synchronise)(int)) {
-    const platform::BlockingSection blocking;
-    if (synchronise(file) != 0)
-        return std::unexpected(errno);
-    return {};
-}
-
 std::expected<void, int> writeAtomically(std::string_view path, std::string_view bytes,
                                          const OSTFileAttributes& attributes) {
     const auto place = OST_TRY(OSTItemPlace::find(path, O_RDONLY));
@@ -95,11 +88,11 @@ std::expected<void, int> writeAtomically(std::string_view path, std::string_view
                                   return static_cast<bool>(file);
                               })));
     OST_TRY(finish(file.get(), bytes, attributes));
-    OST_TRY(waitForDisk(file.get(), ::fdatasync));
+    OST_TRY(OSTWaitForDisk(file.get(), ::fdatasync));
     if (::renameat(place.directory(), unfinished.name(), place.directory(), place.name()) != 0)
         return std::unexpected(errno);
     unfinished.keep();
-    return waitForDisk(place.directory(), ::fsync);
+    return OSTWaitForDisk(place.directory(), ::fsync);
 }
 
 } // namespace
@@ -143,9 +136,9 @@ OSTResult<OSTNewFile> OSTFileManager::createFileAtURL(std::string_view path, std
 }
 
 OSTResult<void> OSTNewFile::makeDurable() {
-    auto durable = waitForDisk(_file.get(), ::fdatasync);
+    auto durable = OSTWaitForDisk(_file.get(), ::fdatasync);
     if (durable)
-        durable = waitForDisk(_directory.get(), ::fsync);
+        durable = OSTWaitForDisk(_directory.get(), ::fsync);
     if (!durable)
         return std::unexpected(
             OSTCreatePOSIXError(durable.error(), "fsync of %@ failed: %s", _path, std::strerror(durable.error())));
