@@ -45,7 +45,8 @@ void copyToStandardError(std::string_view line) {
     if (::poll(&out, 1, 0) != 1 || (out.revents & POLLOUT) == 0)
         return;
     // A writable pipe takes PIPE_BUF bytes without waiting, and no more than that is sure.
-    const auto shown = line.substr(0, std::min<std::size_t>(line.size(), PIPE_BUF));
+    std::string shown(line.substr(0, PIPE_BUF));
+    shown.back() = '\n';
     [[maybe_unused]] const auto written = ::write(STDERR_FILENO, shown.data(), shown.size());
 }
 

@@ -247,6 +247,17 @@ TEST_F(HostileFrameTest, NobodyForgesALogLine) {
         ASSERT_EQ(errors.size(), 1U) << PrintToString(errors);
         EXPECT_NE(errors[0].find(shown), std::string::npos) << errors[0];
     }
+    const auto size = [&] {
+        return std::filesystem::file_size(device().onHost("/private/var/root/Library/Logs/Ostrand/ostrandd.log"));
+    };
+    const auto before = size();
+    const auto reply = connect().call(request(
+        1,
+        {{"ContainerClass", number(99)}, {"UserID", number(1)}, {"Identifier", text(std::string(1U << 20U, '\n'))}}));
+    EXPECT_EQ(reply.error(), 11U);
+    EXPECT_LT(size() - before, 10'000U) << "a long text does not push the others out";
+    EXPECT_EQ(log.takeErrors().size(), 1U);
+
     const Client liar(device().socket(), {.identifier = "a\n" + forged + "\n"});
     EXPECT_TRUE(liar.connect().isRefused(request(1, {{"Command", number(1)}})));
     EXPECT_EQ(log.takeErrors().size(), 1U);

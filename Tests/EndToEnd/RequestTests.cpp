@@ -1,5 +1,6 @@
 #include "EndToEnd/DeviceLog.h"
 #include "EndToEnd/Wire.h"
+#include "model/OSTMetadata.h"
 #include "service/OSTCommandTable.h"
 #include "support/BootedDevice.h"
 
@@ -268,6 +269,24 @@ TEST_F(RequestTest, CreatesOnceFindsAndLists) {
     const auto refused = user.connect().call(request(1, {{"Command", number(1)}, {"UserID", number(501)}}));
     EXPECT_EQ(refused.error(), 11U) << "a class that does not exist is the store's to refuse";
     EXPECT_EQ(refused.keys(), "ReplyError");
+}
+
+TEST_F(RequestTest, AReplyThatNoFrameHoldsIsAnErrorAndNotTheEnd) {
+    for (char name = 'a'; name < 'a' + 17; ++name) {
+        const std::string url = "/private/var/mobile/Containers/Data/Application/" + std::string(1, name);
+        std::filesystem::create_directories(device().onHost(url));
+        ASSERT_TRUE((OSTMetadata{.uid = 501,
+                                 .uuid = platform::UUID::generate(),
+                                 .containerClass = OSTContainerClass::dataApplication,
+                                 .identifier = std::string(1'040'000, name),
+                                 .url = device().onHost(url)}
+                         .writeMetadataToDisk()));
+    }
+    const auto caller = client(allowed());
+    auto connection = caller.connect();
+    const auto listing = request(1, {{"Command", number(1)}, {"ContainerClass", number(2)}, {"UserID", number(501)}});
+    EXPECT_EQ(connection.call(listing).error(), std::uint64_t{EMSGSIZE});
+    EXPECT_EQ(connection.call(listing).keys(), "ReplyError");
 }
 
 TEST_F(RequestTest, RepliesComeInOrderUnderTheNumbersOfTheirRequests) {

@@ -93,7 +93,7 @@ TEST(ErrorCodes, areTheSystemsOwnBeforeTheyAreErrnos) {
         {static_cast<std::uint64_t>(ost::OSTErrorCode::accessControlListFailed),
          "an access control list could not be built or applied"},
         {EACCES, "system error: Permission denied"},
-        {0, "unknown code"},
+        {0, "the daemon could not read its code-signing file, and did nothing"},
         {4000, "unknown code"},
         {~std::uint64_t{0}, "unknown code"},
     };
