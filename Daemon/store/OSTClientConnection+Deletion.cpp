@@ -152,8 +152,9 @@ void OSTClientConnection::deleteContainersOnDeathRowWithCompletion(DeathRowCompl
 }
 
 std::optional<OSTError> OSTClientConnection::_emptyDeathRow() {
-    // Asked for once: a pass does not make the directory again, so one that has gone is reported.
-    static const std::string deathRow = OSTGlobalConfiguration::sharedInstance().deathrowDirectory();
+    // Asked for once: a pass does not make the directory again, so one that has gone is reported. Never destroyed: the
+    // process may end while a pass runs.
+    static const auto& deathRow = *new std::string(OSTGlobalConfiguration::sharedInstance().deathrowDirectory());
     const auto items = OSTFileManager::defaultManager().urlsForItemsInDirectoryAtURL(deathRow);
     if (!items) {
         if (items.error().isPOSIX(ENOENT))

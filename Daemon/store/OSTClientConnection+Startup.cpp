@@ -9,7 +9,8 @@
 namespace ost {
 
 OSTClientConnection& OSTClientConnection::sharedClientConnection() {
-    static OSTClientConnection connection(
+    // Never destroyed: workers may still use it while the process ends.
+    static OSTClientConnection& connection = *new OSTClientConnection(
         {.clientBundleIdentifier = "com.tamarok.ostrandd.internal", .clientUserId = 0, .allowOtherIdLookup = true});
     return connection;
 }

@@ -78,17 +78,24 @@ OSTMetadataRecord readItem(int open, const std::string& directory, const std::st
 /// Below that many items, starting a thread takes longer than it saves.
 constexpr std::size_t itemsWorthAThread = 512;
 
-/// Calls `work` with the bounds of two halves of `count` items, side by side where that is worth it.
-void inTwoHalves(std::size_t count, const std::function<void(std::size_t first, std::size_t last)>& work) {
-    std::future<void> secondHalf;
-    const auto middle = count / 2;
-    if (count >= itemsWorthAThread && std::thread::hardware_concurrency() > 1) {
-        try {
-            secondHalf = std::async(std::launch::async, work, middle, count);
-        } catch (const std::system_error&) {
-            // No thread is to be had: one after the other, then.
-        }
+/// Work on the items from one index to before another.
+using WorkOnItems = std::function<void(std::size_t first, std::size_t last)>;
+
+/// Starts the work on a thread of its own, or gives nothing when no thread is to be had.
+std::future<void> startAside(const WorkOnItems& work, std::size_t first, std::size_t last) {
+    try {
+        return std::async(std::launch::async, work, first, last);
+    } catch (const std::system_error&) {
+        return {};
     }
+}
+
+/// Calls `work` for two halves of `count` items, side by side where that is worth it.
+void inTwoHalves(std::size_t count, const WorkOnItems& work) {
+    const auto middle = count / 2;
+    auto secondHalf = count >= itemsWorthAThread && std::thread::hardware_concurrency() > 1
+                          ? startAside(work, middle, count)
+                          : std::future<void>();
     work(0, secondHalf.valid() ? middle : count);
     if (secondHalf.valid())
         secondHalf.get();

@@ -148,7 +148,7 @@ TEST_F(CodeSigningProcessing, EntitlementsOfTheWrongTypeGiveNothingAndHarmNothin
         OSTDictionary({{OSTEntitlementsKey, OSTArray{appGroups({"g"})}}}),
         OSTDictionary({{OSTEntitlementsKey, OSTDictionary({{OSTSystemContainerKey, OSTData{"1"}}})}}),
         OSTDictionary({{OSTEntitlementsKey, OSTDictionary({{appGroupsKey, OSTDictionary({{"g", true}})}})}}),
-        OSTDictionary({{OSTEntitlementsKey, OSTDictionary({{appGroupsKey, OSTArray{OSTArray{"g"}}}})}}),
+        OSTDictionary({{OSTEntitlementsKey, OSTDictionary({{appGroupsKey, OSTArray{OSTValue(OSTArray{"g"})}}})}}),
         OSTDictionary({{OSTEntitlementsKey, OSTDictionary({{test::systemGroupsKey, OSTDate{1}}})}}),
     };
     ASSERT_EQ(OSTErrorCode::success, registerEntitlements("com.example.Other", appGroups({"g"})));

@@ -69,6 +69,10 @@ std::filesystem::path makeScratchDirectory(unsigned mode) {
         removeAfterwards(directory, lifeline[0]);
     }
     ::close(lifeline[0]);
+    // Out of the way of tests that choose the numbers of their descriptors.
+    constexpr int high = 500;
+    require(::fcntl(lifeline[1], F_DUPFD_CLOEXEC, high) >= 0, "fcntl");
+    ::close(lifeline[1]);
 
     require(::chmod(directory.c_str(), mode) == 0, directory.c_str());
     return directory;
