@@ -4,7 +4,9 @@
 #include "platform/Try.h"
 
 #include <fcntl.h>
+#include <linux/openat2.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -59,13 +61,26 @@ std::expected<FileDescriptor, int> openOrMake(int parent, const std::string& nam
     return directory;
 }
 
+/// The directory of a user's items of one type, which is there as a rule.
+std::expected<FileDescriptor, int> openItems(std::uint32_t userId, std::uint64_t type) {
+    const auto user = std::to_string(userId), items = std::to_string(type);
+    const auto path = std::string(sandboxStateDirectory) + "/" + user + "/" + items;
+    open_how how{};
+    how.flags = O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
+    how.resolve = RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS;
+    FileDescriptor existing(static_cast<int>(::syscall(SYS_openat2, AT_FDCWD, path.c_str(), &how, sizeof how)));
+    if (existing)
+        return existing;
+    const auto top = OST_TRY(openOrMake(AT_FDCWD, sandboxStateDirectory));
+    const auto ofUser = OST_TRY(openOrMake(top.get(), user));
+    return openOrMake(ofUser.get(), items);
+}
+
 } // namespace
 
 std::expected<void, int> setSandboxUserStateItem(std::uint32_t userId, std::uint64_t type, std::string_view key,
                                                  std::optional<std::string_view> path) {
-    const auto top = OST_TRY(openOrMake(AT_FDCWD, sandboxStateDirectory));
-    const auto user = OST_TRY(openOrMake(top.get(), std::to_string(userId)));
-    const auto items = OST_TRY(openOrMake(user.get(), std::to_string(type)));
+    const auto items = OST_TRY(openItems(userId, type));
     const auto name = escapedName(key);
     if (!path) {
         if (::unlinkat(items.get(), name.c_str(), 0) != 0 && errno != ENOENT)

@@ -53,6 +53,7 @@ OSTClientConnection::stageForDeleteContainersWithUsers(const OSTDeletion& deleti
 }
 
 OSTResult<void> OSTClientConnection::_stageForDeletion(const OSTDeletion& deletion) const {
+    const auto deathRow = OSTGlobalConfiguration::sharedInstance().deathrowDirectory(); // the same for all
     for (std::size_t i = 0; i < deletion.uuids.size(); ++i) {
         // A list of users that is too short is the caller's mistake, which the guard reports.
         const auto userId = deletion.userIds.at(i);
@@ -68,15 +69,15 @@ OSTResult<void> OSTClientConnection::_stageForDeletion(const OSTDeletion& deleti
         const auto record =
             OSTContainerCache::sharedInstance().containerForUser(userId, containerClass, *identifier, *uuid);
         if (record)
-            OST_TRY(_stageContainer(userId, *record));
+            OST_TRY(_stageContainer(userId, *record, deathRow));
     }
     return {};
 }
 
-OSTResult<void> OSTClientConnection::_stageContainer(std::uint32_t userId, const OSTMetadata& metadata) {
+OSTResult<void> OSTClientConnection::_stageContainer(std::uint32_t userId, const OSTMetadata& metadata,
+                                                     const std::string& deathRow) {
     const auto& files = OSTFileManager::defaultManager();
-    const auto destination =
-        pathByAppending(OSTGlobalConfiguration::sharedInstance().deathrowDirectory(), lastPathComponent(metadata.url));
+    const auto destination = pathByAppending(deathRow, lastPathComponent(metadata.url));
     if (isBundleClass(metadata.containerClass))
         OSTStoreDelegate::shared().removeCodeSigningDictionariesForIdentifierAndItsChildren(metadata.identifier);
     if (const auto moved = files.moveItemAtURL(metadata.url, destination); !moved) {

@@ -190,7 +190,8 @@ private:
 
     // +Deletion
     [[nodiscard]] OSTResult<void> _stageForDeletion(const OSTDeletion& deletion) const;
-    [[nodiscard]] static OSTResult<void> _stageContainer(std::uint32_t userId, const OSTMetadata& metadata);
+    [[nodiscard]] static OSTResult<void> _stageContainer(std::uint32_t userId, const OSTMetadata& metadata,
+                                                         const std::string& deathRow);
     /// Moves one item to death row with one rename; an item that is already gone is success.
     /// Fails with `moveToDeathRowFailed`.
     [[nodiscard]] OSTResult<void> _moveItemAtURLToDeathRow(const std::string& url, StartPass startDeletionThread) const;

@@ -9,7 +9,7 @@ namespace ost {
 namespace {
 
 /// What a commit takes on an ordinary disk. Those under way may all turn out to be look-ups, which commit nothing.
-constexpr std::chrono::milliseconds patience{3};
+constexpr std::chrono::milliseconds patience{2};
 
 } // namespace
 

@@ -1,0 +1,272 @@
+// Staging for deletion, destruction and replacement, beside the same moves, writes and removals without a daemon.
+
+#include "Client/Containers.h"
+#include "platform/UUID.h"
+#include "support/BootedDevice.h"
+#include "support/ChildProcess.h"
+#include "support/Comparison.h"
+#include "support/JournaledFileSystem.h"
+#include "support/OneProcessor.h"
+#include "support/Require.h"
+#include "support/Workshop.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <chrono>
+#include <functional>
+#include <future>
+#include <stdexcept>
+#include <string>
+#include <vector>
+
+namespace ost::benchmarks {
+
+namespace {
+
+using Clock = std::chrono::steady_clock;
+using ostrand::ContainerClass;
+using platform::FileDescriptor;
+using platform::UUID;
+
+/// Few enough that a turn is short against the drift of the disk.
+constexpr unsigned containersInTurn = 24;
+constexpr unsigned directoriesOfLargeTree = 1000;
+constexpr unsigned filesOfLargeTree = 100'000;
+
+double secondsOf(const std::function<void()>& work) {
+    const auto start = Clock::now();
+    work();
+    return std::chrono::duration<double>(Clock::now() - start).count();
+}
+
+ostrand::Container create(ostrand::Connection& connection, const std::string& identifier, bool transient = false) {
+    return require(
+        ostrand::createOrLookup(
+            connection,
+            {.containerClass = ContainerClass::dataApplication, .identifier = identifier, .transient = transient},
+            ostrand::WhenMissing::create),
+        "create a container");
+}
+
+std::string newIdentifier() {
+    static unsigned number = 0;
+    return "com.example.Sketches." + std::to_string(++number);
+}
+
+ostrand::ContainerReference referenceTo(const ostrand::Container& container) {
+    return {
+        .containerClass = ContainerClass::dataApplication, .identifier = container.identifier, .uuid = container.uuid};
+}
+
+FileDescriptor openDirectory(const std::filesystem::path& path) {
+    std::filesystem::create_directories(path);
+    FileDescriptor directory(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    require(static_cast<bool>(directory), path);
+    return directory;
+}
+
+/// The directories between which containers move, without a daemon.
+class BareStore {
+public:
+    explicit BareStore(const std::filesystem::path& path)
+        : _live(openDirectory(path / "live")), _staging(openDirectory(path / "staging")),
+          _dead(openDirectory(path / "dead")), _replace(openDirectory(path / "replace")),
+          _sandbox(openDirectory(path / "sandbox")) {}
+
+    /// Something to be moved about, as deep as a container.
+    [[nodiscard]] std::string make() const {
+        const auto name = UUID::generate().string();
+        require(::mkdirat(_live.get(), name.c_str(), 0755) == 0, name);
+        require(::symlinkat("/", _sandbox.get(), name.c_str()) == 0, name);
+        return name;
+    }
+
+    /// What is there is on disk, as a daemon's containers are.
+    void settle() const { require(::syncfs(_live.get()) == 0, "syncfs"); }
+
+    void stageForDeletion(const std::string& name) const {
+        _move(_live, name, _dead);
+        require(::unlinkat(_sandbox.get(), name.c_str(), 0) == 0, name);
+    }
+
+    /// With what a crash must find, and what a power cut must not forget.
+    void replace(const std::string& oldName, const std::string& newName) const {
+        const auto token = UUID::generate().string();
+        const FileDescriptor file(::openat(_replace.get(), "new", O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0644));
+        const std::string paths(500, 'x');
+        require(::write(file.get(), paths.data(), paths.size()) == static_cast<ssize_t>(paths.size()), token);
+        require(::fdatasync(file.get()) == 0, token);
+        require(::renameat(_replace.get(), "new", _replace.get(), token.c_str()) == 0, token);
+        require(::fsync(_replace.get()) == 0, token);
+        require(::renameat(_live.get(), oldName.c_str(), _staging.get(), token.c_str()) == 0, oldName);
+        require(::renameat(_live.get(), newName.c_str(), _live.get(), oldName.c_str()) == 0, newName);
+        require(::fsync(_live.get()) == 0, newName);
+        require(::symlinkat("/", _sandbox.get(), token.c_str()) == 0, token);
+        require(::renameat(_sandbox.get(), token.c_str(), _sandbox.get(), newName.c_str()) == 0, token);
+        _move(_staging, token, _newDirectoryOfDead());
+        _move(_replace, token, _newDirectoryOfDead());
+    }
+
+private:
+    static void _move(const FileDescriptor& from, const std::string& name, const FileDescriptor& to) {
+        require(::renameat(from.get(), name.c_str(), to.get(), name.c_str()) == 0, name);
+    }
+    [[nodiscard]] FileDescriptor _newDirectoryOfDead() const {
+        const auto name = UUID::generate().string();
+        require(::mkdirat(_dead.get(), name.c_str(), 0700) == 0, name);
+        return FileDescriptor(::openat(_dead.get(), name.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+    }
+
+    FileDescriptor _live, _staging, _dead, _replace, _sandbox;
+};
+
+void staging(benchmark::State& state) {
+    const OneProcessor oneProcessor;
+    const JournaledFileSystem disk;
+    const BootedDevice device(disk.path() / "device");
+    auto connection = device.connect();
+    const BareStore bare(disk.path() / "bare");
+    const auto daemon = [&] {
+        std::vector<ostrand::ContainerReference> containers;
+        for (unsigned made = 0; made < containersInTurn; ++made)
+            containers.push_back(referenceTo(create(connection, newIdentifier())));
+        return secondsOf([&] { require(ostrand::stageForDeletion(connection, containers), "stage for deletion"); }) /
+               containersInTurn;
+    };
+    const auto baseline = [&] {
+        std::vector<std::string> names;
+        for (unsigned made = 0; made < containersInTurn; ++made)
+            names.push_back(bare.make());
+        return secondsOf([&] {
+                   for (const auto& name : names)
+                       bare.stageForDeletion(name);
+               }) /
+               containersInTurn;
+    };
+    Comparison{
+        .unit = Unit::seconds, .target = {Target::Kind::ratioAtMost, 1.5}, .daemon = daemon, .baseline = baseline}
+        .run(state);
+}
+
+void replacement(benchmark::State& state) {
+    const JournaledFileSystem disk;
+    const BootedDevice device(disk.path() / "device");
+    auto connection = device.connect();
+    const BareStore bare(disk.path() / "bare");
+    const auto daemon = [&] {
+        double seconds = 0;
+        for (unsigned made = 0; made < containersInTurn; ++made) {
+            const auto identifier = newIdentifier();
+            const auto oldContainer = create(connection, identifier);
+            const auto newContainer = create(connection, identifier, true);
+            seconds += secondsOf([&] {
+                require(ostrand::replace(connection, referenceTo(oldContainer), referenceTo(newContainer)), "replace");
+            });
+        }
+        return seconds / containersInTurn;
+    };
+    const auto baseline = [&] {
+        double seconds = 0;
+        for (unsigned made = 0; made < containersInTurn; ++made) {
+            const auto oldName = bare.make(), newName = bare.make();
+            bare.settle();
+            seconds += secondsOf([&] { bare.replace(oldName, newName); });
+        }
+        return seconds / containersInTurn;
+    };
+    Comparison{
+        .unit = Unit::seconds, .target = {Target::Kind::ratioAtMost, 1.5}, .daemon = daemon, .baseline = baseline}
+        .run(state);
+}
+
+void makeLargeTree(const std::filesystem::path& path) {
+    const auto top = openDirectory(path);
+    for (unsigned number = 0; number < directoriesOfLargeTree; ++number) {
+        const auto name = std::to_string(number);
+        require(::mkdirat(top.get(), name.c_str(), 0755) == 0, name);
+        const FileDescriptor directory(::openat(top.get(), name.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+        for (unsigned file = 0; file < filesOfLargeTree / directoriesOfLargeTree; ++file)
+            require(::mknodat(directory.get(), std::to_string(file).c_str(), S_IFREG | 0644, 0) == 0, name);
+    }
+}
+
+/// A device on which a container with a large tree waits on death row, each time anew.
+class DeviceWithWaste {
+public:
+    ostrand::Connection& connection() { return _connection; }
+
+    void makeWaste() {
+        const auto container = create(_connection, newIdentifier());
+        makeLargeTree(_device.hostPath(container.path) / "Documents/tree");
+        require(ostrand::stageForDeletion(_connection, {referenceTo(container)}), "stage for deletion");
+    }
+    void destroyWaste() const {
+        auto connection = _device.connect();
+        require(ostrand::destroyDeathRow(connection), "destroy what is on death row");
+    }
+
+private:
+    BootedDevice _device{makeScratchDirectory() / "device"};
+    ostrand::Connection _connection = _device.connect();
+};
+
+void destruction(benchmark::State& state) {
+    DeviceWithWaste device;
+    const auto bare = makeScratchDirectory();
+    const auto daemon = [&] {
+        device.makeWaste();
+        return secondsOf([&] { device.destroyWaste(); });
+    };
+    const auto baseline = [&] {
+        makeLargeTree(bare / "tree");
+        return secondsOf([&] {
+            if (ChildProcess({"rm", "-rf", bare / "tree"}).wait() != 0)
+                throw std::runtime_error("rm fails");
+        });
+    };
+    Comparison{
+        .unit = Unit::seconds, .target = {Target::Kind::ratioAtMost, 1.0}, .daemon = daemon, .baseline = baseline}
+        .run(state);
+}
+
+/// Look-ups while a large tree is destroyed, beside look-ups while nothing else happens.
+void lookUpsMeanwhile(benchmark::State& state) {
+    constexpr std::chrono::milliseconds duration{300};
+    DeviceWithWaste device;
+    create(device.connection(), "com.example.found");
+    const auto secondsEach = [&](const std::function<bool()>& goesOn) {
+        unsigned count = 0;
+        const auto seconds = secondsOf([&] {
+            for (; goesOn(); ++count)
+                create(device.connection(), "com.example.found");
+        });
+        return seconds / std::max(1U, count);
+    };
+    const auto daemon = [&] {
+        device.makeWaste();
+        auto destroyed = std::async(std::launch::async, [&] { device.destroyWaste(); });
+        const auto seconds =
+            secondsEach([&] { return destroyed.wait_for(std::chrono::seconds(0)) != std::future_status::ready; });
+        destroyed.get();
+        return seconds;
+    };
+    const auto baseline = [&] {
+        const auto end = Clock::now() + duration;
+        return secondsEach([&] { return Clock::now() < end; });
+    };
+    Comparison{
+        .unit = Unit::seconds, .target = {Target::Kind::ratioAtMost, 1.5}, .daemon = daemon, .baseline = baseline}
+        .run(state);
+}
+
+[[maybe_unused]] const int stagings = registerComparison("staging a container for deletion", 31, staging);
+[[maybe_unused]] const int replacements = registerComparison("replacement", 15, replacement);
+[[maybe_unused]] const int destructions = registerComparison("destruction of 100,000 files", 7, destruction);
+[[maybe_unused]] const int beside = registerComparison("look-up while they are destroyed", 7, lookUpsMeanwhile);
+
+} // namespace
+
+} // namespace ost::benchmarks
