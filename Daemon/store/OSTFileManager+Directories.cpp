@@ -20,21 +20,18 @@ using platform::FileDescriptor;
 namespace {
 
 /// Makes the directories on the way to the item at `path` that are missing.
-std::expected<void, int> makeParents(int base, std::string_view path, mode_t mode) {
-    FileDescriptor held;
-    if (path.starts_with('/'))
-        held = OST_TRY(OSTOpenItem(base, "/", O_PATH | O_DIRECTORY));
+std::expected<void, int> makeParents(std::string_view path, mode_t mode) {
+    FileDescriptor held = OST_TRY(OSTOpenItem(AT_FDCWD, "/", O_PATH | O_DIRECTORY));
     for (auto slash = path.find('/'); slash != std::string_view::npos; slash = path.find('/')) {
         const std::string_view name = path.substr(0, slash);
         path.remove_prefix(slash + 1);
         if (name.empty())
             continue;
-        const int above = held ? held.get() : base;
-        auto opened = OSTOpenItem(above, name, O_PATH | O_DIRECTORY);
+        auto opened = OSTOpenItem(held.get(), name, O_PATH | O_DIRECTORY);
         if (!opened && opened.error() == ENOENT) {
-            if (::mkdirat(above, std::string(name).c_str(), mode) != 0 && errno != EEXIST)
+            if (::mkdirat(held.get(), std::string(name).c_str(), mode) != 0 && errno != EEXIST)
                 return std::unexpected(errno);
-            opened = OSTOpenItem(above, name, O_PATH | O_DIRECTORY);
+            opened = OSTOpenItem(held.get(), name, O_PATH | O_DIRECTORY);
         }
         held = OST_TRY(std::move(opened));
     }
@@ -47,12 +44,12 @@ struct MadeDirectory {
 };
 
 /// Makes a directory unless something is there, and opens it with `access`.
-std::expected<MadeDirectory, int> makeDirectory(int base, std::string_view path,
-                                                const OSTDirectoryAttributes& attributes, int access) {
-    auto place = OSTItemPlace::find(base, path);
+std::expected<MadeDirectory, int> makeDirectory(std::string_view path, const OSTDirectoryAttributes& attributes,
+                                                int access) {
+    auto place = OSTItemPlace::find(path);
     if (!place && place.error() == ENOENT && attributes.withIntermediateDirectories) {
-        OST_TRY(makeParents(base, path, attributes.mode));
-        place = OSTItemPlace::find(base, path);
+        OST_TRY(makeParents(path, attributes.mode));
+        place = OSTItemPlace::find(path);
     }
     if (!place)
         return std::unexpected(place.error());
@@ -87,21 +84,13 @@ const OSTFileManager& OSTFileManager::defaultManager() {
 
 OSTResult<void> OSTFileManager::createDirectoryAtURL(std::string_view path,
                                                      const OSTDirectoryAttributes& attributes) const {
-    return createDirectory(AT_FDCWD, path, attributes);
-}
-
-OSTResult<void> OSTFileManager::createDirectory(int base, std::string_view path,
-                                                const OSTDirectoryAttributes& attributes) const {
     const bool setsClass = attributes.protectionClass != OSTKeepProtectionClass;
     const int access = O_DIRECTORY | (setsClass ? O_RDONLY : O_PATH);
 
-    // Most directories asked for exist. Looking first is dearer only where making one needs no parent to be opened.
-    std::expected<FileDescriptor, int> directory = std::unexpected(ENOENT);
-    if (path.contains('/'))
-        directory = OSTOpenItem(base, path, access);
+    auto directory = OSTOpenItem(AT_FDCWD, path, access); // most directories asked for exist
     bool isNew = false;
     if (!directory) {
-        auto made = makeDirectory(base, path, attributes, access);
+        auto made = makeDirectory(path, attributes, access);
         if (!made && attributes.withIntermediateDirectories)
             return std::unexpected(
                 OSTCreatePOSIXError(made.error(), "forgepath of %s failed: %s", path, std::strerror(made.error())));

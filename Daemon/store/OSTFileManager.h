@@ -78,9 +78,6 @@ public:
     /// mode 0 takes nothing from the entries inherited. Fails with ENOTDIR when something else is in the place.
     [[nodiscard]] OSTResult<void> createDirectoryAtURL(std::string_view path,
                                                        const OSTDirectoryAttributes& attributes = {}) const;
-    /// The same for a path relative to the directory `base`; messages name the relative path.
-    [[nodiscard]] OSTResult<void> createDirectory(int base, std::string_view path,
-                                                  const OSTDirectoryAttributes& attributes) const;
     /// Opens the directory at `path` for the functions that take a path relative to one.
     [[nodiscard]] OSTResult<platform::FileDescriptor> openDirectoryAtURL(std::string_view path) const;
     /// Makes a directory with a unique name, "temp." and six characters, and mode 0700. Returns its path.

@@ -43,21 +43,19 @@ std::expected<FileDescriptor, int> OSTOpenItem(int base, std::string_view path, 
     return FileDescriptor(static_cast<int>(fd));
 }
 
-std::expected<OSTItemPlace, int> OSTItemPlace::find(int base, std::string_view path, int access) {
+std::expected<OSTItemPlace, int> OSTItemPlace::find(std::string_view path, int access) {
     path = withoutTrailingSlashes(path);
     const auto slash = path.rfind('/');
     const std::string_view name = path.substr(slash + 1);
     // These name a directory's relatives, not an item that could be made, moved or removed.
-    if (name.empty() || name == "." || name == "..")
+    if (!path.starts_with('/') || name.empty() || name == "." || name == "..")
         return std::unexpected(EINVAL);
     if (name.size() > NAME_MAX)
         return std::unexpected(ENAMETOOLONG);
 
     OSTItemPlace place;
     place._name[name.copy(place._name, name.size())] = '\0';
-    place._base = base;
-    if (slash != std::string_view::npos)
-        place._owned = OST_TRY(OSTOpenItem(base, path.substr(0, slash == 0 ? 1 : slash), access | O_DIRECTORY));
+    place._directory = OST_TRY(OSTOpenItem(AT_FDCWD, path.substr(0, slash == 0 ? 1 : slash), access | O_DIRECTORY));
     return place;
 }
 

@@ -12,27 +12,24 @@ namespace ost {
 
 /// Where an item lies: the directory that holds it and its name there. The item itself has not been looked at.
 ///
-/// Owns the directory's descriptor, unless the directory is the base that the path was relative to.
+/// Owns the directory's descriptor.
 class OSTItemPlace {
 public:
-    /// The place named by `path`, relative to the directory `base` or absolute. The directory is opened with `access`:
-    /// O_PATH, or O_RDONLY where more than the *at calls is asked of it.
-    /// Fails with ELOOP or ENOTDIR at a symbolic link on the way, with EINVAL when the path ends in no name of its own.
-    [[nodiscard]] static std::expected<OSTItemPlace, int> find(int base, std::string_view path, int access = O_PATH);
-    [[nodiscard]] static std::expected<OSTItemPlace, int> find(std::string_view path, int access = O_PATH) {
-        return find(AT_FDCWD, path, access);
-    }
+    /// The place named by `path`. The directory is opened with `access`: O_PATH, or O_RDONLY where more than the *at
+    /// calls is asked of it.
+    /// Fails with ELOOP or ENOTDIR at a symbolic link on the way, with EINVAL when the path is not absolute or ends in
+    /// no name of its own.
+    [[nodiscard]] static std::expected<OSTItemPlace, int> find(std::string_view path, int access = O_PATH);
 
-    [[nodiscard]] int directory() const { return _owned ? _owned.get() : _base; }
+    [[nodiscard]] int directory() const { return _directory.get(); }
     [[nodiscard]] const char* name() const { return _name; }
-    /// Gives up the directory's descriptor; an absolute path always has one.
-    [[nodiscard]] platform::FileDescriptor takeDirectory() && { return std::move(_owned); }
+    /// Gives up the directory's descriptor.
+    [[nodiscard]] platform::FileDescriptor takeDirectory() && { return std::move(_directory); }
 
 private:
     OSTItemPlace() = default;
 
-    int _base = -1;
-    platform::FileDescriptor _owned;
+    platform::FileDescriptor _directory;
     char _name[NAME_MAX + 1];
 };
 

@@ -144,10 +144,6 @@ TEST_F(OSTFileManagerTest, CreatesDirectoriesWithModeOwnerAndClass) {
     const auto directory = files.openDirectoryAtURL(at("a"));
     ASSERT_TRUE(directory);
     EXPECT_EQ(platform::protectionClass(directory->get(), -1), 4);
-
-    EXPECT_TRUE(files.createDirectory(directory->get(), "Library/Caches", {.withIntermediateDirectories = true}));
-    EXPECT_TRUE(files.createDirectory(directory->get(), "tmp", {.mode = 0700, .owner = 501}));
-    EXPECT_EQ(tree(at("a")), "drwxr-xr-x 0:0 Library\ndrwxr-xr-x 0:0 Library/Caches\ndrwx------ 501:501 tmp\n");
 }
 
 TEST_F(OSTFileManagerTest, NeverMakesOrChangesADirectoryThroughAnObstacle) {
