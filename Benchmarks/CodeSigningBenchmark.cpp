@@ -13,6 +13,7 @@
 #include "support/ChildProcess.h"
 #include "support/Comparison.h"
 #include "support/JournaledFileSystem.h"
+#include "support/OneProcessor.h"
 #include "support/Require.h"
 #include "support/RoundTrips.h"
 #include "support/Workshop.h"
@@ -181,6 +182,7 @@ std::string lookUpOf(unsigned number) {
 }
 
 void unchanged(benchmark::State& state) {
+    const OneProcessor oneProcessor;
     constexpr unsigned roundTrips = 2000;
     const CrowdedDevice crowded(makeScratchDirectory() / "device");
     const auto& device = crowded.device();
