@@ -47,8 +47,7 @@ OSTResult<OSTMetadata> OSTMetadata::readAndValidateMetadataAtUrl(const OSTResult
                                               "Failed to read metadata at URL %@", url));
 
     const OSTValue* const identifier = dictionary->find(identifierKey);
-    // No answer could hold one with a NUL.
-    if (!identifier || !identifier->asString() || identifier->asString()->contains('\0'))
+    if (!identifier || !identifier->asString())
         return std::unexpected(OSTCreateError(OSTErrorCode::metadataInvalid, "Invalid metadata Identifier: %@ at %@",
                                               shown(identifier), url));
 

@@ -20,7 +20,7 @@ using Result = std::expected<T, PropertyListError>;
 /// What the tree of a file may take in memory: so much for each of its bytes, and an allowance for small files that
 /// refer to one long string many times. Every reference is charged where it stands, which also ends bombs of nested
 /// references and tables whose offsets all lead to the same array, without keeping note of what has been seen.
-constexpr std::size_t memoryPerByte = 128;
+constexpr std::size_t memoryPerByte = 64;
 constexpr std::size_t memoryAllowance = std::size_t{1} << 20;
 
 std::unexpected<PropertyListError> malformed(const char* what) {

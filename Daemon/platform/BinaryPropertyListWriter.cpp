@@ -123,10 +123,10 @@ private:
         std::uint32_t uses = 0; ///< 0: empty
     };
 
-    /// A reader gives every byte of a file 128 bytes of memory. A short object may be shared by any number of
+    /// A reader gives every byte of a file 64 bytes of memory. A short object may be shared by any number of
     /// references, each of at least one byte; a long one is written anew in time, and so pays for its references.
-    static constexpr std::size_t longestSharedFreely = 64;
-    static constexpr std::uint32_t usesOfLongObject = 64;
+    static constexpr std::size_t longestSharedFreely = 16;
+    static constexpr std::uint32_t usesOfLongObject = 32;
     /// Strings made to collide cost no more than this many comparisons each: what is not found by then is written
     /// twice.
     static constexpr std::size_t longestProbe = 128;

@@ -17,7 +17,7 @@ struct PropertyListError {
 
 /// What a reader accepts. Files come from directories that users own, so reading one never costs more than time and
 /// memory in proportion to its size, whatever it holds. A binary file may refer to an object many times; its tree then
-/// counts as it is walked, and is refused when it takes more than 128 bytes for each byte of the file and 1 MiB
+/// counts as it is walked, and is refused when it takes more than 64 bytes for each byte of the file and 1 MiB
 /// besides.
 struct PropertyListLimits {
     std::size_t depth = 64; ///< nesting of arrays and dictionaries; the root is depth 1
@@ -33,7 +33,7 @@ struct PropertyListLimits {
                                                                            const PropertyListLimits& limits = {});
 
 /// Writes `root` in the binary format; equal values always give the same bytes. Equal strings, numbers and data are
-/// written once (above 64 bytes: once for every 64 references, so that the tree of a file never outgrows what the
+/// written once (above 16 bytes: once for every 32 references, so that the tree of a file never outgrows what the
 /// reader allows); references and offsets have the least width.
 ///
 /// Bytes of a string that are not UTF-8 are written as U+FFFD. The nesting of `root` must be bounded, as that of every

@@ -381,7 +381,7 @@ TEST(PropertyListTests, RefusesTreesOutOfProportionToTheFile) {
 }
 
 TEST(PropertyListTests, ReadsItsOwnFilesHoweverOftenAStringOccurs) {
-    for (const std::size_t length : {10U, 64U, 65U, 200U, 1000U}) {
+    for (const std::size_t length : {10U, 15U, 16U, 17U, 200U, 1000U}) {
         const OSTDictionary dictionary({{"k", OSTArray(20'000, std::string(length, 'x'))}});
         const auto file = serializeBinaryPropertyList(dictionary);
         const auto value = parsePropertyList(file);

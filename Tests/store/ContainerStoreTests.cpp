@@ -206,7 +206,6 @@ TEST_F(ContainerStore, HostileItemsOfAClassDirectoryArePassedOver) {
     fs::create_symlink(fs::path("/outside") / OSTMetadataFileName, directory / "link-inside" / OSTMetadataFileName);
     plant(directory / "giant", "giant");
     plant(directory / "not\xffUTF-8", "unutterable.path");
-    plant(directory / "NUL", std::string_view("unutterable\0", 12));
     fs::resize_file(directory / "giant" / OSTMetadataFileName, std::uintmax_t{10} << 30U);
 
     const auto listed = store().containersForUser(501, dataApplication, false);
