@@ -1,5 +1,4 @@
 #include "Client/Connection.h"
-#include "Client/Containers.h"
 
 #include "support/ScratchDirectory.h"
 
@@ -7,7 +6,6 @@
 
 #include <fcntl.h>
 #include <filesystem>
-#include <functional>
 #include <sys/socket.h>
 #include <sys/un.h>
 #include <thread>
@@ -18,7 +16,6 @@ using ost::platform::CBOREncoder;
 using ost::platform::CBORItem;
 using ost::platform::FileDescriptor;
 using ost::platform::IPCFrameHeader;
-using ost::platform::UUID;
 
 namespace {
 
@@ -213,112 +210,6 @@ TEST(Connection, reachesADeviceWhosePathIsTooLongForASocketAddress) {
     const auto full = Connection::open(device, 1ms);
     ASSERT_FALSE(full);
     EXPECT_EQ(full.error(), Error::transport(ETIMEDOUT));
-}
-
-TEST(Containers, askWithTheKeysThatTheDaemonReads) {
-    Daemon daemon;
-    auto connection = daemon.client();
-    const auto uuid = UUID::generate();
-    std::string answer;
-    CBOREncoder encoder(answer);
-    encoder.beginMap(5);
-    encoder.key("ReplyError");
-    encoder.unsignedNumber(1);
-    encoder.key("ReplyIdentifier");
-    encoder.text("com.example");
-    encoder.key("ReplyUUID");
-    encoder.uuid(uuid);
-    encoder.key("ReplyPath");
-    encoder.text("/private/x");
-    encoder.key("ReplyExisted");
-    encoder.boolean(true);
-    daemon.says(frame(1, answer));
-
-    const ContainerRequest about{ContainerClass::dataApplication, 501, "com.example", true};
-    const auto container = createOrLookup(connection, about, WhenMissing::create);
-    ASSERT_TRUE(container);
-    EXPECT_EQ(container->identifier, "com.example");
-    EXPECT_EQ(container->uuid, uuid);
-    EXPECT_EQ(container->path, "/private/x");
-    EXPECT_TRUE(container->existed);
-
-    const auto [number, payload] = daemon.hears();
-    const auto request = ost::platform::validateCBOR(payload);
-    ASSERT_TRUE(request);
-    EXPECT_EQ(request->find("Command")->asUnsigned(), 0);
-    EXPECT_EQ(request->find("ContainerClass")->asUnsigned(), 2);
-    EXPECT_EQ(request->find("UserID")->asUnsigned(), 501);
-    EXPECT_EQ(request->find("Identifier")->asText(), "com.example");
-    EXPECT_EQ(request->find("CreateIfNecessary")->asBoolean(), true);
-    EXPECT_EQ(request->find("Transient")->asBoolean(), true);
-
-    daemon.says(reply(2, 1));
-    const auto listed = list(connection, about);
-    ASSERT_FALSE(listed) << "the arrays are missing";
-    EXPECT_EQ(listed.error(), Error::transport(EBADMSG));
-}
-
-/// A request in words.
-std::string described(const CBORItem& item) {
-    const auto list = [](const auto& elements, auto describe) {
-        std::string text;
-        for (const auto element : elements)
-            text += (text.empty() ? "" : ", ") + describe(element);
-        return text;
-    };
-    if (const auto number = item.asUnsigned())
-        return std::to_string(*number);
-    if (const auto truth = item.asBoolean())
-        return *truth ? "true" : "false";
-    if (const auto text = item.asText())
-        return std::string(*text);
-    if (const auto uuid = item.asUUID())
-        return uuid->string().substr(0, 2);
-    if (item.type() == ost::platform::CBORType::array)
-        return "[" + list(item.elements(), described) + "]";
-    return "{" +
-           list(item.entries(),
-                [](const auto& entry) { return std::string(entry.key) + ": " + described(entry.value); }) +
-           "}";
-}
-
-TEST(Containers, areRemovedAndReplacedByTheirUUIDs) {
-    Daemon daemon;
-    auto connection = daemon.client();
-    using enum ContainerClass;
-    const ContainerReference one{dataApplication, 501, "one", UUID({0x11})};
-    const ContainerReference two{sharedAppGroup, currentUser, "two", UUID({0x22})};
-    const std::string newSide =
-        "NewContainerUUID: 22, NewContainerClass: 7, NewContainerUserID: 1, NewIdentifier: two}";
-    const struct {
-        std::function<Result<void>()> call;
-        std::string request;
-    } rows[] = {
-        {[&] { return stageForDeletion(connection, {one, two}); },
-         "{Command: 3, ContainerClassesArray: [2, 7], UUIDsArray: [11, 22], UserIDsArray: [501, 1], "
-         "IdentifiersArray: [one, two]}"},
-        {[&] { return stageForDeletion(connection, {}); },
-         "{Command: 3, ContainerClassesArray: [], UUIDsArray: [], UserIDsArray: [], IdentifiersArray: []}"},
-        {[&] { return deleteContainer(connection, {dataApplication, 501, "one", true}); },
-         "{Command: 10, ContainerClass: 2, UserID: 501, Transient: true, Identifier: one}"},
-        {[&] { return destroyDeathRow(connection); }, "{Command: 4}"},
-        {[&] { return replace(connection, one, two); },
-         "{Command: 2, OldContainerUUID: 11, OldContainerClass: 2, OldContainerUserID: 501, OldIdentifier: one, " +
-             newSide},
-        {[&] { return replace(connection, {}, two); }, "{Command: 2, " + newSide},
-    };
-    std::uint32_t number = 0;
-    for (const auto& [call, request] : rows) {
-        daemon.says(reply(++number, 1));
-        EXPECT_TRUE(call());
-        const auto payload = daemon.hears().second;
-        EXPECT_EQ(described(*ost::platform::validateCBOR(payload)), request);
-        daemon.says(reply(++number, 21));
-        const auto failed = call();
-        ASSERT_FALSE(failed);
-        EXPECT_EQ(failed.error(), Error::failed(21));
-        (void)daemon.hears();
-    }
 }
 
 } // namespace
