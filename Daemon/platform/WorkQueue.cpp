@@ -63,24 +63,28 @@ void WorkQueue::setTargetBackgroundPriority() {
     _background = true;
 }
 
+void WorkQueue::abandon() {
+    std::vector<Work> abandoned; // goes last and without the lock: what it holds may do anything when it is let go
+    const std::lock_guard lock(_mutex);
+    _stopped = true;
+    for (auto& entry : _entries)
+        if (!entry.waiter)
+            abandoned.push_back(std::move(entry.work));
+    std::erase_if(_entries, [](const Entry& entry) { return !entry.waiter; });
+    _workerTurnCame.notify_one();
+    _wakeNext();
+}
+
 void WorkQueue::stop() {
     OST_ASSERT(!isCurrent());
-    std::vector<Work> abandoned;
+    abandon();
     std::thread worker;
     {
         const std::lock_guard lock(_mutex);
-        _stopped = true;
-        for (auto& entry : _entries)
-            if (!entry.waiter)
-                abandoned.push_back(std::move(entry.work));
-        std::erase_if(_entries, [](const Entry& entry) { return !entry.waiter; });
         worker = std::move(_worker);
-        _workerTurnCame.notify_one();
-        _wakeNext();
     }
     if (worker.joinable())
         worker.join();
-    // The abandoned work goes last and without the lock: what it holds may do anything when it is let go.
 }
 
 void WorkQueue::_enter() {

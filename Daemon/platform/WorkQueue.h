@@ -58,9 +58,10 @@ public:
     /// Gives asynchronous work the lowest processor and disk priority. Must come before the first `async`.
     void setTargetBackgroundPriority();
 
-    /// Abandons asynchronous work that has not begun, waits for the one that runs, and ends the thread. From then on
-    /// asynchronous work is dropped, while `sync` goes on excluding and no longer heeds suspension. Must not be called
-    /// from work of this same queue.
+    /// Abandons asynchronous work that has not begun, and waits for nothing. From then on asynchronous work is dropped,
+    /// while `sync` goes on excluding and no longer heeds suspension.
+    void abandon();
+    /// The same, and waits for the work that runs. Must not be called from work of this same queue.
     void stop();
 
 private:

@@ -164,7 +164,7 @@ void OSTDaemon::_finish() {
     const auto deadline = std::chrono::steady_clock::now() + timeToFinish;
     const bool requestsDone = !_listener || _listener->finish(deadline);
     // What waits for an unlock would wait for longer than there is time.
-    OSTLockStateQueue().stop();
+    OSTLockStateQueue().abandon();
     if (platform::Transactions::shared().waitUntilNone(deadline) && requestsDone)
         return;
     auto open = platform::Transactions::shared().describeOpen();
