@@ -9,7 +9,7 @@ namespace ost::platform {
 
 namespace {
 
-/// The length of the valid UTF-8 sequence at the start of `text` that is no control character, or 0.
+/// The length of the valid UTF-8 sequence at the start of `text` that only shows itself, or 0.
 std::size_t printableSequence(std::string_view text) {
     const auto at = [&](std::size_t i) { return static_cast<unsigned char>(text[i]); };
     const auto first = at(0);
@@ -25,7 +25,11 @@ std::size_t printableSequence(std::string_view text) {
     const bool secondControlBlock = first == 0xc2 && second < 0xa0;
     const bool overlong = (first == 0xe0 && second < 0xa0) || (first == 0xf0 && second < 0x90);
     const bool outOfRange = (first == 0xed && second >= 0xa0) || (first == 0xf4 && second >= 0x90);
-    return secondControlBlock || overlong || outOfRange ? 0 : length;
+    // Separators of lines, and what makes a terminal show a text in another order than it has.
+    const auto third = length == 3 ? at(2) : 0;
+    const bool rearranges = first == 0xe2 && ((second == 0x80 && third >= 0xa8 && third <= 0xae) ||
+                                              (second == 0x81 && third >= 0xa6 && third <= 0xa9));
+    return secondControlBlock || overlong || outOfRange || rearranges ? 0 : length;
 }
 
 /// What a message shows of one text: every path and identifier of ordinary length, and not so much that a client could

@@ -129,6 +129,8 @@ std::uint64_t truncated(double value) {
     return value < firstTooLarge ? static_cast<std::uint64_t>(value) : std::numeric_limits<std::uint64_t>::max();
 }
 
+bool isSameReal(double a, double b) { return a == b || (std::isnan(a) && std::isnan(b)); }
+
 } // namespace
 
 OSTValue::OSTValue(std::int64_t value) {
@@ -193,6 +195,10 @@ bool operator==(const OSTValue& a, const OSTValue& b) {
         return array == other || *array == *other;
     if (const auto *dictionary = a.asDictionary(), *other = b.asDictionary(); dictionary && other)
         return dictionary == other || *dictionary == *other;
+    if (const auto *real = std::get_if<double>(&a._value), *other = std::get_if<double>(&b._value); real && other)
+        return isSameReal(*real, *other);
+    if (const auto *date = std::get_if<OSTDate>(&a._value), *other = std::get_if<OSTDate>(&b._value); date && other)
+        return isSameReal(date->secondsSince1970, other->secondsSince1970);
     return a._value == b._value;
 }
 

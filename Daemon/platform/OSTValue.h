@@ -70,8 +70,7 @@ public:
     /// Whether this is a number other than 0.
     [[nodiscard]] bool truthValue() const;
 
-    /// Deep comparison. Numbers are equal by value within integers, within reals, within booleans; no number is NaN's
-    /// equal.
+    /// Deep comparison. Numbers are equal by value within integers, within reals, within booleans; NaN is NaN's equal.
     friend bool operator==(const OSTValue& a, const OSTValue& b);
 
     /// The value in words, for messages: a string as it is, a number in decimal, `(a, b)`, `{key = value; }`, a boolean

@@ -235,7 +235,7 @@ TEST_F(HostileFrameTest, NobodyForgesALogLine) {
              {"a\n" + forged, "a\\n" + forged},
              {"a\r\n" + forged + "\n", "a\\r\\n" + forged + "\\n"},
              {"\x1b[2Ja\x7f\x01\tb", "\\x1b[2Ja\\x7f\\x01\\tb"},
-             {"\xc2\x85\xe2\x80\xa8" + forged, "\\xc2\\x85"},
+             {"\xc2\x85\xe2\x80\xa8" + forged, "\\xc2\\x85\\xe2\\x80\\xa8"},
              {"%@ %s %n %%", "%@ %s %n %%"},
          }) {
         const auto reply = connect().call(

@@ -4,6 +4,7 @@
 
 #include <filesystem>
 #include <functional>
+#include <limits>
 
 namespace ost {
 namespace {
@@ -225,6 +226,15 @@ TEST_F(CodeSigningProcessing, WhatIsNoEntryStaysInTheFileUntilItsIdentifierIsReg
         << "entitlements have another name in a bundle container";
     ASSERT_TRUE(entryOnDisk("data"));
     EXPECT_EQ(2U, entryOnDisk("data")->dataContainerClass);
+}
+
+TEST_F(CodeSigningProcessing, WhatIsNotANumberIsNoChangeEither) {
+    const auto nan = std::numeric_limits<double>::quiet_NaN();
+    const OSTDictionary info({{"date", OSTDate{nan}}, {"real", nan}});
+    ASSERT_EQ(OSTErrorCode::success, registerInfo(app, info));
+    fs::remove(mappingFile);
+    ASSERT_EQ(OSTErrorCode::success, registerInfo(app, info));
+    EXPECT_FALSE(fs::exists(mappingFile)) << "nothing is written";
 }
 
 TEST_F(CodeSigningProcessing, AFailedWriteIsReportedAndMadeGoodByTheNext) {
