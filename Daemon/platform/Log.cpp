@@ -81,6 +81,12 @@ std::expected<void, int> Log::_openFile() {
     return {};
 }
 
+/// Whether there is a file that somebody can still find: an administrator may have removed it.
+bool Log::_fileIsLinked() const {
+    struct stat status{};
+    return _file && ::fstat(_file.get(), &status) == 0 && status.st_nlink > 0;
+}
+
 void Log::_rotate() {
     if (_disk.files <= 1) {
         if (::ftruncate(_file.get(), 0) == 0)
@@ -110,7 +116,7 @@ void Log::write(LogLevel level, std::string_view function, std::string_view mess
     const std::lock_guard lock(_mutex);
     if (level == LogLevel::error)
         copyToStandardError(line);
-    if (_disk.path.empty() || (!_file && !_openFile()))
+    if (_disk.path.empty() || (!_fileIsLinked() && !_openFile()))
         return;
     if (_written > 0 && _written + line.size() > _disk.size)
         _rotate();

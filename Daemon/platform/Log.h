@@ -39,6 +39,7 @@ public:
     void write(LogLevel level, std::string_view function, std::string_view message);
 
 private:
+    [[nodiscard]] bool _fileIsLinked() const;
     [[nodiscard]] std::expected<void, int> _openFile();
     void _rotate();
 

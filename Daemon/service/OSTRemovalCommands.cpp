@@ -72,7 +72,10 @@ OSTErrorCode OSTStageForDeleteCommand(const platform::IPCRequest& request, platf
         request, "UserIDsArray", [](const auto& element) { return static_cast<std::uint32_t>(numberOf(element)); });
     // A user without a class could not be validated.
     if (userIds.size() > deletion.classes.size())
-        return OSTErrorCode::invalidObject;
+        return OSTCreateError(OSTErrorCode::invalidObject,
+                              "Can't act on an invalid input: user ID count: %ld, class count: %ld", userIds.size(),
+                              deletion.classes.size())
+            .code();
     for (std::size_t i = 0; i < userIds.size(); ++i) {
         const auto resolved = validateUserId(userIds[i], deletion.classes[i], client.identity().clientUserId);
         if (!resolved)

@@ -74,8 +74,18 @@ public:
         if (!top && !isNoDirectory(top.error()))
             return std::unexpected(top.error());
         const bool isDirectory = top.has_value();
-        if (isDirectory)
+        for (int fillings = 0; isDirectory; ++fillings) {
+            if (!top)
+                return std::unexpected(top.error());
             OST_TRY(_removeContent(*std::move(top), path));
+            if (_firstError != 0 || fillings == mostFillings)
+                break;
+            if (::unlinkat(place.directory(), place.name(), AT_REMOVEDIR) == 0)
+                return {};
+            if (errno != ENOTEMPTY)
+                break;
+            top = OSTOpenSubdirectory(place.directory(), place.name());
+        }
         _unlink({.directory = place.directory(),
                  .name = place.name(),
                  .path = path,
@@ -88,6 +98,10 @@ public:
     [[nodiscard]] int firstError() const { return _firstError; }
 
 private:
+    /// How often something may come into a directory that has just been emptied: a new directory on death row gets its
+    /// item.
+    static constexpr int mostFillings = 4;
+
     static bool isNoDirectory(int error) { return error == ENOTDIR || error == ELOOP; }
 
     [[nodiscard]] std::expected<void, int> _removeContent(FileDescriptor top, const std::string& path) {
