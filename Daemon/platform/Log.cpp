@@ -81,10 +81,10 @@ std::expected<void, int> Log::_openFile() {
     return {};
 }
 
-/// Whether there is a file that somebody can still find: an administrator may have removed it.
+/// Whether there is a file, and nobody has removed it meanwhile.
 bool Log::_fileIsLinked() const {
     struct stat status{};
-    return _file && ::fstat(_file.get(), &status) == 0 && status.st_nlink > 0;
+    return _file && (::fstat(_file.get(), &status) != 0 || status.st_nlink > 0);
 }
 
 void Log::_rotate() {
