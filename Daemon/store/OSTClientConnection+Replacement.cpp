@@ -295,7 +295,7 @@ OSTResult<void> OSTClientConnection::_discardReplaceFile(const std::string& url,
 OSTResult<void> OSTClientConnection::_recoverFromReplaceOperations() const {
     const auto& files = OSTFileManager::defaultManager();
     const auto directory = OSTGlobalConfiguration::sharedInstance().replaceDirectory();
-    files.removeUnfinishedFilesInDirectoryURL(directory);
+    files.removeUnfinishedItemsInDirectoryURL(directory);
     const auto items = files.urlsForItemsInDirectoryAtURL(directory);
     if (!items) {
         if (!items.error().isPOSIX(ENOENT))

@@ -16,7 +16,7 @@ OSTClientConnection& OSTClientConnection::sharedClientConnection() {
 }
 
 void OSTClientConnection::containerManagerSetup() const {
-    OSTFileManager::defaultManager().removeUnfinishedFilesInDirectoryURL(
+    OSTFileManager::defaultManager().removeUnfinishedItemsInDirectoryURL(
         OSTGlobalConfiguration::sharedInstance().libraryDirectory());
     if (!_recoverFromReplaceOperations())
         platform::logError("Failed recovering from replace operations");
@@ -25,6 +25,8 @@ void OSTClientConnection::containerManagerSetup() const {
 void OSTClientConnection::containerManagerCleanup() const {
     const auto staging = OSTGlobalConfiguration::sharedInstance().stagingDirectory();
     const auto& files = OSTFileManager::defaultManager();
+    for (const auto& directory : {staging, OSTGlobalConfiguration::sharedInstance().deathrowDirectory()})
+        files.removeUnfinishedItemsInDirectoryURL(directory);
     const auto items = files.urlsForItemsInDirectoryAtURL(staging);
     if (items) {
         // What cannot be moved stays for the next start, and so does a container that could not be put back in its

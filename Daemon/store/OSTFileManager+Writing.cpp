@@ -1,6 +1,7 @@
 #include "store/OSTFileManager.h"
 
 #include "platform/AccessControlList.h"
+#include "platform/Path.h"
 #include "platform/ProtectionClass.h"
 #include "store/OSTDurability.h"
 #include "store/OSTPathResolution.h"
@@ -105,7 +106,7 @@ OSTResult<void> OSTFileManager::writeFileAtomicallyAtURL(std::string_view path, 
     return {};
 }
 
-void OSTFileManager::removeUnfinishedFilesInDirectoryURL(std::string_view path) const {
+void OSTFileManager::removeUnfinishedItemsInDirectoryURL(std::string_view path) const {
     auto directory = OSTOpenItem(AT_FDCWD, path, O_RDONLY | O_DIRECTORY);
     const auto close = [](DIR* stream) { ::closedir(stream); };
     const std::unique_ptr<DIR, decltype(close)> stream(directory ? ::fdopendir(directory->release()) : nullptr);
@@ -113,7 +114,7 @@ void OSTFileManager::removeUnfinishedFilesInDirectoryURL(std::string_view path) 
         return;
     while (const dirent* const entry = ::readdir(stream.get()))
         if (std::string_view(entry->d_name).starts_with(unfinishedPrefix))
-            ::unlinkat(::dirfd(stream.get()), entry->d_name, 0);
+            static_cast<void>(removeItemAtURL(platform::pathByAppending(path, entry->d_name)));
 }
 
 OSTResult<OSTNewFile> OSTFileManager::createFileAtURL(std::string_view path, std::string_view bytes,

@@ -128,8 +128,8 @@ public:
     /// new. The new file is on disk when this returns.
     [[nodiscard]] OSTResult<void> writeFileAtomicallyAtURL(std::string_view path, std::string_view bytes,
                                                            const OSTFileAttributes& attributes = {}) const;
-    /// Removes the unfinished files that a crash left in a directory. Nobody may be writing there.
-    void removeUnfinishedFilesInDirectoryURL(std::string_view path) const;
+    /// Removes the unfinished files and copies that a crash left in a directory. Nobody may be writing there.
+    void removeUnfinishedItemsInDirectoryURL(std::string_view path) const;
     /// Writes a file that must not exist yet (EEXIST), in a directory that nobody else looks into, and leaves the wait
     /// for the disk to the caller.
     [[nodiscard]] OSTResult<OSTNewFile> createFileAtURL(std::string_view path, std::string_view bytes,

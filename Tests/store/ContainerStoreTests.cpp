@@ -256,6 +256,7 @@ TEST_F(ContainerStore, LinkInPlaceOfADirectoryLeadsNowhere) {
 TEST_F(ContainerStore, StagingLeftByACrashIsDestroyedAtTheNextStart) {
     fs::create_directories(fs::path(stagingDirectory) / "HALF-MADE" / "Library");
     test::writeFile(fs::path(stagingDirectory) / "file", "x");
+    test::writeFile(fs::path(stagingDirectory) / ".temp.a1b2c3/HALF-COPIED/file", "x");
     store().containerManagerCleanup();
     EXPECT_EQ(1, passCode());
     EXPECT_TRUE(isEmpty(stagingDirectory));
