@@ -1,10 +1,10 @@
 #include "platform/CBOR.h"
 #include "platform/CBORFormat.h"
 #include "platform/MessageFormat.h"
+#include "platform/Unicode.h"
 
 #include <algorithm>
 #include <array>
-#include <cstring>
 #include <functional>
 #include <limits>
 #include <memory_resource>
@@ -16,50 +16,6 @@ namespace ost::platform {
 using namespace cbor;
 
 namespace {
-
-/// The length of the UTF-8 sequence at the start of `text`, 0 when there is no valid one or it is NUL.
-std::size_t sequenceLength(std::string_view text) {
-    const auto byte = [&](std::size_t index) {
-        return index < text.size() ? static_cast<std::uint8_t>(text[index]) : std::uint8_t{0};
-    };
-    const auto continues = [&](std::size_t index) { return (byte(index) & 0xc0) == 0x80; };
-    const unsigned first = byte(0), second = byte(1);
-    if (first < 0x80)
-        return first == 0 ? 0 : 1;
-    if (first >= 0xc2 && first <= 0xdf)
-        return continues(1) ? 2 : 0;
-    if (first >= 0xe0 && first <= 0xef) {
-        const bool overlong = first == 0xe0 && second < 0xa0;
-        const bool surrogate = first == 0xed && second >= 0xa0;
-        return continues(1) && continues(2) && !overlong && !surrogate ? 3 : 0;
-    }
-    if (first >= 0xf0 && first <= 0xf4) {
-        const bool overlong = first == 0xf0 && second < 0x90;
-        const bool tooLarge = first == 0xf4 && second >= 0x90;
-        return continues(1) && continues(2) && continues(3) && !overlong && !tooLarge ? 4 : 0;
-    }
-    return 0;
-}
-
-/// Whether `text` is UTF-8 without NUL. Almost all texts are ASCII, which goes eight bytes at a time.
-bool isValidText(std::string_view text) {
-    constexpr std::uint64_t ones = 0x0101010101010101, highBits = 0x8080808080808080;
-    while (!text.empty()) {
-        if (std::uint64_t word = 0; text.size() >= sizeof word) {
-            std::memcpy(&word, text.data(), sizeof word);
-            const bool plain = (((word - ones) | word) & highBits) == 0;
-            if (plain) {
-                text.remove_prefix(sizeof word);
-                continue;
-            }
-        }
-        const auto length = sequenceLength(text);
-        if (length == 0)
-            return false;
-        text.remove_prefix(length);
-    }
-    return true;
-}
 
 /// The check of one payload: one pass, with a stack of the arrays and maps that are open.
 class Validator {

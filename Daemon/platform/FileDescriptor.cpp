@@ -1,5 +1,9 @@
 #include "platform/FileDescriptor.h"
 
+#include <fcntl.h>
+#include <linux/openat2.h>
+#include <sys/syscall.h>
+
 #include <cerrno>
 
 namespace ost::platform {
@@ -12,6 +16,16 @@ void FileDescriptor::reset(int fd) noexcept {
         errno = saved;
     }
     _fd = fd;
+}
+
+std::expected<FileDescriptor, int> openWithoutLinks(int base, const char* path, int flags, std::uint64_t resolve) {
+    open_how how{};
+    how.flags = static_cast<std::uint32_t>(flags | O_NOFOLLOW | O_CLOEXEC);
+    how.resolve = RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS | resolve;
+    const long fd = ::syscall(SYS_openat2, base, path, &how, sizeof how);
+    if (fd < 0)
+        return std::unexpected(errno);
+    return FileDescriptor(static_cast<int>(fd));
 }
 
 } // namespace ost::platform

@@ -2,6 +2,8 @@
 
 #include <unistd.h>
 
+#include <cstdint>
+#include <expected>
 #include <utility>
 
 namespace ost::platform {
@@ -33,5 +35,10 @@ public:
 private:
     int _fd = -1;
 };
+
+/// Opens `path`, relative to the directory `base` or absolute, and follows no symbolic link, neither on the way (ELOOP)
+/// nor at its end. Close-on-exec. `resolve` adds further RESOLVE_ flags of openat2.
+[[nodiscard]] std::expected<FileDescriptor, int> openWithoutLinks(int base, const char* path, int flags,
+                                                                  std::uint64_t resolve = 0);
 
 } // namespace ost::platform

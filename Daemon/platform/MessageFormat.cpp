@@ -1,6 +1,7 @@
 #include "platform/MessageFormat.h"
 
 #include "platform/Assert.h"
+#include "platform/Unicode.h"
 
 #include <algorithm>
 #include <charconv>
@@ -11,25 +12,15 @@ namespace {
 
 /// The length of the valid UTF-8 sequence at the start of `text` that only shows itself, or 0.
 std::size_t printableSequence(std::string_view text) {
-    const auto at = [&](std::size_t i) { return static_cast<unsigned char>(text[i]); };
-    const auto first = at(0);
-    if (first < 0x80)
-        return first >= 0x20 && first != 0x7f ? 1 : 0;
-    const std::size_t length = first >= 0xf0 ? 4 : first >= 0xe0 ? 3 : 2;
-    if (first < 0xc2 || first > 0xf4 || text.size() < length)
+    auto rest = text;
+    const auto codePoint = takeCodePoint(rest);
+    if (!codePoint)
         return 0;
-    for (std::size_t i = 1; i < length; ++i)
-        if ((at(i) & 0xc0) != 0x80)
-            return 0;
-    const auto second = at(1);
-    const bool secondControlBlock = first == 0xc2 && second < 0xa0;
-    const bool overlong = (first == 0xe0 && second < 0xa0) || (first == 0xf0 && second < 0x90);
-    const bool outOfRange = (first == 0xed && second >= 0xa0) || (first == 0xf4 && second >= 0x90);
+    const auto isBetween = [&](char32_t first, char32_t last) { return *codePoint >= first && *codePoint <= last; };
+    const bool controls = *codePoint < 0x20 || isBetween(0x7f, 0x9f);
     // Separators of lines, and what makes a terminal show a text in another order than it has.
-    const auto third = length == 3 ? at(2) : 0;
-    const bool rearranges = first == 0xe2 && ((second == 0x80 && third >= 0xa8 && third <= 0xae) ||
-                                              (second == 0x81 && third >= 0xa6 && third <= 0xa9));
-    return secondControlBlock || overlong || outOfRange || rearranges ? 0 : length;
+    const bool rearranges = isBetween(0x2028, 0x202e) || isBetween(0x2066, 0x2069);
+    return controls || rearranges ? 0 : text.size() - rest.size();
 }
 
 /// What a message shows of one text: every path and identifier of ordinary length, and not so much that a client could

@@ -4,9 +4,7 @@
 #include "platform/Try.h"
 
 #include <fcntl.h>
-#include <linux/openat2.h>
 #include <sys/stat.h>
-#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -65,11 +63,7 @@ std::expected<FileDescriptor, int> openOrMake(int parent, const std::string& nam
 std::expected<FileDescriptor, int> openItems(std::uint32_t userId, std::uint64_t type) {
     const auto user = std::to_string(userId), items = std::to_string(type);
     const auto path = std::string(sandboxStateDirectory) + "/" + user + "/" + items;
-    open_how how{};
-    how.flags = O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
-    how.resolve = RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS;
-    FileDescriptor existing(static_cast<int>(::syscall(SYS_openat2, AT_FDCWD, path.c_str(), &how, sizeof how)));
-    if (existing)
+    if (auto existing = openWithoutLinks(AT_FDCWD, path.c_str(), O_PATH | O_DIRECTORY))
         return existing;
     const auto top = OST_TRY(openOrMake(AT_FDCWD, sandboxStateDirectory));
     const auto ofUser = OST_TRY(openOrMake(top.get(), user));

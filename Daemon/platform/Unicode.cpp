@@ -48,12 +48,21 @@ std::optional<char32_t> takeCodePoint(std::string_view& text) {
     return valid ? std::optional(codePoint) : std::nullopt;
 }
 
-bool isValidUTF8(std::string_view text) {
-    if (isASCII(text))
-        return true;
-    while (!text.empty())
-        if (!takeCodePoint(text))
+bool isValidText(std::string_view text) {
+    // Almost all texts are ASCII, which goes eight bytes at a time.
+    constexpr std::uint64_t ones = 0x0101010101010101, highBits = 0x8080808080808080;
+    while (!text.empty()) {
+        if (std::uint64_t word = 0; text.size() >= sizeof word) {
+            std::memcpy(&word, text.data(), sizeof word);
+            const bool plain = (((word - ones) | word) & highBits) == 0;
+            if (plain) {
+                text.remove_prefix(sizeof word);
+                continue;
+            }
+        }
+        if (!takeCodePoint(text).value_or(0))
             return false;
+    }
     return true;
 }
 

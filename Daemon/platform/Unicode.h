@@ -9,8 +9,8 @@ namespace ost::platform {
 /// Whether every byte of `text` is below 0x80.
 [[nodiscard]] bool isASCII(std::string_view text);
 
-/// Whether `text` is UTF-8 throughout.
-[[nodiscard]] bool isValidUTF8(std::string_view text);
+/// Whether `text` is UTF-8 without NUL, as every text is that goes over the wire.
+[[nodiscard]] bool isValidText(std::string_view text);
 
 /// Takes the first code point off `text`, which must not be empty. A byte that begins no valid UTF-8 sequence is taken
 /// off alone and gives nothing.

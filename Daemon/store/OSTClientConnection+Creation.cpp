@@ -41,8 +41,6 @@ bool placeIsPending(const OSTMetadata& record) { return record.pendingPlacement 
 /// so after the locks are released; whoever finds one that is not there yet does it too, since it is going to be
 /// answered.
 OSTResult<void> makePlaceDurable(const OSTMetadata& record) {
-    if (!placeIsPending(record))
-        return {};
     const auto durable = OSTFileManager::defaultManager().makeDirectoryDurable(pathByDeletingLastComponent(record.url));
     if (!durable)
         return std::unexpected(OSTCreateError(OSTErrorCode::moveToLiveFailed, durable.error(),
@@ -77,10 +75,11 @@ OSTClientConnection::createOrLookupContainerForUser(const OSTContainerLookup& lo
         }
         lock.unlock();
         underWay.reset();
-        if (record && placeIsPending(**record) && lookup.useLocking)
-            OSTCommitSharing::sharedInstance().letOthersCommit();
-        if (record)
+        if (record && placeIsPending(**record)) {
+            if (lookup.useLocking)
+                OSTCommitSharing::sharedInstance().letOthersCommit();
             OST_TRY(makePlaceDurable(**record));
+        }
         return record;
     });
     if (!result)
@@ -215,7 +214,9 @@ OSTClientConnection::containersForUser(std::uint32_t userId, OSTContainerClass c
             OST_TRY(OSTContainerCache::sharedInstance().allContainersForUser(userId, containerClass, transient));
         lock.unlock();
         // What may be forgotten in a power cut is not said to be there; the log has the reason.
-        std::erase_if(records, [](const OSTMetadataRecord& record) { return !makePlaceDurable(*record); });
+        std::erase_if(records, [](const OSTMetadataRecord& record) {
+            return placeIsPending(*record) && !makePlaceDurable(*record);
+        });
         return records;
     });
     if (!result)

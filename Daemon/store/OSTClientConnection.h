@@ -148,7 +148,6 @@ private:
     [[nodiscard]] OSTResult<void> _checkLookup(const OSTContainerLookup& lookup) const;
     [[nodiscard]] OSTResult<OSTMetadataRecord> _lookUpOrCreate(const OSTContainerLookup& lookup,
                                                                std::optional<std::string>& staging) const;
-    [[nodiscard]] OSTResult<OSTMetadataRecord> _findContainer(const OSTContainerLookup& lookup) const;
     [[nodiscard]] OSTResult<OSTMetadataRecord> _createContainer(const OSTContainerLookup& lookup,
                                                                 std::optional<std::string>& staging) const;
     [[nodiscard]] static OSTResult<OSTMetadata> _buildInStaging(const OSTContainerLookup& lookup,

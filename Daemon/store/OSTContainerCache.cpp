@@ -57,7 +57,7 @@ OSTResult<void> checkOnDisk(const OSTMetadata& record, bool transient, std::sour
 /// The record of an item of a class directory; null, with the reason in the log, when the item is no valid container.
 OSTMetadataRecord readItem(int open, const std::string& directory, const std::string& name, std::uint32_t userId,
                            bool transient, std::string& buffer) {
-    if (!platform::isValidUTF8(name)) { // no answer could hold its path
+    if (!platform::isValidText(name)) { // no answer could hold its path
         platform::logError("Skipping %@ in %@, whose name is not UTF-8", name, directory);
         return nullptr;
     }

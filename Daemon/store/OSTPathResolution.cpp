@@ -3,8 +3,6 @@
 #include "platform/Try.h"
 
 #include <linux/openat2.h>
-#include <sys/syscall.h>
-#include <unistd.h>
 
 #include <cerrno>
 #include <cstring>
@@ -32,15 +30,8 @@ std::expected<FileDescriptor, int> OSTOpenItem(int base, std::string_view path, 
 
     // The kernel refuses non-blocking together with O_PATH, which never waits anyway.
     const int unblocked = (flags & O_PATH) != 0 ? 0 : O_NONBLOCK | O_NOCTTY;
-    open_how how{};
-    how.flags = static_cast<std::uint32_t>(flags | O_NOFOLLOW | O_CLOEXEC | unblocked);
-    how.resolve = RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS;
-    if (mounts == OSTMounts::stayOut)
-        how.resolve |= RESOLVE_NO_XDEV;
-    const long fd = ::syscall(SYS_openat2, base, terminated, &how, sizeof how);
-    if (fd < 0)
-        return std::unexpected(errno);
-    return FileDescriptor(static_cast<int>(fd));
+    return platform::openWithoutLinks(base, terminated, flags | unblocked,
+                                      mounts == OSTMounts::stayOut ? RESOLVE_NO_XDEV : 0);
 }
 
 std::expected<OSTItemPlace, int> OSTItemPlace::find(std::string_view path, int access) {
