@@ -7,6 +7,7 @@
 #include "support/BootedDevice.h"
 #include "support/Comparison.h"
 #include "support/Require.h"
+#include "support/Stopwatch.h"
 #include "support/Workshop.h"
 
 #include <dirent.h>
@@ -27,14 +28,11 @@ namespace ost::benchmarks {
 
 namespace {
 
-using Clock = std::chrono::steady_clock;
 using platform::FileDescriptor;
 using platform::UUID;
 
 constexpr unsigned containers = 100'000;
 constexpr unsigned turns = 9;
-
-double secondsSince(Clock::time_point start) { return std::chrono::duration<double>(Clock::now() - start).count(); }
 
 /// 40 bytes, as identifiers usually are about.
 std::string identifierOf(unsigned number) {

@@ -16,6 +16,7 @@
 #include "support/OneProcessor.h"
 #include "support/Require.h"
 #include "support/RoundTrips.h"
+#include "support/Stopwatch.h"
 #include "support/Workshop.h"
 
 #include <fcntl.h>
@@ -32,7 +33,6 @@ namespace ost::benchmarks {
 
 namespace {
 
-using Clock = std::chrono::steady_clock;
 using ostrand::ContainerClass;
 using platform::CBOREncoder;
 using platform::FileDescriptor;
@@ -40,8 +40,6 @@ using platform::IPCFrameHeader;
 
 constexpr unsigned identifiers = 10'000;
 constexpr const char* mappingFile = "/private/var/root/Library/Ostrand/ost_code_signing_info.plist";
-
-double secondsSince(Clock::time_point start) { return std::chrono::duration<double>(Clock::now() - start).count(); }
 
 std::string identifierOf(unsigned number) { return "com.example.benchmark.application." + std::to_string(number); }
 
@@ -140,17 +138,6 @@ void oneMore(benchmark::State& state) {
                    },
                .baseline = [&] { return secondsOfRewriting(file, bare); }}
         .run(state);
-}
-
-/// A request as the client library sends it. Made here, so that what is timed is the daemon and not the library.
-std::string requestWith(std::uint64_t entries, const std::function<void(CBOREncoder&)>& writeEntries) {
-    std::string frame(IPCFrameHeader::size, '\0');
-    CBOREncoder encoder(frame);
-    encoder.beginMap(entries);
-    writeEntries(encoder);
-    IPCFrameHeader{.payloadLength = static_cast<std::uint32_t>(frame.size() - IPCFrameHeader::size), .requestNumber = 1}
-        .write(frame.data());
-    return frame;
 }
 
 std::string registrationOf(unsigned number) {

@@ -6,6 +6,7 @@
 #include "support/Comparison.h"
 #include "support/JournaledFileSystem.h"
 #include "support/Require.h"
+#include "support/Stopwatch.h"
 
 #include <fcntl.h>
 #include <sys/stat.h>
@@ -23,19 +24,12 @@ namespace ost::benchmarks {
 
 namespace {
 
-using Clock = std::chrono::steady_clock;
 using platform::FileDescriptor;
 using platform::UUID;
 
 /// Few enough that a turn is short against the drift of the disk.
 constexpr unsigned creationsInTurn = 24;
 constexpr unsigned turns = 31;
-
-double secondsOf(const std::function<void()>& work) {
-    const auto start = Clock::now();
-    work();
-    return std::chrono::duration<double>(Clock::now() - start).count();
-}
 
 /// Creates containers through the client library, each under a name of its own.
 class Creator {

@@ -23,26 +23,21 @@ using platform::IPCFrameHeader;
 
 constexpr const char* identifier = "com.example.Sketches.Documents";
 
-/// The request as the client library sends it. Made here, so that what is timed is the daemon and not the library.
 std::string lookUpRequest() {
-    std::string frame(IPCFrameHeader::size, '\0');
-    platform::CBOREncoder encoder(frame);
-    encoder.beginMap(6);
-    encoder.key("Command");
-    encoder.unsignedNumber(0);
-    encoder.key("ContainerClass");
-    encoder.unsignedNumber(static_cast<std::uint64_t>(ContainerClass::dataApplication));
-    encoder.key("UserID");
-    encoder.unsignedNumber(ostrand::currentUser);
-    encoder.key("Transient");
-    encoder.boolean(false);
-    encoder.key("Identifier");
-    encoder.text(identifier);
-    encoder.key("CreateIfNecessary");
-    encoder.boolean(false);
-    IPCFrameHeader{.payloadLength = static_cast<std::uint32_t>(frame.size() - IPCFrameHeader::size), .requestNumber = 1}
-        .write(frame.data());
-    return frame;
+    return requestWith(6, [](platform::CBOREncoder& encoder) {
+        encoder.key("Command");
+        encoder.unsignedNumber(0);
+        encoder.key("ContainerClass");
+        encoder.unsignedNumber(static_cast<std::uint64_t>(ContainerClass::dataApplication));
+        encoder.key("UserID");
+        encoder.unsignedNumber(ostrand::currentUser);
+        encoder.key("Transient");
+        encoder.boolean(false);
+        encoder.key("Identifier");
+        encoder.text(identifier);
+        encoder.key("CreateIfNecessary");
+        encoder.boolean(false);
+    });
 }
 
 /// A daemon with one container, and an echo that answers the look-up of that container with what the daemon answers.

@@ -8,6 +8,7 @@
 #include "support/JournaledFileSystem.h"
 #include "support/OneProcessor.h"
 #include "support/Require.h"
+#include "support/Stopwatch.h"
 #include "support/Workshop.h"
 
 #include <fcntl.h>
@@ -26,7 +27,6 @@ namespace ost::benchmarks {
 
 namespace {
 
-using Clock = std::chrono::steady_clock;
 using ostrand::ContainerClass;
 using platform::FileDescriptor;
 using platform::UUID;
@@ -35,12 +35,6 @@ using platform::UUID;
 constexpr unsigned containersInTurn = 24;
 constexpr unsigned directoriesOfLargeTree = 1000;
 constexpr unsigned filesOfLargeTree = 100'000;
-
-double secondsOf(const std::function<void()>& work) {
-    const auto start = Clock::now();
-    work();
-    return std::chrono::duration<double>(Clock::now() - start).count();
-}
 
 ostrand::Container create(ostrand::Connection& connection, const std::string& identifier, bool transient = false) {
     return require(

@@ -3,6 +3,7 @@
 #include "platform/IPCFrame.h"
 #include "support/Require.h"
 #include "support/Socket.h"
+#include "support/Stopwatch.h"
 
 #include <sys/epoll.h>
 #include <sys/socket.h>
@@ -17,7 +18,6 @@ namespace ost::benchmarks {
 
 using platform::FileDescriptor;
 using platform::IPCFrameHeader;
-using Clock = std::chrono::steady_clock;
 
 namespace {
 
@@ -43,9 +43,17 @@ void expect(std::size_t size, std::size_t expected) {
         throw std::runtime_error("a reply of another size");
 }
 
-double secondsSince(Clock::time_point start) { return std::chrono::duration<double>(Clock::now() - start).count(); }
-
 } // namespace
+
+std::string requestWith(std::uint64_t entries, const std::function<void(platform::CBOREncoder&)>& writeEntries) {
+    std::string frame(IPCFrameHeader::size, '\0');
+    platform::CBOREncoder encoder(frame);
+    encoder.beginMap(entries);
+    writeEntries(encoder);
+    IPCFrameHeader{.payloadLength = static_cast<std::uint32_t>(frame.size() - IPCFrameHeader::size), .requestNumber = 1}
+        .write(frame.data());
+    return frame;
+}
 
 RoundTrips::RoundTrips(const std::string& socketPath, std::string request)
     : _socket(connectTo(socketPath)), _request(std::move(request)), _received(largestReply, '\0') {}

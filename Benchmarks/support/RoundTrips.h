@@ -1,14 +1,22 @@
 #pragma once
 
+#include "platform/CBOR.h"
 #include "platform/FileDescriptor.h"
 
 #include <chrono>
 #include <cstddef>
+#include <cstdint>
+#include <functional>
 #include <string>
 #include <string_view>
 #include <vector>
 
 namespace ost::benchmarks {
+
+/// A request of so many entries, as the client library sends it. Made here, so that what is timed is the daemon and not
+/// the library.
+[[nodiscard]] std::string requestWith(std::uint64_t entries,
+                                      const std::function<void(platform::CBOREncoder&)>& writeEntries);
 
 /// One client that sends the same request over and over, and does nothing else.
 class RoundTrips {

@@ -5,11 +5,8 @@
 
 #include <gtest/gtest.h>
 
-#include <unistd.h>
-
 #include <cerrno>
 #include <filesystem>
-#include <optional>
 #include <set>
 #include <string>
 
@@ -29,17 +26,14 @@ struct Kind {
 void PrintTo(const Kind& kind, std::ostream* out) { *out << kind.name; }
 
 /// A daemon whose file-system calls fail or kill it while it makes a container.
-class CreationFaultTest : public testing::TestWithParam<Kind> {
+class CreationFaultTest : public GatedDeviceTest, public testing::WithParamInterface<Kind> {
 protected:
     void SetUp() override {
-        if (::geteuid() != 0)
-            GTEST_SKIP() << "A device can be run by root only";
-        _device.emplace();
-        _device->startDaemon();
-        ASSERT_TRUE(_device->waitForFirstPass());
+        GatedDeviceTest::SetUp();
+        if (IsSkipped())
+            return;
+        ASSERT_TRUE(device().waitForFirstPass());
     }
-
-    GatedDevice& device() { return *_device; }
 
     static ostrand::Result<ostrand::Container> create(Connection& connection, const std::string& identifier) {
         return ostrand::createOrLookup(connection,
@@ -58,9 +52,6 @@ protected:
         EXPECT_EQ(listedContainers(connection, GetParam().containerClass, false), onDisk);
         return onDisk;
     }
-
-private:
-    std::optional<GatedDevice> _device;
 };
 
 } // namespace

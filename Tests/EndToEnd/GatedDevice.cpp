@@ -146,4 +146,11 @@ void GatedDevice::enter() const {
         ::_exit(EXIT_FAILURE); // It would act on the host.
 }
 
+void GatedDeviceTest::SetUp() {
+    if (::geteuid() != 0)
+        GTEST_SKIP() << "A device can be run by root only";
+    _device.emplace();
+    _device->startDaemon();
+}
+
 } // namespace ost::test

@@ -6,6 +6,8 @@
 #include "EndToEnd/Wire.h"
 #include "platform/FileDescriptor.h"
 
+#include <gtest/gtest.h>
+
 #include <filesystem>
 #include <optional>
 #include <string>
@@ -54,6 +56,16 @@ private:
     platform::FileDescriptor _program, _complaints, _listener;
     wire::Client _client;
     std::optional<GatedProcess> _daemon;
+};
+
+/// A test with such a device, whose daemon has been started.
+class GatedDeviceTest : public testing::Test {
+protected:
+    void SetUp() override;
+    [[nodiscard]] GatedDevice& device() { return *_device; }
+
+private:
+    std::optional<GatedDevice> _device;
 };
 
 } // namespace ost::test

@@ -8,11 +8,8 @@
 
 #include <gtest/gtest.h>
 
-#include <unistd.h>
-
 #include <cerrno>
 #include <filesystem>
-#include <optional>
 #include <set>
 #include <string>
 
@@ -61,20 +58,17 @@ for k, v in sorted(plistlib.load(open(sys.argv[1], "rb")).items()): print(k, v["
 }
 
 /// A daemon whose file-system calls fail or kill it while it rewrites the mapping file.
-class MappingFaultTest : public testing::Test {
+class MappingFaultTest : public GatedDeviceTest {
 protected:
     void SetUp() override {
-        if (::geteuid() != 0)
-            GTEST_SKIP() << "A device can be run by root only";
-        _device.emplace();
-        _device->startDaemon();
+        GatedDeviceTest::SetUp();
+        if (IsSkipped())
+            return;
         auto connection = device().connect();
         for (int other = 10; other < 50; ++other)
             ASSERT_TRUE(registerClass(connection, "com.example." + std::to_string(other), 9));
         ASSERT_TRUE(registerClass(connection, "com.example.changing", 0));
     }
-
-    GatedDevice& device() { return *_device; }
 
     static ostrand::Result<void> registerClass(Connection& connection, const std::string& identifier,
                                                std::uint64_t dataContainerClass) {
@@ -91,9 +85,6 @@ protected:
         EXPECT_NE(std::string::npos, at) << file;
         return at == std::string::npos ? "" : std::string(file).replace(at, line(from).size(), line(to));
     }
-
-private:
-    std::optional<GatedDevice> _device;
 };
 
 TEST_F(MappingFaultTest, AKillAtAnyMomentLeavesTheOldFileOrTheNew) {

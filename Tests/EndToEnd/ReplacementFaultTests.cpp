@@ -81,17 +81,8 @@ ostrand::ContainerReference referenceTo(const Container& container, ContainerCla
 /// Replacements of one container by another of the same identifier, in one boot of one device: each time the two are
 /// made anew, something happens to the replacement, the daemon starts again, and the disk must hold one of them in its
 /// place.
-class ReplacementFaultTest : public testing::TestWithParam<Setting> {
+class ReplacementFaultTest : public GatedDeviceTest, public testing::WithParamInterface<Setting> {
 protected:
-    void SetUp() override {
-        if (::geteuid() != 0)
-            GTEST_SKIP() << "A device can be run by root only";
-        _device.emplace();
-        _device->startDaemon();
-    }
-
-    [[nodiscard]] GatedDevice& device() { return *_device; }
-
     void makeBoth() {
         auto connection = device().connect();
         _old = _make(connection, "old", GetParam().oldIsTransient);
@@ -244,7 +235,6 @@ private:
         return static_cast<int>(result ? OSTErrorCode::success : result.error());
     }
 
-    std::optional<GatedDevice> _device;
     Made _old, _new;
     std::filesystem::path _destination;
 };
