@@ -3,7 +3,7 @@
 
 #include "Client/Containers.h"
 #include "model/OSTMetadata.h"
-#include "platform/PropertyList.h"
+#include "platform/codec/PropertyList.h"
 #include "support/BootedDevice.h"
 #include "support/Comparison.h"
 #include "support/Require.h"

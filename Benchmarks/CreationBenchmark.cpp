@@ -1,7 +1,7 @@
 // Creation of containers that survive a power cut, beside a loop that makes the same directories and files.
 
 #include "Client/Containers.h"
-#include "platform/UUID.h"
+#include "platform/base/UUID.h"
 #include "support/BootedDevice.h"
 #include "support/Comparison.h"
 #include "support/JournaledFileSystem.h"

@@ -1,8 +1,8 @@
 // Look-ups of an existing container, beside an echo of the same bytes from an event loop.
 
 #include "Client/Containers.h"
-#include "platform/CBOR.h"
-#include "platform/IPCFrame.h"
+#include "platform/codec/CBOR.h"
+#include "platform/ipc/IPCFrame.h"
 #include "support/BootedDevice.h"
 #include "support/Comparison.h"
 #include "support/EchoServer.h"

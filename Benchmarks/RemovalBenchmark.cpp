@@ -1,7 +1,7 @@
 // Staging for deletion, destruction and replacement, beside the same moves, writes and removals without a daemon.
 
 #include "Client/Containers.h"
-#include "platform/UUID.h"
+#include "platform/base/UUID.h"
 #include "support/BootedDevice.h"
 #include "support/ChildProcess.h"
 #include "support/Comparison.h"

@@ -1,7 +1,7 @@
 #include "Client/CodeSigning.h"
 
-#include "platform/IPCValue.h"
-#include "platform/Try.h"
+#include "platform/base/Try.h"
+#include "platform/codec/IPCValue.h"
 
 #include <cerrno>
 

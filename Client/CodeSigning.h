@@ -2,7 +2,7 @@
 
 #include "Client/Connection.h"
 #include "Client/ContainerClass.h"
-#include "platform/OSTValue.h"
+#include "platform/base/OSTValue.h"
 
 #include <map>
 #include <optional>

@@ -1,8 +1,8 @@
 #include "Client/Connection.h"
 
-#include "platform/Assert.h"
-#include "platform/Path.h"
-#include "platform/Try.h"
+#include "platform/base/Assert.h"
+#include "platform/base/Path.h"
+#include "platform/base/Try.h"
 
 #include <algorithm>
 #include <cerrno>

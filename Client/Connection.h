@@ -1,9 +1,9 @@
 #pragma once
 
 #include "Client/Error.h"
-#include "platform/CBOR.h"
-#include "platform/FileDescriptor.h"
-#include "platform/IPCFrame.h"
+#include "platform/base/FileDescriptor.h"
+#include "platform/codec/CBOR.h"
+#include "platform/ipc/IPCFrame.h"
 
 #include <cerrno>
 #include <chrono>

@@ -1,6 +1,6 @@
 #include "Client/Containers.h"
 
-#include "platform/Try.h"
+#include "platform/base/Try.h"
 
 #include <cerrno>
 

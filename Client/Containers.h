@@ -2,7 +2,7 @@
 
 #include "Client/Connection.h"
 #include "Client/ContainerClass.h"
-#include "platform/UUID.h"
+#include "platform/base/UUID.h"
 
 #include <optional>
 #include <string>

@@ -1,6 +1,6 @@
 #include "Device/DeviceImage.h"
 
-#include "platform/Try.h"
+#include "platform/base/Try.h"
 
 #include <fcntl.h>
 #include <linux/openat2.h>

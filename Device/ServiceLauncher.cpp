@@ -1,6 +1,6 @@
 #include "Device/ServiceLauncher.h"
 
-#include "platform/Try.h"
+#include "platform/base/Try.h"
 
 #include <elf.h>
 #include <fcntl.h>

@@ -1,5 +1,5 @@
-#include "platform/Assert.h"
-#include "platform/CBOR.h"
+#include "platform/base/Assert.h"
+#include "platform/codec/CBOR.h"
 
 #include <cstddef>
 #include <cstdint>

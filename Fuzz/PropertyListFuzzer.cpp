@@ -1,5 +1,5 @@
-#include "platform/Assert.h"
-#include "platform/PropertyList.h"
+#include "platform/base/Assert.h"
+#include "platform/codec/PropertyList.h"
 
 #include <algorithm>
 #include <cmath>

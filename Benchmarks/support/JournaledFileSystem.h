@@ -1,6 +1,6 @@
 #pragma once
 
-#include "platform/FileDescriptor.h"
+#include "platform/base/FileDescriptor.h"
 
 #include <filesystem>
 

@@ -1,6 +1,6 @@
 #include "support/RoundTrips.h"
 
-#include "platform/IPCFrame.h"
+#include "platform/ipc/IPCFrame.h"
 #include "support/Require.h"
 #include "support/Socket.h"
 #include "support/Stopwatch.h"

@@ -1,7 +1,7 @@
 #pragma once
 
-#include "platform/CBOR.h"
-#include "platform/FileDescriptor.h"
+#include "platform/base/FileDescriptor.h"
+#include "platform/codec/CBOR.h"
 
 #include <chrono>
 #include <cstddef>

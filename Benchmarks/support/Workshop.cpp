@@ -1,7 +1,7 @@
 #include "support/Workshop.h"
 
-#include "platform/CodeSignature.h"
-#include "platform/OSTValue.h"
+#include "platform/base/OSTValue.h"
+#include "platform/device/CodeSignature.h"
 #include "support/Require.h"
 
 #include <sched.h>

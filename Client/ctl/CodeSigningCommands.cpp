@@ -1,7 +1,7 @@
 #include "Client/CodeSigning.h"
 #include "Client/ctl/Commands.h"
 #include "Client/ctl/Values.h"
-#include "platform/Try.h"
+#include "platform/base/Try.h"
 
 #include <algorithm>
 #include <array>
@@ -58,11 +58,9 @@ Report reportOn(const char* done, const std::string& identifier) {
 
 Outcome registerInfo(const Arguments& arguments) {
     auto options = OST_TRY(optionsOf(arguments));
-    const Registration registration {
-        .identifier = *arguments.value(identifierOperand.name),
-        .info = OST_TRY(dictionaryIn(*arguments.value(infoOption.name)))
-        , .options = std::move(options)
-    };
+    const Registration registration{.identifier = *arguments.value(identifierOperand.name),
+                                    .info = OST_TRY(dictionaryIn(*arguments.value(infoOption.name))),
+                                    .options = std::move(options)};
     auto connection = OST_TRY(connectToDevice(arguments));
     OST_TRY(orFailure(registerCodeSigning(connection, registration)));
     return reportOn("registered", registration.identifier);

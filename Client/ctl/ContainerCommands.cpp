@@ -1,7 +1,7 @@
 #include "Client/Containers.h"
 #include "Client/ctl/Commands.h"
 #include "Client/ctl/Values.h"
-#include "platform/Try.h"
+#include "platform/base/Try.h"
 
 #include <algorithm>
 #include <chrono>
@@ -167,8 +167,7 @@ std::expected<ContainerReference, Failure> sideOf(const Arguments& arguments, Co
                                                   const ContainerRequest& about, const Option& uuidOption) {
     const auto text = arguments.value(uuidOption.name);
     if (!text)
-        return OST_TRY(listedContainers(connection, about, {*about.identifier}))
-    .front();
+        return OST_TRY(listedContainers(connection, about, {*about.identifier})).front();
     const auto uuid = ost::platform::UUID::parse(*text);
     if (!uuid)
         return std::unexpected(Failure::usage("\"" + escaped(*text) + "\" is no UUID"));

@@ -1,5 +1,5 @@
 #include "Client/ctl/Commands.h"
-#include "platform/DeviceLockState.h"
+#include "platform/device/DeviceLockState.h"
 
 namespace ostrand::ctl {
 

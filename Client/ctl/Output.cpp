@@ -1,7 +1,7 @@
 #include "Client/ctl/Output.h"
 
-#include "platform/MessageFormat.h"
-#include "platform/Unicode.h"
+#include "platform/base/MessageFormat.h"
+#include "platform/base/Unicode.h"
 
 #include <charconv>
 #include <cmath>

@@ -1,7 +1,7 @@
 #pragma once
 
 #include "Client/Error.h"
-#include "platform/OSTValue.h"
+#include "platform/base/OSTValue.h"
 
 #include <expected>
 #include <string>

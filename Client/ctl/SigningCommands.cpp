@@ -1,7 +1,7 @@
 #include "Client/ctl/Commands.h"
 #include "Client/ctl/Values.h"
-#include "platform/CodeSignature.h"
-#include "platform/Try.h"
+#include "platform/base/Try.h"
+#include "platform/device/CodeSignature.h"
 
 #include <cerrno>
 #include <sys/stat.h>

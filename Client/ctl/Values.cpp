@@ -1,7 +1,7 @@
 #include "Client/ctl/Values.h"
 
-#include "platform/PropertyList.h"
-#include "platform/Try.h"
+#include "platform/base/Try.h"
+#include "platform/codec/PropertyList.h"
 
 #include <cerrno>
 #include <charconv>

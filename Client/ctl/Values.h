@@ -2,7 +2,7 @@
 
 #include "Client/ContainerClass.h"
 #include "Client/ctl/Output.h"
-#include "platform/OSTValue.h"
+#include "platform/base/OSTValue.h"
 
 #include <cstdint>
 #include <expected>

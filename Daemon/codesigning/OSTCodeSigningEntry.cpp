@@ -1,6 +1,6 @@
 #include "codesigning/OSTCodeSigningEntry.h"
 
-#include "platform/MessageFormat.h"
+#include "platform/base/MessageFormat.h"
 
 namespace ost {
 

@@ -1,6 +1,6 @@
 #pragma once
 
-#include "platform/OSTValue.h"
+#include "platform/base/OSTValue.h"
 
 #include <cstdint>
 #include <memory>

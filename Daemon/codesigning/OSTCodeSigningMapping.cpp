@@ -1,10 +1,10 @@
 #include "codesigning/OSTCodeSigningMapping.h"
 
-#include "model/OSTDictionaryFile.h"
+#include "files/OSTDictionaryFile.h"
 #include "model/OSTGlobalConfiguration.h"
-#include "platform/Assert.h"
-#include "platform/Log.h"
-#include "platform/Path.h"
+#include "platform/base/Assert.h"
+#include "platform/base/Log.h"
+#include "platform/base/Path.h"
 #include "store/OSTContainerCache.h"
 #include "store/OSTLocks.h"
 

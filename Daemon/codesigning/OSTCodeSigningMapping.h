@@ -1,9 +1,9 @@
 #pragma once
 
 #include "codesigning/OSTCodeSigningEntry.h"
-#include "model/OSTError.h"
-#include "platform/OSTValue.h"
-#include "platform/WorkQueue.h"
+#include "platform/base/OSTError.h"
+#include "platform/base/OSTValue.h"
+#include "platform/threads/WorkQueue.h"
 #include "store/OSTLocks.h"
 
 #include <concepts>

@@ -3,8 +3,8 @@
 #include "codesigning/OSTCodeSigningMapping.h"
 #include "model/OSTFailureReport.h"
 #include "model/OSTGlobalConfiguration.h"
-#include "platform/Assert.h"
-#include "platform/Log.h"
+#include "platform/base/Assert.h"
+#include "platform/base/Log.h"
 #include "store/OSTContainerCache.h"
 #include "store/OSTLocks.h"
 

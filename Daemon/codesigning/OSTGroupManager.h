@@ -1,8 +1,8 @@
 #pragma once
 
 #include "model/OSTContainerClass.h"
-#include "model/OSTError.h"
 #include "model/OSTMetadata.h"
+#include "platform/base/OSTError.h"
 #include "store/OSTClientConnection.h"
 
 #include <cstdint>

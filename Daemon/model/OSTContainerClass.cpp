@@ -1,6 +1,6 @@
 #include "model/OSTContainerClass.h"
 
-#include "platform/Assert.h"
+#include "platform/base/Assert.h"
 
 #include <array>
 

@@ -1,9 +1,9 @@
 #include "model/OSTFailureReport.h"
 
-#include "platform/CrashReport.h"
-#include "platform/DeviceCapabilities.h"
-#include "platform/StackTrace.h"
-#include "platform/ThreadName.h"
+#include "platform/base/StackTrace.h"
+#include "platform/device/CrashReport.h"
+#include "platform/device/DeviceCapabilities.h"
+#include "platform/threads/ThreadName.h"
 
 #include <cxxabi.h>
 

@@ -1,6 +1,6 @@
 #pragma once
 
-#include "model/OSTError.h"
+#include "platform/base/OSTError.h"
 
 #include <exception>
 #include <source_location>

@@ -1,9 +1,9 @@
 #include "model/OSTGlobalConfiguration.h"
 
 #include "model/OSTMadeDirectory.h"
-#include "platform/Accounts.h"
-#include "platform/Log.h"
-#include "platform/Path.h"
+#include "platform/base/Log.h"
+#include "platform/base/Path.h"
+#include "platform/device/Accounts.h"
 
 #include <cerrno>
 #include <climits>

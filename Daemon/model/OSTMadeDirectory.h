@@ -1,7 +1,7 @@
 #pragma once
 
-#include "model/OSTError.h"
-#include "store/OSTFileManager.h"
+#include "files/OSTFileManager.h"
+#include "platform/base/OSTError.h"
 
 #include <string>
 

@@ -1,8 +1,8 @@
 #include "model/OSTMetadata.h"
 
-#include "model/OSTDictionaryFile.h"
-#include "platform/Path.h"
-#include "store/OSTFileManager.h"
+#include "files/OSTDictionaryFile.h"
+#include "files/OSTFileManager.h"
+#include "platform/base/Path.h"
 
 #include <optional>
 

@@ -1,10 +1,10 @@
 #pragma once
 
+#include "files/OSTFileManager.h"
 #include "model/OSTContainerClass.h"
-#include "model/OSTError.h"
-#include "platform/OSTValue.h"
-#include "platform/UUID.h"
-#include "store/OSTFileManager.h"
+#include "platform/base/OSTError.h"
+#include "platform/base/OSTValue.h"
+#include "platform/base/UUID.h"
 
 #include <atomic>
 #include <cstdint>
@@ -13,9 +13,6 @@
 #include <string_view>
 
 namespace ost {
-
-/// The file directly inside every container directory that says what the container is.
-inline constexpr std::string_view OSTMetadataFileName = ".com.tamarok.ostrand.metadata.plist";
 
 /// Whether reading a metadata file also checks that the container lies in the directory of its class.
 enum class OSTCheckClassPath : bool { no, yes };

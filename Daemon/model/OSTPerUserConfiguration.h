@@ -1,7 +1,7 @@
 #pragma once
 
+#include "files/OSTFileManager.h"
 #include "model/OSTContainerClass.h"
-#include "store/OSTFileManager.h"
 
 #include <cstdint>
 #include <memory>

@@ -1,7 +1,7 @@
 #include "model/OSTUserIdentity.h"
 
-#include "platform/Accounts.h"
-#include "platform/Log.h"
+#include "platform/base/Log.h"
+#include "platform/device/Accounts.h"
 
 #include <cerrno>
 #include <mutex>

@@ -1,7 +1,7 @@
 #include "protection/OSTLockStateQueue.h"
 
-#include "platform/DeviceLockState.h"
-#include "platform/Log.h"
+#include "platform/base/Log.h"
+#include "platform/device/DeviceLockState.h"
 
 namespace ost {
 

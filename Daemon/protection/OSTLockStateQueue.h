@@ -1,6 +1,6 @@
 #pragma once
 
-#include "platform/WorkQueue.h"
+#include "platform/threads/WorkQueue.h"
 
 #include <cstdint>
 

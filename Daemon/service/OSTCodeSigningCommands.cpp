@@ -4,8 +4,8 @@
 #include "codesigning/OSTGroupManager.h"
 #include "codesigning/OSTWhitelist.h"
 #include "model/OSTUserIdentity.h"
-#include "platform/IPCValue.h"
-#include "platform/Log.h"
+#include "platform/base/Log.h"
+#include "platform/codec/IPCValue.h"
 #include "service/OSTRequestReaders.h"
 
 #include <algorithm>

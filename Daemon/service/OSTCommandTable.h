@@ -1,7 +1,7 @@
 #pragma once
 
-#include "model/OSTError.h"
-#include "platform/IPCMessage.h"
+#include "platform/base/OSTError.h"
+#include "platform/ipc/IPCMessage.h"
 #include "store/OSTClientConnection.h"
 
 #include <array>

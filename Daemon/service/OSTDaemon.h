@@ -1,10 +1,10 @@
 #pragma once
 
-#include "platform/ActivatedSockets.h"
-#include "platform/DeviceLockState.h"
-#include "platform/IPCListener.h"
-#include "platform/RunLoop.h"
-#include "platform/UpcallPort.h"
+#include "platform/device/DeviceLockState.h"
+#include "platform/ipc/ActivatedSockets.h"
+#include "platform/ipc/IPCListener.h"
+#include "platform/ipc/UpcallPort.h"
+#include "platform/threads/RunLoop.h"
 #include "protection/OSTLockStateQueue.h"
 
 #include <memory>

@@ -1,7 +1,7 @@
 #include "service/OSTRemovalCommands.h"
 
 #include "model/OSTUserIdentity.h"
-#include "platform/Log.h"
+#include "platform/base/Log.h"
 #include "service/OSTRequestReaders.h"
 
 #include <utility>

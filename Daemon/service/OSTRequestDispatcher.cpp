@@ -2,7 +2,7 @@
 
 #include "codesigning/OSTCodeSigningMapping.h"
 #include "model/OSTFailureReport.h"
-#include "platform/Log.h"
+#include "platform/base/Log.h"
 
 #include <cerrno>
 #include <cstring>

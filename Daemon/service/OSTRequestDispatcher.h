@@ -1,7 +1,7 @@
 #pragma once
 
-#include "platform/IPCConnection.h"
-#include "platform/IPCMessage.h"
+#include "platform/ipc/IPCConnection.h"
+#include "platform/ipc/IPCMessage.h"
 #include "service/OSTCommandTable.h"
 #include "store/OSTClientConnection.h"
 

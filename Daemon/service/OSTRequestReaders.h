@@ -1,8 +1,8 @@
 #pragma once
 
 #include "model/OSTContainerClass.h"
-#include "model/OSTError.h"
-#include "platform/IPCMessage.h"
+#include "platform/base/OSTError.h"
+#include "platform/ipc/IPCMessage.h"
 #include "store/OSTClientConnection.h"
 
 #include <cstdint>

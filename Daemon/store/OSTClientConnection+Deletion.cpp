@@ -1,10 +1,10 @@
+#include "files/OSTFileManager.h"
 #include "model/OSTFailureReport.h"
 #include "model/OSTGlobalConfiguration.h"
-#include "platform/Path.h"
-#include "platform/Transactions.h"
+#include "platform/base/Path.h"
+#include "platform/threads/Transactions.h"
 #include "store/OSTClientConnection.h"
 #include "store/OSTContainerCache.h"
-#include "store/OSTFileManager.h"
 #include "store/OSTLocks.h"
 #include "store/OSTStoreDelegate.h"
 

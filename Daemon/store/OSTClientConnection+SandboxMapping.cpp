@@ -1,5 +1,5 @@
-#include "platform/Log.h"
-#include "platform/SandboxUserState.h"
+#include "platform/base/Log.h"
+#include "platform/device/SandboxUserState.h"
 #include "store/OSTClientConnection.h"
 
 namespace ost {

@@ -1,7 +1,7 @@
+#include "files/OSTFileManager.h"
 #include "model/OSTGlobalConfiguration.h"
-#include "platform/Path.h"
+#include "platform/base/Path.h"
 #include "store/OSTClientConnection.h"
-#include "store/OSTFileManager.h"
 #include "store/OSTReplaceFile.h"
 
 #include <cerrno>

@@ -1,10 +1,10 @@
 #pragma once
 
 #include "model/OSTContainerClass.h"
-#include "model/OSTError.h"
 #include "model/OSTMetadata.h"
-#include "platform/UUID.h"
-#include "platform/WorkQueue.h"
+#include "platform/base/OSTError.h"
+#include "platform/base/UUID.h"
+#include "platform/threads/WorkQueue.h"
 
 #include <cstdint>
 #include <expected>

@@ -1,6 +1,6 @@
 #include "store/OSTCommitSharing.h"
 
-#include "platform/BlockingSection.h"
+#include "platform/threads/BlockingSection.h"
 
 #include <chrono>
 

@@ -1,13 +1,13 @@
 #include "store/OSTContainerCache.h"
 
-#include "model/OSTDictionaryFile.h"
+#include "files/OSTDictionaryFile.h"
+#include "files/OSTFileManager.h"
 #include "model/OSTFailureReport.h"
 #include "model/OSTGlobalConfiguration.h"
-#include "platform/BlockingSection.h"
-#include "platform/Log.h"
-#include "platform/Path.h"
-#include "platform/Unicode.h"
-#include "store/OSTFileManager.h"
+#include "platform/base/Log.h"
+#include "platform/base/Path.h"
+#include "platform/base/Unicode.h"
+#include "platform/threads/BlockingSection.h"
 
 #include <cerrno>
 #include <cstring>

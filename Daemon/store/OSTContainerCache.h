@@ -1,8 +1,8 @@
 #pragma once
 
 #include "model/OSTContainerClass.h"
-#include "model/OSTError.h"
 #include "model/OSTMetadata.h"
+#include "platform/base/OSTError.h"
 
 #include <cstdint>
 #include <functional>

@@ -1,8 +1,8 @@
 #include "store/OSTLocks.h"
 
-#include "platform/Assert.h"
-#include "platform/BlockingSection.h"
-#include "platform/Log.h"
+#include "platform/base/Assert.h"
+#include "platform/base/Log.h"
+#include "platform/threads/BlockingSection.h"
 
 #include <algorithm>
 #include <atomic>

@@ -1,10 +1,10 @@
 #include "store/OSTReplaceFile.h"
 
-#include "model/OSTDictionaryFile.h"
+#include "files/OSTDictionaryFile.h"
+#include "files/OSTFileManager.h"
 #include "model/OSTGlobalConfiguration.h"
-#include "platform/Path.h"
-#include "platform/Try.h"
-#include "store/OSTFileManager.h"
+#include "platform/base/Path.h"
+#include "platform/base/Try.h"
 
 #include <cerrno>
 #include <cstring>

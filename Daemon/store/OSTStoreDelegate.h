@@ -1,7 +1,7 @@
 #pragma once
 
 #include "model/OSTContainerClass.h"
-#include "model/OSTError.h"
+#include "platform/base/OSTError.h"
 
 #include <functional>
 #include <optional>

@@ -1,6 +1,6 @@
 #include "upcall/OSTKernServer.h"
 
-#include "platform/Log.h"
+#include "platform/base/Log.h"
 
 #include <bit>
 #include <cstring>

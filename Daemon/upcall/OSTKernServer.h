@@ -1,8 +1,8 @@
 #pragma once
 
-#include "platform/FileDescriptor.h"
-#include "platform/RunLoop.h"
-#include "platform/UpcallPort.h"
+#include "platform/base/FileDescriptor.h"
+#include "platform/ipc/UpcallPort.h"
+#include "platform/threads/RunLoop.h"
 
 #include <expected>
 #include <memory>

@@ -2,8 +2,8 @@
 
 #include "Client/Containers.h"
 #include "EndToEnd/Wire.h"
-#include "model/OSTDictionaryFile.h"
-#include "platform/PropertyList.h"
+#include "files/OSTDictionaryFile.h"
+#include "platform/codec/PropertyList.h"
 #include "support/BootedDevice.h"
 #include "support/DeviceTest.h"
 #include "support/ScratchDirectory.h"

@@ -4,7 +4,7 @@
 #include "Device/DeviceImage.h"
 #include "EndToEnd/GatedProcess.h"
 #include "EndToEnd/Wire.h"
-#include "platform/FileDescriptor.h"
+#include "platform/base/FileDescriptor.h"
 
 #include <gtest/gtest.h>
 

@@ -1,7 +1,7 @@
 #include "Client/CodeSigning.h"
 
 #include "EndToEnd/GatedDevice.h"
-#include "model/OSTDictionaryFile.h"
+#include "files/OSTDictionaryFile.h"
 #include "support/ChildProcess.h"
 #include "support/DeviceTest.h"
 #include "support/ScratchDirectory.h"

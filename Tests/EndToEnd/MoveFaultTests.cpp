@@ -1,5 +1,5 @@
 #include "EndToEnd/GatedProcess.h"
-#include "store/OSTFileManager.h"
+#include "files/OSTFileManager.h"
 #include "support/DeviceTest.h"
 #include "support/ScratchDirectory.h"
 

@@ -1,6 +1,6 @@
 #include "EndToEnd/StoreView.h"
 
-#include "model/OSTDictionaryFile.h"
+#include "files/OSTDictionaryFile.h"
 #include "model/OSTMetadata.h"
 
 #include <gtest/gtest.h>

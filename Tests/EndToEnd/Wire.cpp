@@ -1,7 +1,7 @@
 #include "EndToEnd/Wire.h"
 
-#include "platform/CodeSignature.h"
-#include "platform/IPCFrame.h"
+#include "platform/device/CodeSignature.h"
+#include "platform/ipc/IPCFrame.h"
 #include "support/BootedDevice.h"
 #include "support/ScratchDirectory.h"
 

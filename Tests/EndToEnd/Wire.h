@@ -1,8 +1,8 @@
 #pragma once
 
-#include "platform/CBOR.h"
-#include "platform/FileDescriptor.h"
-#include "platform/OSTValue.h"
+#include "platform/base/FileDescriptor.h"
+#include "platform/base/OSTValue.h"
+#include "platform/codec/CBOR.h"
 
 #include <sys/types.h>
 

@@ -1,5 +1,5 @@
 #include "Client/ctl/Commands.h"
-#include "platform/CodeSignature.h"
+#include "platform/device/CodeSignature.h"
 
 #include "support/ScratchDirectory.h"
 

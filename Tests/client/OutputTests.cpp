@@ -2,7 +2,7 @@
 #include "Client/ErrorCodes.h"
 #include "Client/ctl/Output.h"
 #include "model/OSTContainerClass.h"
-#include "model/OSTError.h"
+#include "platform/base/OSTError.h"
 
 #include <gtest/gtest.h>
 

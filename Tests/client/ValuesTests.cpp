@@ -1,5 +1,5 @@
 #include "Client/ctl/Values.h"
-#include "platform/PropertyList.h"
+#include "platform/codec/PropertyList.h"
 
 #include "support/DeviceTest.h"
 #include "support/ScratchDirectory.h"

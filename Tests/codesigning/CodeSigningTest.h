@@ -2,8 +2,8 @@
 
 #include "codesigning/OSTCodeSigningMapping.h"
 #include "codesigning/OSTCodeSigningStoreDelegate.h"
-#include "model/OSTDictionaryFile.h"
-#include "platform/PropertyList.h"
+#include "files/OSTDictionaryFile.h"
+#include "platform/codec/PropertyList.h"
 #include "store/OSTLocks.h"
 #include "support/StoreTest.h"
 

@@ -1,8 +1,8 @@
 #include "model/OSTMetadata.h"
 
-#include "model/OSTDictionaryFile.h"
-#include "platform/Path.h"
-#include "platform/PropertyList.h"
+#include "files/OSTDictionaryFile.h"
+#include "platform/base/Path.h"
+#include "platform/codec/PropertyList.h"
 #include "support/DeviceTest.h"
 
 #include <gtest/gtest.h>

@@ -1,7 +1,7 @@
-#include "platform/AccessControlList.h"
+#include "platform/device/AccessControlList.h"
 
-#include "platform/FileDescriptor.h"
-#include "platform/Membership.h"
+#include "platform/base/FileDescriptor.h"
+#include "platform/device/Membership.h"
 #include "support/DeviceTest.h"
 
 #include <fcntl.h>

@@ -1,4 +1,4 @@
-#include "platform/Accounts.h"
+#include "platform/device/Accounts.h"
 
 #include "support/DeviceTest.h"
 

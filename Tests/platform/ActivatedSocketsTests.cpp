@@ -1,4 +1,4 @@
-#include "platform/ActivatedSockets.h"
+#include "platform/ipc/ActivatedSockets.h"
 
 #include "support/DeviceTest.h"
 

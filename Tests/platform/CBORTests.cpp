@@ -1,4 +1,4 @@
-#include "platform/CBOR.h"
+#include "platform/codec/CBOR.h"
 
 #include <gtest/gtest.h>
 

@@ -1,6 +1,6 @@
-#include "platform/CrashReport.h"
+#include "platform/device/CrashReport.h"
 
-#include "platform/StackTrace.h"
+#include "platform/base/StackTrace.h"
 #include "support/DeviceTest.h"
 
 #include <stdexcept>

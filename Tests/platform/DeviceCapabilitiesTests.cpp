@@ -1,4 +1,4 @@
-#include "platform/DeviceCapabilities.h"
+#include "platform/device/DeviceCapabilities.h"
 
 #include "support/DeviceTest.h"
 

@@ -1,4 +1,4 @@
-#include "platform/DeviceLockState.h"
+#include "platform/device/DeviceLockState.h"
 
 #include "support/DeviceTest.h"
 

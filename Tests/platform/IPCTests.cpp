@@ -1,6 +1,6 @@
-#include "platform/BlockingSection.h"
-#include "platform/IPCListener.h"
-#include "platform/Log.h"
+#include "platform/base/Log.h"
+#include "platform/ipc/IPCListener.h"
+#include "platform/threads/BlockingSection.h"
 
 #include "support/ScratchDirectory.h"
 

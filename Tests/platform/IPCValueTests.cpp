@@ -1,4 +1,4 @@
-#include "platform/IPCValue.h"
+#include "platform/codec/IPCValue.h"
 
 #include <gtest/gtest.h>
 

@@ -1,4 +1,4 @@
-#include "platform/NamedSemaphore.h"
+#include "platform/device/NamedSemaphore.h"
 
 #include "support/DeviceTest.h"
 

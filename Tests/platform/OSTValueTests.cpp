@@ -1,4 +1,4 @@
-#include "platform/OSTValue.h"
+#include "platform/base/OSTValue.h"
 
 #include <gtest/gtest.h>
 

@@ -1,4 +1,4 @@
-#include "platform/PeerIdentity.h"
+#include "platform/ipc/PeerIdentity.h"
 
 #include "support/ScratchDirectory.h"
 

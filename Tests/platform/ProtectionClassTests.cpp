@@ -1,7 +1,7 @@
-#include "platform/ProtectionClass.h"
+#include "platform/device/ProtectionClass.h"
 
-#include "platform/DeviceLockState.h"
-#include "platform/FileDescriptor.h"
+#include "platform/base/FileDescriptor.h"
+#include "platform/device/DeviceLockState.h"
 #include "support/DeviceTest.h"
 
 #include <fcntl.h>

@@ -1,4 +1,4 @@
-#include "platform/RunLoop.h"
+#include "platform/threads/RunLoop.h"
 
 #include <gtest/gtest.h>
 

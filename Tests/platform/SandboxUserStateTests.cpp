@@ -1,4 +1,4 @@
-#include "platform/SandboxUserState.h"
+#include "platform/device/SandboxUserState.h"
 
 #include "support/DeviceTest.h"
 

@@ -1,4 +1,4 @@
-#include "platform/Transactions.h"
+#include "platform/threads/Transactions.h"
 
 #include <gtest/gtest.h>
 

@@ -1,4 +1,4 @@
-#include "platform/UUID.h"
+#include "platform/base/UUID.h"
 
 #include <gtest/gtest.h>
 

@@ -1,4 +1,4 @@
-#include "platform/UpcallPort.h"
+#include "platform/ipc/UpcallPort.h"
 
 #include <gtest/gtest.h>
 

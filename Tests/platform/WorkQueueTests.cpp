@@ -1,6 +1,6 @@
-#include "platform/WorkQueue.h"
+#include "platform/threads/WorkQueue.h"
 
-#include "platform/ThreadName.h"
+#include "platform/threads/ThreadName.h"
 
 #include <gtest/gtest.h>
 

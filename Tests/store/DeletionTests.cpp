@@ -1,7 +1,7 @@
 #include "codesigning/OSTCodeSigningMapping.h"
 #include "codesigning/OSTCodeSigningStoreDelegate.h"
-#include "platform/PropertyList.h"
-#include "platform/SandboxUserState.h"
+#include "platform/codec/PropertyList.h"
+#include "platform/device/SandboxUserState.h"
 #include "store/OSTLocks.h"
 #include "support/StoreTest.h"
 

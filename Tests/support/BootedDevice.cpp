@@ -1,6 +1,6 @@
 #include "support/BootedDevice.h"
 
-#include "platform/CodeSignature.h"
+#include "platform/device/CodeSignature.h"
 #include "support/DeviceTest.h"
 #include "support/ScratchDirectory.h"
 

@@ -1,0 +1,19 @@
+#pragma once
+
+#include "platform/threads/BlockingSection.h"
+
+#include <cerrno>
+#include <expected>
+
+namespace ost {
+
+/// Waits for the disk with `synchronise`: `fsync`, `fdatasync` or `syncfs`. Other connections are served meanwhile.
+/// Fails with its errno.
+[[nodiscard]] inline std::expected<void, int> OSTWaitForDisk(int fd, int (*synchronise)(int)) {
+    const platform::BlockingSection blocking;
+    if (synchronise(fd) != 0)
+        return std::unexpected(errno);
+    return {};
+}
+
+} // namespace ost

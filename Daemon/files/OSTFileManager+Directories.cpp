@@ -1,0 +1,153 @@
+#include "files/OSTFileManager.h"
+
+#include "files/OSTDurability.h"
+#include "files/OSTPathResolution.h"
+#include "files/OSTUniqueName.h"
+#include "platform/base/Path.h"
+#include "platform/device/AccessControlList.h"
+#include "platform/device/ProtectionClass.h"
+
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+
+namespace ost {
+
+using platform::FileDescriptor;
+
+namespace {
+
+/// Makes the directories on the way to the item at `path` that are missing.
+std::expected<void, int> makeParents(std::string_view path, mode_t mode) {
+    FileDescriptor held = OST_TRY(OSTOpenItem(AT_FDCWD, "/", O_PATH | O_DIRECTORY));
+    for (auto slash = path.find('/'); slash != std::string_view::npos; slash = path.find('/')) {
+        const std::string_view name = path.substr(0, slash);
+        path.remove_prefix(slash + 1);
+        if (name.empty())
+            continue;
+        auto opened = OSTOpenItem(held.get(), name, O_PATH | O_DIRECTORY);
+        if (!opened && opened.error() == ENOENT) {
+            if (::mkdirat(held.get(), std::string(name).c_str(), mode) != 0 && errno != EEXIST)
+                return std::unexpected(errno);
+            opened = OSTOpenItem(held.get(), name, O_PATH | O_DIRECTORY);
+        }
+        held = OST_TRY(std::move(opened));
+    }
+    return {};
+}
+
+struct MadeDirectory {
+    bool isNew;
+    std::expected<FileDescriptor, int> opened;
+};
+
+/// Makes a directory unless something is there, and opens it with `access`.
+std::expected<MadeDirectory, int> makeDirectory(std::string_view path, const OSTDirectoryAttributes& attributes,
+                                                int access) {
+    auto place = OSTItemPlace::find(path);
+    if (!place && place.error() == ENOENT && attributes.withIntermediateDirectories) {
+        OST_TRY(makeParents(path, attributes.mode));
+        place = OSTItemPlace::find(path);
+    }
+    if (!place)
+        return std::unexpected(place.error());
+    const bool isNew = ::mkdirat(place->directory(), place->name(), attributes.mode) == 0;
+    if (!isNew && errno != EEXIST)
+        return std::unexpected(errno);
+    auto opened = OSTOpenItem(place->directory(), place->name(), access);
+    if (isNew && opened && attributes.mode == 0) { // which masks all that the directory inherits
+        const auto applied = platform::applyInheritedEntries(place->directory(), opened->get());
+        if (!applied && applied.error() != EOPNOTSUPP)
+            return std::unexpected(applied.error());
+    }
+    return MadeDirectory{.isNew = isNew, .opened = std::move(opened)};
+}
+
+void giveDirectory(int directory, std::uint32_t owner) {
+    // What cannot be given away stays root's.
+    (void)::fchownat(directory, "", owner, owner, AT_EMPTY_PATH);
+}
+
+bool belongsTo(int directory, std::uint32_t owner) {
+    struct stat status{};
+    return ::fstat(directory, &status) == 0 && status.st_uid == owner && status.st_gid == owner;
+}
+
+} // namespace
+
+const OSTFileManager& OSTFileManager::defaultManager() {
+    static const OSTFileManager manager;
+    return manager;
+}
+
+OSTResult<void> OSTFileManager::createDirectoryAtURL(std::string_view path,
+                                                     const OSTDirectoryAttributes& attributes) const {
+    const bool setsClass = attributes.protectionClass != OSTKeepProtectionClass;
+    const int access = O_DIRECTORY | (setsClass ? O_RDONLY : O_PATH);
+
+    auto directory = OSTOpenItem(AT_FDCWD, path, access); // most directories asked for exist
+    bool isNew = false;
+    if (!directory) {
+        auto made = makeDirectory(path, attributes, access);
+        if (!made && attributes.withIntermediateDirectories)
+            return std::unexpected(
+                OSTCreatePOSIXError(made.error(), "forgepath of %s failed: %s", path, std::strerror(made.error())));
+        if (!made)
+            return std::unexpected(
+                OSTCreatePOSIXError(made.error(), "mkdir of %s failed: %s", path, std::strerror(made.error())));
+        isNew = made->isNew;
+        directory = std::move(made->opened);
+    }
+    if (!directory)
+        return std::unexpected(
+            OSTCreatePOSIXError(directory.error(), "opendir of %s failed: %s", path, std::strerror(directory.error())));
+
+    if (setsClass && (isNew || platform::protectionClass(directory->get(), -1) != attributes.protectionClass)) {
+        const auto set = platform::setProtectionClass(directory->get(), attributes.protectionClass);
+        if (!set)
+            return std::unexpected(OSTCreatePOSIXError(set.error(), "Failed to setclass(%d) on directory %s: %s",
+                                                       attributes.protectionClass, path, std::strerror(set.error())));
+    }
+    if (attributes.owner != 0 && (isNew || !belongsTo(directory->get(), attributes.owner)))
+        giveDirectory(directory->get(), attributes.owner);
+    return {};
+}
+
+OSTResult<FileDescriptor> OSTFileManager::openDirectoryAtURL(std::string_view path) const {
+    auto opened = OSTOpenItem(AT_FDCWD, path, O_RDONLY | O_DIRECTORY);
+    if (!opened)
+        return std::unexpected(
+            OSTCreatePOSIXError(opened.error(), "opendir of %s failed: %s", path, std::strerror(opened.error())));
+    return *std::move(opened);
+}
+
+OSTResult<std::string> OSTFileManager::createTemporaryDirectoryInDirectoryURL(std::string_view path,
+                                                                              std::uint32_t owner) const {
+    const auto make = [&]() -> std::expected<std::string, int> {
+        const FileDescriptor parent = OST_TRY(OSTOpenItem(AT_FDCWD, path, O_PATH | O_DIRECTORY));
+        std::string name = OST_TRY(OSTMakeUnique(
+            "temp.", [&](const char* candidate) { return ::mkdirat(parent.get(), candidate, S_IRWXU) == 0; }));
+        if (owner != 0)
+            if (const auto made = OSTOpenItem(parent.get(), name, O_PATH | O_DIRECTORY))
+                giveDirectory(made->get(), owner);
+        return name;
+    };
+    const auto name = make();
+    if (!name)
+        return std::unexpected(OSTCreatePOSIXError(name.error(), "Failed to create temp dir at path %s : %s",
+                                                   platform::pathByAppending(path, "temp.XXXXXX"),
+                                                   std::strerror(name.error())));
+    return platform::pathByAppending(path, *name);
+}
+
+OSTResult<void> OSTFileManager::makeDirectoryDurable(std::string_view path) const {
+    const FileDescriptor directory = OST_TRY(openDirectoryAtURL(path));
+    if (const auto durable = OSTWaitForDisk(directory.get(), ::fsync); !durable)
+        return std::unexpected(
+            OSTCreatePOSIXError(durable.error(), "fsync of %@ failed: %s", path, std::strerror(durable.error())));
+    return {};
+}
+
+} // namespace ost

@@ -1,0 +1,84 @@
+#include "files/OSTFileManager.h"
+
+#include "files/OSTPathResolution.h"
+#include "files/OSTTreeCursor.h"
+#include "platform/base/Log.h"
+#include "platform/base/Path.h"
+
+#include <dirent.h>
+#include <sys/stat.h>
+
+#include <cerrno>
+#include <cstring>
+
+namespace ost {
+
+namespace {
+
+bool isDirectory(const OSTTreeCursor& item) {
+    if (item.type() != DT_UNKNOWN)
+        return item.type() == DT_DIR;
+    struct stat status{};
+    return ::fstatat(item.directory(), item.name(), &status, AT_SYMLINK_NOFOLLOW) == 0 && S_ISDIR(status.st_mode);
+}
+
+std::expected<std::vector<OSTDirectoryItem>, int> listing(std::string_view path) {
+    auto directory = OSTOpenItem(AT_FDCWD, path, O_RDONLY | O_DIRECTORY);
+    if (!directory && directory.error() != ENOENT)
+        platform::logAs(platform::LogLevel::error, "_IterateDirectory", "opendir of %s failed: %s", path,
+                        std::strerror(directory.error()));
+    OSTTreeCursor cursor(OST_TRY(std::move(directory)), std::string());
+    std::vector<OSTDirectoryItem> items;
+    while (OST_TRY(cursor.next()))
+        if (cursor.name()[0] != '.')
+            items.push_back({.name = cursor.name(), .isDirectory = isDirectory(cursor)});
+    return items;
+}
+
+/// 0 when an item is at `path`, else why it cannot be seen.
+int errorOfLooking(std::string_view path) {
+    const auto item = OSTOpenItem(AT_FDCWD, path, O_PATH);
+    return item ? 0 : item.error();
+}
+
+} // namespace
+
+OSTResult<std::vector<OSTDirectoryItem>> OSTFileManager::urlsForItemsInDirectoryAtURL(std::string_view path) const {
+    auto items = listing(path);
+    if (!items)
+        return std::unexpected(OSTCreatePOSIXError(items.error(), "_IterateDirectory for %@ returned %s", path,
+                                                   std::strerror(items.error())));
+    return *std::move(items);
+}
+
+bool OSTFileManager::itemExistsAtURL(std::string_view path) const {
+    const int error = errorOfLooking(path);
+    if (error != 0 && error != ENOENT)
+        platform::logError("Failed to determine if %@ exists: %s", path, std::strerror(error));
+    return error == 0;
+}
+
+bool OSTFileManager::itemDoesNotExistAtURL(std::string_view path) const {
+    const int error = errorOfLooking(path);
+    if (error != 0 && error != ENOENT)
+        platform::logError("Failed to determine if %@ exists: %s", path, std::strerror(error));
+    return error == ENOENT;
+}
+
+OSTResult<void> OSTFileManager::_traverseDirectory(std::string_view path, const TreeBlock& block) const {
+    if (path.empty())
+        return std::unexpected(
+            OSTCreatePOSIXError(ENOENT, "fts_open failed for %s with error %s", path, std::strerror(ENOENT)));
+    OSTResult<void> result;
+    OSTWalkTree(path, [&](const OSTTreeEntry& entry) {
+        if (entry.visit == OSTTreeEntry::Visit::failure)
+            result = std::unexpected(
+                OSTCreatePOSIXError(entry.error, "Error for path %s: %s", entry.path, std::strerror(entry.error)));
+        else
+            result = block(entry);
+        return result.has_value();
+    });
+    return result;
+}
+
+} // namespace ost

@@ -1,0 +1,201 @@
+#include "files/OSTFileManager.h"
+
+#include "files/OSTPathResolution.h"
+#include "files/OSTTreeCursor.h"
+#include "platform/base/Log.h"
+
+#include <dirent.h>
+#include <linux/fs.h>
+#include <sys/ioctl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+
+namespace ost {
+
+using platform::FileDescriptor;
+using platform::LogLevel;
+
+namespace {
+
+constexpr std::string_view errorCallback = "_sweeptree_error_callback";
+
+/// An item that could not be removed.
+struct Survivor {
+    int directory;
+    const char* name;
+    const std::string& path;
+    int unlinkFlags;
+    bool liesInTree; ///< else it is the top, whose directory is not ours to change
+};
+
+bool isImmutable(const Survivor& item, const char* name, const std::string& path) {
+    struct statx status{};
+    if (::statx(item.directory, name, AT_SYMLINK_NOFOLLOW | AT_NO_AUTOMOUNT, STATX_TYPE, &status) != 0) {
+        platform::logAs(LogLevel::error, errorCallback, "Failed to stat %s before unsetting UF_IMMUTABLE: %s", path,
+                        std::strerror(errno));
+        return false;
+    }
+    return (status.stx_attributes & STATX_ATTR_IMMUTABLE) != 0;
+}
+
+std::expected<void, int> clearImmutableFlag(int directory, const char* name) {
+    const FileDescriptor item = OST_TRY(OSTOpenItem(directory, name, O_RDONLY));
+    int flags = 0;
+    if (::ioctl(item.get(), FS_IOC_GETFLAGS, &flags) != 0)
+        return std::unexpected(errno);
+    flags &= ~FS_IMMUTABLE_FL;
+    if (::ioctl(item.get(), FS_IOC_SETFLAGS, &flags) != 0)
+        return std::unexpected(errno);
+    return {};
+}
+
+/// Clears the flag of the item that `name` means next to `item`, when it is set. Answers whether it was cleared.
+bool unsetImmutable(const Survivor& item, const char* name, const std::string& path) {
+    if (!isImmutable(item, name, path))
+        return false;
+    if (const auto cleared = clearImmutableFlag(item.directory, name); !cleared) {
+        platform::logAs(LogLevel::error, errorCallback, "Failed to lchflags %s: %s", path,
+                        std::strerror(cleared.error()));
+        return false;
+    }
+    platform::logAs(LogLevel::notice, errorCallback, "Unset UF_IMMUTABLE on %s", path);
+    return true;
+}
+
+/// The removal of one tree, which goes on after an item that cannot be removed.
+class Removal {
+public:
+    /// Removes the item at `place`. Fails when nothing could be tried.
+    [[nodiscard]] std::expected<void, int> remove(const OSTItemPlace& place, const std::string& path) {
+        auto top = OSTOpenSubdirectory(place.directory(), place.name());
+        if (!top && !isNoDirectory(top.error()))
+            return std::unexpected(top.error());
+        const bool isDirectory = top.has_value();
+        for (int fillings = 0; isDirectory; ++fillings) {
+            if (!top)
+                return std::unexpected(top.error());
+            OST_TRY(_removeContent(*std::move(top), path));
+            if (_firstError != 0 || fillings == mostFillings)
+                break;
+            if (::unlinkat(place.directory(), place.name(), AT_REMOVEDIR) == 0)
+                return {};
+            if (errno != ENOTEMPTY)
+                break;
+            top = OSTOpenSubdirectory(place.directory(), place.name());
+        }
+        _unlink({.directory = place.directory(),
+                 .name = place.name(),
+                 .path = path,
+                 .unlinkFlags = isDirectory ? AT_REMOVEDIR : 0,
+                 .liesInTree = false});
+        return {};
+    }
+
+    /// The errno of the first item that was not removed, or 0.
+    [[nodiscard]] int firstError() const { return _firstError; }
+
+private:
+    /// How often something may come into a directory that has just been emptied: a new directory on death row gets its
+    /// item.
+    static constexpr int mostFillings = 4;
+
+    static bool isNoDirectory(int error) { return error == ENOTDIR || error == ELOOP; }
+
+    [[nodiscard]] std::expected<void, int> _removeContent(FileDescriptor top, const std::string& path) {
+        OSTTreeCursor cursor(std::move(top), path);
+        for (;;) {
+            const auto found = cursor.next();
+            if (found && *found) {
+                _removeItem(cursor);
+                continue;
+            }
+            if (!found)
+                _record(found.error(), cursor.directoryPath());
+            if (cursor.depth() == 0)
+                return {};
+            OST_TRY(cursor.leave());
+            _unlinkItem(cursor, AT_REMOVEDIR);
+        }
+    }
+
+    /// Enters the current item when it is a directory, else removes it.
+    void _removeItem(OSTTreeCursor& cursor) {
+        if (cursor.type() == DT_DIR || cursor.type() == DT_UNKNOWN) {
+            const auto entered = cursor.enter();
+            if (entered)
+                return;
+            if (!isNoDirectory(entered.error()))
+                return _record(entered.error(), cursor.path());
+        }
+        _unlinkItem(cursor, 0);
+    }
+
+    void _unlinkItem(const OSTTreeCursor& cursor, int flags) {
+        _unlink({.directory = cursor.directory(),
+                 .name = cursor.name(),
+                 .path = cursor.path(),
+                 .unlinkFlags = flags,
+                 .liesInTree = true});
+    }
+
+    void _unlink(const Survivor& item) {
+        if (::unlinkat(item.directory, item.name, item.unlinkFlags) == 0)
+            return;
+        const int error = errno;
+        if (error == EPERM)
+            return _unlinkImmutable(item);
+        _record(error, item.path);
+    }
+
+    /// An immutable item cannot be removed, nor can anything that an immutable directory holds.
+    void _unlinkImmutable(const Survivor& item) {
+        _log(EPERM, item.path);
+        bool unset = unsetImmutable(item, item.name, item.path);
+        if (item.liesInTree)
+            unset |= unsetImmutable(item, ".", item.path.substr(0, item.path.rfind('/')));
+        if (unset) {
+            if (::unlinkat(item.directory, item.name, item.unlinkFlags) == 0)
+                return;
+            platform::logAs(LogLevel::error, errorCallback, "unlink of %s failed: %s", item.path, std::strerror(errno));
+        }
+        _keepFirst(EPERM);
+    }
+
+    void _record(int error, const std::string& path) {
+        if (error == ENOENT)
+            return;
+        _log(error, path);
+        _keepFirst(error);
+    }
+
+    static void _log(int error, const std::string& path) {
+        platform::logAs(LogLevel::error, errorCallback, "sweeptree hit error for %s : %s", path, std::strerror(error));
+    }
+
+    void _keepFirst(int error) {
+        if (_firstError == 0)
+            _firstError = error;
+    }
+
+    int _firstError = 0;
+};
+
+} // namespace
+
+OSTResult<void> OSTFileManager::removeItemAtURL(std::string_view path) const {
+    if (path.empty())
+        return std::unexpected(OSTCreatePOSIXError(EFAULT, "nil url passed to -removeItemAtURL:error:"));
+    Removal removal;
+    const auto place = OSTItemPlace::find(path);
+    const auto removed =
+        place ? removal.remove(*place, std::string(path)) : std::expected<void, int>(std::unexpected(place.error()));
+    const int error = removed || removed.error() == ENOENT ? removal.firstError() : removed.error();
+    if (error != 0)
+        return std::unexpected(OSTCreatePOSIXError(error, "sweeptree of %@ failed: %s", path, std::strerror(error)));
+    return {};
+}
+
+} // namespace ost

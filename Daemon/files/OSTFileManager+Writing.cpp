@@ -1,0 +1,149 @@
+#include "files/OSTFileManager.h"
+
+#include "files/OSTDurability.h"
+#include "files/OSTPathResolution.h"
+#include "files/OSTUniqueName.h"
+#include "platform/base/Path.h"
+#include "platform/device/AccessControlList.h"
+#include "platform/device/ProtectionClass.h"
+
+#include <dirent.h>
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdio>
+#include <cstring>
+#include <memory>
+
+namespace ost {
+
+using platform::FileDescriptor;
+
+namespace {
+
+/// What the name of an unfinished file begins with.
+constexpr std::string_view unfinishedPrefix = ".temp.";
+
+/// The name of a file that is removed again unless it was kept.
+class UnfinishedFile {
+public:
+    UnfinishedFile(int directory, std::string name) : _directory(directory), _name(std::move(name)) {}
+    UnfinishedFile(const UnfinishedFile&) = delete;
+    UnfinishedFile& operator=(const UnfinishedFile&) = delete;
+    ~UnfinishedFile() {
+        if (!_name.empty())
+            ::unlinkat(_directory, _name.c_str(), 0);
+    }
+
+    [[nodiscard]] const char* name() const { return _name.c_str(); }
+    void keep() { _name.clear(); }
+
+private:
+    int _directory;
+    std::string _name;
+};
+
+FileDescriptor createExclusively(int directory, const char* name, mode_t mode) {
+    return FileDescriptor(::openat(directory, name, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, mode));
+}
+
+/// A directory may hand an ACL down to what is made in it, which then takes from the mode, and a file of the daemon is
+/// nobody else's to write.
+std::expected<void, int> insistOnMode(int file, mode_t mode) {
+    struct stat status{};
+    if (::fstat(file, &status) != 0)
+        return std::unexpected(errno);
+    if ((status.st_mode & static_cast<mode_t>(ALLPERMS)) == mode)
+        return {};
+    const auto none = OST_TRY(platform::AccessControlList::create(0));
+    OST_TRY(none.apply(file));
+    return platform::setModeKeepingMask(file, mode);
+}
+
+std::expected<void, int> finish(int file, std::string_view bytes, const OSTFileAttributes& attributes) {
+    OST_TRY(insistOnMode(file, attributes.mode));
+    if (attributes.protectionClass != OSTKeepProtectionClass) {
+        const auto set = platform::setProtectionClass(file, attributes.protectionClass);
+        // On a file system without classes every file is unprotected anyway.
+        if (!set && set.error() != EBADF)
+            return std::unexpected(set.error());
+    }
+    while (!bytes.empty()) {
+        const ssize_t count = ::write(file, bytes.data(), bytes.size());
+        if (count < 0 && errno != EINTR)
+            return std::unexpected(errno);
+        if (count > 0)
+            bytes.remove_prefix(static_cast<std::size_t>(count));
+    }
+    return {};
+}
+
+std::expected<void, int> writeAtomically(std::string_view path, std::string_view bytes,
+                                         const OSTFileAttributes& attributes) {
+    const auto place = OST_TRY(OSTItemPlace::find(path, O_RDONLY));
+    FileDescriptor file;
+    UnfinishedFile unfinished(place.directory(), OST_TRY(OSTMakeUnique(unfinishedPrefix, [&](const char* candidate) {
+                                  file = createExclusively(place.directory(), candidate, attributes.mode);
+                                  return static_cast<bool>(file);
+                              })));
+    OST_TRY(finish(file.get(), bytes, attributes));
+    OST_TRY(OSTWaitForDisk(file.get(), ::fdatasync));
+    if (::renameat(place.directory(), unfinished.name(), place.directory(), place.name()) != 0)
+        return std::unexpected(errno);
+    unfinished.keep();
+    return OSTWaitForDisk(place.directory(), ::fsync);
+}
+
+} // namespace
+
+OSTResult<void> OSTFileManager::writeFileAtomicallyAtURL(std::string_view path, std::string_view bytes,
+                                                         const OSTFileAttributes& attributes) const {
+    if (const auto written = writeAtomically(path, bytes, attributes); !written)
+        return std::unexpected(
+            OSTCreatePOSIXError(written.error(), "write of %@ failed: %s", path, std::strerror(written.error())));
+    return {};
+}
+
+void OSTFileManager::removeUnfinishedItemsInDirectoryURL(std::string_view path) const {
+    auto directory = OSTOpenItem(AT_FDCWD, path, O_RDONLY | O_DIRECTORY);
+    const auto close = [](DIR* stream) { ::closedir(stream); };
+    const std::unique_ptr<DIR, decltype(close)> stream(directory ? ::fdopendir(directory->release()) : nullptr);
+    if (!stream)
+        return;
+    while (const dirent* const entry = ::readdir(stream.get()))
+        if (std::string_view(entry->d_name).starts_with(unfinishedPrefix))
+            static_cast<void>(removeItemAtURL(platform::pathByAppending(path, entry->d_name)));
+}
+
+OSTResult<OSTNewFile> OSTFileManager::createFileAtURL(std::string_view path, std::string_view bytes,
+                                                      const OSTFileAttributes& attributes) const {
+    const auto create = [&]() -> std::expected<OSTNewFile, int> {
+        auto place = OST_TRY(OSTItemPlace::find(path, O_RDONLY));
+        FileDescriptor file = createExclusively(place.directory(), place.name(), attributes.mode);
+        if (!file)
+            return std::unexpected(errno);
+        UnfinishedFile unfinished(place.directory(), place.name());
+        OST_TRY(finish(file.get(), bytes, attributes));
+        unfinished.keep();
+        return OSTNewFile(std::string(path), std::move(file), std::move(place).takeDirectory());
+    };
+    auto created = create();
+    if (!created)
+        return std::unexpected(
+            OSTCreatePOSIXError(created.error(), "write of %@ failed: %s", path, std::strerror(created.error())));
+    return *std::move(created);
+}
+
+OSTResult<void> OSTNewFile::makeDurable() {
+    auto durable = OSTWaitForDisk(_file.get(), ::fdatasync);
+    if (durable)
+        durable = OSTWaitForDisk(_directory.get(), ::fsync);
+    if (!durable)
+        return std::unexpected(
+            OSTCreatePOSIXError(durable.error(), "fsync of %@ failed: %s", _path, std::strerror(durable.error())));
+    return {};
+}
+
+} // namespace ost

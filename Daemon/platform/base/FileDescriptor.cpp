@@ -1,0 +1,31 @@
+#include "platform/base/FileDescriptor.h"
+
+#include <fcntl.h>
+#include <linux/openat2.h>
+#include <sys/syscall.h>
+
+#include <cerrno>
+
+namespace ost::platform {
+
+void FileDescriptor::reset(int fd) noexcept {
+    if (_fd >= 0) {
+        // A failed operation closes its descriptors on the way out, and its errno is still to be reported.
+        const int saved = errno;
+        ::close(_fd);
+        errno = saved;
+    }
+    _fd = fd;
+}
+
+std::expected<FileDescriptor, int> openWithoutLinks(int base, const char* path, int flags, std::uint64_t resolve) {
+    open_how how{};
+    how.flags = static_cast<std::uint32_t>(flags | O_NOFOLLOW | O_CLOEXEC);
+    how.resolve = RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS | resolve;
+    const long fd = ::syscall(SYS_openat2, base, path, &how, sizeof how);
+    if (fd < 0)
+        return std::unexpected(errno);
+    return FileDescriptor(static_cast<int>(fd));
+}
+
+} // namespace ost::platform

@@ -1,0 +1,158 @@
+#include "platform/base/MessageFormat.h"
+
+#include "platform/base/Assert.h"
+#include "platform/base/Unicode.h"
+
+#include <algorithm>
+#include <charconv>
+
+namespace ost::platform {
+
+namespace {
+
+/// The length of the valid UTF-8 sequence at the start of `text` that only shows itself, or 0.
+std::size_t printableSequence(std::string_view text) {
+    auto rest = text;
+    const auto codePoint = takeCodePoint(rest);
+    if (!codePoint)
+        return 0;
+    const auto isBetween = [&](char32_t first, char32_t last) { return *codePoint >= first && *codePoint <= last; };
+    const bool controls = *codePoint < 0x20 || isBetween(0x7f, 0x9f);
+    // Separators of lines, and what makes a terminal show a text in another order than it has.
+    const bool rearranges = isBetween(0x2028, 0x202e) || isBetween(0x2066, 0x2069);
+    return controls || rearranges ? 0 : text.size() - rest.size();
+}
+
+/// What a message shows of one text: every path and identifier of ordinary length, and not so much that a client could
+/// fill the log with a few requests.
+constexpr std::size_t longestText = 8192;
+
+/// Appends as much of `text`, escaped, as a message shows.
+void appendShown(std::string& out, std::string_view text) {
+    const auto begin = out.size();
+    appendEscaped(out, text.substr(0, longestText));
+    if (out.size() - begin <= longestText && text.size() <= longestText)
+        return;
+    // Not within a sequence that stands for one character.
+    auto end = std::min(out.size(), begin + longestText);
+    while (end > begin && (static_cast<unsigned char>(out[end - 1]) & 0xc0) == 0x80)
+        --end;
+    if (end > begin && static_cast<unsigned char>(out[end - 1]) >= 0xc0)
+        --end;
+    out.resize(end);
+    out += "...";
+}
+
+void appendNumber(std::string& out, auto value, int base) {
+    char buffer[24];
+    const auto end = std::to_chars(std::begin(buffer), std::end(buffer), value, base).ptr;
+    out.append(buffer, end);
+}
+
+} // namespace
+
+void appendEscaped(std::string& out, std::string_view text) {
+    while (!text.empty()) {
+        std::size_t length = printableSequence(text);
+        if (length > 0) {
+            out.append(text.substr(0, length));
+        } else {
+            constexpr char digits[] = "0123456789abcdef";
+            const auto byte = static_cast<unsigned char>(text[0]);
+            switch (byte) {
+            case '\n':
+                out += "\\n";
+                break;
+            case '\t':
+                out += "\\t";
+                break;
+            case '\r':
+                out += "\\r";
+                break;
+            default:
+                out += "\\x";
+                out += digits[byte >> 4];
+                out += digits[byte & 15];
+            }
+            length = 1;
+        }
+        text.remove_prefix(length);
+    }
+}
+
+MessageArgument::MessageArgument(double value) : _kind(Kind::text), _unsigned(0) {
+    char buffer[32];
+    const auto end = std::to_chars(std::begin(buffer), std::end(buffer), value).ptr;
+    _owned.assign(buffer, end);
+    _text = _owned;
+}
+
+void MessageArgument::appendTo(std::string& out, char conversion) const {
+    const int base = conversion == 'x' || conversion == 'p' ? 16 : 10;
+    switch (_kind) {
+    case Kind::text:
+        appendShown(out, _text);
+        break;
+    case Kind::signedNumber:
+        appendNumber(out, _signed, base);
+        break;
+    case Kind::unsignedNumber:
+        appendNumber(out, _unsigned, base);
+        break;
+    case Kind::pointer:
+        out += "0x";
+        appendNumber(out, _unsigned, 16);
+        break;
+    }
+}
+
+std::string formatMessage(std::string_view format, std::initializer_list<const MessageArgument*> arguments) {
+    std::string out;
+    out.reserve(format.size() + 16 * arguments.size());
+    auto argument = arguments.begin();
+    for (std::size_t i = 0; i < format.size(); ++i) {
+        if (format[i] != '%') {
+            out += format[i];
+            continue;
+        }
+        do
+            ++i;
+        while (format[i] == 'l');
+        OST_ASSERT(argument != arguments.end());
+        (*argument++)->appendTo(out, format[i]);
+    }
+    return out;
+}
+
+std::string qualifiedFunctionName(const std::source_location& where) {
+    std::string name = where.function_name();
+    constexpr std::string_view gccAnonymous = "{anonymous}::";
+    constexpr std::string_view clangAnonymous = "(anonymous namespace)::";
+    for (const auto prefix : {gccAnonymous, clangAnonymous, std::string_view("ost::"), std::string_view("platform::")})
+        for (auto at = name.find(prefix); at != std::string::npos; at = name.find(prefix, at))
+            name.erase(at, prefix.size());
+
+    // The arguments begin at the first parenthesis outside template arguments; the result type ends at the last blank
+    // before them. What follows (arguments, qualifiers, lambdas) is no part of the name.
+    int depth = 0;
+    std::size_t begin = 0;
+    for (std::size_t i = 0; i < name.size(); ++i) {
+        const char c = name[i];
+        if (c == '<')
+            ++depth;
+        else if (c == '>')
+            --depth;
+        else if (depth == 0 && c == ' ')
+            begin = i + 1;
+        else if (depth == 0 && c == '(')
+            return name.substr(begin, i - begin);
+    }
+    return name.substr(begin);
+}
+
+std::string_view lastPartOfFunctionName(std::string_view qualifiedName) {
+    const auto at = qualifiedName.rfind("::");
+    return at == std::string_view::npos ? qualifiedName : qualifiedName.substr(at + 2);
+}
+
+} // namespace ost::platform

@@ -1,0 +1,246 @@
+#include "platform/device/AccessControlList.h"
+
+#include "platform/base/Try.h"
+#include "platform/device/ExtendedAttributes.h"
+#include "platform/device/Membership.h"
+
+#include <sys/stat.h>
+
+#include <algorithm>
+#include <array>
+#include <bit>
+#include <cerrno>
+#include <cstring>
+#include <map>
+#include <span>
+
+namespace ost::platform {
+
+namespace {
+
+constexpr const char* accessAttribute = "system.posix_acl_access";
+constexpr const char* defaultAttribute = "system.posix_acl_default";
+
+/// What the kernel reads and writes as the value of both attributes: a version and then entries, little-endian.
+static_assert(std::endian::native == std::endian::little);
+constexpr std::uint32_t posixVersion = 2;
+struct PosixEntry {
+    std::uint16_t tag;
+    std::uint16_t permissions; ///< 4 read, 2 write, 1 execute
+    std::uint32_t id;          ///< of a named user or group
+};
+using PosixACL = std::vector<PosixEntry>; // in ascending order of tags, as the kernel requires
+
+enum PosixTag : std::uint16_t {
+    owner = 0x01,
+    namedUser = 0x02,
+    owningGroup = 0x04,
+    namedGroup = 0x08,
+    mask = 0x10,
+    other = 0x20
+};
+constexpr std::uint32_t noId = 0xffffffff;
+constexpr std::uint16_t everything = 7;
+
+/// The kernel keeps no larger attribute.
+constexpr std::size_t attributeLimit = 65536;
+/// Enough for every ACL that the daemon makes; others are read a second time with a buffer of the full size.
+constexpr std::size_t usualAttributeSize = 256;
+
+PosixEntry* find(PosixACL& acl, PosixTag tag) {
+    const auto found = std::ranges::find(acl, tag, &PosixEntry::tag);
+    return found == acl.end() ? nullptr : &*found;
+}
+
+std::uint16_t permissionsOf(PosixACL& acl, PosixTag tag) {
+    const auto* entry = find(acl, tag);
+    return entry ? entry->permissions : std::uint16_t{0};
+}
+
+/// The ACL kept in an attribute; empty when there is none, or none possible.
+std::expected<PosixACL, int> read(int fd, const char* attribute) {
+    std::array<std::byte, usualAttributeSize> usual;
+    std::vector<std::byte> large;
+    std::span<std::byte> buffer(usual);
+    auto size = getAttribute(fd, attribute, buffer);
+    if (!size && size.error() == ERANGE) {
+        large.resize(attributeLimit);
+        buffer = large;
+        size = getAttribute(fd, attribute, buffer);
+    }
+    if (!size && (size.error() == ENODATA || size.error() == EOPNOTSUPP))
+        return PosixACL();
+    if (!size)
+        return std::unexpected(size.error());
+    if (*size < sizeof posixVersion)
+        return std::unexpected(EINVAL);
+    PosixACL acl((*size - sizeof posixVersion) / sizeof(PosixEntry));
+    std::memcpy(acl.data(), buffer.data() + sizeof posixVersion, acl.size() * sizeof(PosixEntry));
+    return acl;
+}
+
+std::expected<void, int> write(int fd, const char* attribute, const PosixACL& acl) {
+    std::vector<std::byte> value(sizeof posixVersion + acl.size() * sizeof(PosixEntry));
+    std::memcpy(value.data(), &posixVersion, sizeof posixVersion);
+    std::memcpy(value.data() + sizeof posixVersion, acl.data(), acl.size() * sizeof(PosixEntry));
+    return setAttribute(fd, attribute, value);
+}
+
+std::expected<void, int> removeDefaultACL(int fd) {
+    const auto removed = removeAttribute(fd, defaultAttribute);
+    if (!removed && removed.error() != ENODATA && removed.error() != EOPNOTSUPP)
+        return removed;
+    return {};
+}
+
+/// A symbolic link, which alone does not support it, keeps its mode.
+std::expected<void, int> changeMode(int fd, mode_t mode) {
+    if (::fchmod(fd, mode) == 0 || (errno == EBADF && ::chmod(DescriptorPath(fd).text, mode) == 0) ||
+        errno == EOPNOTSUPP)
+        return {};
+    return std::unexpected(errno);
+}
+
+/// The permissions that the mode gives, the owning group's not mistaken for the mask that `stat` shows.
+struct OwnPermissions {
+    std::uint16_t owner;
+    std::uint16_t group;
+    std::uint16_t other;
+    bool isExtended; ///< the item has an extended ACL now
+};
+
+std::expected<OwnPermissions, int> ownPermissions(int fd, mode_t mode) {
+    const auto bits = [&](unsigned shift) { return static_cast<std::uint16_t>(mode >> shift & everything); };
+    auto acl = OST_TRY(read(fd, accessAttribute));
+    return OwnPermissions{bits(6), acl.empty() ? bits(3) : permissionsOf(acl, owningGroup), bits(0), !acl.empty()};
+}
+
+/// An ACL with entries for named groups, each of which gets what others get, too.
+PosixACL makeACL(const OwnPermissions& own, const std::map<gid_t, std::uint16_t>& groups) {
+    PosixACL acl{{owner, own.owner, noId}, {owningGroup, own.group, noId}};
+    auto needed = own.group;
+    for (const auto& [gid, permissions] : groups) {
+        const auto granted = static_cast<std::uint16_t>(permissions | own.other);
+        acl.push_back({namedGroup, granted, gid});
+        needed = static_cast<std::uint16_t>(needed | granted);
+    }
+    if (!groups.empty())
+        acl.push_back({mask, needed, noId});
+    acl.push_back({other, own.other, noId});
+    return acl;
+}
+
+std::uint16_t posixPermissions(std::uint32_t permissions) {
+    return static_cast<std::uint16_t>(((permissions & AccessControlList::readData) != 0 ? 4 : 0) |
+                                      ((permissions & AccessControlList::writeData) != 0 ? 2 : 0) |
+                                      ((permissions & AccessControlList::execute) != 0 ? 1 : 0));
+}
+
+} // namespace
+
+std::expected<void, int> AccessControlList::Entry::addPermissions(std::uint32_t permissions) {
+    if ((permissions & ~allPermissions) != 0)
+        return std::unexpected(EINVAL);
+    _permissions |= permissions;
+    return {};
+}
+
+std::expected<void, int> AccessControlList::Entry::addFlags(std::uint32_t flags) {
+    if ((flags & ~allFlags) != 0)
+        return std::unexpected(EINVAL);
+    _flags |= flags;
+    return {};
+}
+
+std::expected<void, int> AccessControlList::Entry::setTag(std::uint32_t tag) {
+    if (tag != extendedAllow)
+        return std::unexpected(EINVAL);
+    _tag = tag;
+    return {};
+}
+
+std::expected<void, int> AccessControlList::Entry::setQualifier(const UUID& group) {
+    if (!groupIdForUUID(group))
+        return std::unexpected(EINVAL);
+    _qualifier = group;
+    return {};
+}
+
+std::expected<AccessControlList, int> AccessControlList::create(std::size_t entries) {
+    if (entries > maximumEntries)
+        return std::unexpected(EINVAL);
+    AccessControlList acl;
+    acl._entries.reserve(entries);
+    return acl;
+}
+
+std::expected<AccessControlList::Entry*, int> AccessControlList::createEntry() {
+    if (_entries.size() == maximumEntries)
+        return std::unexpected(ENOMEM);
+    return &_entries.emplace_back();
+}
+
+std::expected<void, int> AccessControlList::apply(int fd) const {
+    struct stat status{};
+    if (::fstat(fd, &status) != 0)
+        return std::unexpected(errno);
+    if (S_ISLNK(status.st_mode))
+        return {};
+
+    std::map<gid_t, std::uint16_t> governing;
+    std::map<gid_t, std::uint16_t> handedDown;
+    const auto grant = [](auto& groups, const Entry& entry) {
+        auto& permissions = groups[groupIdForUUID(entry._qualifier).value()];
+        permissions = static_cast<std::uint16_t>(permissions | posixPermissions(entry._permissions));
+    };
+    for (const auto& entry : _entries) {
+        if (entry._grants() && (entry._flags & onlyInherit) == 0)
+            grant(governing, entry);
+        if (entry._grants() && (entry._flags & (fileInherit | directoryInherit)) != 0)
+            grant(handedDown, entry);
+    }
+
+    const auto own = OST_TRY(ownPermissions(fd, status.st_mode));
+    if (own.isExtended || !governing.empty())
+        OST_TRY(write(fd, accessAttribute, makeACL(own, governing)));
+    if (!S_ISDIR(status.st_mode))
+        return {};
+    if (handedDown.empty())
+        return removeDefaultACL(fd);
+    return write(fd, defaultAttribute,
+                 makeACL({.owner = everything, .group = 0, .other = 0, .isExtended = true}, handedDown));
+}
+
+std::expected<void, int> setModeKeepingMask(int fd, mode_t mode) {
+    auto acl = OST_TRY(read(fd, accessAttribute));
+    auto* group = find(acl, owningGroup);
+    const auto* maskEntry = find(acl, mask);
+    constexpr mode_t groupBits = 070;
+    // To an item with an extended ACL, the group bits of a mode are the mask.
+    const auto shownMode = maskEntry ? (mode & ~groupBits) | static_cast<mode_t>(maskEntry->permissions) << 3 : mode;
+    OST_TRY(changeMode(fd, shownMode));
+    const auto groupPermissions = static_cast<std::uint16_t>((mode & groupBits) >> 3);
+    if (!maskEntry || group->permissions == groupPermissions)
+        return {};
+    group->permissions = groupPermissions;
+    find(acl, owner)->permissions = static_cast<std::uint16_t>(mode >> 6 & everything);
+    find(acl, other)->permissions = static_cast<std::uint16_t>(mode & everything);
+    return write(fd, accessAttribute, acl);
+}
+
+std::expected<bool, int> applyInheritedEntries(int parentFd, int childFd) {
+    auto acl = OST_TRY(read(parentFd, defaultAttribute));
+    if (acl.empty())
+        return false;
+    struct stat status{};
+    if (::fstat(childFd, &status) != 0)
+        return std::unexpected(errno);
+    const auto own = OST_TRY(ownPermissions(childFd, status.st_mode));
+    find(acl, owner)->permissions = own.owner;
+    find(acl, owningGroup)->permissions = own.group;
+    find(acl, other)->permissions = own.other;
+    OST_TRY(write(childFd, accessAttribute, acl));
+    return true;
+}
+
+} // namespace ost::platform

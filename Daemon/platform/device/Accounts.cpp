@@ -1,0 +1,103 @@
+#include "platform/device/Accounts.h"
+
+#include "platform/base/SmallFile.h"
+#include "platform/base/Try.h"
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <charconv>
+#include <cstdint>
+#include <optional>
+
+namespace ost::platform {
+
+namespace {
+
+constexpr const char* passwdFile = "/etc/passwd";
+constexpr const char* groupFile = "/etc/group";
+constexpr std::size_t databaseLimit = 4 << 20; // far above what fits a device, far below what hurts
+
+struct Group {
+    std::string name;
+    gid_t gid;
+};
+
+/// Cuts a line into exactly `count` fields at its colons.
+template<std::size_t count>
+std::optional<std::array<std::string_view, count>> fieldsOf(std::string_view line) {
+    std::array<std::string_view, count> fields;
+    for (std::size_t index = 0; index < count; ++index) {
+        const auto colon = line.find(':');
+        if ((colon == std::string_view::npos) != (index == count - 1))
+            return std::nullopt;
+        fields[index] = line.substr(0, colon);
+        line.remove_prefix(index == count - 1 ? line.size() : colon + 1);
+    }
+    return fields;
+}
+
+std::optional<std::uint32_t> numberOf(std::string_view text) {
+    std::uint32_t number = 0;
+    const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), number);
+    if (error != std::errc{} || end != text.data() + text.size())
+        return std::nullopt;
+    return number;
+}
+
+std::optional<Account> parseAccount(std::string_view line) {
+    const auto fields = fieldsOf<7>(line); // name, password, user id, group id, comment, home, shell
+    if (!fields)
+        return std::nullopt;
+    const auto uid = numberOf((*fields)[2]);
+    const auto gid = numberOf((*fields)[3]);
+    if ((*fields)[0].empty() || !uid || !gid)
+        return std::nullopt;
+    return Account{std::string((*fields)[0]), *uid, *gid, std::string((*fields)[5])};
+}
+
+std::optional<Group> parseGroup(std::string_view line) {
+    const auto fields = fieldsOf<4>(line); // name, password, group id, members
+    if (!fields)
+        return std::nullopt;
+    const auto gid = numberOf((*fields)[2]);
+    if ((*fields)[0].empty() || !gid)
+        return std::nullopt;
+    return Group{std::string((*fields)[0]), *gid};
+}
+
+template<typename Record, typename Matches>
+std::expected<Record, int> find(const char* file, std::optional<Record> (*parse)(std::string_view), Matches matches) {
+    const auto content = OST_TRY(readSmallFile(file, databaseLimit, FinalLink::follow));
+    for (std::string_view rest = content; !rest.empty();) {
+        const auto line = rest.substr(0, rest.find('\n'));
+        rest.remove_prefix(std::min(line.size() + 1, rest.size()));
+        if (auto record = parse(line); record && matches(*record))
+            return *std::move(record);
+    }
+    return std::unexpected(ENOENT);
+}
+
+} // namespace
+
+std::expected<Account, int> accountForName(std::string_view name) {
+    return find(passwdFile, parseAccount, [&](const Account& account) { return account.name == name; });
+}
+
+std::expected<Account, int> accountForUserId(uid_t uid) {
+    return find(passwdFile, parseAccount, [&](const Account& account) { return account.uid == uid; });
+}
+
+std::expected<Account, int> accountMatching(const std::function<bool(const Account&)>& matches) {
+    return find(passwdFile, parseAccount, matches);
+}
+
+std::expected<gid_t, int> groupForName(std::string_view name) {
+    return OST_TRY(find(groupFile, parseGroup, [&](const Group& group) { return group.name == name; })).gid;
+}
+
+std::expected<std::string, int> groupForId(gid_t gid) {
+    return OST_TRY(find(groupFile, parseGroup, [&](const Group& group) { return group.gid == gid; })).name;
+}
+
+} // namespace ost::platform

@@ -1,0 +1,90 @@
+#include "platform/device/CodeSignature.h"
+
+#include "platform/codec/PropertyList.h"
+
+#include <fcntl.h>
+#include <linux/magic.h>
+#include <sys/stat.h>
+#include <sys/statvfs.h>
+#include <sys/vfs.h>
+#include <sys/xattr.h>
+
+#include <algorithm>
+#include <cerrno>
+
+namespace ost::platform {
+
+namespace {
+
+/// What ordinary signatures fit into. The kernel allocates and clears as much as its caller has room for, so the first
+/// question has room for little.
+constexpr std::size_t ordinarySignature = 1024;
+
+bool isTrustworthy(const struct stat& status) {
+    return S_ISREG(status.st_mode) && status.st_uid == 0 && (status.st_mode & (S_IWGRP | S_IWOTH)) == 0;
+}
+
+} // namespace
+
+std::expected<RawCodeSignature, int> readCodeSignature(int fd, std::span<char> buffer) {
+    struct stat status{};
+    if (::fstat(fd, &status) != 0)
+        return std::unexpected(errno);
+    return readCodeSignature(fd, status, buffer);
+}
+
+std::expected<RawCodeSignature, int> readCodeSignature(int fd, const struct stat& status, std::span<char> buffer) {
+    RawCodeSignature signature{.bytes = {}, .device = status.st_dev};
+    if (!isTrustworthy(status))
+        return signature;
+    const auto ordinary = std::min(ordinarySignature, buffer.size());
+    auto size = ::fgetxattr(fd, codeSignatureAttribute, buffer.data(), ordinary);
+    if (size < 0 && errno == ERANGE)
+        size = ::fgetxattr(fd, codeSignatureAttribute, buffer.data(), buffer.size());
+    if (size < 0 && errno != ENODATA && errno != ENOTSUP)
+        return std::unexpected(errno);
+    if (size > 0)
+        signature.bytes = {buffer.data(), static_cast<std::size_t>(size)};
+    return signature;
+}
+
+bool isOnUserFileSystem(int fd) {
+    // Such a mount never lets set-user-id bits count; one that an administrator makes may.
+    struct statfs fileSystem{};
+    return ::fstatfs(fd, &fileSystem) != 0 ||
+           (fileSystem.f_type == FUSE_SUPER_MAGIC && (fileSystem.f_flags & ST_NOSUID) != 0);
+}
+
+CodeSigningIdentity parseCodeSignature(std::string_view raw) {
+    CodeSigningIdentity identity;
+    if (raw.empty())
+        return identity;
+    const auto value = parsePropertyList(raw);
+    const auto* const signature = value ? value->asDictionary() : nullptr;
+    if (!signature)
+        return identity;
+    if (const auto* const identifier = signature->find("Identifier"); identifier && identifier->asString())
+        identity.identifier = *identifier->asString();
+    if (const auto* const entitlements = signature->find("Entitlements"))
+        identity.entitlements = entitlements->sharedDictionary();
+    return identity;
+}
+
+std::expected<FileDescriptor, int> openProgram(const std::string& path) {
+    FileDescriptor program(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY));
+    struct stat status{};
+    if (!program || ::fstat(program.get(), &status) != 0)
+        return std::unexpected(errno);
+    if (!S_ISREG(status.st_mode))
+        return std::unexpected(EINVAL);
+    return program;
+}
+
+std::expected<void, int> writeCodeSignature(int fd, const OSTDictionary& signature) {
+    const auto raw = serializeBinaryPropertyList(signature);
+    if (::fsetxattr(fd, codeSignatureAttribute, raw.data(), raw.size(), 0) != 0)
+        return std::unexpected(errno);
+    return {};
+}
+
+} // namespace ost::platform

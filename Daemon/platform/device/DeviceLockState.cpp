@@ -1,0 +1,88 @@
+#include "platform/device/DeviceLockState.h"
+
+#include "platform/base/Path.h"
+#include "platform/base/SmallFile.h"
+#include "platform/base/Try.h"
+
+#include <fcntl.h>
+#include <sys/epoll.h>
+#include <sys/inotify.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <charconv>
+#include <cstdio>
+#include <cstring>
+#include <string_view>
+
+namespace ost::platform {
+
+namespace {
+
+constexpr std::size_t stateTextLimit = 16; // a number of 32 bits and a newline
+
+/// Fetches every event that is due. True when one of them concerns the state's file.
+bool drainEvents(int watch) {
+    alignas(inotify_event) char buffer[4096];
+    const auto watchedName = lastPathComponent(deviceLockStateFile);
+    bool changed = false;
+    for (ssize_t count = 0; (count = ::read(watch, buffer, sizeof buffer)) > 0;) {
+        for (const char* next = buffer; next < buffer + count;) {
+            inotify_event event{};
+            std::memcpy(&event, next, sizeof event);
+            const char* name = next + sizeof event;
+            // Events that were lost may have been ours.
+            changed |= (event.mask & IN_Q_OVERFLOW) != 0 || (event.len > 0 && name == watchedName);
+            next = name + event.len;
+        }
+    }
+    return changed;
+}
+
+} // namespace
+
+int deviceLockState(const std::string& image) {
+    const auto content = readSmallFile((image + deviceLockStateFile).c_str(), stateTextLimit, FinalLink::refuse);
+    if (!content)
+        return content.error() == ENOENT ? deviceUnlocked : deviceLockStateUnknown;
+    int state = 0;
+    const auto* contentEnd = content->data() + content->size();
+    const auto [end, error] = std::from_chars(content->data(), contentEnd, state);
+    const std::string_view rest(end, contentEnd);
+    return error == std::errc{} && state >= 0 && (rest.empty() || rest == "\n") ? state : deviceLockStateUnknown;
+}
+
+std::expected<void, int> writeDeviceLockState(int state, const std::string& image) {
+    const auto file = image + deviceLockStateFile;
+    const auto newFile = file + "." + std::to_string(::getpid());
+    const auto text = std::to_string(state) + "\n";
+    ::unlink(newFile.c_str()); // left by a process of the same number
+    const FileDescriptor descriptor(
+        ::open(newFile.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0644));
+    if (!descriptor)
+        return std::unexpected(errno);
+    const auto written = ::write(descriptor.get(), text.data(), text.size());
+    if (written == static_cast<ssize_t>(text.size()) && ::rename(newFile.c_str(), file.c_str()) == 0)
+        return {};
+    const int error = written >= 0 && static_cast<std::size_t>(written) < text.size() ? ENOSPC : errno;
+    ::unlink(newFile.c_str());
+    return std::unexpected(error);
+}
+
+std::expected<DeviceLockStateNotification, int> DeviceLockStateNotification::registerHandler(RunLoop& loop,
+                                                                                             Handler handler) {
+    FileDescriptor watch(::inotify_init1(IN_NONBLOCK | IN_CLOEXEC));
+    // The directory is watched, because the file itself may be replaced or missing.
+    const std::string directory(pathByDeletingLastComponent(deviceLockStateFile));
+    constexpr auto events = IN_CREATE | IN_CLOSE_WRITE | IN_MOVED_FROM | IN_MOVED_TO | IN_DELETE | IN_ONLYDIR;
+    if (!watch || ::inotify_add_watch(watch.get(), directory.c_str(), events) < 0)
+        return std::unexpected(errno);
+    auto source = OST_TRY(
+        loop.addSource(watch.get(), EPOLLIN, [fd = watch.get(), handler = std::move(handler)](std::uint32_t) mutable {
+            if (drainEvents(fd))
+                handler();
+        }));
+    return DeviceLockStateNotification(std::move(watch), std::move(source));
+}
+
+} // namespace ost::platform

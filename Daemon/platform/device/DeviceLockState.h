@@ -1,0 +1,46 @@
+#pragma once
+
+#include "platform/threads/RunLoop.h"
+
+#include <expected>
+#include <functional>
+#include <memory>
+#include <string>
+
+namespace ost::platform {
+
+/// The device's lock state is a decimal number in a file of the device, which the system's key store writes.
+
+inline constexpr const char* deviceLockStateFile = "/private/var/run/device-lock-state";
+
+inline constexpr int deviceUnlocked = 0;
+inline constexpr int deviceLocked = 1;
+inline constexpr int deviceLockStateUnknown = -1;
+
+/// The current state of the device whose image is the directory `image` ("" for the device that one runs on): 0 when
+/// nobody has written one, `deviceLockStateUnknown` when the file is anything but a number.
+[[nodiscard]] int deviceLockState(const std::string& image = "");
+
+/// Replaces the state of a device, given like above. Fails with the errno of writing the file, and then leaves the old
+/// state.
+[[nodiscard]] std::expected<void, int> writeDeviceLockState(int state, const std::string& image = "");
+
+/// The notification of a changed lock state. Belongs to the thread of its run loop.
+class DeviceLockStateNotification {
+public:
+    using Handler = std::move_only_function<void()>;
+
+    /// Calls `handler` on `loop` after the state's file was written, replaced or removed; changes that come together
+    /// are one call. Fails with the errno of the watch on the file's directory.
+    [[nodiscard]] static std::expected<DeviceLockStateNotification, int> registerHandler(RunLoop& loop,
+                                                                                         Handler handler);
+
+private:
+    DeviceLockStateNotification(FileDescriptor watch, RunLoop::Source source)
+        : _watch(std::move(watch)), _source(std::move(source)) {}
+
+    FileDescriptor _watch;
+    RunLoop::Source _source; // declared last: goes before the descriptor it listens to
+};
+
+} // namespace ost::platform

@@ -1,0 +1,93 @@
+#include "platform/device/SandboxUserState.h"
+
+#include "platform/base/FileDescriptor.h"
+#include "platform/base/Try.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cerrno>
+#include <cstdio>
+#include <string>
+
+namespace ost::platform {
+
+namespace {
+
+/// A key as a file name. No name begins with a dot, so temporary links that do never collide with one.
+std::string escapedName(std::string_view key) {
+    constexpr std::string_view plain = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789._-";
+    constexpr char digits[] = "0123456789ABCDEF";
+    std::string name;
+    for (const char c : key) {
+        if (plain.contains(c) && !(c == '.' && name.empty())) {
+            name += c;
+            continue;
+        }
+        const auto byte = static_cast<unsigned char>(c);
+        name.append({'%', digits[byte >> 4U], digits[byte & 15U]});
+    }
+    return name;
+}
+
+/// Makes a link under a name that nothing else has, and gives the name. A crash may have left such a link behind, made
+/// by a process that had our number.
+std::expected<std::string, int> makeTemporaryLink(int directory, const std::string& path) {
+    static std::atomic<unsigned> links = 0;
+    for (;;) {
+        auto name = "." + std::to_string(::getpid()) + "." + std::to_string(links++);
+        if (::symlinkat(path.c_str(), directory, name.c_str()) == 0)
+            return name;
+        if (errno != EEXIST)
+            return std::unexpected(errno);
+    }
+}
+
+std::expected<FileDescriptor, int> openOrMake(int parent, const std::string& name) {
+    constexpr mode_t searchable = 0755;
+    constexpr int flags = O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
+    FileDescriptor directory(::openat(parent, name.c_str(), flags));
+    if (!directory && errno == ENOENT) {
+        if (::mkdirat(parent, name.c_str(), searchable) != 0 && errno != EEXIST)
+            return std::unexpected(errno);
+        directory.reset(::openat(parent, name.c_str(), flags));
+    }
+    if (!directory)
+        return std::unexpected(errno);
+    return directory;
+}
+
+/// The directory of a user's items of one type, which is there as a rule.
+std::expected<FileDescriptor, int> openItems(std::uint32_t userId, std::uint64_t type) {
+    const auto user = std::to_string(userId), items = std::to_string(type);
+    const auto path = std::string(sandboxStateDirectory) + "/" + user + "/" + items;
+    if (auto existing = openWithoutLinks(AT_FDCWD, path.c_str(), O_PATH | O_DIRECTORY))
+        return existing;
+    const auto top = OST_TRY(openOrMake(AT_FDCWD, sandboxStateDirectory));
+    const auto ofUser = OST_TRY(openOrMake(top.get(), user));
+    return openOrMake(ofUser.get(), items);
+}
+
+} // namespace
+
+std::expected<void, int> setSandboxUserStateItem(std::uint32_t userId, std::uint64_t type, std::string_view key,
+                                                 std::optional<std::string_view> path) {
+    const auto items = OST_TRY(openItems(userId, type));
+    const auto name = escapedName(key);
+    if (!path) {
+        if (::unlinkat(items.get(), name.c_str(), 0) != 0 && errno != ENOENT)
+            return std::unexpected(errno);
+        return {};
+    }
+    const auto temporary = OST_TRY(makeTemporaryLink(items.get(), std::string(*path)));
+    if (::renameat(items.get(), temporary.c_str(), items.get(), name.c_str()) != 0) {
+        const int error = errno;
+        ::unlinkat(items.get(), temporary.c_str(), 0);
+        return std::unexpected(error);
+    }
+    return {};
+}
+
+} // namespace ost::platform

@@ -1,0 +1,158 @@
+#pragma once
+
+#include "platform/base/FileDescriptor.h"
+#include "platform/ipc/IPCFrame.h"
+#include "platform/ipc/IPCMessage.h"
+#include "platform/ipc/PeerIdentity.h"
+#include "platform/threads/DeadlineTimer.h"
+#include "platform/threads/EventSource.h"
+#include "platform/threads/WorkerPool.h"
+
+#include <atomic>
+#include <chrono>
+#include <cstddef>
+#include <cstdint>
+#include <deque>
+#include <functional>
+#include <limits>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <span>
+#include <string>
+#include <string_view>
+
+namespace ost::platform {
+
+class IPCConnectionRegistry;
+
+/// What a client may cost before it loses its connection.
+struct IPCLimits {
+    std::size_t connections = 4096;         ///< in all: three descriptors each
+    std::size_t connectionsOfOneUser = 256; ///< of a user id above 0, so that no user can take them all
+    std::uint32_t payload = IPCFrameHeader::maximumPayload;
+    std::size_t unreadReplies = 64 * 1024 * 1024;                   ///< bytes kept for a client that does not read
+    std::chrono::milliseconds takeReply = std::chrono::seconds(30); ///< to take a reply that the socket cannot hold
+    std::chrono::milliseconds completeFrame =
+        std::chrono::seconds(30);                                    ///< to send a frame whose first byte has arrived
+    std::chrono::milliseconds acceptAgain = std::chrono::seconds(1); ///< pause when the process is out of descriptors
+};
+
+/// One client: a connection that gives its requests, in order and one at a time, to the message handler.
+///
+/// Threads: the message handler runs on a thread of the listener's pool; requests of different connections run at the
+/// same time. `cancel` and replies are safe from any thread; the setters and `resume` belong to the listener's event
+/// handler, before any request; `peer` belongs to the message handler.
+///
+/// Ownership: shared by the listener, as long as the client stays, and by replies that are not yet sent. A connection
+/// that outlives its listener is closed.
+///
+/// The end: the client goes away, or breaks a rule of the wire or a limit, or `cancel` is called. Replies to the
+/// requests before that are still delivered where somebody is left to take them, then the socket is closed and the
+/// invalidation handler is called.
+class IPCConnection final : public EventSource {
+public:
+    using MessageHandler = std::function<void(const std::shared_ptr<IPCConnection>&, IPCRequest)>;
+    using InvalidationHandler = std::function<void(const std::shared_ptr<IPCConnection>&)>;
+
+    /// What a connection uses of its listener, all of which outlives the connection's socket.
+    struct Surroundings {
+        WorkerPool& pool;
+        DeadlineTimer& timer;
+        IPCConnectionRegistry& registry;
+        const IPCLimits& limits;
+    };
+
+    IPCConnection(FileDescriptor socket, PeerIdentity peer, const Surroundings& surroundings);
+
+    void setMessageHandler(MessageHandler handler) { _messageHandler = std::move(handler); }
+    /// Called once, after the last message, when the connection has gone for whatever reason.
+    void setInvalidationHandler(InvalidationHandler handler) { _invalidationHandler = std::move(handler); }
+
+    /// Lets requests come in. A connection that is not resumed by the end of the listener's event handler is closed.
+    void resume();
+
+    /// The reply to `request`, which came in on this connection; absent when that has one already, or the connection is
+    /// gone.
+    [[nodiscard]] std::optional<IPCReply> createReply(IPCRequest& request);
+
+    /// Ends the connection. From the message handler: the request at hand and those behind it get no reply. From
+    /// elsewhere: no further request is handled.
+    void cancel();
+
+    [[nodiscard]] PeerIdentity& peer() { return _peer; }
+    [[nodiscard]] const PeerIdentity& peer() const { return _peer; }
+
+private:
+    friend class IPCReply;
+    friend class IPCListener;
+    friend class IPCConnectionRegistry;
+    using Time = std::chrono::steady_clock::time_point;
+
+    /// Ordered: an end never becomes a milder one.
+    enum class End : std::uint8_t {
+        none,
+        noMoreRequests, ///< the client has sent its last
+        cancelled,      ///< so have we decided: replies to earlier requests are still delivered
+        broken,         ///< nothing can be delivered any more
+    };
+
+    // Receiving: only while the pool serves this connection.
+    void serve(std::uint32_t events, std::span<char> scratch) override;
+    void _serveEvents(std::uint32_t events, std::span<char> scratch);
+    void _receive(std::span<char> scratch);
+    [[nodiscard]] bool _receiveSome(std::span<char> scratch);
+    void _handle(IPCFrame frame);
+    void _watchForFrame(bool drained);
+    void _checkDeadlines();
+    void _closeIfFinished();
+    void _refuse(std::string_view reason);
+
+    // Sending.
+    void _sendReply(std::string frame, std::uint64_t sequence);
+    void _abandonReply();
+    void _flushUntil(Time deadline);
+
+    void _close();
+    void _closeUnlessResumed();
+
+    // Only with _mutex held.
+    void _sendOrKeep(std::string frame);
+    void _sendKept();
+    [[nodiscard]] std::optional<std::size_t> _trySending(std::string_view bytes);
+    void _replyIsDone();
+    void _endWith(End end);
+    void _updateDeadline();
+
+    Surroundings _surroundings;
+    PeerIdentity _peer;
+    MessageHandler _messageHandler;
+    InvalidationHandler _invalidationHandler;
+
+    // Of the thread that serves.
+    IPCFrameReader _reader;
+    std::uint64_t _sequence = 0;     ///< requests received
+    bool _readUntilEnd = false;      ///< the client sends no more than what is here already
+    bool _hungUp = false;            ///< nor does it take replies
+    bool _waitsForFrame = false;     ///< whether _frameDeadline is set
+    std::uint64_t _awaitedFrame = 0; ///< then, for the frame after this many
+
+    // Own locking.
+    std::atomic<End> _end{End::none};              ///< written under _mutex
+    std::atomic<std::size_t> _openReplies{0};      ///< made and neither sent nor abandoned
+    std::atomic<std::uint64_t> _firstUnhandled{0}; ///< sequence of the request at hand, or else of the next
+
+    std::mutex _mutex;
+    // Guarded by _mutex.
+    FileDescriptor _socket; ///< empty once closed; the surroundings are used only while it is open
+    WorkerPool::Watch _watch = WorkerPool::Watch::none;
+    std::uint64_t _repliesEnd = std::numeric_limits<std::uint64_t>::max(); ///< requests from here on get no reply
+    std::deque<std::string> _unsent;
+    std::size_t _unsentBytes = 0;
+    std::size_t _sentOfFirst = 0; ///< bytes of the first one that the socket has taken
+    std::optional<Time> _frameDeadline;
+    std::optional<Time> _replyDeadline;
+    std::optional<Time> _deadline; ///< the earliest, as the timer knows it
+};
+
+} // namespace ost::platform

@@ -1,0 +1,41 @@
+#pragma once
+
+#include "platform/ipc/IPCConnection.h"
+
+#include <sys/types.h>
+
+#include <cstddef>
+#include <expected>
+#include <functional>
+#include <memory>
+#include <mutex>
+#include <unordered_map>
+#include <vector>
+
+namespace ost::platform {
+
+/// The open connections of a listener, counted for each user. Threads: any.
+class IPCConnectionRegistry {
+public:
+    explicit IPCConnectionRegistry(const IPCLimits& limits) : _limits(limits) {}
+
+    /// Called after each removal. To be set before the first connection is added.
+    void setRemovalHandler(std::function<void()> handler) { _removalHandler = std::move(handler); }
+
+    /// Takes a connection in, or says which limit refuses it.
+    [[nodiscard]] std::expected<void, const char*> add(const std::shared_ptr<IPCConnection>& connection);
+    void remove(IPCConnection& connection);
+
+    [[nodiscard]] std::vector<std::shared_ptr<IPCConnection>> all() const;
+
+private:
+    const IPCLimits& _limits;
+    std::function<void()> _removalHandler;
+
+    mutable std::mutex _mutex;
+    // Guarded by _mutex.
+    std::unordered_map<IPCConnection*, std::shared_ptr<IPCConnection>> _connections;
+    std::unordered_map<uid_t, std::size_t> _connectionsOfUser;
+};
+
+} // namespace ost::platform
