@@ -11,9 +11,9 @@
 
 namespace ost::platform {
 
-std::expected<std::string, int> readSmallFile(const char* path, std::size_t limit, FinalLink finalLink) {
+std::expected<std::string, int> readSmallFile(int base, const char* path, std::size_t limit, FinalLink finalLink) {
     const int noFollow = finalLink == FinalLink::refuse ? O_NOFOLLOW : 0;
-    const FileDescriptor file(::open(path, O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY | noFollow));
+    const FileDescriptor file(::openat(base, path, O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY | noFollow));
     struct stat status{};
     if (!file || ::fstat(file.get(), &status) != 0)
         return std::unexpected(errno);
@@ -29,6 +29,10 @@ std::expected<std::string, int> readSmallFile(const char* path, std::size_t limi
         return std::unexpected(errno);
     content.resize(std::min(static_cast<std::size_t>(count), limit));
     return content;
+}
+
+std::expected<std::string, int> readSmallFile(const char* path, std::size_t limit, FinalLink finalLink) {
+    return readSmallFile(AT_FDCWD, path, limit, finalLink);
 }
 
 } // namespace ost::platform

@@ -1,6 +1,7 @@
 #include "platform/device/SandboxUserState.h"
 
 #include "platform/base/FileDescriptor.h"
+#include "platform/base/FileName.h"
 #include "platform/base/Try.h"
 
 #include <fcntl.h>
@@ -15,22 +16,6 @@
 namespace ost::platform {
 
 namespace {
-
-/// A key as a file name. No name begins with a dot, so temporary links that do never collide with one.
-std::string escapedName(std::string_view key) {
-    constexpr std::string_view plain = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789._-";
-    constexpr char digits[] = "0123456789ABCDEF";
-    std::string name;
-    for (const char c : key) {
-        if (plain.contains(c) && !(c == '.' && name.empty())) {
-            name += c;
-            continue;
-        }
-        const auto byte = static_cast<unsigned char>(c);
-        name.append({'%', digits[byte >> 4U], digits[byte & 15U]});
-    }
-    return name;
-}
 
 /// Makes a link under a name that nothing else has, and gives the name. A crash may have left such a link behind, made
 /// by a process that had our number.
@@ -75,7 +60,7 @@ std::expected<FileDescriptor, int> openItems(std::uint32_t userId, std::uint64_t
 std::expected<void, int> setSandboxUserStateItem(std::uint32_t userId, std::uint64_t type, std::string_view key,
                                                  std::optional<std::string_view> path) {
     const auto items = OST_TRY(openItems(userId, type));
-    const auto name = escapedName(key);
+    const auto name = fileNameForKey(key);
     if (!path) {
         if (::unlinkat(items.get(), name.c_str(), 0) != 0 && errno != ENOENT)
             return std::unexpected(errno);

@@ -12,8 +12,8 @@ namespace ost::platform {
 inline constexpr const char* sandboxStateDirectory = "/private/var/db/sandbox-state";
 
 /// Sets the state item `key` of a user and type to `path`, in one rename, or removes it when there is none; removing an
-/// item that is absent succeeds. NAME is the key with every byte outside `A-Z a-z 0-9 . _ -`, and a leading dot, as
-/// `%XX`. Fails with an errno: ENAMETOOLONG when the key is too long for a file name.
+/// item that is absent succeeds. NAME is the key as `fileNameForKey` writes it. Fails with an errno: ENAMETOOLONG when
+/// the key is too long for a file name.
 ///
 /// Threads: any, but not two at a time for one item.
 [[nodiscard]] std::expected<void, int> setSandboxUserStateItem(std::uint32_t userId, std::uint64_t type,
