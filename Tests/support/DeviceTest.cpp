@@ -1,6 +1,7 @@
 #include "support/DeviceTest.h"
 
 #include "Device/DeviceImage.h"
+#include "support/Sanitized.h"
 #include "support/ScratchDirectory.h"
 
 #include <sys/stat.h>
@@ -16,18 +17,6 @@
 namespace ost::test {
 
 namespace {
-
-#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
-constexpr bool isSanitized = true;
-#elif defined(__has_feature)
-#if __has_feature(address_sanitizer) || __has_feature(thread_sanitizer)
-constexpr bool isSanitized = true;
-#else
-constexpr bool isSanitized = false;
-#endif
-#else
-constexpr bool isSanitized = false;
-#endif
 
 /// A test must not go on outside its device: it would act on the host.
 template<typename Value, typename Error>
