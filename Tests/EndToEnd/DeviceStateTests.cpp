@@ -137,15 +137,21 @@ TEST_F(DeviceStateTest, AnOrderlyEndFinishesWhatIsUnderWay) {
 }
 
 TEST_F(DeviceStateTest, AnOrderlyEndAnswersEveryRequestThatHasBegun) {
+    constexpr std::uint32_t requestsInARound = 100; // whose replies a socket holds, however late they are read
     for (int round = 0; round < 5; ++round) {
         auto connection = connect();
+        const auto identifier = [&](std::uint32_t i) {
+            return "com.example." + std::to_string(round) + "." + std::to_string(i);
+        };
+        EXPECT_EQ(connection.call(creation(0, identifier(0))).error(), 1U);
+        const auto daemon = device().daemonId();
         std::string requests;
-        for (std::uint32_t i = 0; i < 200; ++i)
-            requests += creation(i, "com.example." + std::to_string(round) + "." + std::to_string(i));
+        for (std::uint32_t i = 1; i < requestsInARound; ++i)
+            requests += creation(i, identifier(i));
         connection.send(requests);
         ASSERT_TRUE(connection.receive());
-        device().killDaemon(SIGTERM);
-        std::uint32_t answered = 1;
+        ASSERT_EQ(::kill(daemon, SIGTERM), 0);
+        std::uint32_t answered = 2;
         while (const auto reply = connection.receive()) {
             EXPECT_EQ(reply->requestNumber(), answered++);
             EXPECT_EQ(reply->error(), 1U);
