@@ -3,7 +3,9 @@
 #include "platform/base/StackTrace.h"
 #include "support/DeviceTest.h"
 
+#include <exception>
 #include <stdexcept>
+#include <thread>
 
 namespace ost::platform {
 namespace {
@@ -27,16 +29,37 @@ TEST_F(CrashReportTest, endsTheProcessWhateverStandsInTheWay) {
     EXPECT_EXIT(crashWithMessage("last words"), testing::KilledBySignal(SIGABRT), "last words");
 }
 
-TEST(StackTrace, knowsTheFramesOfACall) {
-    try {
+[[gnu::noinline]] void throwsHere(std::size_t index) {
+    if (index < 1)
         throw std::out_of_range("index");
+}
+
+TEST(StackTrace, NamesTheFunctionThatThrew) {
+    try {
+        throwsHere(0);
     } catch (const std::exception&) {
-        EXPECT_GT(exceptionCallStackSymbols().size(), 2U);
+        const auto frames = exceptionCallStackSymbols();
+        ASSERT_GT(frames.size(), 2U);
+        EXPECT_NE(frames[0].find(" ost::platform::(anonymous namespace)::throwsHere(unsigned long)"), std::string::npos)
+            << frames[0];
+        for (const auto& frame : frames)
+            EXPECT_TRUE(frame.starts_with("0x")) << frame;
     }
-    const auto frames = callStackSymbols();
-    ASSERT_GT(frames.size(), 2U);
-    for (const auto& frame : frames)
-        EXPECT_NE(frame.find("0x"), std::string::npos) << frame;
+}
+
+TEST(StackTrace, IsNotThatOfAnotherThrow) {
+    std::exception_ptr elsewhere;
+    std::thread([&] { elsewhere = std::make_exception_ptr(std::out_of_range("elsewhere")); }).join();
+    try {
+        throwsHere(0);
+    } catch (const std::exception&) {
+    }
+    try {
+        std::rethrow_exception(elsewhere);
+    } catch (const std::exception&) {
+        for (const auto& frame : exceptionCallStackSymbols())
+            EXPECT_EQ(frame.find("throwsHere"), std::string::npos) << frame;
+    }
 }
 
 } // namespace

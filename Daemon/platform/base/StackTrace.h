@@ -5,11 +5,11 @@
 
 namespace ost::platform {
 
-/// The calling thread's call stack, innermost frame first, one frame a string.
-[[nodiscard]] std::vector<std::string> callStackSymbols();
-
-/// The call stack of the calling thread's last throw, for use where its exception is handled. Programs that are linked
-/// with `-Wl,--wrap=__cxa_throw` record it when they throw; in others it is that of the handler.
-[[nodiscard]] std::vector<std::string> exceptionCallStackSymbols();
+/// The call stack of the throw whose exception is being handled, innermost frame first, one frame a string: its address
+/// and, where the program's symbol table has it, the function with the offset in it. The stack of the handler when
+/// another thread threw the exception, or a shared library that does not call this program's hook.
+///
+/// Where memory has run out, frames are left out instead of an exception.
+[[nodiscard]] std::vector<std::string> exceptionCallStackSymbols() noexcept;
 
 } // namespace ost::platform
