@@ -40,6 +40,16 @@ OSTCodeSigningEntry OSTCodeSigningEntry::withSerializedDictionary(const OSTDicti
     return entry;
 }
 
+OSTCodeSigningEntry OSTCodeSigningEntry::withCachedInfo(const OSTDictionary& cached, std::uint64_t dataContainerClass) {
+    OSTDictionary info = cached;
+    if (const auto* const entitlements = cached.find("Entitlements"))
+        info.set(OSTEntitlementsKey, OSTValue(*entitlements));
+    else
+        info.remove(OSTEntitlementsKey);
+    return {.codeSigningInfo = std::make_shared<const OSTDictionary>(std::move(info)),
+            .dataContainerClass = dataContainerClass};
+}
+
 OSTDictionary OSTCodeSigningEntry::serialize() const {
     std::vector<OSTDictionary::Entry> entries;
     entries.reserve(6);

@@ -17,6 +17,9 @@ inline constexpr const char* OSTEntitlementsKey = "com.tamarok.Ostrand.Entitleme
 /// The entitlement, a boolean, that gives an identifier a system container.
 inline constexpr const char* OSTSystemContainerKey = "com.tamarok.security.system-container";
 
+/// Where older releases cached code-signing information: in the info values of a bundle container.
+inline constexpr const char* OSTCachedCodeSigningInfoKey = "com.tamarok.Tessaly.CachedCodeSigningInfo";
+
 /// What is known of one identifier's code signing.
 ///
 /// A value type. The mapping holds entries shared and unchanging; a change is a new entry.
@@ -36,6 +39,11 @@ struct OSTCodeSigningEntry {
     /// Builds an entry from its serialized form. What is missing is absent, false or 0; a list of children keeps its
     /// strings.
     [[nodiscard]] static OSTCodeSigningEntry withSerializedDictionary(const OSTDictionary& dictionary);
+
+    /// Builds a valid entry from information that an older release cached, which has the entitlements under another
+    /// key.
+    [[nodiscard]] static OSTCodeSigningEntry withCachedInfo(const OSTDictionary& cached,
+                                                            std::uint64_t dataContainerClass);
 
     [[nodiscard]] OSTDictionary serialize() const;
 

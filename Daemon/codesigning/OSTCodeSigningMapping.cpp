@@ -18,10 +18,6 @@ namespace {
 
 constexpr std::string_view systemGroupPrefix = "systemgroup.";
 
-/// Where older releases cached code-signing information: in the info values of a bundle container.
-constexpr const char* cachedInfoKey = "com.tamarok.Tessaly.CachedCodeSigningInfo";
-constexpr const char* cachedEntitlementsKey = "Entitlements";
-
 /// Whether a client that carries the entitlements would change nothing by registering itself again.
 bool isOwnRegistration(const OSTCodeSigningEntry& entry, const std::shared_ptr<const OSTDictionary>& entitlements) {
     const auto* const held = entry.codeSigningInfo->size() == 1 ? entry.entitlements() : nullptr;
@@ -221,26 +217,24 @@ OSTCodeSigningMapping::_onQueue_codeSigningInfoForIdentifier(std::string_view id
 OSTCodeSigningMapping::EntryRecord OSTCodeSigningMapping::_migrateFromBundleContainer(std::string_view identifier) {
     const auto bundle = OSTContainerCache::sharedInstance().containerForUser(
         OSTInstallerUserId, OSTContainerClass::bundleApplication, identifier, false);
-    const auto* const cached = bundle && (*bundle)->info ? (*bundle)->info->find(cachedInfoKey) : nullptr;
+    const auto* const cached = bundle && (*bundle)->info ? (*bundle)->info->find(OSTCachedCodeSigningInfoKey) : nullptr;
     if (!cached || !cached->asDictionary())
         return nullptr;
     platform::logAs(platform::LogLevel::notice, "_onQueue_codeSigningInfoForIdentifier",
                     "Migrating code signing info from bundle container upon request for %@", (*bundle)->identifier);
-    OSTDictionary info = *cached->asDictionary();
-    if (const auto* const entitlements = info.find(cachedEntitlementsKey))
-        info.set(OSTEntitlementsKey, OSTValue(*entitlements));
-    else
-        info.remove(OSTEntitlementsKey);
-    auto entry = std::make_shared<const OSTCodeSigningEntry>(
-        OSTCodeSigningEntry{.codeSigningInfo = std::make_shared<const OSTDictionary>(std::move(info)),
-                            .dataContainerClass = static_cast<std::uint64_t>(OSTContainerClass::dataApplication)});
-    _codeSigningMappingDict.insert_or_assign((*bundle)->identifier, entry);
-    _unreadableEntries.erase((*bundle)->identifier);
+    _storeEntry((*bundle)->identifier,
+                OSTCodeSigningEntry::withCachedInfo(*cached->asDictionary(),
+                                                    static_cast<std::uint64_t>(OSTContainerClass::dataApplication)));
     if (const auto written = _writeCodeSigningMappingToDisk(); !written)
         platform::logAs(platform::LogLevel::error, "_onQueue_codeSigningInfoForIdentifier",
                         "Failed to write code signing mapping to disk during current identifier migration of %@: %@",
                         (*bundle)->identifier, written.error());
-    return entry;
+    return _entry(identifier);
+}
+
+void OSTCodeSigningMapping::_storeEntry(const std::string& identifier, OSTCodeSigningEntry entry) {
+    _codeSigningMappingDict.insert_or_assign(identifier, std::make_shared<const OSTCodeSigningEntry>(std::move(entry)));
+    _unreadableEntries.erase(identifier);
 }
 
 bool OSTCodeSigningMapping::_onQueue_identifierHasSystemContainer(std::string_view identifier) {

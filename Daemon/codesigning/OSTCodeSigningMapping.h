@@ -1,6 +1,7 @@
 #pragma once
 
 #include "codesigning/OSTCodeSigningEntry.h"
+#include "model/OSTMetadata.h"
 #include "platform/base/OSTError.h"
 #include "platform/base/OSTValue.h"
 #include "platform/threads/WorkQueue.h"
@@ -103,6 +104,11 @@ public:
     /// Fails with `mappingWriteFailed`.
     [[nodiscard]] OSTResult<void> invalidateCodeSigningInfoForIdentifierAndItsChildren(std::string_view identifier);
 
+    /// Moves into the mapping what older releases kept elsewhere, then removes application group containers that nobody
+    /// references. A valid entry is never overwritten. Takes the all-identifiers lock for writing. Failures are logged;
+    /// what fails is tried again the next time.
+    void performAllCodeSigningMigrationAndReconciliation();
+
     using EntryRecord = std::shared_ptr<const OSTCodeSigningEntry>;
 
     /// The entries of an identifier and of its children as they are now.
@@ -149,6 +155,8 @@ private:
     [[nodiscard]] EntryRecord _onQueue_codeSigningInfoForIdentifier(std::string_view identifier, Request request);
     /// The identifier's children in order, then the identifier itself.
     [[nodiscard]] std::vector<std::string> _childrenAndIdentifier(std::string_view identifier) const;
+    /// Replaces an identifier's entry in memory.
+    void _storeEntry(const std::string& identifier, OSTCodeSigningEntry entry);
     [[nodiscard]] EntryRecord _migrateFromBundleContainer(std::string_view identifier);
     [[nodiscard]] bool _onQueue_identifierHasSystemContainer(std::string_view identifier);
     [[nodiscard]] bool _hasBundleContainer(std::string_view identifier) const;
@@ -164,6 +172,17 @@ private:
     void _linkToParent(std::string_view identifier, const std::string& parent, Batch& batch);
     void _releaseSystemContainer(std::string_view identifier, const OSTDictionary* newEntitlements);
     void _releaseGroups(std::string_view identifier, const OSTDictionary* newEntitlements);
+
+    // +Migration: each tells whether all of it is done.
+    [[nodiscard]] bool _migrateAppGroupIdsFromDataContainersToFile();
+    [[nodiscard]] bool _migrateDataFromLegacyEntitlementsFileToCodeSigningFile();
+    [[nodiscard]] bool _migrateCachedCodeSigningInfoFromBundleContainersToMapping();
+    /// Calls `storeEntries` on the queue and writes the mapping if it tells that it stored any.
+    [[nodiscard]] OSTResult<void> _storeMigrated(const std::function<bool()>& storeEntries);
+    // +Migration, on the queue only; the first two tell whether they stored an entry.
+    [[nodiscard]] bool _migrateGroupIds(const OSTMetadata& container, const OSTValue& groupIds);
+    [[nodiscard]] bool _migrateCachedInfo(const OSTMetadata& bundle, const OSTDictionary& cached);
+    [[nodiscard]] bool _hasValidEntry(std::string_view identifier) const;
 
     platform::WorkQueue _codeSignQueue{"com.tamarok.Ostrand.EntitlementQueue"};
     bool _available = false; ///< constant after construction

@@ -14,6 +14,11 @@ std::optional<std::string> OSTCodeSigningStoreDelegate::wellknownContainerForId(
     return OSTWhitelist::sharedWhitelist().wellknownContainerForId(identifier, containerClass);
 }
 
+bool OSTCodeSigningStoreDelegate::containerIdIsWellknown(std::string_view identifier,
+                                                         OSTContainerClass containerClass) {
+    return OSTWhitelist::sharedWhitelist().containerIdIsWellknown(identifier, containerClass);
+}
+
 void OSTCodeSigningStoreDelegate::removeCodeSigningDictionariesForIdentifierAndItsChildren(
     std::string_view identifier) {
     OSTCodeSigningMapping::sharedInstance().removeCodeSigningDictionariesForIdentifierAndItsChildren(identifier);

@@ -13,6 +13,7 @@ public:
     [[nodiscard]] bool identifierHasSystemContainer(std::string_view identifier) override;
     [[nodiscard]] std::optional<std::string> wellknownContainerForId(std::string_view identifier,
                                                                      OSTContainerClass containerClass) override;
+    [[nodiscard]] bool containerIdIsWellknown(std::string_view identifier, OSTContainerClass containerClass) override;
     void removeCodeSigningDictionariesForIdentifierAndItsChildren(std::string_view identifier) override;
     [[nodiscard]] Restoration rememberIdentifierAndItsChildren(std::string_view identifier) override;
     [[nodiscard]] OSTResult<void>

@@ -65,6 +65,15 @@ bool OSTFileManager::itemDoesNotExistAtURL(std::string_view path) const {
     return error == ENOENT;
 }
 
+bool OSTFileManager::itemDoesNotExist(int directory, std::string_view relativePath) const {
+    const auto item = OSTOpenItem(directory, relativePath, O_PATH);
+    const int error = item ? 0 : item.error();
+    const bool absent = error == ENOENT || error == ENOTDIR || error == ELOOP;
+    if (error != 0 && !absent)
+        platform::logError("Failed to determine if %@ exists: %s", relativePath, std::strerror(error));
+    return absent;
+}
+
 OSTResult<void> OSTFileManager::_traverseDirectory(std::string_view path, const TreeBlock& block) const {
     if (path.empty())
         return std::unexpected(

@@ -117,6 +117,18 @@ public:
     [[nodiscard]] bool itemExistsAtURL(std::string_view path) const;
     [[nodiscard]] bool itemDoesNotExistAtURL(std::string_view path) const;
 
+    /// The same for a path relative to `directory`, where many items are looked at. A link or a file on the way says as
+    /// well that nothing is there.
+    [[nodiscard]] bool itemDoesNotExist(int directory, std::string_view relativePath) const;
+
+    /// The bytes that everything below the directory at `path` takes on disk, each file once however many names it has.
+    /// Directories themselves count nothing, links are not followed, other file systems are left out. What cannot be
+    /// read is logged and left out; 0 when nothing could be measured.
+    [[nodiscard]] std::uint64_t diskUsageForURL(std::string_view path) const;
+
+    /// Writes the items of the tree at `path` to the log, the first `maximumLines` of them and a line that says so.
+    void printDirectoryStructureAtURL(std::string_view path, std::size_t maximumLines) const;
+
     // Reading and writing files
 
     /// Reads a regular file of at most `maximumSize` bytes. Anything else in its place fails at once: EFBIG for a

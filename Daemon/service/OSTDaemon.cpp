@@ -1,6 +1,7 @@
 #include "service/OSTDaemon.h"
 
 #include "codesigning/OSTCodeSigningStoreDelegate.h"
+#include "migration/OSTContainerMigrator.h"
 #include "model/OSTGlobalConfiguration.h"
 #include "platform/base/Log.h"
 #include "platform/base/Path.h"
@@ -70,6 +71,9 @@ bool OSTDaemon::start() {
     const bool firstBoot = !platform::namedSemaphoreExists(firstBootMarker);
     if (firstBoot)
         logAs(LogLevel::notice, "main", "ostrandd performing first boot initialization");
+    if (firstBoot)
+        OSTClientConnection::rebootContainerManagerSetup(
+            [] { return OSTContainerMigrator::sharedInstance().performSynchronousDaemonStartupMigration(); });
     store.containerManagerSetup();
 
     if (_startRunLoop())
@@ -80,6 +84,7 @@ bool OSTDaemon::start() {
     }
     _followLockState();
     if (firstBoot) {
+        store.rebootContainerManagerCleanup();
         logAs(LogLevel::notice, "main", "ostrandd first boot cleanup complete");
         set_first_boot_work_completed();
     }

@@ -133,9 +133,20 @@ public:
 
     // Start-up
 
+    /// The start-up migration, which lies above the store. A failure may come without an error.
+    using StartupMigration = std::function<std::expected<void, std::optional<OSTError>>()>;
+
+    /// The first step after a boot of the device: changes what older releases left behind. A failure is logged.
+    static void rebootContainerManagerSetup(const StartupMigration& migration);
+
     /// Finishes or undoes the replacements that a crash interrupted. Failures are logged. Runs first, and takes no
     /// locks.
     void containerManagerSetup() const;
+
+    /// The work of the first start after a boot of the device: transient containers, which do not survive it, and items
+    /// of class directories that are no containers go to death row. Failures are logged. Runs before requests are
+    /// accepted, and so takes no locks.
+    void rebootContainerManagerCleanup() const;
 
     /// Brings the store to order before anybody is served: what a crash left in staging goes to death row, and a first
     /// pass destroys it. Failures are logged. Runs before requests are accepted, and so takes no locks.
@@ -179,6 +190,11 @@ private:
     [[nodiscard]] OSTResult<void> _discardReplaceFile(const std::string& url, StartPass startDeletionThread) const;
     [[nodiscard]] OSTResult<void> _recoverFromReplaceOperations() const;
     [[nodiscard]] OSTResult<void> _recoverFromReplaceFile(const std::string& url) const;
+
+    // +Reboot
+    void _cleanUpMobileUser() const;
+    /// Moves to death row what lies in a class directory and is no container.
+    void _cleanupOrphanedDataForUser(std::uint32_t userId, OSTContainerClass containerClass) const;
 
     // +SandboxMapping
     /// Tells the sandbox where the container of an identifier lies, or with no URL that there is none. False, with the

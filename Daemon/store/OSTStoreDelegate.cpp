@@ -12,6 +12,7 @@ public:
     std::optional<std::string> wellknownContainerForId(std::string_view, OSTContainerClass) override {
         return std::nullopt;
     }
+    bool containerIdIsWellknown(std::string_view, OSTContainerClass) override { return false; }
     void removeCodeSigningDictionariesForIdentifierAndItsChildren(std::string_view) override {}
     Restoration rememberIdentifierAndItsChildren(std::string_view) override {
         return [] {};

@@ -23,6 +23,10 @@ public:
     [[nodiscard]] virtual std::optional<std::string> wellknownContainerForId(std::string_view identifier,
                                                                              OSTContainerClass containerClass) = 0;
 
+    /// Whether a system service's container of the class is known by that identifier on every device.
+    [[nodiscard]] virtual bool containerIdIsWellknown(std::string_view identifier,
+                                                      OSTContainerClass containerClass) = 0;
+
     /// Forgets the code signing of an identifier and of its children: its bundle is being deleted. Failures are logged.
     /// The caller holds the all-identifiers lock for writing.
     virtual void removeCodeSigningDictionariesForIdentifierAndItsChildren(std::string_view identifier) = 0;

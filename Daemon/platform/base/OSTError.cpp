@@ -2,25 +2,21 @@
 
 namespace ost {
 
-namespace {
-
-std::string_view nameOf(OSTError::Domain domain) {
-    switch (domain) {
-    case OSTError::Domain::ost:
+std::string_view OSTError::domainName() const {
+    switch (domain()) {
+    case Domain::ost:
         return "OSTErrorDomain";
-    case OSTError::Domain::posix:
+    case Domain::posix:
         return "POSIX";
-    case OSTError::Domain::general:
-        return "general";
+    case Domain::general:
+        break;
     }
     return "general";
 }
 
-} // namespace
-
 std::string OSTError::description() const {
     std::string text;
-    text.append(nameOf(domain())).append(" ").append(std::to_string(static_cast<std::int64_t>(code())));
+    text.append(domainName()).append(" ").append(std::to_string(static_cast<std::int64_t>(code())));
     if (message())
         text.append(": ").append(*message());
     if (underlyingError())

@@ -76,6 +76,8 @@ public:
     static constexpr std::int64_t corruptPropertyList = 2048;
 
     [[nodiscard]] Domain domain() const { return _record->domain; }
+    /// The domain as messages name it: "OSTErrorDomain", "POSIX" or "general".
+    [[nodiscard]] std::string_view domainName() const;
     [[nodiscard]] OSTErrorCode code() const { return _record->code; }
     [[nodiscard]] const std::optional<std::string>& message() const { return _record->message; }
     [[nodiscard]] const std::shared_ptr<const OSTError>& underlyingError() const { return _record->underlyingError; }
