@@ -4,7 +4,6 @@
 #include "platform/base/Path.h"
 #include "platform/base/UUID.h"
 #include "store/OSTClientConnection.h"
-#include "store/OSTCommitSharing.h"
 #include "store/OSTContainerCache.h"
 #include "store/OSTLocks.h"
 #include "store/OSTStoreDelegate.h"
@@ -14,6 +13,7 @@
 
 namespace ost {
 
+using platform::lastPathComponent;
 using platform::pathByAppending;
 using platform::pathByDeletingLastComponent;
 
@@ -37,9 +37,8 @@ std::span<const std::string_view> subDirectoriesOf(OSTContainerClass containerCl
 
 bool placeIsPending(const OSTMetadata& record) { return record.pendingPlacement && *record.pendingPlacement; }
 
-/// Waits until the rename that put the record's container in place has reached the disk. Whoever made a container does
-/// so after the locks are released; whoever finds one that is not there yet does it too, since it is going to be
-/// answered.
+/// Waits until the rename that put the record's container in place has reached the disk. The look-up that made the
+/// container does so when it has given back the lock; one that finds it too early does it as well, before it answers.
 OSTResult<void> makePlaceDurable(const OSTMetadata& record) {
     const auto durable = OSTFileManager::defaultManager().makeDirectoryDurable(pathByDeletingLastComponent(record.url));
     if (!durable)
@@ -62,24 +61,15 @@ std::expected<OSTMetadataRecord, OSTErrorCode>
 OSTClientConnection::createOrLookupContainerForUser(const OSTContainerLookup& lookup) const {
     const auto result = OSTGuarded([&]() -> OSTResult<OSTMetadataRecord> {
         OST_TRY(_checkLookup(lookup));
-        std::optional<OSTCommitSharing::Creation> underWay;
-        if (lookup.createIfNecessary)
-            underWay.emplace();
-        OSTAllIdentifiersLock lock(OSTLockKind::writing, lookup.useLocking);
-        std::optional<std::string> staging;
+        std::string staging;
         auto record = OSTGuarded([&] { return _lookUpOrCreate(lookup, staging); });
-        if (staging) {
-            if (const auto cleared = _moveItemAtURLToDeathRow(*staging, StartPass::yes); !cleared)
-                record = std::unexpected(OSTCreateError(OSTErrorCode::stagingRemovalFailed, cleared.error(),
-                                                        "Failed to remove staging dir: %@", *staging));
+        if (!staging.empty()) {
+            if (const auto cleared = _moveItemAtURLToDeathRow(staging, StartPass::yes); !cleared)
+                return std::unexpected(OSTCreateError(OSTErrorCode::stagingRemovalFailed, cleared.error(),
+                                                      "Failed to remove staging dir: %@", staging));
         }
-        lock.unlock();
-        underWay.reset();
-        if (record && placeIsPending(**record)) {
-            if (lookup.useLocking)
-                OSTCommitSharing::sharedInstance().letOthersCommit();
+        if (record && placeIsPending(**record))
             OST_TRY(makePlaceDurable(**record));
-        }
         return record;
     });
     if (!result)
@@ -104,11 +94,29 @@ OSTResult<void> OSTClientConnection::_checkLookup(const OSTContainerLookup& look
 }
 
 OSTResult<OSTMetadataRecord> OSTClientConnection::_lookUpOrCreate(const OSTContainerLookup& lookup,
-                                                                  std::optional<std::string>& staging) const {
+                                                                  std::string& staging) const {
+    {
+        const OSTAllIdentifiersLock lock(OSTLockKind::writing, lookup.useLocking);
+        const auto found = OST_TRY(_lookUp(lookup));
+        if (found.record)
+            return found.record;
+        // Nobody can come between: the lock is the caller's, or kept because the cache still has the transient
+        // container that has just been thrown away.
+        if (found.threwTransientAway || !lookup.useLocking)
+            return _putInPlace(OST_TRY(_buildInStaging(lookup, staging)), lookup, staging);
+    }
+    // Building waits for the disk. Without the lock, creations do so side by side and share the disk's commits.
+    auto built = OST_TRY(_buildInStaging(lookup, staging));
+    const OSTAllIdentifiersLock lock(OSTLockKind::writing);
+    const auto made = OST_TRY(_lookUp(lookup)); // by another creation meanwhile
+    return made.record ? made.record : _putInPlace(std::move(built), lookup, staging);
+}
+
+OSTResult<OSTClientConnection::LookUpResult> OSTClientConnection::_lookUp(const OSTContainerLookup& lookup) const {
     const auto found = OSTContainerCache::sharedInstance().containerForUser(lookup.userId, lookup.containerClass,
                                                                             *lookup.identifier, lookup.transient);
     if (found && !lookup.transient)
-        return *found;
+        return LookUpResult{.record = *found};
     if (found) {
         // A transient container is never reused.
         if (const auto removed = _moveItemAtURLToDeathRow((*found)->url, StartPass::yes); !removed)
@@ -120,40 +128,12 @@ OSTResult<OSTMetadataRecord> OSTClientConnection::_lookUpOrCreate(const OSTConta
     if (!lookup.createIfNecessary)
         return std::unexpected(OSTCreateError(OSTErrorCode::notFound, OSTLogging::silent, nullptr,
                                               "Container with identifier: \"%@\" Not Found", *lookup.identifier));
-    return _createContainer(lookup, staging);
+    return LookUpResult{.threwTransientAway = found.has_value()};
 }
 
-OSTResult<OSTMetadataRecord> OSTClientConnection::_createContainer(const OSTContainerLookup& lookup,
-                                                                   std::optional<std::string>& staging) const {
-    auto& layout = OSTGlobalConfiguration::sharedInstance();
-    const std::string directoryUUID = platform::UUID::generate().string();
-    const std::string stagingURL = pathByAppending(layout.stagingDirectory(), directoryUUID);
-    staging = stagingURL;
-    OSTMetadata metadata = OST_TRY(_buildInStaging(lookup, stagingURL));
-
-    const auto liveParent = layout.containerDirectoryURLForUser(lookup.userId, lookup.containerClass, lookup.transient);
-    const auto liveName = OSTStoreDelegate::shared()
-                              .wellknownContainerForId(*lookup.identifier, lookup.containerClass)
-                              .value_or(directoryUUID);
-    const auto liveURL = pathByAppending(liveParent.value_or(std::string()), liveName);
-    if (const auto moved = OSTFileManager::defaultManager().moveItemAtURL(stagingURL, liveURL); !moved)
-        return std::unexpected(OSTCreateError(OSTErrorCode::moveToLiveFailed, moved.error(),
-                                              "Failed to move staging dir: %@ to live dir: %@", stagingURL, liveURL));
-    staging.reset();
-
-    metadata.url = liveURL;
-    metadata.pendingPlacement = std::make_shared<std::atomic<bool>>(true);
-    const auto added =
-        OSTContainerCache::sharedInstance().addContainerMetadata(metadata, lookup.userId, liveURL, lookup.transient);
-    if (!added)
-        return std::unexpected(OSTCreateError(OSTErrorCode::cacheAddFailed, added.error(),
-                                              "Failed to add to cache for %u : %@, url: %@, transient: %d",
-                                              lookup.userId, metadata, liveURL, lookup.transient));
-    return asMadeNow(**added);
-}
-
-OSTResult<OSTMetadata> OSTClientConnection::_buildInStaging(const OSTContainerLookup& lookup,
-                                                            const std::string& staging) {
+OSTResult<OSTMetadata> OSTClientConnection::_buildInStaging(const OSTContainerLookup& lookup, std::string& staging) {
+    staging = pathByAppending(OSTGlobalConfiguration::sharedInstance().stagingDirectory(),
+                              platform::UUID::generate().string());
     if (const auto made = _createTopLevelContainerDirectory(staging, lookup.containerClass, lookup.userId); !made)
         return std::unexpected(OSTCreateError(OSTErrorCode::stagingCreationFailed, made.error(),
                                               "Failed to create staging dir at %@ : %@", staging, made.error()));
@@ -168,8 +148,31 @@ OSTResult<OSTMetadata> OSTClientConnection::_buildInStaging(const OSTContainerLo
     OST_TRY(_createSubDirectories(staging, lookup.userId, lookup.containerClass));
     // Last, so that one commit of the file system's journal carries the sub-directories as well.
     OST_TRY(metadata.makeMetadataDurable(std::move(pendingFile)));
-    OSTCommitSharing::sharedInstance().didCommit();
     return metadata;
+}
+
+OSTResult<OSTMetadataRecord> OSTClientConnection::_putInPlace(OSTMetadata metadata, const OSTContainerLookup& lookup,
+                                                              std::string& staging) {
+    const auto liveParent = OSTGlobalConfiguration::sharedInstance().containerDirectoryURLForUser(
+        lookup.userId, lookup.containerClass, lookup.transient);
+    const auto liveName = OSTStoreDelegate::shared()
+                              .wellknownContainerForId(*lookup.identifier, lookup.containerClass)
+                              .value_or(std::string(lastPathComponent(staging)));
+    const auto liveURL = pathByAppending(liveParent.value_or(std::string()), liveName);
+    if (const auto moved = OSTFileManager::defaultManager().moveItemAtURL(staging, liveURL); !moved)
+        return std::unexpected(OSTCreateError(OSTErrorCode::moveToLiveFailed, moved.error(),
+                                              "Failed to move staging dir: %@ to live dir: %@", staging, liveURL));
+    staging.clear();
+
+    metadata.url = liveURL;
+    metadata.pendingPlacement = std::make_shared<std::atomic<bool>>(true);
+    const auto added =
+        OSTContainerCache::sharedInstance().addContainerMetadata(metadata, lookup.userId, liveURL, lookup.transient);
+    if (!added)
+        return std::unexpected(OSTCreateError(OSTErrorCode::cacheAddFailed, added.error(),
+                                              "Failed to add to cache for %u : %@, url: %@, transient: %d",
+                                              lookup.userId, metadata, liveURL, lookup.transient));
+    return asMadeNow(**added);
 }
 
 OSTResult<void> OSTClientConnection::_createTopLevelContainerDirectory(const std::string& url,

@@ -157,12 +157,17 @@ private:
 
     // +Creation
     [[nodiscard]] OSTResult<void> _checkLookup(const OSTContainerLookup& lookup) const;
+    /// `staging` is what is to be thrown away when this has returned, if anything.
     [[nodiscard]] OSTResult<OSTMetadataRecord> _lookUpOrCreate(const OSTContainerLookup& lookup,
-                                                               std::optional<std::string>& staging) const;
-    [[nodiscard]] OSTResult<OSTMetadataRecord> _createContainer(const OSTContainerLookup& lookup,
-                                                                std::optional<std::string>& staging) const;
-    [[nodiscard]] static OSTResult<OSTMetadata> _buildInStaging(const OSTContainerLookup& lookup,
-                                                                const std::string& staging);
+                                                               std::string& staging) const;
+    struct LookUpResult {
+        OSTMetadataRecord record = nullptr; ///< null: the container is to be made
+        bool threwTransientAway = false;
+    };
+    [[nodiscard]] OSTResult<LookUpResult> _lookUp(const OSTContainerLookup& lookup) const;
+    [[nodiscard]] static OSTResult<OSTMetadata> _buildInStaging(const OSTContainerLookup& lookup, std::string& staging);
+    [[nodiscard]] static OSTResult<OSTMetadataRecord>
+    _putInPlace(OSTMetadata metadata, const OSTContainerLookup& lookup, std::string& staging);
     [[nodiscard]] static OSTResult<void>
     _createTopLevelContainerDirectory(const std::string& url, OSTContainerClass containerClass, std::uint32_t owner);
     [[nodiscard]] static OSTResult<void> _createSubDirectories(const std::string& url, std::uint32_t userId,

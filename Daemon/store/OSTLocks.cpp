@@ -259,7 +259,7 @@ void unlock_all_identifiers() {
     platform::logDebug("Unlocked all identifiers");
 }
 
-bool OSTHoldsAllIdentifiersLock() { return heldOfAllIdentifiers.has_value(); }
+bool OSTHoldsAllIdentifiersLock(OSTLockKind kind) { return heldOfAllIdentifiers == kind; }
 
 std::size_t OSTLockRecordCount() {
     const std::lock_guard lock(gOSTLocks.mutex);

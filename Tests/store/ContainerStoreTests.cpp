@@ -17,8 +17,10 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <barrier>
 #include <filesystem>
 #include <future>
+#include <set>
 
 namespace ost {
 namespace {
@@ -32,6 +34,9 @@ constexpr const char* stagingDirectory = "/private/var/root/Library/Caches/com.t
 class ContainerStore : public test::DeviceTest {
 protected:
     ContainerStore() { ::umask(0); }
+
+    /// Lets several threads create the same containers at the same time, one after the other. Their answers, by thread.
+    static std::vector<std::vector<OSTMetadataRecord>> createInParallel(std::size_t containers, bool transient);
 
     static auto lookUp(std::string_view identifier, bool create, bool transient = false) {
         return store().createOrLookupContainerForUser({.userId = 501,
@@ -294,21 +299,64 @@ TEST_F(ContainerStore, CacheTellsLiveAndTransientContainersApart) {
               *cache.allContainerIdentifiersForUser(501, dataApplication, false));
 }
 
-TEST_F(ContainerStore, ParallelCreationMakesEachContainerOnce) {
-    constexpr int threads = 8;
-    constexpr int identifiers = 40;
-    std::vector<std::future<std::vector<std::string>>> results;
-    for (int t = 0; t < threads; ++t)
-        results.push_back(std::async(std::launch::async, [] {
-            std::vector<std::string> urls;
-            for (int i = 0; i < identifiers; ++i)
-                urls.push_back((*lookUp("org.example." + std::to_string(i), true))->url);
-            return urls;
+/// Long enough that all who want the container are building it before one of them has finished.
+std::string longIdentifier(std::size_t number) {
+    return std::to_string(number).append(OSTSmallDictionaryFileSize / 2, 'x');
+}
+
+std::vector<std::vector<OSTMetadataRecord>> ContainerStore::createInParallel(std::size_t containers, bool transient) {
+    constexpr std::ptrdiff_t threads = 8;
+    std::barrier together(threads);
+    std::vector<std::future<std::vector<OSTMetadataRecord>>> results;
+    for (std::ptrdiff_t t = 0; t < threads; ++t)
+        results.push_back(std::async(std::launch::async, [&, containers, transient] {
+            std::vector<OSTMetadataRecord> records;
+            for (std::size_t i = 0; i < containers; ++i) {
+                together.arrive_and_wait();
+                records.push_back(*lookUp(longIdentifier(i), true, transient));
+            }
+            return records;
         }));
-    const auto first = results.front().get();
-    for (std::size_t t = 1; t < results.size(); ++t)
-        EXPECT_EQ(first, results[t].get());
-    EXPECT_EQ(identifiers, std::distance(fs::directory_iterator(classDirectory), {}));
+    std::vector<std::vector<OSTMetadataRecord>> answers;
+    for (auto& result : results)
+        answers.push_back(result.get());
+    return answers;
+}
+
+TEST_F(ContainerStore, ParallelCreationMakesEachContainerOnce) {
+    constexpr std::size_t containers = 10;
+    const auto answers = createInParallel(containers, false);
+    for (std::size_t i = 0; i < containers; ++i) {
+        std::set<std::string> all;
+        std::size_t makers = 0;
+        for (const auto& ofThread : answers) {
+            makers += ofThread[i]->existed ? 0 : 1;
+            all.insert(ofThread[i]->url + ofThread[i]->uuid.string());
+        }
+        EXPECT_EQ(1U, makers);
+        EXPECT_EQ(1U, all.size());
+    }
+    EXPECT_EQ(containers, std::distance(fs::directory_iterator(classDirectory), {}));
+    EXPECT_TRUE(isEmpty(stagingDirectory));
+    EXPECT_EQ(1, passCode());
+}
+
+TEST_F(ContainerStore, ParallelCreationOfATransientContainerLeavesTheLastOne) {
+    constexpr std::size_t containers = 10;
+    std::set<std::string> urls;
+    std::size_t answered = 0;
+    for (const auto& ofThread : createInParallel(containers, true))
+        for (const auto& record : ofThread) {
+            EXPECT_FALSE(record->existed);
+            urls.insert(record->url);
+            ++answered;
+        }
+    EXPECT_EQ(answered, urls.size());
+    const auto left = store().containersForUser(501, dataApplication, true);
+    ASSERT_TRUE(left);
+    EXPECT_EQ(containers, left->size());
+    const auto directory = fs::path(left->front()->url).parent_path();
+    EXPECT_EQ(containers, std::distance(fs::directory_iterator(directory), {}));
     EXPECT_TRUE(isEmpty(stagingDirectory));
 }
 
