@@ -12,9 +12,11 @@
 #include <sys/xattr.h>
 #include <unistd.h>
 
+#include <chrono>
 #include <filesystem>
 #include <functional>
 #include <string>
+#include <thread>
 #include <utility>
 
 namespace ost::platform {
@@ -134,6 +136,23 @@ TEST_F(PeerIdentityTest, ReadsTheSignatureOfThePeersProgramAfresh) {
     sign(program, signature("com.example.second"));
     identity = peer->codeSigningIdentity();
     EXPECT_EQ((*identity)->identifier, "com.example.second");
+}
+
+TEST_F(PeerIdentityTest, SeesThatAProgramHasChangedAfterAWhile) {
+    const auto program = copy("/bin/cat", "program");
+    sign(program, signature("com.example.first"));
+    const Peer child(program);
+    auto peer = PeerIdentity::ofSocket(child.socket());
+    ASSERT_TRUE(peer);
+    const auto identifier = [&] { return (*peer->codeSigningIdentity())->identifier; };
+    std::this_thread::sleep_for(std::chrono::seconds(4)); // only time makes a file old
+    EXPECT_EQ(identifier(), "com.example.first");
+    for (const char* next : {"com.example.second", "com.example.third"}) {
+        sign(program, signature(next));
+        EXPECT_EQ(identifier(), next);
+    }
+    fs::permissions(program, fs::perms::group_write, fs::perm_options::add);
+    EXPECT_EQ(identifier(), std::nullopt);
 }
 
 TEST_F(PeerIdentityTest, FollowsThePeerToTheProgramItExecutes) {

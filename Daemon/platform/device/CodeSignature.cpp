@@ -48,11 +48,14 @@ std::expected<RawCodeSignature, int> readCodeSignature(int fd, const struct stat
     return signature;
 }
 
-bool isOnUserFileSystem(int fd) {
-    // Such a mount never lets set-user-id bits count; one that an administrator makes may.
+SignatureFileSystem signatureFileSystem(int fd) {
     struct statfs fileSystem{};
-    return ::fstatfs(fd, &fileSystem) != 0 ||
-           (fileSystem.f_type == FUSE_SUPER_MAGIC && (fileSystem.f_flags & ST_NOSUID) != 0);
+    if (::fstatfs(fd, &fileSystem) != 0)
+        return {};
+    const auto type = fileSystem.f_type;
+    // What a user mounts never lets set-user-id bits count; what an administrator mounts may.
+    return {.ofUser = type == FUSE_SUPER_MAGIC && (fileSystem.f_flags & ST_NOSUID) != 0,
+            .showsChanges = type == EXT4_SUPER_MAGIC || type == XFS_SUPER_MAGIC || type == BTRFS_SUPER_MAGIC};
 }
 
 CodeSigningIdentity parseCodeSignature(std::string_view raw) {

@@ -42,9 +42,17 @@ struct RawCodeSignature {
 [[nodiscard]] std::expected<RawCodeSignature, int> readCodeSignature(int fd, const struct stat& status,
                                                                      std::span<char> buffer);
 
-/// Whether the open file `fd` lies on a file system whose content, owners and attributes included, is what an
-/// unprivileged user says: one mounted by a user with the help of FUSE.
-[[nodiscard]] bool isOnUserFileSystem(int fd);
+/// What the file system of a program means for the program's signature.
+struct SignatureFileSystem {
+    /// Its content, owners and attributes included, is what an unprivileged user says: one mounted by a user with the
+    /// help of FUSE. Also said of one that cannot be asked.
+    bool ofUser = true;
+    /// Every change of an extended attribute shows in the file's time of last change.
+    bool showsChanges = false;
+};
+
+/// About the file system of the open file `fd`.
+[[nodiscard]] SignatureFileSystem signatureFileSystem(int fd);
 
 /// The identity in a raw signature; an empty one when the bytes are no property-list dictionary.
 [[nodiscard]] CodeSigningIdentity parseCodeSignature(std::string_view raw);

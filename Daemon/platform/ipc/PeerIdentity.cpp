@@ -9,6 +9,7 @@
 
 #include <array>
 #include <cerrno>
+#include <ctime>
 #include <utility>
 
 #ifndef SO_PEERPIDFD
@@ -28,6 +29,14 @@ int openPeer(int socket, pid_t processId) {
     if (::getsockopt(socket, SOL_SOCKET, SO_PEERPIDFD, &peer, &size) == 0)
         return peer;
     return errno == ENOPROTOOPT ? static_cast<int>(::syscall(SYS_pidfd_open, processId, 0)) : -1;
+}
+
+/// A file whose last change is older than this gets another time with its next one. Times are as fine as the clock's
+/// tick on most file systems, and as coarse as a second on some.
+constexpr time_t secondsUntilAChangeShows = 2;
+
+bool haveSameChangeTime(const struct stat& one, const struct stat& other) {
+    return one.st_ctim.tv_sec == other.st_ctim.tv_sec && one.st_ctim.tv_nsec == other.st_ctim.tv_nsec;
 }
 
 /// The directory of a live process in /proc. Once it is open it names one process for good: after that has ended,
@@ -60,15 +69,27 @@ std::expected<PeerIdentity, int> PeerIdentity::ofSocket(int socket) {
 }
 
 std::expected<const CodeSigningIdentity*, int> PeerIdentity::codeSigningIdentity() {
+    timespec now{}; // of before the status is read; by the clock that dates changes
+    ::clock_gettime(CLOCK_REALTIME_COARSE, &now);
     const auto status = OST_TRY(_holdProgram());
+    if (_changeWouldShow && haveSameChangeTime(status, _programStatus))
+        return &_identity;
+    _changeWouldShow = false;
+    OST_TRY(_readSignature(status));
+    _programStatus = status;
+    _changeWouldShow = _fileSystem.showsChanges && status.st_ctim.tv_sec + secondsUntilAChangeShows < now.tv_sec;
+    return &_identity;
+}
+
+std::expected<void, int> PeerIdentity::_readSignature(const struct stat& status) {
     std::array<char, maximumCodeSignature> buffer;
     const auto signature = OST_TRY(readCodeSignature(_program.get(), status, buffer));
     if (signature.bytes != _raw || signature.device != _device) {
-        _identity = isOnUserFileSystem(_program.get()) ? CodeSigningIdentity{} : parseCodeSignature(signature.bytes);
+        _identity = _fileSystem.ofUser ? CodeSigningIdentity{} : parseCodeSignature(signature.bytes);
         _raw = signature.bytes;
         _device = signature.device;
     }
-    return &_identity;
+    return {};
 }
 
 /// Holds the program that the process runs now, and gives its status. Opening it at every request would cost more than
@@ -82,9 +103,11 @@ std::expected<struct stat, int> PeerIdentity::_holdProgram() {
         return std::unexpected(errno);
     if (_program && status.st_dev == _programStatus.st_dev && status.st_ino == _programStatus.st_ino)
         return status;
+    _changeWouldShow = false;
     _program.reset(::openat(_process.get(), "exe", O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY));
     if (!_program || ::fstat(_program.get(), &_programStatus) != 0)
         return std::unexpected(errno);
+    _fileSystem = signatureFileSystem(_program.get());
     return _programStatus;
 }
 

@@ -29,9 +29,10 @@ public:
     [[nodiscard]] pid_t processId() const { return _processId; }
     [[nodiscard]] uid_t effectiveUserId() const { return _effectiveUserId; }
 
-    /// What the program that the peer runs now is signed as; read afresh at every call, because a process may execute
-    /// another program. As long as the signature stays the same, so do the objects in the identity. Valid until the
-    /// next call. Fails with an errno when the program cannot be determined: ESRCH when the process has ended.
+    /// What the program that the peer runs now is signed as. Asks at every call which program that is and whether it
+    /// has changed, because a process may execute another one, and one may be signed anew. As long as the signature
+    /// stays the same, so do the objects in the identity. Valid until the next call. Fails with an errno when the
+    /// program cannot be determined: ESRCH when the process has ended.
     [[nodiscard]] std::expected<const CodeSigningIdentity*, int> codeSigningIdentity();
 
     /// Gives the descriptors back; no program can be determined any more.
@@ -45,12 +46,15 @@ private:
         : _processId(processId), _effectiveUserId(effectiveUserId), _process(std::move(process)) {}
 
     [[nodiscard]] std::expected<struct stat, int> _holdProgram();
+    [[nodiscard]] std::expected<void, int> _readSignature(const struct stat& status);
 
     pid_t _processId;
     uid_t _effectiveUserId;
     FileDescriptor _process; ///< the process's directory in /proc; empty when it had ended
     FileDescriptor _program; ///< the program that was last asked for, open
+    SignatureFileSystem _fileSystem;
     struct stat _programStatus{};
+    bool _changeWouldShow = false; ///< whether a signature other than the one last read comes with another status
     // The signature last read, where from, and what it says.
     std::string _raw;
     dev_t _device = 0;
