@@ -11,7 +11,10 @@ namespace ost {
 OSTClientConnection& OSTClientConnection::sharedClientConnection() {
     // Never destroyed: workers may still use it while the process ends.
     static OSTClientConnection& connection = *new OSTClientConnection(
-        {.clientBundleIdentifier = "com.tamarok.ostrandd.internal", .clientUserId = 0, .allowOtherIdLookup = true});
+        {.clientBundleIdentifier = "com.tamarok.ostrandd.internal",
+         .clientUserId = 0,
+         .allowOtherIdLookup = true,
+         .allowGroupIdLookup = true});
     return connection;
 }
 

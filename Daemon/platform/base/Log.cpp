@@ -103,6 +103,8 @@ void Log::_rotate() {
 
 void Log::write(LogLevel level, std::string_view function, std::string_view message) {
     std::string line = linePrefix(level);
+    if (message.ends_with('\n')) // Some texts bring the end of their line with them.
+        message.remove_suffix(1);
     line.append(function).append(": ");
     while (!message.empty()) {
         const auto tab = std::min(message.find('\t'), message.size());
