@@ -48,7 +48,7 @@ OSTResult<void> clearInfoValue(const OSTMetadata& container, const char* key) {
     info.remove(key);
     cleared.info = info.empty() ? nullptr : std::make_shared<const OSTDictionary>(std::move(info));
     OST_TRY(cleared.writeMetadataToDisk());
-    OST_TRY(OSTContainerCache::sharedInstance().addContainerMetadata(cleared, cleared.uid, cleared.url, false));
+    OST_TRY(OSTContainerCache::sharedInstance().addContainerMetadata(cleared));
     return {};
 }
 

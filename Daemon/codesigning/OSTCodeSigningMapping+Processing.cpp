@@ -109,18 +109,13 @@ void OSTCodeSigningMapping::_releaseSystemContainer(std::string_view identifier,
     if (!_onQueue_identifierHasSystemContainer(identifier) || (wanted && wanted->truthValue()))
         return;
     const auto container = OSTContainerCache::sharedInstance().containerForUser(
-        OSTSystemUserId, OSTContainerClass::dataSystem, identifier, false);
+        {OSTSystemUserId, OSTContainerClass::dataSystem, identifier});
     if (!container) {
         logOfProcessing("Failed to retrieve system container %@: %@", identifier, container.error());
         return;
     }
     logOfProcessing("Deleting system container for ID: %@ because it is no longer in the entitlements", identifier);
-    const auto staged = OSTClientConnection::sharedClientConnection().stageForDeleteContainersWithUsers(
-        {.userIds = {OSTSystemUserId},
-         .uuids = {(*container)->uuid},
-         .identifiers = {std::string(identifier)},
-         .classes = {(*container)->containerClass},
-         .useLocking = false});
+    const auto staged = OSTClientConnection::sharedClientConnection().stageForDeleteContainer(**container, false);
     if (!staged)
         logOfProcessing("Failed to destroy system container with identifier %@: %llu", identifier, staged.error());
 }

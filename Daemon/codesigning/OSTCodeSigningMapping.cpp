@@ -154,7 +154,7 @@ bool OSTCodeSigningMapping::_hasBundleContainer(std::string_view identifier) con
     using enum OSTContainerClass;
     return std::ranges::any_of(std::array{bundleApplication, bundleLoomworkPlugin, bundleVPNPlugin}, [&](auto bundle) {
         return OSTContainerCache::sharedInstance()
-            .containerForUser(OSTInstallerUserId, bundle, identifier, false)
+            .containerForUser({OSTInstallerUserId, bundle, identifier})
             .has_value();
     });
 }
@@ -216,7 +216,7 @@ OSTCodeSigningMapping::_onQueue_codeSigningInfoForIdentifier(std::string_view id
 
 OSTCodeSigningMapping::EntryRecord OSTCodeSigningMapping::_migrateFromBundleContainer(std::string_view identifier) {
     const auto bundle = OSTContainerCache::sharedInstance().containerForUser(
-        OSTInstallerUserId, OSTContainerClass::bundleApplication, identifier, false);
+        {OSTInstallerUserId, OSTContainerClass::bundleApplication, identifier});
     const auto* const cached = bundle && (*bundle)->info ? (*bundle)->info->find(OSTCachedCodeSigningInfoKey) : nullptr;
     if (!cached || !cached->asDictionary())
         return nullptr;

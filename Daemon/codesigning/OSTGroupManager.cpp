@@ -58,13 +58,10 @@ OSTGroupManager::groupContainerPathsForUser(std::uint32_t userId, OSTClientConne
                                    : mapping.appGroupIdentifiersForIdentifier(*identifier);
         client.setAllowGroupIdLookup();
         Paths found;
+        const auto containerClass = placeOf(system ? OSTGroupType::system : OSTGroupType::application).containerClass;
         for (const auto& group : groups.value_or(std::vector<std::string>())) {
             const auto record = client.createOrLookupContainerForUser(
-                {.userId = userId,
-                 .identifier = group,
-                 .containerClass = placeOf(system ? OSTGroupType::system : OSTGroupType::application).containerClass,
-                 .createIfNecessary = true,
-                 .useLocking = false});
+                {.name = {userId, containerClass, group}, .createIfNecessary = true, .useLocking = false});
             if (record)
                 found.emplace(group, (*record)->url);
             else
@@ -147,11 +144,11 @@ void OSTGroupManager::_removeGroupContainersIfNeededforUser(std::uint32_t userId
         auto& count = referenceCounts[group];
         if (count != 1) {
             platform::logDebug("Reference count for user: %u, ID: %@ is %ld", userId, group, count);
-        } else if (const auto container = OSTContainerCache::sharedInstance().containerForUser(
-                       userId, groupContainerClass, group, false)) {
+        } else if (const auto container =
+                       OSTContainerCache::sharedInstance().containerForUser({userId, groupContainerClass, group})) {
             platform::logNotice("Last reference to group container %@ for %u is going away; removing it.", group,
                                 userId);
-            _stageForDeletion(userId, **container, "_removeGroupContainersIfNeededforUser");
+            _stageForDeletion(**container, "_removeGroupContainersIfNeededforUser");
         } else {
             platform::logDebug("Failed to retrieve group container %@ for %u : %@.  May not exist for this user", group,
                                userId, container.error());
@@ -186,22 +183,16 @@ void OSTGroupManager::_cleanupUnreferencedGroupContainersForUser(std::uint32_t u
         if (referenceCounts.at(container->identifier) > 0)
             continue;
         platform::logError("Removing group container with identifier %@ for %u", container->identifier, userId);
-        _stageForDeletion(userId, *container, "_cleanupUnreferencedGroupContainersForUser");
+        _stageForDeletion(*container, "_cleanupUnreferencedGroupContainersForUser");
     }
 }
 
-void OSTGroupManager::_stageForDeletion(std::uint32_t userId, const OSTMetadata& container,
-                                        std::string_view operation) {
-    const auto staged = OSTClientConnection::sharedClientConnection().stageForDeleteContainersWithUsers(
-        {.userIds = {userId},
-         .uuids = {container.uuid},
-         .identifiers = {container.identifier},
-         .classes = {container.containerClass},
-         .useLocking = false});
+void OSTGroupManager::_stageForDeletion(const OSTMetadata& container, std::string_view operation) {
+    const auto staged = OSTClientConnection::sharedClientConnection().stageForDeleteContainer(container, false);
     if (!staged)
         platform::logAs(platform::LogLevel::error, operation,
                         "Failed to destroy group container with identifier %@ for %u: %llu", container.identifier,
-                        userId, staged.error());
+                        container.uid, staged.error());
 }
 
 } // namespace ost

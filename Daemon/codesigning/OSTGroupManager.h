@@ -77,7 +77,7 @@ private:
                                                            const std::vector<OSTMetadataRecord>& containers,
                                                            const ReferenceCounts& referenceCounts);
     /// `operation` is whose name a failure is logged under.
-    static void _stageForDeletion(std::uint32_t userId, const OSTMetadata& container, std::string_view operation);
+    static void _stageForDeletion(const OSTMetadata& container, std::string_view operation);
 };
 
 } // namespace ost

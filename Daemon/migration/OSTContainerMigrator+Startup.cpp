@@ -171,9 +171,7 @@ OSTResult<void> OSTContainerMigrator::_migrateWellknownContainer(const OSTMetada
         return {};
     logError("Migrating well-known container %@ from %@ to %@", container.identifier, container.url, expected);
     auto& cache = OSTContainerCache::sharedInstance();
-    if (auto removed =
-            cache.removeContainerForUser(OSTSystemUserId, container.containerClass, container.identifier, false);
-        !removed) {
+    if (auto removed = cache.removeContainerForUser(container.name()); !removed) {
         logError("%s: Failed to remove cache for whitelisted container %@: (error= %@: %lld)", migrationName,
                  container.identifier, removed.error().domainName(), removed.error().code());
         return removed;
@@ -184,8 +182,10 @@ OSTResult<void> OSTContainerMigrator::_migrateWellknownContainer(const OSTMetada
                  migrationName, container.identifier, container.url, expected, moved.error().domainName(),
                  moved.error().code());
     // One whose place is taken stays where it is, and is found there.
-    const auto& url = moved ? expected : container.url;
-    if (const auto added = cache.addContainerMetadata(container, OSTSystemUserId, url, false); !added) {
+    OSTMetadata metadata = container;
+    if (moved)
+        metadata.url = expected;
+    if (const auto added = cache.addContainerMetadata(metadata); !added) {
         logError("%s: Failed to update cache for whitelisted container %@: (error= %@: %lld)", migrationName,
                  container.identifier, added.error().domainName(), added.error().code());
         return std::unexpected(added.error());

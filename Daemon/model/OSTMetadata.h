@@ -1,12 +1,11 @@
 #pragma once
 
 #include "files/OSTFileManager.h"
-#include "model/OSTContainerClass.h"
+#include "model/OSTContainerName.h"
 #include "platform/base/OSTError.h"
 #include "platform/base/OSTValue.h"
 #include "platform/base/UUID.h"
 
-#include <atomic>
 #include <cstdint>
 #include <memory>
 #include <string>
@@ -33,9 +32,9 @@ struct OSTMetadata {
     std::string url = {};                                ///< path of the container directory
     bool transient = false;                              ///< lies in a transient directory; not in the file
     bool existed = true; ///< false when the look-up that gave this record made the container; not in the file
-    /// True while the rename that put the container in place may still be lost in a power cut; null for one read from
-    /// disk.
-    std::shared_ptr<std::atomic<bool>> pendingPlacement = nullptr;
+
+    /// The name under which the container is found, for as long as this record lives.
+    [[nodiscard]] OSTContainerName name() const { return {uid, containerClass, identifier, transient}; }
 
     /// Reads the metadata file of the container at `url` and validates it for the user.
     /// Fails with `metadataUnreadable` or `metadataInvalid`, logged.

@@ -86,10 +86,8 @@ std::optional<std::string> grantedGroupPath(std::optional<std::string_view> iden
 
 std::optional<std::string> wellknownGroupPath(const std::string& group, OSTClientConnection& client) {
     client.setAllowGroupIdLookup();
-    const auto record = client.createOrLookupContainerForUser({.userId = OSTSystemUserId,
-                                                               .identifier = group,
-                                                               .containerClass = OSTContainerClass::sharedSystemGroup,
-                                                               .createIfNecessary = true});
+    const auto record = client.createOrLookupContainerForUser(
+        {.name = {OSTSystemUserId, OSTContainerClass::sharedSystemGroup, group}, .createIfNecessary = true});
     return record ? std::optional((*record)->url) : std::nullopt;
 }
 
@@ -120,10 +118,8 @@ OSTErrorCode OSTSystemContainerPathCommand(const platform::IPCRequest& request, 
     const bool isOwn = identifier == client.identity().clientBundleIdentifier;
     if (identifier && !isOwn && OSTWhitelist::sharedWhitelist().systemContainerIdIsWellknown(*identifier))
         client.setAllowOtherIdLookup();
-    const auto record = client.createOrLookupContainerForUser({.userId = OSTSystemUserId,
-                                                               .identifier = identifier,
-                                                               .containerClass = OSTContainerClass::dataSystem,
-                                                               .createIfNecessary = true});
+    const auto record = client.createOrLookupContainerForUser(
+        {.name = {OSTSystemUserId, OSTContainerClass::dataSystem, identifier}, .createIfNecessary = true});
     if (!record)
         return record.error();
     reply.set("ReplyPath", (*record)->url);

@@ -10,10 +10,10 @@ OSTErrorCode OSTCreateOrLookupCommand(const platform::IPCRequest& request, platf
     if (!place)
         return place.error();
     const auto record =
-        client.createOrLookupContainerForUser({.userId = place->userId,
-                                               .identifier = OSTRequestedIdentifier(request, client),
-                                               .containerClass = place->containerClass,
-                                               .transient = request.booleanValue("Transient"),
+        client.createOrLookupContainerForUser({.name = {.userId = place->userId,
+                                                        .containerClass = place->containerClass,
+                                                        .identifier = OSTRequestedIdentifier(request, client),
+                                                        .transient = request.booleanValue("Transient")},
                                                .createIfNecessary = request.booleanValue("CreateIfNecessary")});
     if (!record)
         return record.error();

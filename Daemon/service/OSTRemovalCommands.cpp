@@ -15,10 +15,6 @@ OSTErrorCode codeOf(const std::expected<void, OSTErrorCode>& result) {
     return result ? OSTErrorCode::success : result.error();
 }
 
-std::optional<std::string> stringOf(const std::optional<std::string_view>& text) {
-    return text ? std::optional<std::string>(*text) : std::nullopt;
-}
-
 /// Reads every element of an array; a value that is no array has none.
 template<typename T, typename Read>
 std::vector<T> elementsOf(const platform::IPCRequest& request, std::string_view key, Read read) {
@@ -46,17 +42,17 @@ OSTErrorCode OSTReplaceCommand(const platform::IPCRequest& request, platform::IP
         const auto place = OSTRequestedPlace(request, client, "OldContainerClass", "OldContainerUserID");
         if (!place)
             return place.error();
-        oldContainer.containerClass = place->containerClass;
-        oldContainer.userId = place->userId;
-        oldContainer.identifier = stringOf(request.stringValue("OldIdentifier"));
+        oldContainer.name = {.userId = place->userId,
+                             .containerClass = place->containerClass,
+                             .identifier = request.stringValue("OldIdentifier")};
     }
     const auto place = OSTRequestedPlace(request, client, "NewContainerClass", "NewContainerUserID");
     if (!place)
         return place.error();
-    replacement.newContainer = {.uuid = request.uuidValue("NewContainerUUID"),
-                                .userId = place->userId,
-                                .identifier = stringOf(request.stringValue("NewIdentifier")),
-                                .containerClass = place->containerClass};
+    replacement.newContainer = {.name = {.userId = place->userId,
+                                         .containerClass = place->containerClass,
+                                         .identifier = request.stringValue("NewIdentifier")},
+                                .uuid = request.uuidValue("NewContainerUUID")};
     return codeOf(client.replaceContainer(replacement));
 }
 
@@ -85,8 +81,8 @@ OSTErrorCode OSTStageForDeleteCommand(const platform::IPCRequest& request, platf
     if (!isArray(request, "IdentifiersArray"))
         platform::logAs(platform::LogLevel::error, "stageContainerForDelete",
                         "Got non-Array input for the identifiers array");
-    deletion.identifiers = elementsOf<std::optional<std::string>>(
-        request, "IdentifiersArray", [](const auto& element) { return stringOf(element.asText()); });
+    deletion.identifiers = elementsOf<std::optional<std::string_view>>(
+        request, "IdentifiersArray", [](const auto& element) { return element.asText(); });
     return codeOf(client.stageForDeleteContainersWithUsers(deletion));
 }
 
@@ -104,8 +100,10 @@ OSTErrorCode OSTDeleteCommand(const platform::IPCRequest& request, platform::IPC
     const auto place = OSTRequestedPlace(request, client);
     if (!place)
         return place.error();
-    return codeOf(client.deleteContainerForUser(place->userId, request.stringValue("Identifier"), place->containerClass,
-                                                request.booleanValue("Transient")));
+    return codeOf(client.deleteContainerForUser({.userId = place->userId,
+                                                 .containerClass = place->containerClass,
+                                                 .identifier = request.stringValue("Identifier"),
+                                                 .transient = request.booleanValue("Transient")}));
 }
 
 } // namespace ost

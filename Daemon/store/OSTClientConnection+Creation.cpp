@@ -35,8 +35,6 @@ std::span<const std::string_view> subDirectoriesOf(OSTContainerClass containerCl
     return dataSubDirectories;
 }
 
-bool placeIsPending(const OSTMetadata& record) { return record.pendingPlacement && *record.pendingPlacement; }
-
 /// Waits until the rename that put the record's container in place has reached the disk. The look-up that made the
 /// container does so when it has given back the lock; one that finds it too early does it as well, before it answers.
 OSTResult<void> makePlaceDurable(const OSTMetadata& record) {
@@ -44,7 +42,7 @@ OSTResult<void> makePlaceDurable(const OSTMetadata& record) {
     if (!durable)
         return std::unexpected(OSTCreateError(OSTErrorCode::moveToLiveFailed, durable.error(),
                                               "Failed to make sure of live dir: %@", record.url));
-    *record.pendingPlacement = false;
+    OSTContainerCache::sharedInstance().placementReachedDisk(record);
     return {};
 }
 
@@ -62,14 +60,15 @@ OSTClientConnection::createOrLookupContainerForUser(const OSTContainerLookup& lo
     const auto result = OSTGuarded([&]() -> OSTResult<OSTMetadataRecord> {
         OST_TRY(_checkLookup(lookup));
         std::string staging;
-        auto record = OSTGuarded([&] { return _lookUpOrCreate(lookup, staging); });
+        auto entry = OSTGuarded([&] { return _lookUpOrCreate(lookup, staging); });
         if (!staging.empty()) {
             if (const auto cleared = _moveItemAtURLToDeathRow(staging, StartPass::yes); !cleared)
                 return std::unexpected(OSTCreateError(OSTErrorCode::stagingRemovalFailed, cleared.error(),
                                                       "Failed to remove staging dir: %@", staging));
         }
-        if (record && placeIsPending(**record))
-            OST_TRY(makePlaceDurable(**record));
+        const auto [record, placement] = OST_TRY(std::move(entry));
+        if (placement == OSTPlacement::pending)
+            OST_TRY(makePlaceDurable(*record));
         return record;
     });
     if (!result)
@@ -78,85 +77,85 @@ OSTClientConnection::createOrLookupContainerForUser(const OSTContainerLookup& lo
 }
 
 OSTResult<void> OSTClientConnection::_checkLookup(const OSTContainerLookup& lookup) const {
-    if (!lookup.identifier || !isValidContainerClass(lookup.containerClass))
+    const auto& [userId, containerClass, identifier, transient] = lookup.name;
+    if (!identifier || !isValidContainerClass(containerClass))
         return std::unexpected(OSTCreateError(OSTErrorCode::invalidObject,
-                                              "Can't act on an invalid object: userId: %u, ID: %@, class: %ld",
-                                              lookup.userId, lookup.identifier, lookup.containerClass));
-    if (!OSTUserIdFitsClass(lookup.containerClass, lookup.userId))
+                                              "Can't act on an invalid object: userId: %u, ID: %@, class: %ld", userId,
+                                              identifier, containerClass));
+    if (!OSTUserIdFitsClass(containerClass, userId))
         return std::unexpected(OSTCreateError(OSTErrorCode::invalidObject, "Invalid userId %u for class %ld, ID: %@",
-                                              lookup.userId, lookup.containerClass, *lookup.identifier));
-    if (lookup.containerClass == OSTContainerClass::dataSystem && !_identity.allowOtherIdLookup &&
-        !OSTStoreDelegate::shared().identifierHasSystemContainer(*lookup.identifier))
+                                              userId, containerClass, *identifier));
+    if (containerClass == OSTContainerClass::dataSystem && !_identity.allowOtherIdLookup &&
+        !OSTStoreDelegate::shared().identifierHasSystemContainer(*identifier))
         return std::unexpected(OSTCreateError(OSTErrorCode::notEntitled,
-                                              "%@ not entitled for a system container, but %@ is trying",
-                                              *lookup.identifier, _identity.clientBundleIdentifier));
+                                              "%@ not entitled for a system container, but %@ is trying", *identifier,
+                                              _identity.clientBundleIdentifier));
     return {};
 }
 
-OSTResult<OSTMetadataRecord> OSTClientConnection::_lookUpOrCreate(const OSTContainerLookup& lookup,
-                                                                  std::string& staging) const {
+OSTResult<OSTCacheEntry> OSTClientConnection::_lookUpOrCreate(const OSTContainerLookup& lookup,
+                                                              std::string& staging) const {
     {
         const OSTAllIdentifiersLock lock(OSTLockKind::writing, lookup.useLocking);
         const auto found = OST_TRY(_lookUp(lookup));
-        if (found.record)
-            return found.record;
+        if (found.entry.record)
+            return found.entry;
         // Nobody can come between: the lock is the caller's, or kept because the cache still has the transient
         // container that has just been thrown away.
         if (found.threwTransientAway || !lookup.useLocking)
-            return _putInPlace(OST_TRY(_buildInStaging(lookup, staging)), lookup, staging);
+            return _putInPlace(OST_TRY(_buildInStaging(lookup.name, staging)), staging);
     }
     // Building waits for the disk. Without the lock, creations do so side by side and share the disk's commits.
-    auto built = OST_TRY(_buildInStaging(lookup, staging));
+    auto built = OST_TRY(_buildInStaging(lookup.name, staging));
     const OSTAllIdentifiersLock lock(OSTLockKind::writing);
     const auto made = OST_TRY(_lookUp(lookup)); // by another creation meanwhile
-    return made.record ? made.record : _putInPlace(std::move(built), lookup, staging);
+    return made.entry.record ? made.entry : _putInPlace(std::move(built), staging);
 }
 
 OSTResult<OSTClientConnection::LookUpResult> OSTClientConnection::_lookUp(const OSTContainerLookup& lookup) const {
-    const auto found = OSTContainerCache::sharedInstance().containerForUser(lookup.userId, lookup.containerClass,
-                                                                            *lookup.identifier, lookup.transient);
-    if (found && !lookup.transient)
-        return LookUpResult{.record = *found};
+    const auto found = OSTContainerCache::sharedInstance().entryForUser(lookup.name);
+    if (found && !lookup.name.transient)
+        return LookUpResult{.entry = *found};
     if (found) {
         // A transient container is never reused.
-        if (const auto removed = _moveItemAtURLToDeathRow((*found)->url, StartPass::yes); !removed)
+        if (const auto removed = _moveItemAtURLToDeathRow(found->record->url, StartPass::yes); !removed)
             return std::unexpected(OSTCreateError(OSTErrorCode::transientRemovalFailed, removed.error(),
-                                                  "Failed to remove transient container at %@", (*found)->url));
+                                                  "Failed to remove transient container at %@", found->record->url));
     } else if (!found.error().is(OSTErrorCode::notFound)) {
         return std::unexpected(found.error());
     }
     if (!lookup.createIfNecessary)
         return std::unexpected(OSTCreateError(OSTErrorCode::notFound, OSTLogging::silent, nullptr,
-                                              "Container with identifier: \"%@\" Not Found", *lookup.identifier));
+                                              "Container with identifier: \"%@\" Not Found", lookup.name.identifier));
     return LookUpResult{.threwTransientAway = found.has_value()};
 }
 
-OSTResult<OSTMetadata> OSTClientConnection::_buildInStaging(const OSTContainerLookup& lookup, std::string& staging) {
+OSTResult<OSTMetadata> OSTClientConnection::_buildInStaging(const OSTContainerName& name, std::string& staging) {
     staging = pathByAppending(OSTGlobalConfiguration::sharedInstance().stagingDirectory(),
                               platform::UUID::generate().string());
-    if (const auto made = _createTopLevelContainerDirectory(staging, lookup.containerClass, lookup.userId); !made)
+    if (const auto made = _createTopLevelContainerDirectory(staging, name.containerClass, name.userId); !made)
         return std::unexpected(OSTCreateError(OSTErrorCode::stagingCreationFailed, made.error(),
                                               "Failed to create staging dir at %@ : %@", staging, made.error()));
-    OSTMetadata metadata{.uid = lookup.userId,
+    OSTMetadata metadata{.uid = name.userId,
                          .uuid = platform::UUID::generate(),
-                         .containerClass = lookup.containerClass,
-                         .identifier = std::string(*lookup.identifier),
-                         .url = staging};
+                         .containerClass = name.containerClass,
+                         .identifier = std::string(*name.identifier),
+                         .url = staging,
+                         .transient = name.transient};
     auto pendingFile = OST_TRY(metadata.writeMetadataToNewDirectory());
-    if (isSystemClass(lookup.containerClass))
+    if (isSystemClass(name.containerClass))
         OST_TRY(OSTFileManager::defaultManager().setTopLevelSystemContainerACLAtURL(staging));
-    OST_TRY(_createSubDirectories(staging, lookup.userId, lookup.containerClass));
+    OST_TRY(_createSubDirectories(staging, name.userId, name.containerClass));
     // Last, so that one commit of the file system's journal carries the sub-directories as well.
     OST_TRY(metadata.makeMetadataDurable(std::move(pendingFile)));
     return metadata;
 }
 
-OSTResult<OSTMetadataRecord> OSTClientConnection::_putInPlace(OSTMetadata metadata, const OSTContainerLookup& lookup,
-                                                              std::string& staging) {
+OSTResult<OSTCacheEntry> OSTClientConnection::_putInPlace(OSTMetadata metadata, std::string& staging) {
     const auto liveParent = OSTGlobalConfiguration::sharedInstance().containerDirectoryURLForUser(
-        lookup.userId, lookup.containerClass, lookup.transient);
+        metadata.uid, metadata.containerClass, metadata.transient);
     const auto liveName = OSTStoreDelegate::shared()
-                              .wellknownContainerForId(*lookup.identifier, lookup.containerClass)
+                              .wellknownContainerForId(metadata.identifier, metadata.containerClass)
                               .value_or(std::string(lastPathComponent(staging)));
     const auto liveURL = pathByAppending(liveParent.value_or(std::string()), liveName);
     if (const auto moved = OSTFileManager::defaultManager().moveItemAtURL(staging, liveURL); !moved)
@@ -165,14 +164,12 @@ OSTResult<OSTMetadataRecord> OSTClientConnection::_putInPlace(OSTMetadata metada
     staging.clear();
 
     metadata.url = liveURL;
-    metadata.pendingPlacement = std::make_shared<std::atomic<bool>>(true);
-    const auto added =
-        OSTContainerCache::sharedInstance().addContainerMetadata(metadata, lookup.userId, liveURL, lookup.transient);
+    const auto added = OSTContainerCache::sharedInstance().addContainerMetadata(metadata, OSTPlacement::pending);
     if (!added)
         return std::unexpected(OSTCreateError(OSTErrorCode::cacheAddFailed, added.error(),
                                               "Failed to add to cache for %u : %@, url: %@, transient: %d",
-                                              lookup.userId, metadata, liveURL, lookup.transient));
-    return asMadeNow(**added);
+                                              metadata.uid, metadata, liveURL, metadata.transient));
+    return OSTCacheEntry{asMadeNow(**added), OSTPlacement::pending};
 }
 
 OSTResult<void> OSTClientConnection::_createTopLevelContainerDirectory(const std::string& url,
@@ -213,13 +210,15 @@ OSTClientConnection::containersForUser(std::uint32_t userId, OSTContainerClass c
                                                   "Can't act on an invalid container-userId: %u, class: %ld", userId,
                                                   containerClass));
         OSTAllIdentifiersLock lock(OSTLockKind::reading);
-        auto records =
-            OST_TRY(OSTContainerCache::sharedInstance().allContainersForUser(userId, containerClass, transient));
+        const auto entries =
+            OST_TRY(OSTContainerCache::sharedInstance().allEntriesForUser(userId, containerClass, transient));
         lock.unlock();
+        std::vector<OSTMetadataRecord> records;
+        records.reserve(entries.size());
         // What may be forgotten in a power cut is not said to be there; the log has the reason.
-        std::erase_if(records, [](const OSTMetadataRecord& record) {
-            return placeIsPending(*record) && !makePlaceDurable(*record);
-        });
+        for (const auto& [record, placement] : entries)
+            if (placement == OSTPlacement::durable || makePlaceDurable(*record))
+                records.push_back(record);
         return records;
     });
     if (!result)

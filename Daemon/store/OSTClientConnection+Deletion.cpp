@@ -44,40 +44,45 @@ OSTClientConnection::stageForDeleteContainersWithUsers(const OSTDeletion& deleti
                 OSTCreateError(OSTErrorCode::invalidObject,
                                "Can't act on an invalid input: UUIDString count: %ld, class count: %ld, ID count: %ld",
                                deletion.uuids.size(), deletion.classes.size(), deletion.identifiers.size()));
-        const OSTAllIdentifiersLock lock(OSTLockKind::writing, deletion.useLocking);
-        return _stageForDeletion(deletion);
+        const OSTAllIdentifiersLock lock(OSTLockKind::writing);
+        // A list of users that is too short is the caller's mistake, which the guard reports.
+        for (std::size_t i = 0; i < deletion.uuids.size(); ++i)
+            OST_TRY(_stageForDeletion(
+                {{deletion.userIds.at(i), deletion.classes[i], deletion.identifiers[i]}, deletion.uuids[i]}));
+        return {};
     });
     if (!result)
         return std::unexpected(result.error().code());
     return {};
 }
 
-OSTResult<void> OSTClientConnection::_stageForDeletion(const OSTDeletion& deletion) const {
-    const auto deathRow = OSTGlobalConfiguration::sharedInstance().deathrowDirectory(); // the same for all
-    for (std::size_t i = 0; i < deletion.uuids.size(); ++i) {
-        // A list of users that is too short is the caller's mistake, which the guard reports.
-        const auto userId = deletion.userIds.at(i);
-        const auto& uuid = deletion.uuids[i];
-        const auto& identifier = deletion.identifiers[i];
-        const auto containerClass = deletion.classes[i];
-        if (!uuid || !identifier || !isValidContainerClass(containerClass)) {
-            static_cast<void>(OSTCreateError(OSTErrorCode::invalidObject,
-                                             "Can't act on an invalid object: userId: %u, UUID: %@, ID: %@, Class: %ld",
-                                             userId, uuid, identifier, containerClass));
-            continue;
-        }
-        const auto record =
-            OSTContainerCache::sharedInstance().containerForUser(userId, containerClass, *identifier, *uuid);
-        if (record)
-            OST_TRY(_stageContainer(userId, *record, deathRow));
-    }
+std::expected<void, OSTErrorCode> OSTClientConnection::stageForDeleteContainer(const OSTMetadata& container,
+                                                                               bool useLocking) const {
+    const auto result = OSTGuarded([&] {
+        const OSTAllIdentifiersLock lock(OSTLockKind::writing, useLocking);
+        return _stageForDeletion({container.name(), container.uuid});
+    });
+    if (!result)
+        return std::unexpected(result.error().code());
     return {};
 }
 
-OSTResult<void> OSTClientConnection::_stageContainer(std::uint32_t userId, const OSTMetadata& metadata,
-                                                     const std::string& deathRow) {
+OSTResult<void> OSTClientConnection::_stageForDeletion(const OSTContainerReference& reference) {
+    const auto& [name, uuid] = reference;
+    if (!uuid || !name.identifier || !isValidContainerClass(name.containerClass)) {
+        static_cast<void>(OSTCreateError(OSTErrorCode::invalidObject,
+                                         "Can't act on an invalid object: userId: %u, UUID: %@, ID: %@, Class: %ld",
+                                         name.userId, uuid, name.identifier, name.containerClass));
+        return {};
+    }
+    const auto record = OSTContainerCache::sharedInstance().containerForUser(name, *uuid);
+    return record ? _stageContainer(*record) : OSTResult<void>();
+}
+
+OSTResult<void> OSTClientConnection::_stageContainer(const OSTMetadata& metadata) {
     const auto& files = OSTFileManager::defaultManager();
-    const auto destination = pathByAppending(deathRow, lastPathComponent(metadata.url));
+    const auto destination =
+        pathByAppending(OSTGlobalConfiguration::sharedInstance().deathrowDirectory(), lastPathComponent(metadata.url));
     if (isBundleClass(metadata.containerClass))
         OSTStoreDelegate::shared().removeCodeSigningDictionariesForIdentifierAndItsChildren(metadata.identifier);
     if (const auto moved = files.moveItemAtURL(metadata.url, destination); !moved) {
@@ -88,32 +93,24 @@ OSTResult<void> OSTClientConnection::_stageContainer(std::uint32_t userId, const
             return {};
         }
     }
-    if (!_setSandboxContainerMappingForUser(userId, metadata.identifier, metadata.containerClass, std::nullopt))
+    if (!_setSandboxContainerMappingForUser(metadata.name(), std::nullopt))
         platform::logError("Failed to remove container mapping in delete operation of %@, %llu", metadata.identifier,
                            metadata.containerClass);
-    const auto removed = OSTContainerCache::sharedInstance().removeContainerForUser(
-        userId, metadata.containerClass, metadata.identifier, metadata.transient);
-    if (!removed)
+    if (const auto removed = OSTContainerCache::sharedInstance().removeContainerForUser(metadata.name()); !removed)
         return std::unexpected(OSTCreateError(OSTErrorCode::cacheRemoveFailed, removed.error(),
                                               "Failed to remove from cache id: %@, class: %ld, transient: %d",
                                               metadata.identifier, metadata.containerClass, metadata.transient));
     return {};
 }
 
-std::expected<void, OSTErrorCode>
-OSTClientConnection::deleteContainerForUser(std::uint32_t userId, std::optional<std::string_view> identifier,
-                                            OSTContainerClass containerClass, bool transient) const {
-    const auto record = createOrLookupContainerForUser(
-        {.userId = userId, .identifier = identifier, .containerClass = containerClass, .transient = transient});
+std::expected<void, OSTErrorCode> OSTClientConnection::deleteContainerForUser(const OSTContainerName& name) const {
+    const auto record = createOrLookupContainerForUser({.name = name});
     if (!record) {
         platform::logError("Failed to lookup existing container to delete-identifier: %@, class: %ld, transient: %d",
-                           identifier, containerClass, transient);
+                           name.identifier, name.containerClass, name.transient);
         return std::unexpected(record.error());
     }
-    return stageForDeleteContainersWithUsers({.userIds = {(*record)->uid},
-                                              .uuids = {(*record)->uuid},
-                                              .identifiers = {(*record)->identifier},
-                                              .classes = {(*record)->containerClass}});
+    return stageForDeleteContainer(**record);
 }
 
 OSTResult<void> OSTClientConnection::_moveItemAtURLToDeathRow(const std::string& url,

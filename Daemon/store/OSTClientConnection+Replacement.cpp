@@ -72,49 +72,49 @@ std::expected<void, OSTErrorCode> OSTClientConnection::replaceContainer(const OS
 }
 
 OSTResult<void> OSTClientConnection::_checkReplacement(const OSTReplacement& replacement) {
-    const auto& [oldSide, newSide, preserveOldUUID, startDeletionThread] = replacement;
-    if (!newSide.uuid || !isValidContainerClass(newSide.containerClass))
+    const auto& [oldName, oldUUID] = replacement.oldContainer;
+    const auto& [newName, newUUID] = replacement.newContainer;
+    if (!newUUID || !isValidContainerClass(newName.containerClass))
         return std::unexpected(OSTCreateError(OSTErrorCode::invalidObject,
                                               "Can't act on an invalid object: new userId: %u, newUUID: %@, Class: %ld",
-                                              newSide.userId, newSide.uuid, newSide.containerClass));
-    if (!oldSide.uuid) {
-        if (preserveOldUUID)
+                                              newName.userId, newUUID, newName.containerClass));
+    if (!oldUUID) {
+        if (replacement.preserveOldUUID)
             return std::unexpected(OSTCreateError(OSTErrorCode::invalidObject,
                                                   "Can't have a nil oldContainerUUID when preserving the UUID"));
         return {};
     }
-    if (!isValidContainerClass(oldSide.containerClass))
+    if (!isValidContainerClass(oldName.containerClass))
         return std::unexpected(OSTCreateError(OSTErrorCode::invalidObject,
                                               "Can't act on an invalid object: old userId: %u, oldUUID: %@, Class: %ld",
-                                              oldSide.userId, oldSide.uuid, oldSide.containerClass));
-    if (oldSide.containerClass != newSide.containerClass)
+                                              oldName.userId, oldUUID, oldName.containerClass));
+    if (oldName.containerClass != newName.containerClass)
         return std::unexpected(OSTCreateError(OSTErrorCode::classesDiffer,
                                               "Can't replace containers of different class types: %ld and %ld",
-                                              oldSide.containerClass, newSide.containerClass));
-    if (oldSide.userId != newSide.userId)
+                                              oldName.containerClass, newName.containerClass));
+    if (oldName.userId != newName.userId)
         return std::unexpected(OSTCreateError(OSTErrorCode::usersDiffer,
                                               "Can't replace containers of different userIds: %u and %u",
-                                              oldSide.userId, newSide.userId));
+                                              oldName.userId, newName.userId));
     return {};
 }
 
 OSTResult<void> OSTClientConnection::_replace(const OSTReplacement& replacement, ReplaceOperation& operation) const {
     OST_TRY(_findSides(replacement, operation));
     if (operation.oldContainer)
-        OST_TRY(_parkOldContainer(replacement, operation));
+        OST_TRY(_parkOldContainer(operation));
     else
-        OST_TRY(_checkNothingLives(replacement, operation));
+        OST_TRY(_checkNothingLives(operation));
     return _putNewContainerInPlace(replacement, operation);
 }
 
-OSTResult<OSTMetadataRecord> OSTClientConnection::_containerOfSide(const OSTReplacementSide& side) {
-    auto record = side.identifier ? OSTContainerCache::sharedInstance().containerForUser(
-                                        side.userId, side.containerClass, *side.identifier, *side.uuid)
-                                  : nullptr;
+OSTResult<OSTMetadataRecord> OSTClientConnection::_containerOfSide(const OSTContainerReference& side) {
+    const auto& [name, uuid] = side;
+    auto record = name.identifier ? OSTContainerCache::sharedInstance().containerForUser(name, *uuid) : nullptr;
     if (!record)
         return std::unexpected(OSTCreateError(OSTErrorCode::notFound,
                                               "No Container with userId: %u UUID: %@, identifier: %@, Class: %ld",
-                                              side.userId, *side.uuid, side.identifier, side.containerClass));
+                                              name.userId, *uuid, name.identifier, name.containerClass));
     return record;
 }
 
@@ -136,7 +136,7 @@ OSTResult<void> OSTClientConnection::_findSides(const OSTReplacement& replacemen
         return {};
     }
     const auto directory = OSTGlobalConfiguration::sharedInstance().containerDirectoryURLForUser(
-        replacement.newContainer.userId, replacement.newContainer.containerClass, operation.transient);
+        operation.newContainer->uid, operation.newContainer->containerClass, operation.transient);
     operation.destination = pathByAppending(directory.value_or(std::string()), lastPathComponent(newURL));
     if (OSTFileManager::defaultManager().itemExistsAtURL(operation.destination))
         return std::unexpected(
@@ -144,23 +144,20 @@ OSTResult<void> OSTClientConnection::_findSides(const OSTReplacement& replacemen
     return {};
 }
 
-OSTResult<void> OSTClientConnection::_checkNothingLives(const OSTReplacement& replacement,
-                                                        const ReplaceOperation& operation) {
-    const auto& identifier = operation.newContainer->identifier;
-    const auto containerClass = replacement.newContainer.containerClass;
-    const auto living = OSTContainerCache::sharedInstance().containerForUser(replacement.newContainer.userId,
-                                                                             containerClass, identifier, false);
+OSTResult<void> OSTClientConnection::_checkNothingLives(const ReplaceOperation& operation) {
+    auto name = operation.newContainer->name();
+    name.transient = false;
+    const auto living = OSTContainerCache::sharedInstance().containerForUser(name);
     if (living)
         return std::unexpected(OSTCreateError(OSTErrorCode::alreadyExists,
                                               "Container with identifier: %@, class: %ld, transient: %d already exists",
-                                              identifier, containerClass, false));
+                                              *name.identifier, name.containerClass, name.transient));
     if (!living.error().is(OSTErrorCode::notFound))
         return std::unexpected(living.error());
     return {};
 }
 
-OSTResult<void> OSTClientConnection::_parkOldContainer(const OSTReplacement& replacement,
-                                                       ReplaceOperation& operation) const {
+OSTResult<void> OSTClientConnection::_parkOldContainer(ReplaceOperation& operation) {
     const auto token = platform::UUID::generate().string();
     operation.replaceFileURL = OSTReplaceFile::urlOfToken(token);
     operation.stagingURL = pathByAppending(OSTGlobalConfiguration::sharedInstance().stagingDirectory(), token);
@@ -179,7 +176,7 @@ OSTResult<void> OSTClientConnection::_parkOldContainer(const OSTReplacement& rep
         return std::unexpected(OSTCreateError(OSTErrorCode::moveOldToStagingFailed, parked.error(),
                                               "Failed to move old %@ to staging %@", old.url, operation.stagingURL));
     operation.oldIsParked = true;
-    OST_TRY(_forgetContainer(replacement.oldContainer, old));
+    OST_TRY(_forgetContainer(old.name()));
     operation.oldIsForgotten = true;
     if (!isBundleClass(old.containerClass))
         return {};
@@ -191,19 +188,18 @@ OSTResult<void> OSTClientConnection::_parkOldContainer(const OSTReplacement& rep
     return invalidated;
 }
 
-OSTResult<void> OSTClientConnection::_forgetContainer(const OSTReplacementSide& side, const OSTMetadata& metadata) {
-    const auto removed = OSTContainerCache::sharedInstance().removeContainerForUser(
-        side.userId, side.containerClass, *side.identifier, metadata.transient);
+OSTResult<void> OSTClientConnection::_forgetContainer(const OSTContainerName& name) {
+    const auto removed = OSTContainerCache::sharedInstance().removeContainerForUser(name);
     if (!removed)
         return std::unexpected(OSTCreateError(OSTErrorCode::cacheRemoveFailed, removed.error(),
                                               "Failed to remove from cache id: %@, class: %ld, transient: %d",
-                                              *side.identifier, side.containerClass, metadata.transient));
+                                              *name.identifier, name.containerClass, name.transient));
     return {};
 }
 
 OSTResult<void> OSTClientConnection::_putNewContainerInPlace(const OSTReplacement& replacement,
                                                              ReplaceOperation& operation) const {
-    const auto& side = replacement.newContainer;
+    const auto name = operation.newContainer->name();
     const auto& destination = operation.destination;
     const auto& files = OSTFileManager::defaultManager();
     const auto failedMove = [&](const OSTError& cause) {
@@ -222,15 +218,16 @@ OSTResult<void> OSTClientConnection::_putNewContainerInPlace(const OSTReplacemen
         return std::unexpected(failedMove(durable.error()));
     }
 
-    OST_TRY(_forgetContainer(side, *operation.newContainer));
-    if (!_setSandboxContainerMappingForUser(side.userId, *side.identifier, side.containerClass, destination))
-        platform::logError("Failed to set container mapping in replace operation of %@, %llu", *side.identifier,
-                           side.containerClass);
+    OST_TRY(_forgetContainer(name));
+    if (!_setSandboxContainerMappingForUser(name, destination))
+        platform::logError("Failed to set container mapping in replace operation of %@, %llu", *name.identifier,
+                           name.containerClass);
     OSTMetadata metadata = *operation.newContainer;
+    metadata.url = destination;
+    metadata.transient = operation.transient;
     if (replacement.preserveOldUUID)
         metadata.uuid = *replacement.oldContainer.uuid;
-    const auto added = OSTContainerCache::sharedInstance().addContainerMetadata(metadata, side.userId, destination,
-                                                                                operation.transient);
+    const auto added = OSTContainerCache::sharedInstance().addContainerMetadata(metadata);
     if (!added)
         return std::unexpected(OSTCreateError(OSTErrorCode::cacheAddFailed, added.error(),
                                               "Failed to add to cache: %@, url: %@, transient: %d", metadata,
@@ -254,8 +251,7 @@ OSTResult<void> OSTClientConnection::_restoreOldContainer(ReplaceOperation& oper
         if (operation.restoreCodeSigning)
             operation.restoreCodeSigning();
         if (operation.oldIsForgotten)
-            static_cast<void>(
-                OSTContainerCache::sharedInstance().addContainerMetadata(old, old.uid, old.url, operation.transient));
+            static_cast<void>(OSTContainerCache::sharedInstance().addContainerMetadata(old));
         restored = files.makeDirectoryDurable(pathByDeletingLastComponent(old.url));
     }
     if (!restored)

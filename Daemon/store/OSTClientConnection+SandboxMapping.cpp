@@ -25,16 +25,17 @@ SandboxItem itemOf(std::uint32_t userId, OSTContainerClass containerClass) {
 
 } // namespace
 
-bool OSTClientConnection::_setSandboxContainerMappingForUser(std::uint32_t userId, std::string_view identifier,
-                                                             OSTContainerClass containerClass,
+bool OSTClientConnection::_setSandboxContainerMappingForUser(const OSTContainerName& name,
                                                              std::optional<std::string_view> url) {
+    const auto containerClass = name.containerClass;
     if (isBundleClass(containerClass))
         return true;
     if (!isPerUserClass(containerClass) && !isSystemClass(containerClass)) {
         platform::logError("Unsupported class for setting sandbox container mapping: %llu", containerClass);
         return false;
     }
-    const auto item = itemOf(userId, containerClass);
+    const auto item = itemOf(name.userId, containerClass);
+    const auto identifier = *name.identifier;
     const auto type = static_cast<std::uint64_t>(item.type);
     if (const auto removed = platform::setSandboxUserStateItem(item.userId, type, identifier, std::nullopt); !removed) {
         platform::logError(

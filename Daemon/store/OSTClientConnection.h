@@ -1,10 +1,11 @@
 #pragma once
 
-#include "model/OSTContainerClass.h"
+#include "model/OSTContainerName.h"
 #include "model/OSTMetadata.h"
 #include "platform/base/OSTError.h"
 #include "platform/base/UUID.h"
 #include "platform/threads/WorkQueue.h"
+#include "store/OSTContainerCache.h"
 
 #include <cstdint>
 #include <expected>
@@ -27,35 +28,23 @@ struct OSTClientIdentity {
 
 /// What a client asks for when it asks for one container.
 struct OSTContainerLookup {
-    std::uint32_t userId = 0;
-    std::optional<std::string_view> identifier = std::nullopt;
-    OSTContainerClass containerClass = OSTContainerClass::undefined;
-    bool transient = false;
+    OSTContainerName name;
     bool createIfNecessary = false;
     bool useLocking = true; ///< false when the caller holds the all-identifiers lock for writing
 };
 
-/// Containers to be deleted, one for each index.
+/// Containers to be deleted as a client lists them, one for each index of lists that may differ in length.
 struct OSTDeletion {
     std::vector<std::uint32_t> userIds;
     std::vector<std::optional<platform::UUID>> uuids;
-    std::vector<std::optional<std::string>> identifiers;
+    std::vector<std::optional<std::string_view>> identifiers;
     std::vector<OSTContainerClass> classes;
-    bool useLocking = true; ///< false when the caller holds the all-identifiers lock for writing
-};
-
-/// One of the two containers of a replacement.
-struct OSTReplacementSide {
-    std::optional<platform::UUID> uuid = std::nullopt;
-    std::uint32_t userId = 0;
-    std::optional<std::string> identifier = std::nullopt;
-    OSTContainerClass containerClass = OSTContainerClass::undefined;
 };
 
 /// A container to be put in another's place.
 struct OSTReplacement {
-    OSTReplacementSide oldContainer; ///< without a UUID: there is none
-    OSTReplacementSide newContainer;
+    OSTContainerReference oldContainer; ///< without a UUID: there is none
+    OSTContainerReference newContainer;
     bool preserveOldUUID = false; ///< the new one takes the old one's directory name and internal UUID
     bool startDeletionThread = false;
 };
@@ -106,12 +95,13 @@ public:
     /// `cacheRemoveFailed`.
     [[nodiscard]] std::expected<void, OSTErrorCode>
     stageForDeleteContainersWithUsers(const OSTDeletion& deletion) const;
+    /// The same for a container that was found; one that has gone since is passed over. `useLocking` is false when the
+    /// caller holds the all-identifiers lock for writing.
+    [[nodiscard]] std::expected<void, OSTErrorCode> stageForDeleteContainer(const OSTMetadata& container,
+                                                                            bool useLocking = true) const;
 
     /// Looks one container up and stages it for deletion. Codes: those of the look-up and of the staging.
-    [[nodiscard]] std::expected<void, OSTErrorCode> deleteContainerForUser(std::uint32_t userId,
-                                                                           std::optional<std::string_view> identifier,
-                                                                           OSTContainerClass containerClass,
-                                                                           bool transient) const;
+    [[nodiscard]] std::expected<void, OSTErrorCode> deleteContainerForUser(const OSTContainerName& name) const;
 
     using DeathRowCompletion = std::move_only_function<void(std::int64_t code)>;
 
@@ -158,16 +148,15 @@ private:
     // +Creation
     [[nodiscard]] OSTResult<void> _checkLookup(const OSTContainerLookup& lookup) const;
     /// `staging` is what is to be thrown away when this has returned, if anything.
-    [[nodiscard]] OSTResult<OSTMetadataRecord> _lookUpOrCreate(const OSTContainerLookup& lookup,
-                                                               std::string& staging) const;
+    [[nodiscard]] OSTResult<OSTCacheEntry> _lookUpOrCreate(const OSTContainerLookup& lookup,
+                                                           std::string& staging) const;
     struct LookUpResult {
-        OSTMetadataRecord record = nullptr; ///< null: the container is to be made
+        OSTCacheEntry entry = {}; ///< without a record: the container is to be made
         bool threwTransientAway = false;
     };
     [[nodiscard]] OSTResult<LookUpResult> _lookUp(const OSTContainerLookup& lookup) const;
-    [[nodiscard]] static OSTResult<OSTMetadata> _buildInStaging(const OSTContainerLookup& lookup, std::string& staging);
-    [[nodiscard]] static OSTResult<OSTMetadataRecord>
-    _putInPlace(OSTMetadata metadata, const OSTContainerLookup& lookup, std::string& staging);
+    [[nodiscard]] static OSTResult<OSTMetadata> _buildInStaging(const OSTContainerName& name, std::string& staging);
+    [[nodiscard]] static OSTResult<OSTCacheEntry> _putInPlace(OSTMetadata metadata, std::string& staging);
     [[nodiscard]] static OSTResult<void>
     _createTopLevelContainerDirectory(const std::string& url, OSTContainerClass containerClass, std::uint32_t owner);
     [[nodiscard]] static OSTResult<void> _createSubDirectories(const std::string& url, std::uint32_t userId,
@@ -179,15 +168,13 @@ private:
     struct ReplaceOperation;
     [[nodiscard]] static OSTResult<void> _checkReplacement(const OSTReplacement& replacement);
     [[nodiscard]] OSTResult<void> _replace(const OSTReplacement& replacement, ReplaceOperation& operation) const;
-    [[nodiscard]] static OSTResult<OSTMetadataRecord> _containerOfSide(const OSTReplacementSide& side);
+    [[nodiscard]] static OSTResult<OSTMetadataRecord> _containerOfSide(const OSTContainerReference& side);
     [[nodiscard]] static OSTResult<void> _findSides(const OSTReplacement& replacement, ReplaceOperation& operation);
-    [[nodiscard]] static OSTResult<void> _checkNothingLives(const OSTReplacement& replacement,
-                                                            const ReplaceOperation& operation);
-    [[nodiscard]] OSTResult<void> _parkOldContainer(const OSTReplacement& replacement,
-                                                    ReplaceOperation& operation) const;
+    [[nodiscard]] static OSTResult<void> _checkNothingLives(const ReplaceOperation& operation);
+    [[nodiscard]] static OSTResult<void> _parkOldContainer(ReplaceOperation& operation);
     [[nodiscard]] OSTResult<void> _putNewContainerInPlace(const OSTReplacement& replacement,
                                                           ReplaceOperation& operation) const;
-    [[nodiscard]] static OSTResult<void> _forgetContainer(const OSTReplacementSide& side, const OSTMetadata& metadata);
+    [[nodiscard]] static OSTResult<void> _forgetContainer(const OSTContainerName& name);
     [[nodiscard]] static OSTResult<void> _restoreOldContainer(ReplaceOperation& operation);
     [[nodiscard]] OSTResult<void> _cleanUpReplacement(const OSTReplacement& replacement,
                                                       const ReplaceOperation& operation) const;
@@ -204,14 +191,11 @@ private:
     // +SandboxMapping
     /// Tells the sandbox where the container of an identifier lies, or with no URL that there is none. False, with the
     /// reason in the log, when that failed. Bundle classes are not the sandbox's business.
-    static bool _setSandboxContainerMappingForUser(std::uint32_t userId, std::string_view identifier,
-                                                   OSTContainerClass containerClass,
-                                                   std::optional<std::string_view> url);
+    static bool _setSandboxContainerMappingForUser(const OSTContainerName& name, std::optional<std::string_view> url);
 
     // +Deletion
-    [[nodiscard]] OSTResult<void> _stageForDeletion(const OSTDeletion& deletion) const;
-    [[nodiscard]] static OSTResult<void> _stageContainer(std::uint32_t userId, const OSTMetadata& metadata,
-                                                         const std::string& deathRow);
+    [[nodiscard]] static OSTResult<void> _stageForDeletion(const OSTContainerReference& reference);
+    [[nodiscard]] static OSTResult<void> _stageContainer(const OSTMetadata& metadata);
     /// Moves one item to death row with one rename; an item that is already gone is success.
     /// Fails with `moveToDeathRowFailed`.
     [[nodiscard]] OSTResult<void> _moveItemAtURLToDeathRow(const std::string& url, StartPass startDeletionThread) const;

@@ -12,6 +12,7 @@
 #include <cerrno>
 #include <cstring>
 #include <future>
+#include <ranges>
 #include <system_error>
 #include <thread>
 
@@ -39,18 +40,27 @@ OSTError invalidContentClass(OSTContainerClass contentClass, std::source_locatio
                             contentClass);
 }
 
+OSTResult<void> checkName(const OSTContainerName& name, std::source_location where) {
+    if (!isValidContainerClass(name.containerClass))
+        return std::unexpected(invalidContentClass(name.containerClass, where));
+    if (!name.identifier)
+        return std::unexpected(OSTCreateErrorAt(where, OSTErrorCode::invalidCacheInput, nullptr,
+                                                "Invalid identifier: %@", name.identifier));
+    return {};
+}
+
 /// Checks a record that the cache holds against the disk.
-OSTResult<void> checkOnDisk(const OSTMetadata& record, bool transient, std::source_location where) {
+OSTResult<void> checkOnDisk(const OSTMetadata& record, std::source_location where) {
     const auto className = pathComponentForContainerClass(record.containerClass);
     if (record.url.empty())
         return std::unexpected(OSTCreateErrorAt(where, OSTErrorCode::invalidCacheInput, nullptr,
                                                 "Cache: %@%@: Invalid URL path string: %@", className,
-                                                suffix(transient), record.url));
+                                                suffix(record.transient), record.url));
     const auto metadataFile = record.metadataFileURL();
     if (!OSTFileManager::defaultManager().itemExistsAtURL(metadataFile))
         return std::unexpected(OSTCreateErrorAt(where, OSTErrorCode::cacheInconsistent, nullptr,
                                                 "Cache: %@%@: INCONSISTENT-No Metadata at: %@", className,
-                                                suffix(transient), metadataFile));
+                                                suffix(record.transient), metadataFile));
     return {};
 }
 
@@ -109,60 +119,72 @@ OSTContainerCache& OSTContainerCache::sharedInstance() {
     return cache;
 }
 
-OSTResult<OSTMetadataRecord> OSTContainerCache::containerForUser(std::uint32_t userId, OSTContainerClass contentClass,
-                                                                 std::string_view identifier, bool transient) {
+OSTResult<OSTMetadataRecord> OSTContainerCache::containerForUser(const OSTContainerName& name) {
+    return OST_TRY(entryForUser(name)).record;
+}
+
+OSTResult<OSTCacheEntry> OSTContainerCache::entryForUser(const OSTContainerName& name) {
     const auto here = std::source_location::current();
-    return OSTGuarded([&]() -> OSTResult<OSTMetadataRecord> {
-        if (!isValidContainerClass(contentClass))
-            return std::unexpected(invalidContentClass(contentClass, here));
-        const auto className = pathComponentForContainerClass(contentClass);
-        OSTMetadataRecord record;
+    return OSTGuarded([&]() -> OSTResult<OSTCacheEntry> {
+        OST_TRY(checkName(name, here));
+        const auto className = pathComponentForContainerClass(name.containerClass);
+        OSTCacheEntry entry;
         {
             const auto lock = lockCache(_cacheLock);
-            const ClassTable* const table = OST_TRY(_tableForUserId(userId, contentClass, transient, here));
-            if (const auto found = table->find(identifier); found != table->end())
-                record = *found;
+            const ClassTable* const table = OST_TRY(_tableForUserId(name, here));
+            if (const auto found = table->find(*name.identifier); found != table->end())
+                entry = found->second;
         }
-        if (!record)
+        if (!entry.record)
             return std::unexpected(OSTCreateError(OSTErrorCode::notFound, OSTLogging::silent, nullptr,
                                                   "Cache: %@%@: Container Not Found with ID: %@", className,
-                                                  suffix(transient), identifier));
-        OST_TRY(checkOnDisk(*record, transient, here));
-        platform::logDebug("Cache: %@%@: Found Identifier: %@", className, suffix(transient), identifier);
-        return record;
+                                                  suffix(name.transient), name.identifier));
+        OST_TRY(checkOnDisk(*entry.record, here));
+        platform::logDebug("Cache: %@%@: Found Identifier: %@", className, suffix(name.transient), name.identifier);
+        return entry;
     });
 }
 
-OSTMetadataRecord OSTContainerCache::containerForUser(std::uint32_t userId, OSTContainerClass contentClass,
-                                                      std::string_view identifier, const platform::UUID& uuid) {
-    for (const bool transient : {false, true}) {
-        auto found = containerForUser(userId, contentClass, identifier, transient);
+OSTMetadataRecord OSTContainerCache::containerForUser(OSTContainerName name, const platform::UUID& uuid) {
+    for (name.transient = false;; name.transient = true) {
+        auto found = containerForUser(name);
         if (found && (*found)->uuid == uuid)
             return *std::move(found);
+        if (name.transient)
+            return nullptr;
     }
-    return nullptr;
 }
 
 OSTResult<std::vector<OSTMetadataRecord>>
 OSTContainerCache::allContainersForUser(std::uint32_t userId, OSTContainerClass contentClass, bool transient) {
+    std::vector<OSTMetadataRecord> records;
+    for (auto& entry : OST_TRY(allEntriesForUser(userId, contentClass, transient)))
+        records.push_back(std::move(entry.record));
+    return records;
+}
+
+OSTResult<std::vector<OSTCacheEntry>>
+OSTContainerCache::allEntriesForUser(std::uint32_t userId, OSTContainerClass contentClass, bool transient) {
     const auto here = std::source_location::current();
-    return OSTGuarded([&]() -> OSTResult<std::vector<OSTMetadataRecord>> {
+    return OSTGuarded([&]() -> OSTResult<std::vector<OSTCacheEntry>> {
         if (!isValidContainerClass(contentClass))
             return std::unexpected(invalidContentClass(contentClass, here));
-        std::vector<OSTMetadataRecord> records;
+        std::vector<OSTCacheEntry> entries;
         {
             const auto lock = lockCache(_cacheLock);
-            const ClassTable* const table = OST_TRY(_tableForUserId(userId, contentClass, transient, here));
-            records.assign(table->begin(), table->end());
+            const ClassTable* const table = OST_TRY(
+                _tableForUserId({.userId = userId, .containerClass = contentClass, .transient = transient}, here));
+            for (const auto& entry : *table | std::views::values)
+                entries.push_back(entry);
         }
-        std::erase_if(records, [&](const OSTMetadataRecord& record) {
-            if (!checkOnDisk(*record, transient, here))
+        std::erase_if(entries, [&](const OSTCacheEntry& entry) {
+            if (!checkOnDisk(*entry.record, here))
                 return true;
             platform::logDebug("Cache: %@%@: ALL Found Identifier: %@", pathComponentForContainerClass(contentClass),
-                               suffix(transient), record->identifier);
+                               suffix(transient), entry.record->identifier);
             return false;
         });
-        return records;
+        return entries;
     });
 }
 
@@ -174,71 +196,75 @@ OSTResult<std::vector<std::string>> OSTContainerCache::allContainerIdentifiersFo
         if (!isValidContainerClass(contentClass))
             return std::unexpected(invalidContentClass(contentClass, here));
         const auto lock = lockCache(_cacheLock);
-        const ClassTable* const table = OST_TRY(_tableForUserId(userId, contentClass, transient, here));
+        const ClassTable* const table =
+            OST_TRY(_tableForUserId({.userId = userId, .containerClass = contentClass, .transient = transient}, here));
         std::vector<std::string> identifiers;
         identifiers.reserve(table->size());
-        for (const auto& record : *table)
-            identifiers.push_back(record->identifier);
+        for (const auto identifier : *table | std::views::keys)
+            identifiers.emplace_back(identifier);
         return identifiers;
     });
 }
 
-OSTResult<OSTMetadataRecord> OSTContainerCache::addContainerMetadata(OSTMetadata metadata, std::uint32_t userId,
-                                                                     std::string_view url, bool transient) {
+OSTResult<OSTMetadataRecord> OSTContainerCache::addContainerMetadata(OSTMetadata metadata, OSTPlacement placement) {
     const auto here = std::source_location::current();
     return OSTGuarded([&]() -> OSTResult<OSTMetadataRecord> {
         const auto contentClass = metadata.containerClass;
         if (!isValidContainerClass(contentClass))
             return std::unexpected(
                 OSTCreateError(OSTErrorCode::invalidCacheInput, "Invalid Metadata Content Class: %lld", contentClass));
-        if (url.empty())
-            return std::unexpected(OSTCreateError(OSTErrorCode::invalidCacheInput, "Invalid input: URL: %@", url));
-        metadata.url = url;
-        metadata.transient = transient;
+        if (metadata.url.empty())
+            return std::unexpected(
+                OSTCreateError(OSTErrorCode::invalidCacheInput, "Invalid input: URL: %@", metadata.url));
         auto record = std::make_shared<const OSTMetadata>(std::move(metadata));
         {
             const auto lock = lockCache(_cacheLock);
-            ClassTable* const table = OST_TRY(_tableForUserId(userId, contentClass, transient, here));
-            _put(*table, record);
+            ClassTable* const table = OST_TRY(_tableForUserId(record->name(), here));
+            _put(*table, {record, placement});
         }
         platform::logDebug("Cache: %@%@: Added Identifier: %@", pathComponentForContainerClass(contentClass),
-                           suffix(transient), record->identifier);
+                           suffix(record->transient), record->identifier);
         return record;
     });
 }
 
-OSTResult<void> OSTContainerCache::removeContainerForUser(std::uint32_t userId, OSTContainerClass contentClass,
-                                                          std::string_view identifier, bool transient) {
+void OSTContainerCache::placementReachedDisk(const OSTMetadata& metadata) {
+    const auto lock = lockCache(_cacheLock);
+    const auto table = _getCacheForUserId(metadata.name());
+    if (!table)
+        return;
+    const auto found = (*table)->find(metadata.identifier);
+    if (found != (*table)->end() && found->second.record->uuid == metadata.uuid)
+        found->second.placement = OSTPlacement::durable;
+}
+
+OSTResult<void> OSTContainerCache::removeContainerForUser(const OSTContainerName& name) {
     const auto here = std::source_location::current();
     return OSTGuarded([&]() -> OSTResult<void> {
-        if (!isValidContainerClass(contentClass))
-            return std::unexpected(invalidContentClass(contentClass, here));
+        OST_TRY(checkName(name, here));
         {
             const auto lock = lockCache(_cacheLock);
-            ClassTable* const table = OST_TRY(_tableForUserId(userId, contentClass, transient, here));
-            if (const auto found = table->find(identifier); found != table->end())
-                table->erase(found);
+            ClassTable* const table = OST_TRY(_tableForUserId(name, here));
+            table->erase(*name.identifier);
         }
-        platform::logDebug("Cache: %@%@: Removed Identifier: %@", pathComponentForContainerClass(contentClass),
-                           suffix(transient), identifier);
+        platform::logDebug("Cache: %@%@: Removed Identifier: %@", pathComponentForContainerClass(name.containerClass),
+                           suffix(name.transient), name.identifier);
         return {};
     });
 }
 
-OSTResult<OSTContainerCache::ClassTable*> OSTContainerCache::_tableForUserId(std::uint32_t userId,
-                                                                             OSTContainerClass contentClass,
-                                                                             bool transient,
+OSTResult<OSTContainerCache::ClassTable*> OSTContainerCache::_tableForUserId(const OSTContainerName& name,
                                                                              std::source_location where) {
-    auto table = _getCacheForUserId(userId, contentClass, transient);
+    auto table = _getCacheForUserId(name);
     if (!table)
-        return std::unexpected(OSTCreateErrorAt(where, OSTErrorCode::cacheRebuildFailed, &table.error(),
-                                                "Cache: %u-%@%@: Failed to rebuild", userId,
-                                                pathComponentForContainerClass(contentClass), suffix(transient)));
+        return std::unexpected(OSTCreateErrorAt(
+            where, OSTErrorCode::cacheRebuildFailed, &table.error(), "Cache: %u-%@%@: Failed to rebuild", name.userId,
+            pathComponentForContainerClass(name.containerClass), suffix(name.transient)));
     return table;
 }
 
-OSTResult<OSTContainerCache::ClassTable*>
-OSTContainerCache::_getCacheForUserId(std::uint32_t userId, OSTContainerClass contentClass, bool transient) {
+OSTResult<OSTContainerCache::ClassTable*> OSTContainerCache::_getCacheForUserId(const OSTContainerName& name) {
+    const auto& [userId, contentClass, identifier, transient] = name;
     if (!OSTUserIdFitsClass(contentClass, userId))
         return std::unexpected(OSTCreateError(OSTErrorCode::invalidCacheInput,
                                               "Invalid cache get-userId %u for class %ld", userId, contentClass));
@@ -273,14 +299,18 @@ OSTResult<OSTContainerCache::ClassTable> OSTContainerCache::_readClassDirectory(
     table.reserve(items.size());
     for (auto& record : records)
         if (record)
-            _put(table, std::move(record));
+            _put(table, {std::move(record)});
     return table;
 }
 
-void OSTContainerCache::_put(ClassTable& table, OSTMetadataRecord record) {
-    if (const auto old = table.find(record); old != table.end())
-        table.erase(old);
-    table.insert(std::move(record));
+void OSTContainerCache::_put(ClassTable& table, OSTCacheEntry entry) {
+    const std::string_view identifier = entry.record->identifier;
+    if (const auto old = table.find(identifier); old != table.end()) {
+        if (old->second.record->url == entry.record->url && old->second.placement == OSTPlacement::pending)
+            entry.placement = OSTPlacement::pending;
+        table.erase(old); // with its key, which the old record owns
+    }
+    table.emplace(identifier, std::move(entry));
 }
 
 } // namespace ost

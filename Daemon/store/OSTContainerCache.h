@@ -1,6 +1,6 @@
 #pragma once
 
-#include "model/OSTContainerClass.h"
+#include "model/OSTContainerName.h"
 #include "model/OSTMetadata.h"
 #include "platform/base/OSTError.h"
 
@@ -11,11 +11,20 @@
 #include <source_location>
 #include <string>
 #include <string_view>
-#include <unordered_set>
+#include <unordered_map>
 #include <utility>
 #include <vector>
 
 namespace ost {
+
+/// Whether a container's place is certain to outlast a power cut.
+enum class OSTPlacement : bool { durable, pending };
+
+/// What the cache knows of one container.
+struct OSTCacheEntry {
+    OSTMetadataRecord record = nullptr;
+    OSTPlacement placement = OSTPlacement::durable;
+};
 
 /// The metadata records of all containers, by user, class and identifier, so that a look-up does not scan a class
 /// directory.
@@ -33,52 +42,46 @@ public:
     /// Finds a container by its identifier. Fails with `invalidCacheInput`, `cacheRebuildFailed`, `notFound` (not
     /// logged), or `cacheInconsistent` when the container's metadata file has gone from the disk; the record then
     /// stays.
-    [[nodiscard]] OSTResult<OSTMetadataRecord> containerForUser(std::uint32_t userId, OSTContainerClass contentClass,
-                                                                std::string_view identifier, bool transient);
+    [[nodiscard]] OSTResult<OSTMetadataRecord> containerForUser(const OSTContainerName& name);
+    [[nodiscard]] OSTResult<OSTCacheEntry> entryForUser(const OSTContainerName& name);
 
     /// Finds the container with that internal UUID, among the live ones first; null when neither table has it.
-    [[nodiscard]] OSTMetadataRecord containerForUser(std::uint32_t userId, OSTContainerClass contentClass,
-                                                     std::string_view identifier, const platform::UUID& uuid);
+    [[nodiscard]] OSTMetadataRecord containerForUser(OSTContainerName name, const platform::UUID& uuid);
 
     /// All containers whose metadata file is on disk; the errors of others are logged and not returned.
     [[nodiscard]] OSTResult<std::vector<OSTMetadataRecord>>
     allContainersForUser(std::uint32_t userId, OSTContainerClass contentClass, bool transient);
+    [[nodiscard]] OSTResult<std::vector<OSTCacheEntry>>
+    allEntriesForUser(std::uint32_t userId, OSTContainerClass contentClass, bool transient);
 
     /// The identifiers of all containers, without a look at the disk.
     [[nodiscard]] OSTResult<std::vector<std::string>>
     allContainerIdentifiersForUser(std::uint32_t userId, OSTContainerClass contentClass, bool transient);
 
-    /// Puts `metadata`, found at `url` from now on, into the table of the user and the record's class. Gives the record
-    /// as it is held. Fails with `invalidCacheInput` or `cacheRebuildFailed`.
-    [[nodiscard]] OSTResult<OSTMetadataRecord> addContainerMetadata(OSTMetadata metadata, std::uint32_t userId,
-                                                                    std::string_view url, bool transient);
+    /// Holds `metadata` under its name, in place of what is held there. Gives the record as it is held. A place that is
+    /// pending stays so until `placementReachedDisk`, even when a later record speaks of the same place.
+    /// Fails with `invalidCacheInput` or `cacheRebuildFailed`.
+    [[nodiscard]] OSTResult<OSTMetadataRecord> addContainerMetadata(OSTMetadata metadata,
+                                                                    OSTPlacement placement = OSTPlacement::durable);
+    /// Ends the pending of the container's place, unless another container has its name by now.
+    void placementReachedDisk(const OSTMetadata& metadata);
 
     /// Forgets a container; one that is not there is no error. Fails with `invalidCacheInput` or `cacheRebuildFailed`.
-    [[nodiscard]] OSTResult<void> removeContainerForUser(std::uint32_t userId, OSTContainerClass contentClass,
-                                                         std::string_view identifier, bool transient);
+    [[nodiscard]] OSTResult<void> removeContainerForUser(const OSTContainerName& name);
 
 private:
-    /// Hashes and compares records by identifier, and finds them by a plain string.
-    struct ByIdentifier {
-        using is_transparent = void;
-        static std::string_view key(std::string_view identifier) { return identifier; }
-        static std::string_view key(const OSTMetadataRecord& record) { return record->identifier; }
-        std::size_t operator()(const auto& value) const { return std::hash<std::string_view>{}(key(value)); }
-        bool operator()(const auto& a, const auto& b) const { return key(a) == key(b); }
-    };
-    using ClassTable = std::unordered_set<OSTMetadataRecord, ByIdentifier, ByIdentifier>;
+    /// Entries by the identifier that their own record owns.
+    using ClassTable = std::unordered_map<std::string_view, OSTCacheEntry>;
     using ClassKey = std::pair<std::uint32_t, OSTContainerClass>;
     using ClassTables = std::map<ClassKey, ClassTable>;
 
-    /// The table of a user and class, read from disk when there is none. Call with the mutex held.
-    [[nodiscard]] OSTResult<ClassTable*> _getCacheForUserId(std::uint32_t userId, OSTContainerClass contentClass,
-                                                            bool transient);
+    /// The table that a name belongs to, read from disk when there is none. Call with the mutex held.
+    [[nodiscard]] OSTResult<ClassTable*> _getCacheForUserId(const OSTContainerName& name);
     /// The same for the public operations, which report any failure as `cacheRebuildFailed`.
-    [[nodiscard]] OSTResult<ClassTable*> _tableForUserId(std::uint32_t userId, OSTContainerClass contentClass,
-                                                         bool transient, std::source_location where);
+    [[nodiscard]] OSTResult<ClassTable*> _tableForUserId(const OSTContainerName& name, std::source_location where);
     [[nodiscard]] static OSTResult<ClassTable> _readClassDirectory(const std::string& directory, std::uint32_t userId,
                                                                    bool transient);
-    static void _put(ClassTable& table, OSTMetadataRecord record);
+    static void _put(ClassTable& table, OSTCacheEntry entry);
 
     std::mutex _cacheLock;
     // Guarded by _cacheLock.

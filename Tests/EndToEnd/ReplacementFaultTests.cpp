@@ -223,10 +223,9 @@ private:
         ost::OSTStoreDelegate::join(codeSigning);
         const auto containerClass = static_cast<ost::OSTContainerClass>(GetParam().containerClass);
         const auto side = [&](const Container& container) {
-            return ost::OSTReplacementSide{.uuid = container.uuid,
-                                           .userId = ost::isBundleClass(containerClass) ? 33U : 501U,
-                                           .identifier = container.identifier,
-                                           .containerClass = containerClass};
+            return ost::OSTContainerReference{
+                {ost::isBundleClass(containerClass) ? 33U : 501U, containerClass, container.identifier},
+                container.uuid};
         };
         const auto result = ost::OSTClientConnection::sharedClientConnection().replaceContainer(
             {.oldContainer = side(_old.container), .newContainer = side(_new.container), .preserveOldUUID = true});

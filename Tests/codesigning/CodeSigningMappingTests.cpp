@@ -138,16 +138,13 @@ TEST_F(CodeSigningMapping, WriteFailureKeepsTheChangeInMemory) {
 
 TEST_F(CodeSigningMapping, InfoCachedInABundleContainerIsTakenOver) {
     const auto bundle = OSTClientConnection::sharedClientConnection().createOrLookupContainerForUser(
-        {.userId = 33,
-         .identifier = "org.example.app",
-         .containerClass = OSTContainerClass::bundleApplication,
-         .createIfNecessary = true});
+        {.name = {33, OSTContainerClass::bundleApplication, "org.example.app"}, .createIfNecessary = true});
     ASSERT_TRUE(bundle);
     OSTMetadata metadata = **bundle;
     metadata.info = shared(OSTDictionary(
         {{"com.tamarok.Tessaly.CachedCodeSigningInfo",
           OSTDictionary({{"Entitlements", OSTDictionary({{"com.tamarok.security.system-container", true}})}})}}));
-    ASSERT_TRUE(OSTContainerCache::sharedInstance().addContainerMetadata(metadata, 33, metadata.url, false));
+    ASSERT_TRUE(OSTContainerCache::sharedInstance().addContainerMetadata(metadata));
     EXPECT_TRUE(mapping().identifierHasSystemContainer("org.example.app"));
     EXPECT_EQ(2U, mapping().dataContainerTypeForIdentifier("org.example.app"));
     EXPECT_EQ(1U, onDisk().size());

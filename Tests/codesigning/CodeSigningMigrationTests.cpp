@@ -29,7 +29,7 @@ protected:
         metadata.info =
             std::make_shared<const OSTDictionary>(std::vector<OSTDictionary::Entry>{{key, std::move(value)}});
         EXPECT_TRUE(metadata.writeMetadataToDisk());
-        EXPECT_TRUE(OSTContainerCache::sharedInstance().addContainerMetadata(metadata, metadata.uid, url, false));
+        EXPECT_TRUE(OSTContainerCache::sharedInstance().addContainerMetadata(metadata));
         return url;
     }
     static bool hasInfo(OSTContainerClass containerClass, std::string_view identifier) {

@@ -220,7 +220,7 @@ TEST_F(CodeSigningProcessing, WhatIsNoEntryStaysInTheFileUntilItsIdentifierIsReg
     auto bundle = *make(bundleApplication, "data");
     bundle.info = std::make_shared<const OSTDictionary>(std::vector<OSTDictionary::Entry>{
         {"com.tamarok.Tessaly.CachedCodeSigningInfo", OSTDictionary({{OSTEntitlementsKey, systemContainer}})}});
-    ASSERT_TRUE(OSTContainerCache::sharedInstance().addContainerMetadata(bundle, 33, bundle.url, false));
+    ASSERT_TRUE(OSTContainerCache::sharedInstance().addContainerMetadata(bundle));
     EXPECT_TRUE(mapping().codeSigningInfoExistForIdentifier("data"));
     EXPECT_FALSE(mapping().identifierHasSystemContainer("data"))
         << "entitlements have another name in a bundle container";
@@ -267,7 +267,7 @@ TEST_F(CodeSigningProcessing, AMappingThatCannotBeReadProcessesNothing) {
     EXPECT_EQ(OSTNoProcessingResult, remove(app));
     EXPECT_EQ(OSTNoProcessingResult, mapping().invalidateCodeSigningInfoForAppsWithoutBundleContainer());
     EXPECT_EQ(Identifiers(), mapping().appGroupIdentifiersForIdentifier(app));
-    EXPECT_TRUE(store().deleteContainerForUser(33, app, bundleApplication, false));
+    EXPECT_TRUE(store().deleteContainerForUser({33, bundleApplication, app}));
     EXPECT_FALSE(fs::exists(bundle));
     EXPECT_TRUE(lives(sharedAppGroup, "g", group));
     EXPECT_EQ(damaged, test::readFile(mappingFile));
@@ -286,7 +286,7 @@ TEST_F(CodeSigningProcessing, DeletingABundleRemovesTheIdentifierAndItsChildrenW
     const auto ofAll = makeContainer(sharedAppGroup, "of all");
     const auto shared = makeContainer(sharedAppGroup, "shared");
 
-    ASSERT_TRUE(store().deleteContainerForUser(33, app, bundleApplication, false));
+    ASSERT_TRUE(store().deleteContainerForUser({33, bundleApplication, app}));
     EXPECT_FALSE(lives(bundleApplication, app, bundle));
     EXPECT_FALSE(lives(dataSystem, "plug-in", ofPlugIn));
     EXPECT_FALSE(lives(sharedAppGroup, "of all", ofAll));

@@ -85,10 +85,8 @@ protected:
 
     /// Makes a container, whatever its identifier is made of, and gives its path.
     static std::string makeContainer(OSTContainerClass containerClass, std::string_view identifier) {
-        const auto made = store().createOrLookupContainerForUser({.userId = userOf(containerClass),
-                                                                  .identifier = identifier,
-                                                                  .containerClass = containerClass,
-                                                                  .createIfNecessary = true});
+        const auto made = store().createOrLookupContainerForUser(
+            {.name = {userOf(containerClass), containerClass, identifier}, .createIfNecessary = true});
         return made ? (*made)->url : std::string();
     }
     /// Whether a container is there, on disk and for the cache, which must agree.

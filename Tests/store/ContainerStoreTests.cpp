@@ -39,15 +39,12 @@ protected:
     static std::vector<std::vector<OSTMetadataRecord>> createInParallel(std::size_t containers, bool transient);
 
     static auto lookUp(std::string_view identifier, bool create, bool transient = false) {
-        return store().createOrLookupContainerForUser({.userId = 501,
-                                                       .identifier = identifier,
-                                                       .containerClass = dataApplication,
-                                                       .transient = transient,
-                                                       .createIfNecessary = create});
+        return store().createOrLookupContainerForUser(
+            {.name = {501, dataApplication, identifier, transient}, .createIfNecessary = create});
     }
     static auto create(std::uint32_t userId, OSTContainerClass containerClass, std::string_view identifier) {
         return store().createOrLookupContainerForUser(
-            {.userId = userId, .identifier = identifier, .containerClass = containerClass, .createIfNecessary = true});
+            {.name = {userId, containerClass, identifier}, .createIfNecessary = true});
     }
     static OSTClientConnection& store() { return OSTClientConnection::sharedClientConnection(); }
 
@@ -139,13 +136,13 @@ TEST_F(ContainerStore, SystemContainersBelongToNobodyAndUseWellknownNames) {
     }
 
     const OSTClientConnection stranger(OSTClientIdentity{.clientBundleIdentifier = "me", .clientUserId = 501});
-    OSTContainerLookup lookup{.userId = 499, .containerClass = dataSystem, .createIfNecessary = true};
-    lookup.identifier = "me";
+    OSTContainerLookup lookup{.name = {499, dataSystem}, .createIfNecessary = true};
+    lookup.name.identifier = "me";
     EXPECT_EQ(OSTErrorCode::notEntitled, stranger.createOrLookupContainerForUser(lookup).error());
-    lookup.identifier = "entitled";
+    lookup.name.identifier = "entitled";
     EXPECT_TRUE(stranger.createOrLookupContainerForUser(lookup));
-    lookup.containerClass = sharedSystemGroup;
-    lookup.identifier = "me";
+    lookup.name.containerClass = sharedSystemGroup;
+    lookup.name.identifier = "me";
     EXPECT_TRUE(stranger.createOrLookupContainerForUser(lookup)) << "no other class asks for an entitlement";
 }
 
@@ -158,14 +155,12 @@ TEST_F(ContainerStore, RefusesWhatFitsNoContainerBeforeAnyLock) {
     };
     for (const auto& c : {Case{501, 2, {}}, Case{501, 0, "a"}, Case{501, 14, "a"}, Case{501, 1, "a"}, Case{500, 2, "a"},
                           Case{501, 12, "a"}, Case{501, std::uint64_t{1} << 32U | 2U, "a"}})
-        EXPECT_EQ(
-            OSTErrorCode::invalidObject,
-            store()
-                .createOrLookupContainerForUser({.userId = c.user,
-                                                 .identifier = c.identifier,
-                                                 .containerClass = static_cast<OSTContainerClass>(c.containerClass),
-                                                 .createIfNecessary = true})
-                .error());
+        EXPECT_EQ(OSTErrorCode::invalidObject,
+                  store()
+                      .createOrLookupContainerForUser(
+                          {.name = {c.user, static_cast<OSTContainerClass>(c.containerClass), c.identifier},
+                           .createIfNecessary = true})
+                      .error());
 }
 
 TEST_F(ContainerStore, LooksUpWithoutMaking) {
@@ -276,7 +271,7 @@ TEST_F(ContainerStore, CacheReportsWhatGoneBehindItsBack) {
     EXPECT_EQ(OSTErrorCode::cacheInconsistent, lookUp("org.example.app", true).error());
     EXPECT_EQ(1U, store().containersForUser(501, dataApplication, false)->size());
 
-    const auto wrongUser = OSTContainerCache::sharedInstance().containerForUser(501, dataSystem, "a", false);
+    const auto wrongUser = OSTContainerCache::sharedInstance().containerForUser({501, dataSystem, "a"});
     ASSERT_FALSE(wrongUser);
     EXPECT_TRUE(wrongUser.error().is(OSTErrorCode::cacheRebuildFailed));
     EXPECT_TRUE(wrongUser.error().underlyingError()->is(OSTErrorCode::invalidCacheInput));
@@ -286,14 +281,15 @@ TEST_F(ContainerStore, CacheTellsLiveAndTransientContainersApart) {
     auto& cache = OSTContainerCache::sharedInstance();
     const auto live = *lookUp("org.example.app", true);
     const auto transient = *lookUp("org.example.app", true, true);
-    EXPECT_EQ(live->url, cache.containerForUser(501, dataApplication, "org.example.app", live->uuid)->url);
-    const auto found = cache.containerForUser(501, dataApplication, "org.example.app", transient->uuid);
+    const OSTContainerName name = live->name();
+    EXPECT_EQ(live->url, cache.containerForUser(name, live->uuid)->url);
+    const auto found = cache.containerForUser(name, transient->uuid);
     EXPECT_EQ(transient->url, found->url);
     EXPECT_TRUE(found->transient);
-    EXPECT_FALSE(cache.containerForUser(501, dataApplication, "org.example.app", platform::UUID::generate()));
+    EXPECT_FALSE(cache.containerForUser(name, platform::UUID::generate()));
 
-    ASSERT_TRUE(cache.removeContainerForUser(501, dataApplication, "org.example.app", true));
-    ASSERT_TRUE(cache.removeContainerForUser(501, dataApplication, "org.example.app", true)) << "absent is no error";
+    ASSERT_TRUE(cache.removeContainerForUser(transient->name()));
+    ASSERT_TRUE(cache.removeContainerForUser(transient->name())) << "absent is no error";
     EXPECT_TRUE(cache.allContainerIdentifiersForUser(501, dataApplication, true)->empty());
     EXPECT_EQ(std::vector<std::string>{"org.example.app"},
               *cache.allContainerIdentifiersForUser(501, dataApplication, false));

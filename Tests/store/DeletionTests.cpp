@@ -28,11 +28,11 @@ protected:
             add(deletion, record->uuid, record->identifier, record->containerClass);
         return deletion;
     }
-    static void add(OSTDeletion& deletion, std::optional<UUID> uuid, std::optional<std::string> identifier,
+    static void add(OSTDeletion& deletion, std::optional<UUID> uuid, std::optional<std::string_view> identifier,
                     OSTContainerClass containerClass) {
         deletion.userIds.push_back(userOf(containerClass));
         deletion.uuids.push_back(uuid);
-        deletion.identifiers.push_back(std::move(identifier));
+        deletion.identifiers.push_back(identifier);
         deletion.classes.push_back(containerClass);
     }
     /// The code of an operation: 1 for success.
@@ -88,15 +88,14 @@ TEST_F(Deletion, EntriesThatNameNoContainerArePassedOver) {
 
 TEST_F(Deletion, UserThatIsMissingIsAnExceptionThatLeavesNoLock) {
     const auto one = make(dataApplication, "one");
-    auto deletion = deletionOf({one, make(dataApplication, "two")});
+    const auto two = make(dataApplication, "two");
+    auto deletion = deletionOf({one, two});
     deletion.userIds.pop_back();
     EXPECT_EQ(40, stage(deletion));
     EXPECT_FALSE(cached(dataApplication, "one"));
     EXPECT_TRUE(cached(dataApplication, "two"));
     const OSTAllIdentifiersLock lock(OSTLockKind::writing);
-    deletion = deletionOf({cached(dataApplication, "two")});
-    deletion.useLocking = false;
-    EXPECT_EQ(1, stage(deletion)) << "who holds the lock stages without";
+    EXPECT_EQ(1, codeOf(store().stageForDeleteContainer(*two, false))) << "who holds the lock stages without";
 }
 
 TEST_F(Deletion, SandboxForgetsWhatIsStaged) {
@@ -186,7 +185,7 @@ TEST_F(Deletion, WhatCannotBeMovedIsRemovedAndWhatCannotBeRemovedStays) {
 
 TEST_F(Deletion, OneContainerIsLookedUpAndStaged) {
     const auto remove = [](std::uint32_t user, std::optional<std::string_view> identifier, bool transient = false) {
-        return codeOf(store().deleteContainerForUser(user, identifier, dataApplication, transient));
+        return codeOf(store().deleteContainerForUser({user, dataApplication, identifier, transient}));
     };
     EXPECT_EQ(21, remove(501, "a"));
     const auto live = make(dataApplication, "a");

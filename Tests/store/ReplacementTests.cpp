@@ -47,9 +47,9 @@ protected:
     static OSTReplacement replacementOf(const OSTMetadataRecord& old, const OSTMetadataRecord& fresh,
                                         bool preserveOldUUID = false) {
         const auto side = [](const OSTMetadataRecord& record) {
-            return OSTReplacementSide{record->uuid, record->uid, record->identifier, record->containerClass};
+            return OSTContainerReference{record->name(), record->uuid};
         };
-        return {.oldContainer = old ? side(old) : OSTReplacementSide{},
+        return {.oldContainer = old ? side(old) : OSTContainerReference{},
                 .newContainer = side(fresh),
                 .preserveOldUUID = preserveOldUUID};
     }
@@ -106,7 +106,9 @@ TEST_F(Replacement, PutsTheNewContainerInThePlaceOfTheOldOne) {
 
 TEST_F(Replacement, StartsAPassOnlyWhenAskedTo) {
     for (const bool start : {false, true}) {
-        auto replacement = replacementOf(make(dataApplication, "a"), make(dataApplication, "a", true));
+        const auto old = make(dataApplication, "a");
+        const auto fresh = make(dataApplication, "a", true);
+        auto replacement = replacementOf(old, fresh);
         replacement.startDeletionThread = start;
         EXPECT_EQ(1, replace(replacement));
         OSTDeathRowQueue().sync([] {});
@@ -180,12 +182,14 @@ TEST_F(Replacement, RefusesWhatDoesNotGoTogether) {
     };
     const Case checkedFirst[] = {
         {11, changed([](auto& r) { r.newContainer.uuid.reset(); })},
-        {11, changed([](auto& r) { r.newContainer.containerClass = undefined; })},
-        {11, changed([](auto& r) { r.newContainer.containerClass = max; })},
-        {11, changed([](auto& r) { r.oldContainer.containerClass = max; })},
+        {11, changed([](auto& r) { r.newContainer.name.containerClass = undefined; })},
+        {11, changed([](auto& r) { r.newContainer.name.containerClass = max; })},
+        {11, changed([](auto& r) { r.oldContainer.name.containerClass = max; })},
         {11, changed([](auto& r) { r.oldContainer = {}, r.preserveOldUUID = true; })},
-        {23, changed([](auto& r) { r.newContainer.containerClass = dataVPNPlugin, r.newContainer.userId = 502; })},
-        {56, changed([](auto& r) { r.newContainer.userId = 502; })},
+        {23, changed([](auto& r) {
+             r.newContainer.name.containerClass = dataVPNPlugin, r.newContainer.name.userId = 502;
+         })},
+        {56, changed([](auto& r) { r.newContainer.name.userId = 502; })},
     };
     {
         const OSTAllIdentifiersLock lock(OSTLockKind::writing);
@@ -194,9 +198,9 @@ TEST_F(Replacement, RefusesWhatDoesNotGoTogether) {
     }
     const Case cases[] = {
         {21, changed([](auto& r) { r.oldContainer.uuid = UUID::generate(); })},
-        {21, changed([](auto& r) { r.oldContainer.identifier.reset(); })},
+        {21, changed([](auto& r) { r.oldContainer.name.identifier.reset(); })},
         {21, changed([](auto& r) { r.newContainer.uuid = UUID::generate(); })},
-        {21, changed([](auto& r) { r.newContainer.identifier = "old"; })},
+        {21, changed([](auto& r) { r.newContainer.name.identifier = "old"; })},
         {22, replacementOf(old, old)},
         {22, replacementOf(fresh, fresh, true)},
     };

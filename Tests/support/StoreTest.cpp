@@ -22,11 +22,8 @@ std::uint32_t StoreTest::userOf(OSTContainerClass containerClass) {
 }
 
 OSTMetadataRecord StoreTest::make(OSTContainerClass containerClass, std::string_view identifier, bool transient) {
-    const auto made = store().createOrLookupContainerForUser({.userId = userOf(containerClass),
-                                                              .identifier = identifier,
-                                                              .containerClass = containerClass,
-                                                              .transient = transient,
-                                                              .createIfNecessary = true});
+    const auto made = store().createOrLookupContainerForUser(
+        {.name = {userOf(containerClass), containerClass, identifier, transient}, .createIfNecessary = true});
     if (!made)
         throw std::runtime_error("no container for " + std::string(identifier));
     writeFile(fs::path((*made)->url) / identifier, identifier);
@@ -34,8 +31,8 @@ OSTMetadataRecord StoreTest::make(OSTContainerClass containerClass, std::string_
 }
 
 OSTMetadataRecord StoreTest::cached(OSTContainerClass containerClass, std::string_view identifier, bool transient) {
-    const auto found = OSTContainerCache::sharedInstance().containerForUser(userOf(containerClass), containerClass,
-                                                                            identifier, transient);
+    const auto found = OSTContainerCache::sharedInstance().containerForUser(
+        {userOf(containerClass), containerClass, identifier, transient});
     return found ? *found : nullptr;
 }
 
