@@ -157,7 +157,7 @@ using LookupResult = std::expected<OSTMetadataRecord, OSTErrorCode>;
 
 LookupResult lookUp(std::uint32_t userId, std::string_view identifier, OSTContainerClass containerClass) {
     return OSTClientConnection::sharedClientConnection().createOrLookupContainerForUser(
-        {.userId = userId, .identifier = identifier, .containerClass = containerClass, .createIfNecessary = true});
+        {.name = {userId, containerClass, identifier}, .createIfNecessary = true});
 }
 
 /// The class of the data container: what the mapping knows, seen beside what the sandbox says.
