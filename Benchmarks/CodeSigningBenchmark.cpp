@@ -160,7 +160,7 @@ std::string lookUpOf(unsigned number) {
         encoder.key("ContainerClass");
         encoder.unsignedNumber(static_cast<std::uint64_t>(ContainerClass::dataApplication));
         encoder.key("UserID");
-        encoder.unsignedNumber(ostrand::currentUser);
+        encoder.unsignedNumber(ost::OSTCurrentUserPlaceholder);
         encoder.key("Identifier");
         encoder.text(identifierOf(number));
         encoder.key("CreateIfNecessary");

@@ -30,7 +30,7 @@ std::string lookUpRequest() {
         encoder.key("ContainerClass");
         encoder.unsignedNumber(static_cast<std::uint64_t>(ContainerClass::dataApplication));
         encoder.key("UserID");
-        encoder.unsignedNumber(ostrand::currentUser);
+        encoder.unsignedNumber(ost::OSTCurrentUserPlaceholder);
         encoder.key("Transient");
         encoder.boolean(false);
         encoder.key("Identifier");

@@ -1,5 +1,6 @@
 #include "Client/CodeSigning.h"
 
+#include "Protocol/OSTKeys.h"
 #include "platform/base/Try.h"
 #include "platform/codec/IPCValue.h"
 
@@ -7,26 +8,20 @@
 
 namespace ostrand {
 
+using ost::OSTCommand;
 using ost::OSTDictionary;
 using ost::platform::CBORItem;
 
+namespace optionKey = ost::optionKey;
+namespace replyKey = ost::replyKey;
+namespace requestKey = ost::requestKey;
+
 namespace {
 
-enum Command : std::uint64_t {
-    groupPathsCommand = 13,
-    groupIdentifiersCommand = 14,
-    systemPathCommand = 15,
-    systemGroupPathsCommand = 16,
-    systemGroupPathCommand = 17,
-    registerCommand = 18,
-    infoCommand = 19,
-    invalidateCommand = 20,
-};
-
-Request requestFor(Command command, const std::optional<std::string>& identifier) {
+Request requestFor(OSTCommand command, const std::optional<std::string>& identifier) {
     Request request(command);
     if (identifier)
-        request.key("Identifier").text(*identifier);
+        request.key(requestKey::identifier).text(*identifier);
     return request;
 }
 
@@ -44,7 +39,7 @@ Result<void> done(Connection& connection, const Request& request) {
 
 Result<GroupPaths> pathsFrom(Connection& connection, const Request& request) {
     const auto reply = OST_TRY(connection.call(request));
-    const auto dictionary = reply.find("ReplyGroupContainerDict");
+    const auto dictionary = reply.find(replyKey::groupContainers);
     if (!dictionary)
         return incomprehensible();
     GroupPaths paths;
@@ -59,7 +54,7 @@ Result<GroupPaths> pathsFrom(Connection& connection, const Request& request) {
 
 Result<std::string> pathFrom(Connection& connection, const Request& request) {
     const auto reply = OST_TRY(connection.call(request));
-    return std::string(OST_TRY(reply.promised("ReplyPath", &CBORItem::asText)));
+    return std::string(OST_TRY(reply.promised(replyKey::path, &CBORItem::asText)));
 }
 
 } // namespace
@@ -67,30 +62,30 @@ Result<std::string> pathFrom(Connection& connection, const Request& request) {
 OSTDictionary RegistrationOptions::dictionary() const {
     OSTDictionary dictionary;
     if (dataContainerClass != 0)
-        dictionary.set("com.tamarok.Ostrand.DataContainerClass", dataContainerClass);
+        dictionary.set(optionKey::dataContainerClass, dataContainerClass);
     if (parent)
-        dictionary.set("com.tamarok.Ostrand.ParentBundleID", *parent);
+        dictionary.set(optionKey::parentBundleIdentifier, *parent);
     if (placeholder)
-        dictionary.set("com.tamarok.Ostrand.PlaceholderEntitlements", true);
+        dictionary.set(optionKey::placeholder, true);
     if (byCaller)
-        dictionary.set("RegByCaller", true);
+        dictionary.set(optionKey::registeredByCaller, true);
     return dictionary;
 }
 
 Result<void> registerCodeSigning(Connection& connection, const Registration& registration) {
-    auto request = requestFor(registerCommand, registration.identifier);
-    addDictionary(request, "CodeSigningInfo", registration.info);
-    addDictionary(request, "OptionsDictionary", registration.options);
+    auto request = requestFor(OSTCommand::registerCodeSigning, registration.identifier);
+    addDictionary(request, requestKey::codeSigningInfo, registration.info);
+    addDictionary(request, requestKey::optionsDictionary, registration.options);
     return done(connection, request);
 }
 
 Result<void> removeCodeSigning(Connection& connection, const std::string& identifier) {
-    return done(connection, requestFor(registerCommand, identifier));
+    return done(connection, requestFor(OSTCommand::registerCodeSigning, identifier));
 }
 
 Result<OSTDictionary> codeSigningInfo(Connection& connection, const std::string& identifier) {
-    const auto reply = OST_TRY(connection.call(requestFor(infoCommand, identifier)));
-    const auto item = reply.find("ReplyInfoDictionary");
+    const auto reply = OST_TRY(connection.call(requestFor(OSTCommand::codeSigningInfo, identifier)));
+    const auto item = reply.find(replyKey::infoDictionary);
     const auto value = item ? ost::platform::propertyListValue(*item) : std::nullopt;
     if (!value || !value->asDictionary())
         return incomprehensible();
@@ -98,26 +93,26 @@ Result<OSTDictionary> codeSigningInfo(Connection& connection, const std::string&
 }
 
 Result<void> invalidateCodeSigningWithoutBundle(Connection& connection) {
-    return done(connection, Request(invalidateCommand));
+    return done(connection, Request(OSTCommand::invalidateCodeSigning));
 }
 
 Result<GroupPaths> groupContainerPaths(Connection& connection, std::uint64_t user,
                                        const std::optional<std::string>& identifier) {
-    auto request = requestFor(groupPathsCommand, identifier);
-    request.key("UserID").unsignedNumber(user);
+    auto request = requestFor(OSTCommand::groupContainerPaths, identifier);
+    request.key(requestKey::container.userId).unsignedNumber(user);
     return pathsFrom(connection, request);
 }
 
 Result<GroupPaths> systemGroupContainerPaths(Connection& connection, const std::optional<std::string>& identifier) {
-    return pathsFrom(connection, requestFor(systemGroupPathsCommand, identifier));
+    return pathsFrom(connection, requestFor(OSTCommand::systemGroupContainerPaths, identifier));
 }
 
 Result<std::vector<std::string>> groupIdentifiers(Connection& connection, std::uint64_t user,
                                                   const std::optional<std::string>& identifier) {
-    auto request = requestFor(groupIdentifiersCommand, identifier);
-    request.key("UserID").unsignedNumber(user);
+    auto request = requestFor(OSTCommand::groupIdentifiers, identifier);
+    request.key(requestKey::container.userId).unsignedNumber(user);
     const auto reply = OST_TRY(connection.call(request));
-    const auto array = reply.find("ReplyGroupIdentifiersArray");
+    const auto array = reply.find(replyKey::groupIdentifiers);
     if (!array)
         return incomprehensible();
     std::vector<std::string> groups;
@@ -132,13 +127,13 @@ Result<std::vector<std::string>> groupIdentifiers(Connection& connection, std::u
 }
 
 Result<std::string> systemContainerPath(Connection& connection, const std::optional<std::string>& identifier) {
-    return pathFrom(connection, requestFor(systemPathCommand, identifier));
+    return pathFrom(connection, requestFor(OSTCommand::systemContainerPath, identifier));
 }
 
 Result<std::string> systemGroupContainerPath(Connection& connection, const std::string& group,
                                              const std::optional<std::string>& identifier) {
-    auto request = requestFor(systemGroupPathCommand, identifier);
-    request.key("GroupIdentifier").text(group);
+    auto request = requestFor(OSTCommand::systemGroupContainerPath, identifier);
+    request.key(requestKey::groupIdentifier).text(group);
     return pathFrom(connection, request);
 }
 

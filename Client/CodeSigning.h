@@ -1,7 +1,6 @@
 #pragma once
 
 #include "Client/Connection.h"
-#include "Client/ContainerClass.h"
 #include "platform/base/OSTValue.h"
 
 #include <map>

@@ -1,5 +1,8 @@
 #include "Client/Connection.h"
 
+#include "Protocol/OSTErrorCode.h"
+#include "Protocol/OSTKeys.h"
+#include "Protocol/OSTServices.h"
 #include "platform/base/Assert.h"
 #include "platform/base/Path.h"
 #include "platform/base/Try.h"
@@ -20,10 +23,10 @@ using ost::platform::FileDescriptor;
 using ost::platform::IPCFrame;
 using ost::platform::IPCFrameHeader;
 
-namespace {
+namespace replyKey = ost::replyKey;
+namespace requestKey = ost::requestKey;
 
-constexpr std::string_view runDirectory = "private/var/run";
-constexpr std::string_view serviceName = "com.tamarok.ostrandd";
+namespace {
 
 /// What one system call takes in; replies are short, listings come in several such pieces.
 constexpr std::size_t receiveSize = 16 * 1024;
@@ -36,14 +39,15 @@ bool meansClosed(int errnoValue) { return errnoValue == EPIPE || errnoValue == E
 /// An address that is too long for a socket is reached through a descriptor of its directory, which `directory` keeps
 /// open.
 Result<sockaddr_un> serviceAddress(const std::string& device, FileDescriptor& directory) {
-    const auto directoryPath = ost::platform::pathByAppending(device, runDirectory);
-    auto path = ost::platform::pathByAppending(directoryPath, serviceName);
+    const auto directoryPath =
+        ost::platform::pathByAppending(device, std::string_view(ost::OSTServiceSocketDirectory).substr(1));
+    auto path = ost::platform::pathByAppending(directoryPath, ost::OSTServiceName);
     sockaddr_un address{};
     if (path.size() >= sizeof address.sun_path) {
         directory.reset(::open(directoryPath.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
         if (!directory)
             return transportError(errno);
-        path = ost::platform::pathByAppending("/proc/self/fd/" + std::to_string(directory.get()), serviceName);
+        path = ost::platform::pathByAppending("/proc/self/fd/" + std::to_string(directory.get()), ost::OSTServiceName);
     }
     address.sun_family = AF_UNIX;
     path.copy(address.sun_path, sizeof address.sun_path - 1);
@@ -52,7 +56,9 @@ Result<sockaddr_un> serviceAddress(const std::string& device, FileDescriptor& di
 
 } // namespace
 
-Request::Request(std::uint64_t command) { key("Command").unsignedNumber(command); }
+Request::Request(ost::OSTCommand command) {
+    key(requestKey::command).unsignedNumber(static_cast<std::uint64_t>(command));
+}
 
 CBOREncoder Request::key(std::string_view key) {
     ++_entryCount;
@@ -143,11 +149,11 @@ Result<Reply> Connection::_receive(std::uint32_t requestNumber, const Deadline& 
         if (auto arrived = _arrived.extract(requestNumber)) {
             auto frame = std::make_unique<const IPCFrame>(std::move(arrived.mapped()));
             const auto root = ost::platform::validateCBOR(frame->payload());
-            const auto answer = root ? root->find("ReplyError") : std::nullopt;
+            const auto answer = root ? root->find(replyKey::error) : std::nullopt;
             const auto code = answer ? answer->asUnsigned() : std::nullopt;
             if (!code)
                 return transportError(EBADMSG);
-            if (*code != 1)
+            if (*code != static_cast<std::uint64_t>(ost::OSTErrorCode::success))
                 return std::unexpected(Error::failed(*code));
             return Reply(std::move(frame), *root);
         }

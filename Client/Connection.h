@@ -1,6 +1,7 @@
 #pragma once
 
 #include "Client/Error.h"
+#include "Protocol/OSTCommand.h"
 #include "platform/base/FileDescriptor.h"
 #include "platform/codec/CBOR.h"
 #include "platform/ipc/IPCFrame.h"
@@ -21,7 +22,7 @@ namespace ostrand {
 /// be sent more than once.
 class Request {
 public:
-    explicit Request(std::uint64_t command);
+    explicit Request(ost::OSTCommand command);
 
     /// Begins the entry of `key`; the caller writes exactly one value, at once:
     /// `request.key("UserID").unsignedNumber(501)`. A key that stands twice, or a text that is no UTF-8, makes the

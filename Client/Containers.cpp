@@ -1,38 +1,34 @@
 #include "Client/Containers.h"
 
+#include "Protocol/OSTKeys.h"
 #include "platform/base/Try.h"
 
 #include <cerrno>
 
 namespace ostrand {
 
+using ost::OSTCommand;
 using ost::platform::CBORItem;
+
+namespace replyKey = ost::replyKey;
+namespace requestKey = ost::requestKey;
 
 namespace {
 
-enum Command : std::uint64_t {
-    createOrLookupCommand = 0,
-    listCommand = 1,
-    replaceCommand = 2,
-    stageForDeletionCommand = 3,
-    destroyDeathRowCommand = 4,
-    deleteCommand = 10,
-};
-
-Request requestFor(Command command, const ContainerRequest& about) {
+Request requestFor(OSTCommand command, const ContainerRequest& about) {
     Request request(command);
-    request.key("ContainerClass").unsignedNumber(static_cast<std::uint64_t>(about.containerClass));
-    request.key("UserID").unsignedNumber(about.user);
-    request.key("Transient").boolean(about.transient);
+    request.key(requestKey::container.containerClass).unsignedNumber(static_cast<std::uint64_t>(about.containerClass));
+    request.key(requestKey::container.userId).unsignedNumber(about.user);
+    request.key(requestKey::transient).boolean(about.transient);
     return request;
 }
 
-/// One of the two containers of a replacement; `side` is "Old" or "New".
-void addSide(Request& request, const std::string& side, const ContainerReference& container) {
-    request.key(side + "ContainerUUID").uuid(container.uuid);
-    request.key(side + "ContainerClass").unsignedNumber(static_cast<std::uint64_t>(container.containerClass));
-    request.key(side + "ContainerUserID").unsignedNumber(container.user);
-    request.key(side + "Identifier").text(container.identifier);
+/// One of the two containers of a replacement.
+void addSide(Request& request, const requestKey::Container& keys, const ContainerReference& container) {
+    request.key(keys.uuid).uuid(container.uuid);
+    request.key(keys.containerClass).unsignedNumber(static_cast<std::uint64_t>(container.containerClass));
+    request.key(keys.userId).unsignedNumber(container.user);
+    request.key(keys.identifier).text(container.identifier);
 }
 
 Result<void> withoutAnswer(const Result<Reply>& reply) {
@@ -44,23 +40,23 @@ Result<void> withoutAnswer(const Result<Reply>& reply) {
 } // namespace
 
 Result<Container> createOrLookup(Connection& connection, const ContainerRequest& about, WhenMissing whenMissing) {
-    auto request = requestFor(createOrLookupCommand, about);
+    auto request = requestFor(OSTCommand::createOrLookup, about);
     if (about.identifier)
-        request.key("Identifier").text(*about.identifier);
-    request.key("CreateIfNecessary").boolean(whenMissing == WhenMissing::create);
+        request.key(requestKey::identifier).text(*about.identifier);
+    request.key(requestKey::createIfNecessary).boolean(whenMissing == WhenMissing::create);
 
     const auto reply = OST_TRY(connection.call(request));
-    const auto identifier = OST_TRY(reply.promised("ReplyIdentifier", &CBORItem::asText));
-    const auto uuid = OST_TRY(reply.promised("ReplyUUID", &CBORItem::asUUID));
-    const auto path = OST_TRY(reply.promised("ReplyPath", &CBORItem::asText));
-    const bool existed = OST_TRY(reply.promised("ReplyExisted", &CBORItem::asBoolean));
+    const auto identifier = OST_TRY(reply.promised(replyKey::identifier, &CBORItem::asText));
+    const auto uuid = OST_TRY(reply.promised(replyKey::uuid, &CBORItem::asUUID));
+    const auto path = OST_TRY(reply.promised(replyKey::path, &CBORItem::asText));
+    const bool existed = OST_TRY(reply.promised(replyKey::existed, &CBORItem::asBoolean));
     return Container{std::string(identifier), uuid, std::string(path), existed};
 }
 
 Result<std::vector<ListedContainer>> list(Connection& connection, const ContainerRequest& about) {
-    const auto reply = OST_TRY(connection.call(requestFor(listCommand, about)));
-    const auto identifiers = reply.find("ReplyIdsArray");
-    const auto uuids = reply.find("ReplyUUIDsArray");
+    const auto reply = OST_TRY(connection.call(requestFor(OSTCommand::list, about)));
+    const auto identifiers = reply.find(replyKey::identifiers);
+    const auto uuids = reply.find(replyKey::uuids);
     if (!identifiers || !uuids || identifiers->count() != uuids->count())
         return std::unexpected(Error::transport(EBADMSG));
 
@@ -78,39 +74,41 @@ Result<std::vector<ListedContainer>> list(Connection& connection, const Containe
 }
 
 Result<void> stageForDeletion(Connection& connection, const std::vector<ContainerReference>& containers) {
-    Request request(stageForDeletionCommand);
+    Request request(OSTCommand::stageForDelete);
     const auto array = [&](std::string_view key, auto writeElement) {
         auto elements = request.key(key);
         elements.beginArray(containers.size());
         for (const auto& container : containers)
             writeElement(elements, container);
     };
-    array("ContainerClassesArray", [](auto& elements, const auto& container) {
+    array(requestKey::containers.containerClass, [](auto& elements, const auto& container) {
         elements.unsignedNumber(static_cast<std::uint64_t>(container.containerClass));
     });
-    array("UUIDsArray", [](auto& elements, const auto& container) { elements.uuid(container.uuid); });
-    array("UserIDsArray", [](auto& elements, const auto& container) { elements.unsignedNumber(container.user); });
-    array("IdentifiersArray", [](auto& elements, const auto& container) { elements.text(container.identifier); });
+    array(requestKey::containers.uuid, [](auto& elements, const auto& container) { elements.uuid(container.uuid); });
+    array(requestKey::containers.userId,
+          [](auto& elements, const auto& container) { elements.unsignedNumber(container.user); });
+    array(requestKey::containers.identifier,
+          [](auto& elements, const auto& container) { elements.text(container.identifier); });
     return withoutAnswer(connection.call(request));
 }
 
 Result<void> deleteContainer(Connection& connection, const ContainerRequest& about) {
-    auto request = requestFor(deleteCommand, about);
+    auto request = requestFor(OSTCommand::deleteContainer, about);
     if (about.identifier)
-        request.key("Identifier").text(*about.identifier);
+        request.key(requestKey::identifier).text(*about.identifier);
     return withoutAnswer(connection.call(request));
 }
 
 Result<void> destroyDeathRow(Connection& connection) {
-    return withoutAnswer(connection.call(Request(destroyDeathRowCommand)));
+    return withoutAnswer(connection.call(Request(OSTCommand::destroyDeathRow)));
 }
 
 Result<void> replace(Connection& connection, const std::optional<ContainerReference>& oldContainer,
                      const ContainerReference& newContainer) {
-    Request request(replaceCommand);
+    Request request(OSTCommand::replace);
     if (oldContainer)
-        addSide(request, "Old", *oldContainer);
-    addSide(request, "New", newContainer);
+        addSide(request, requestKey::oldContainer, *oldContainer);
+    addSide(request, requestKey::newContainer, newContainer);
     return withoutAnswer(connection.call(request));
 }
 

@@ -1,7 +1,7 @@
 #pragma once
 
 #include "Client/Connection.h"
-#include "Client/ContainerClass.h"
+#include "Protocol/OSTContainerClass.h"
 #include "platform/base/UUID.h"
 
 #include <optional>
@@ -10,10 +10,14 @@
 
 namespace ostrand {
 
+/// The kinds of container. The daemon takes any number and refuses what it does not know, so other values may be cast
+/// to this type and sent.
+using ContainerClass = ost::OSTContainerClass;
+
 /// The container that a request is about.
 struct ContainerRequest {
     ContainerClass containerClass;
-    std::uint64_t user = currentUser;
+    std::uint64_t user = ost::OSTCurrentUserPlaceholder;
     std::optional<std::string> identifier; ///< absent: the caller's own, from its signature
     bool transient = false;
 };
@@ -35,7 +39,7 @@ struct ListedContainer {
 /// A container that its lister knows by its UUID.
 struct ContainerReference {
     ContainerClass containerClass;
-    std::uint64_t user = currentUser;
+    std::uint64_t user = ost::OSTCurrentUserPlaceholder;
     std::string identifier;
     ost::platform::UUID uuid;
 };

@@ -1,5 +1,7 @@
 #include "Device/DeviceImage.h"
 
+#include "Protocol/OSTServices.h"
+#include "Protocol/OSTUserId.h"
 #include "platform/base/Try.h"
 
 #include <fcntl.h>
@@ -21,9 +23,11 @@ using platform::FileDescriptor;
 
 namespace {
 
-constexpr unsigned rootUser = 0;
-constexpr unsigned installerUser = 33;
+/// The user of the account "mobile".
 constexpr unsigned mobileUser = 501;
+
+/// Paths in an image begin at its root.
+constexpr const char* runDirectory = OSTServiceSocketDirectory + 1;
 
 struct Directory {
     const char* name;
@@ -34,18 +38,18 @@ struct Directory {
 // Parents first. The staging area and death row lie in root's home: users may not pass it. The other homes are open,
 // because the containers in them have modes of their own, and bundles are for everybody.
 constexpr std::array directories{
-    Directory{"dev", 0755, rootUser},
-    Directory{"dev/shm", 0755, rootUser},
-    Directory{"etc", 0755, rootUser},
-    Directory{"private", 0755, rootUser},
-    Directory{"private/var", 0755, rootUser},
-    Directory{"private/var/db", 0755, rootUser},
+    Directory{"dev", 0755, OSTRootUserId},
+    Directory{"dev/shm", 0755, OSTRootUserId},
+    Directory{"etc", 0755, OSTRootUserId},
+    Directory{"private", 0755, OSTRootUserId},
+    Directory{"private/var", 0755, OSTRootUserId},
+    Directory{"private/var/db", 0755, OSTRootUserId},
     Directory{"private/var/mobile", 0755, mobileUser},
-    Directory{"private/var/root", 0700, rootUser},
-    Directory{"private/var/run", 0755, rootUser},
-    Directory{"private/var/tessalyd", 0755, installerUser},
-    Directory{"proc", 0555, rootUser},
-    Directory{"tmp", 01777, rootUser},
+    Directory{"private/var/root", 0700, OSTRootUserId},
+    Directory{runDirectory, 0755, OSTRootUserId},
+    Directory{"private/var/tessalyd", 0755, OSTInstallerUserId},
+    Directory{"proc", 0555, OSTRootUserId},
+    Directory{"tmp", 01777, OSTRootUserId},
 };
 
 struct File {
@@ -182,7 +186,7 @@ Result<void> DeviceImage::mountHostLibraries() const {
         const std::string source = std::string("/") + name;
         if (::access(source.c_str(), F_OK) != 0)
             continue;
-        OST_TRY(_makeDirectory(name, 0755, rootUser));
+        OST_TRY(_makeDirectory(name, 0755, OSTRootUserId));
         OST_TRY(_mount(source.c_str(), name, nullptr, MS_BIND, nullptr));
         // A bind mount takes its flags only when it is mounted again; the directory is by now the mounted one.
         OST_TRY(_mount(nullptr, name, nullptr, MS_REMOUNT | MS_BIND | MS_RDONLY | MS_NOSUID | MS_NODEV, nullptr));
@@ -191,14 +195,14 @@ Result<void> DeviceImage::mountHostLibraries() const {
 }
 
 Result<FileDescriptor> DeviceImage::openEmptiedRunDirectory() const {
-    FileDescriptor directory = OST_TRY(_openDirectory("private/var/run"));
+    FileDescriptor directory = OST_TRY(_openDirectory(runDirectory));
     std::error_code error;
     for (std::filesystem::directory_iterator entry(procPathOf(directory), error), end; !error && entry != end;
          entry.increment(error))
         if (std::filesystem::remove_all(entry->path(), error); error)
             break;
     if (error)
-        return std::unexpected(Failure{"empty " + (_path / "private/var/run").string(), error.value()});
+        return std::unexpected(Failure{"empty " + (_path / runDirectory).string(), error.value()});
     return directory;
 }
 

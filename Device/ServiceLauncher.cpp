@@ -1,5 +1,6 @@
 #include "Device/ServiceLauncher.h"
 
+#include "Protocol/OSTServices.h"
 #include "platform/base/Try.h"
 
 #include <elf.h>
@@ -131,8 +132,7 @@ Result<ServiceLauncher> ServiceLauncher::prepare(const BootOptions& options) {
     if (isDynamicallyLinked(launcher._daemonProgram))
         OST_TRY(launcher._image.mountHostLibraries());
     launcher._runDirectory = OST_TRY(launcher._image.openEmptiedRunDirectory());
-    launcher._listeners = {Listener{"com.tamarok.ostrandd", SOCK_STREAM},
-                           Listener{"com.tamarok.ostrandd.upcall", SOCK_SEQPACKET}};
+    launcher._listeners = {Listener{OSTServiceName, SOCK_STREAM}, Listener{OSTKernServiceName, SOCK_SEQPACKET}};
     for (Listener& listener : launcher._listeners)
         OST_TRY(launcher._listen(listener));
     return launcher;

@@ -38,7 +38,7 @@ BootedDevice::BootedDevice(const std::filesystem::path& image)
         std::this_thread::sleep_for(std::chrono::milliseconds(1));
     }
     require(ostrand::list(*connection, {.containerClass = ostrand::ContainerClass::sharedSystemGroup,
-                                        .user = ostrand::systemContainerUser,
+                                        .user = ost::OSTSystemUserId,
                                         .identifier = {}}),
             "The daemon does not serve: " + contentOf(messagesOf(image)));
 }

@@ -87,7 +87,7 @@ Outcome invalidate(const Arguments& arguments) {
 
 std::expected<std::uint64_t, Failure> userOf(const Arguments& arguments) {
     const auto text = arguments.value(userOption.name);
-    return text ? userNamed(*text, deviceDirectory(arguments)) : currentUser;
+    return text ? userNamed(*text, deviceDirectory(arguments)) : ost::OSTCurrentUserPlaceholder;
 }
 
 Outcome groupPaths(const Arguments& arguments) {

@@ -1,5 +1,7 @@
 #include "Client/ctl/Commands.h"
 #include "Client/ctl/Values.h"
+#include "Protocol/OSTEntitlements.h"
+#include "Protocol/OSTKeys.h"
 #include "platform/base/Try.h"
 #include "platform/device/CodeSignature.h"
 
@@ -12,9 +14,6 @@ namespace {
 
 using ost::OSTDictionary;
 using ost::platform::FileDescriptor;
-
-/// Entitlements whose names begin so are rights over the daemon itself.
-constexpr std::string_view privatePrefix = "com.tamarok.private.Ostrand.";
 
 constexpr Operand fileOperand{"FILE", "the program's executable file, a path of the host"};
 constexpr Option identifierOption{"identifier", "ID", "the program's code-signing identifier"};
@@ -35,10 +34,10 @@ std::expected<OSTDictionary, Failure> entitlementsOf(const Arguments& arguments)
 std::expected<OSTDictionary, Failure> signatureOf(const Arguments& arguments) {
     OSTDictionary signature;
     if (auto identifier = arguments.value(identifierOption.name))
-        signature.set("Identifier", *std::move(identifier));
+        signature.set(ost::signatureKey::identifier, *std::move(identifier));
     if (arguments.has(entitlementsOption.name) || arguments.has(entitlementOption.name)) {
         auto entitlements = OST_TRY(entitlementsOf(arguments));
-        signature.set("Entitlements", std::move(entitlements));
+        signature.set(ost::signatureKey::entitlements, std::move(entitlements));
     }
     if (signature.empty())
         return std::unexpected(Failure::usage("neither an identifier nor entitlements to sign with"));
@@ -51,11 +50,11 @@ std::string objectionTo(const struct stat& file, const OSTDictionary& signature,
         return "its owner is not root, so its signature would not count";
     if (file.st_mode & (S_IWGRP | S_IWOTH))
         return "group or others may write it, so its signature would not count";
-    const auto* const entitlements = signature.find("Entitlements");
+    const auto* const entitlements = signature.find(ost::signatureKey::entitlements);
     if (force || !entitlements || !(file.st_mode & S_IXOTH))
         return {};
     for (const auto& [key, value] : *entitlements->asDictionary())
-        if (key.starts_with(privatePrefix))
+        if (key.starts_with(ost::OSTEntitlementPrefix))
             return "others may execute it and would have the rights of " + escaped(key) +
                    "; take their permission away, or use --force";
     return {};

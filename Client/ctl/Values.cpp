@@ -9,6 +9,7 @@
 #include <memory>
 #include <optional>
 #include <pwd.h>
+#include <strings.h>
 
 namespace ostrand::ctl {
 
@@ -23,6 +24,18 @@ std::optional<std::uint64_t> numberIn(std::string_view text) {
     std::uint64_t number = 0;
     const auto [end, problem] = std::from_chars(text.data(), text.data() + text.size(), number);
     return problem == std::errc{} && end == text.data() + text.size() ? std::optional(number) : std::nullopt;
+}
+
+/// The class of that name, in any case.
+std::optional<ContainerClass> containerClassNamed(std::string_view name) {
+    const auto isNamed = [&](std::uint64_t number) {
+        const auto candidate = ost::OSTContainerClassPathComponents[number];
+        return candidate.size() == name.size() && strncasecmp(candidate.data(), name.data(), name.size()) == 0;
+    };
+    for (std::uint64_t number = 0; number < ost::OSTContainerClassPathComponents.size(); ++number)
+        if (const auto named = static_cast<ContainerClass>(number); isValidContainerClass(named) && isNamed(number))
+            return named;
+    return std::nullopt;
 }
 
 std::expected<std::string, Failure> contentOf(const std::string& path, std::size_t largest) {

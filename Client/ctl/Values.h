@@ -1,6 +1,6 @@
 #pragma once
 
-#include "Client/ContainerClass.h"
+#include "Client/Containers.h"
 #include "Client/ctl/Output.h"
 #include "platform/base/OSTValue.h"
 

@@ -41,7 +41,7 @@ OSTErrorCode OSTCodeSigningMapping::processCodeSigningInfo(const std::shared_ptr
                                                            std::optional<std::string_view> identifier,
                                                            const OSTRegistrationOptions& options) {
     if (!_available)
-        return OSTNoProcessingResult;
+        return OSTErrorCode::noProcessingResult;
     if (!identifier)
         return OSTErrorCode::noIdentifier;
     const OSTAllIdentifiersLock lock(OSTLockKind::writing);

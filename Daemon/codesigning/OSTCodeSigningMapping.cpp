@@ -134,7 +134,7 @@ OSTCodeSigningMapping::invalidateCodeSigningInfoForIdentifierAndItsChildren(std:
 
 OSTErrorCode OSTCodeSigningMapping::invalidateCodeSigningInfoForAppsWithoutBundleContainer() {
     if (!_available)
-        return OSTNoProcessingResult;
+        return OSTErrorCode::noProcessingResult;
     const OSTAllIdentifiersLock lock(OSTLockKind::writing);
     const auto result = _sync([&]() -> OSTResult<void> {
         for (auto& [identifier, entry] : _codeSigningMappingDict) {

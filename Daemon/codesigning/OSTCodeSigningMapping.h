@@ -28,9 +28,6 @@ struct OSTRegistrationOptions {
     bool placeholder = false;
 };
 
-/// What an operation that processes registrations gives when the mapping is unavailable.
-inline constexpr OSTErrorCode OSTNoProcessingResult{0};
-
 /// The entitlements that list an identifier's groups: the second one counts where the first lists none.
 struct OSTGroupKeys {
     const char* key;

@@ -1,7 +1,7 @@
 #pragma once
 
+#include "Protocol/OSTContainerClass.h"
 #include "files/OSTFileManager.h"
-#include "model/OSTContainerClass.h"
 
 #include <cstdint>
 #include <memory>

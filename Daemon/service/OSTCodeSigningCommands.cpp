@@ -14,15 +14,10 @@ namespace ost {
 
 namespace {
 
-constexpr const char* dataContainerClassOption = "com.tamarok.Ostrand.DataContainerClass";
-constexpr const char* parentBundleOption = "com.tamarok.Ostrand.ParentBundleID";
-constexpr const char* registeredByCallerOption = "RegByCaller";
-constexpr const char* placeholderOption = "com.tamarok.Ostrand.PlaceholderEntitlements";
-
 /// The user of a request about application groups, resolved for the client.
 std::expected<std::uint32_t, OSTErrorCode> groupUser(const platform::IPCRequest& request,
                                                      const OSTClientConnection& client) {
-    return validateUserId(static_cast<std::uint32_t>(request.unsignedValue("UserID")),
+    return validateUserId(static_cast<std::uint32_t>(request.unsignedValue(requestKey::container.userId)),
                           OSTContainerClass::sharedAppGroup, client.identity().clientUserId);
 }
 
@@ -32,7 +27,7 @@ OSTErrorCode replyWithGroupPaths(const platform::IPCRequest& request, platform::
         userId, client, OSTRequestedIdentifier(request, client));
     if (!paths)
         return paths.error();
-    auto dictionary = reply.encoder("ReplyGroupContainerDict");
+    auto dictionary = reply.encoder(replyKey::groupContainers);
     dictionary.beginMap(paths->size());
     for (const auto& [group, path] : *paths) {
         dictionary.key(group);
@@ -65,12 +60,12 @@ OSTRegistrationOptions optionsOf(const OSTDictionary* dictionary) {
         const auto* const value = dictionary->find(key);
         return value && value->truthValue();
     };
-    if (const auto* const containerClass = dictionary->find(dataContainerClassOption))
+    if (const auto* const containerClass = dictionary->find(optionKey::dataContainerClass))
         options.dataContainerClass = containerClass->unsignedValue().value_or(0);
-    if (const auto* const parent = dictionary->find(parentBundleOption); parent && parent->asString())
+    if (const auto* const parent = dictionary->find(optionKey::parentBundleIdentifier); parent && parent->asString())
         options.parentBundleIdentifier = *parent->asString();
-    options.registeredByCaller = isTrue(registeredByCallerOption);
-    options.placeholder = isTrue(placeholderOption);
+    options.registeredByCaller = isTrue(optionKey::registeredByCaller);
+    options.placeholder = isTrue(optionKey::placeholder);
     return options;
 }
 
@@ -108,7 +103,7 @@ OSTErrorCode OSTGroupIdentifiersCommand(const platform::IPCRequest& request, pla
         *userId, OSTRequestedIdentifier(request, client));
     if (!groups)
         return groups.error();
-    reply.set("ReplyGroupIdentifiersArray", *groups);
+    reply.set(replyKey::groupIdentifiers, *groups);
     return OSTErrorCode::success;
 }
 
@@ -122,7 +117,7 @@ OSTErrorCode OSTSystemContainerPathCommand(const platform::IPCRequest& request, 
         {.name = {OSTSystemUserId, OSTContainerClass::dataSystem, identifier}, .createIfNecessary = true});
     if (!record)
         return record.error();
-    reply.set("ReplyPath", (*record)->url);
+    reply.set(replyKey::path, (*record)->url);
     return OSTErrorCode::success;
 }
 
@@ -136,7 +131,7 @@ OSTErrorCode OSTSystemGroupContainerPathCommand(const platform::IPCRequest& requ
     constexpr const char* function = "systemGroupContainerPath";
     const auto identifier = OSTRequestedIdentifier(request, client);
     const auto& clientIdentifier = client.identity().clientBundleIdentifier;
-    const auto named = request.stringValue("GroupIdentifier");
+    const auto named = request.stringValue(requestKey::groupIdentifier);
     const std::string group(named.value_or(std::string_view()));
     const auto granted =
         clientIdentifier
@@ -157,30 +152,30 @@ OSTErrorCode OSTSystemGroupContainerPathCommand(const platform::IPCRequest& requ
                         "Did not find system group container with identifier: %@ for %@", group, identifier);
         return OSTErrorCode::notFound;
     }
-    reply.set("ReplyPath", *path);
+    reply.set(replyKey::path, *path);
     return OSTErrorCode::success;
 }
 
 OSTErrorCode OSTRegisterCodeSigningCommand(const platform::IPCRequest& request, platform::IPCReply& /*reply*/,
                                            OSTClientConnection& /*client*/) {
-    auto info = dictionaryOf(request, "CodeSigningInfo");
+    auto info = dictionaryOf(request, requestKey::codeSigningInfo);
     if (!info)
         return info.error();
-    const auto options = dictionaryOf(request, "OptionsDictionary");
+    const auto options = dictionaryOf(request, requestKey::optionsDictionary);
     if (!options)
         return options.error();
     return OSTCodeSigningMapping::sharedInstance().processCodeSigningInfo(
-        *std::move(info), request.stringValue("Identifier"), optionsOf(options->get()));
+        *std::move(info), request.stringValue(requestKey::identifier), optionsOf(options->get()));
 }
 
 OSTErrorCode OSTCodeSigningInfoCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
                                        OSTClientConnection& /*client*/) {
-    const auto identifier = request.stringValue("Identifier");
+    const auto identifier = request.stringValue(requestKey::identifier);
     const auto info =
         identifier ? OSTCodeSigningMapping::sharedInstance().getCodeSigningInfoForIdentifier(*identifier) : nullptr;
     if (!info)
         return OSTErrorCode::notFound;
-    auto encoder = reply.encoder("ReplyInfoDictionary");
+    auto encoder = reply.encoder(replyKey::infoDictionary);
     platform::encodePropertyListValue(encoder, *info);
     return OSTErrorCode::success;
 }

@@ -1,5 +1,6 @@
 #include "service/OSTCommandTable.h"
 
+#include "Protocol/OSTEntitlements.h"
 #include "service/OSTCodeSigningCommands.h"
 #include "service/OSTContainerCommands.h"
 #include "service/OSTRemovalCommands.h"
@@ -7,6 +8,9 @@
 namespace ost {
 
 namespace {
+
+using enum OSTCommand;
+using enum OSTReplyBy;
 
 constexpr auto allowed = OSTEntitlementAllowed;
 constexpr auto none = OSTEntitlementNone;
@@ -16,32 +20,32 @@ constexpr auto dataMigration = OSTEntitlementDataMigration;
 } // namespace
 
 const std::array<OSTCommandEntry, OSTCommandCount> OSTCommandTable = {{
-    {0, OSTCreateOrLookupCommand, none, OSTReplyBy::dispatcher},
-    {1, OSTListCommand, allowed, OSTReplyBy::dispatcher},
-    {2, OSTReplaceCommand, allowed, OSTReplyBy::dispatcher},
-    {3, OSTStageForDeleteCommand, allowed, OSTReplyBy::dispatcher},
-    {4, OSTDestroyDeathRowCommand, allowed, OSTReplyBy::handler},
-    {5, nullptr, allowed, OSTReplyBy::dispatcher}, // set an info value of a container
-    {6, nullptr, allowed, OSTReplyBy::dispatcher}, // get an info value of a container
-    {7, nullptr, allowed, OSTReplyBy::dispatcher}, // get a container's path, transient flag and info
-    {8, nullptr, allowed, OSTReplyBy::dispatcher}, // recreate a container's default structure
-    {9, nullptr, allowed, OSTReplyBy::dispatcher}, // regenerate a container's directory UUID
-    {10, OSTDeleteCommand, allowed, OSTReplyBy::dispatcher},
-    {11, nullptr, wipeContainer, OSTReplyBy::dispatcher}, // wipe an entitled plug-in data container
-    {12, nullptr, allowed, OSTReplyBy::dispatcher},       // wipe a data container
-    {13, OSTGroupContainerPathsCommand, none, OSTReplyBy::dispatcher},
-    {14, OSTGroupIdentifiersCommand, allowed, OSTReplyBy::dispatcher},
-    {15, OSTSystemContainerPathCommand, none, OSTReplyBy::dispatcher},
-    {16, OSTSystemGroupContainerPathsCommand, none, OSTReplyBy::dispatcher},
-    {17, OSTSystemGroupContainerPathCommand, none, OSTReplyBy::dispatcher},
-    {18, OSTRegisterCodeSigningCommand, allowed, OSTReplyBy::dispatcher},
-    {19, OSTCodeSigningInfoCommand, allowed, OSTReplyBy::dispatcher},
-    {20, OSTInvalidateCodeSigningCommand, allowed, OSTReplyBy::dispatcher},
-    {21, nullptr, allowed, OSTReplyBy::handler},          // set a data container's protection class
-    {22, nullptr, allowed, OSTReplyBy::dispatcher},       // recreate a container's default structure, as 8
-    {23, nullptr, allowed, OSTReplyBy::dispatcher},       // disk usage of a container
-    {24, nullptr, dataMigration, OSTReplyBy::dispatcher}, // run the data migration
-    {25, nullptr, allowed, OSTReplyBy::dispatcher},       // retry test
+    {createOrLookup, OSTCreateOrLookupCommand, none, dispatcher},
+    {list, OSTListCommand, allowed, dispatcher},
+    {replace, OSTReplaceCommand, allowed, dispatcher},
+    {stageForDelete, OSTStageForDeleteCommand, allowed, dispatcher},
+    {destroyDeathRow, OSTDestroyDeathRowCommand, allowed, handler},
+    {setInfoValue, nullptr, allowed, dispatcher},
+    {infoValue, nullptr, allowed, dispatcher},
+    {metadata, nullptr, allowed, dispatcher},
+    {recreateDefaultStructure, nullptr, allowed, dispatcher},
+    {regenerateDirectoryUUID, nullptr, allowed, dispatcher},
+    {deleteContainer, OSTDeleteCommand, allowed, dispatcher},
+    {wipePlugInData, nullptr, wipeContainer, dispatcher},
+    {wipeData, nullptr, allowed, dispatcher},
+    {groupContainerPaths, OSTGroupContainerPathsCommand, none, dispatcher},
+    {groupIdentifiers, OSTGroupIdentifiersCommand, allowed, dispatcher},
+    {systemContainerPath, OSTSystemContainerPathCommand, none, dispatcher},
+    {systemGroupContainerPaths, OSTSystemGroupContainerPathsCommand, none, dispatcher},
+    {systemGroupContainerPath, OSTSystemGroupContainerPathCommand, none, dispatcher},
+    {registerCodeSigning, OSTRegisterCodeSigningCommand, allowed, dispatcher},
+    {codeSigningInfo, OSTCodeSigningInfoCommand, allowed, dispatcher},
+    {invalidateCodeSigning, OSTInvalidateCodeSigningCommand, allowed, dispatcher},
+    {setDataProtection, nullptr, allowed, handler},
+    {recreateDefaultStructureAgain, nullptr, allowed, dispatcher},
+    {diskUsage, nullptr, allowed, dispatcher},
+    {performDataMigration, nullptr, dataMigration, dispatcher},
+    {retryTest, nullptr, allowed, dispatcher},
 }};
 
 } // namespace ost

@@ -1,21 +1,15 @@
 #pragma once
 
-#include "platform/base/OSTError.h"
+#include "Protocol/OSTCommand.h"
+#include "Protocol/OSTErrorCode.h"
 #include "platform/ipc/IPCMessage.h"
 #include "store/OSTClientConnection.h"
 
 #include <array>
-#include <cstddef>
 #include <cstdint>
+#include <string_view>
 
 namespace ost {
-
-/// The entitlements that commands ask for and clients hold.
-inline constexpr const char* OSTEntitlementAllowed = "com.tamarok.private.Ostrand.allowed";
-inline constexpr const char* OSTEntitlementNone = "com.tamarok.private.Ostrand.none";
-inline constexpr const char* OSTEntitlementOtherIdLookup = "com.tamarok.private.Ostrand.otherIdLookup";
-inline constexpr const char* OSTEntitlementWipeContainer = "com.tamarok.private.Ostrand.wipeContainer";
-inline constexpr const char* OSTEntitlementDataMigration = "com.tamarok.private.Ostrand.dataMigration";
 
 /// Carries a command out: reads its keys from the request, acts for the client, puts the results into the reply. Gives
 /// the reply's code.
@@ -29,13 +23,11 @@ enum class OSTReplyBy : std::uint32_t {
 };
 
 struct OSTCommandEntry {
-    std::uint64_t index;       ///< equal to the entry's place in the table
-    OSTCommandHandler handler; ///< null while there is none: the command is then refused
-    const char* entitlement;   ///< what the client must hold
+    OSTCommand command;           ///< equal to the entry's place in the table
+    OSTCommandHandler handler;    ///< null while there is none: the command is then refused
+    std::string_view entitlement; ///< what the client must hold
     OSTReplyBy replyBy;
 };
-
-inline constexpr std::size_t OSTCommandCount = 26;
 
 /// Every command that a request may name.
 extern const std::array<OSTCommandEntry, OSTCommandCount> OSTCommandTable;

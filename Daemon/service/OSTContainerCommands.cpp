@@ -9,18 +9,18 @@ OSTErrorCode OSTCreateOrLookupCommand(const platform::IPCRequest& request, platf
     const auto place = OSTRequestedPlace(request, client);
     if (!place)
         return place.error();
-    const auto record =
-        client.createOrLookupContainerForUser({.name = {.userId = place->userId,
-                                                        .containerClass = place->containerClass,
-                                                        .identifier = OSTRequestedIdentifier(request, client),
-                                                        .transient = request.booleanValue("Transient")},
-                                               .createIfNecessary = request.booleanValue("CreateIfNecessary")});
+    const auto record = client.createOrLookupContainerForUser(
+        {.name = {.userId = place->userId,
+                  .containerClass = place->containerClass,
+                  .identifier = OSTRequestedIdentifier(request, client),
+                  .transient = request.booleanValue(requestKey::transient)},
+         .createIfNecessary = request.booleanValue(requestKey::createIfNecessary)});
     if (!record)
         return record.error();
-    reply.set("ReplyUUID", (*record)->uuid);
-    reply.set("ReplyExisted", (*record)->existed);
-    reply.set("ReplyPath", (*record)->url);
-    reply.set("ReplyIdentifier", (*record)->identifier);
+    reply.set(replyKey::uuid, (*record)->uuid);
+    reply.set(replyKey::existed, (*record)->existed);
+    reply.set(replyKey::path, (*record)->url);
+    reply.set(replyKey::identifier, (*record)->identifier);
     return OSTErrorCode::success;
 }
 
@@ -30,14 +30,14 @@ OSTErrorCode OSTListCommand(const platform::IPCRequest& request, platform::IPCRe
     if (!place)
         return place.error();
     const auto records =
-        client.containersForUser(place->userId, place->containerClass, request.booleanValue("Transient"));
+        client.containersForUser(place->userId, place->containerClass, request.booleanValue(requestKey::transient));
     if (!records)
         return records.error();
-    auto identifiers = reply.encoder("ReplyIdsArray");
+    auto identifiers = reply.encoder(replyKey::identifiers);
     identifiers.beginArray(records->size());
     for (const auto& record : *records)
         identifiers.text(record->identifier);
-    auto uuids = reply.encoder("ReplyUUIDsArray");
+    auto uuids = reply.encoder(replyKey::uuids);
     uuids.beginArray(records->size());
     for (const auto& record : *records)
         uuids.uuid(record->uuid);

@@ -1,5 +1,6 @@
 #include "service/OSTDaemon.h"
 
+#include "Protocol/OSTServices.h"
 #include "codesigning/OSTCodeSigningStoreDelegate.h"
 #include "migration/OSTContainerMigrator.h"
 #include "model/OSTGlobalConfiguration.h"
@@ -30,7 +31,6 @@ using platform::LogLevel;
 
 namespace {
 
-constexpr const char* serviceName = "com.tamarok.ostrandd";
 constexpr const char* listenerQueueName = "com.tamarok.ostrandd.listener";
 /// There while the first-boot work of this boot is done; named semaphores do not survive a reboot.
 constexpr const char* firstBootMarker = "ostrandd.fb_check";
@@ -100,7 +100,7 @@ void OSTDaemon::_openLog() {
         platform::pathByAppending(OSTGlobalConfiguration::sharedInstance().logDirectory(), "ostrandd.log");
     const auto opened = platform::Log::shared().open(LogLevel::notice, {path, size.files, size.fileSize});
     if (!opened) {
-        ::openlog(serviceName, LOG_PID, LOG_DAEMON);
+        ::openlog(OSTServiceName, LOG_PID, LOG_DAEMON);
         ::syslog(LOG_ERR, "Failed to set up rotating logs at path %s", path.c_str());
         ::closelog();
     }
@@ -146,7 +146,7 @@ void OSTDaemon::_followLockState() {
 
 void OSTDaemon::_startListener() {
     const auto start = [this]() -> std::expected<void, int> {
-        auto socket = OST_TRY(_sockets.takeListener(serviceName, SOCK_STREAM));
+        auto socket = OST_TRY(_sockets.takeListener(OSTServiceName, SOCK_STREAM));
         auto listener = OST_TRY(platform::IPCListener::create(
             std::move(socket), listenerQueueName, [](const std::shared_ptr<platform::IPCConnection>& connection) {
                 connection->setMessageHandler(OSTProcessVexelEvent);

@@ -38,34 +38,36 @@ OSTErrorCode OSTReplaceCommand(const platform::IPCRequest& request, platform::IP
                                OSTClientConnection& client) {
     OSTReplacement replacement;
     auto& oldContainer = replacement.oldContainer;
-    if ((oldContainer.uuid = request.uuidValue("OldContainerUUID"))) {
-        const auto place = OSTRequestedPlace(request, client, "OldContainerClass", "OldContainerUserID");
+    if ((oldContainer.uuid = request.uuidValue(requestKey::oldContainer.uuid))) {
+        const auto place = OSTRequestedPlace(request, client, requestKey::oldContainer);
         if (!place)
             return place.error();
         oldContainer.name = {.userId = place->userId,
                              .containerClass = place->containerClass,
-                             .identifier = request.stringValue("OldIdentifier")};
+                             .identifier = request.stringValue(requestKey::oldContainer.identifier)};
     }
-    const auto place = OSTRequestedPlace(request, client, "NewContainerClass", "NewContainerUserID");
+    const auto place = OSTRequestedPlace(request, client, requestKey::newContainer);
     if (!place)
         return place.error();
     replacement.newContainer = {.name = {.userId = place->userId,
                                          .containerClass = place->containerClass,
-                                         .identifier = request.stringValue("NewIdentifier")},
-                                .uuid = request.uuidValue("NewContainerUUID")};
+                                         .identifier = request.stringValue(requestKey::newContainer.identifier)},
+                                .uuid = request.uuidValue(requestKey::newContainer.uuid)};
     return codeOf(client.replaceContainer(replacement));
 }
 
 OSTErrorCode OSTStageForDeleteCommand(const platform::IPCRequest& request, platform::IPCReply& /*reply*/,
                                       OSTClientConnection& client) {
     OSTDeletion deletion;
-    deletion.classes = elementsOf<OSTContainerClass>(request, "ContainerClassesArray", [](const auto& element) {
-        return static_cast<OSTContainerClass>(numberOf(element));
-    });
-    deletion.uuids = elementsOf<std::optional<platform::UUID>>(request, "UUIDsArray",
+    deletion.classes =
+        elementsOf<OSTContainerClass>(request, requestKey::containers.containerClass, [](const auto& element) {
+            return static_cast<OSTContainerClass>(numberOf(element));
+        });
+    deletion.uuids = elementsOf<std::optional<platform::UUID>>(request, requestKey::containers.uuid,
                                                                [](const auto& element) { return element.asUUID(); });
-    const auto userIds = elementsOf<std::uint32_t>(
-        request, "UserIDsArray", [](const auto& element) { return static_cast<std::uint32_t>(numberOf(element)); });
+    const auto userIds = elementsOf<std::uint32_t>(request, requestKey::containers.userId, [](const auto& element) {
+        return static_cast<std::uint32_t>(numberOf(element));
+    });
     // A user without a class could not be validated.
     if (userIds.size() > deletion.classes.size())
         return OSTCreateError(OSTErrorCode::invalidObject,
@@ -78,18 +80,18 @@ OSTErrorCode OSTStageForDeleteCommand(const platform::IPCRequest& request, platf
             return resolved.error();
         deletion.userIds.push_back(*resolved);
     }
-    if (!isArray(request, "IdentifiersArray"))
+    if (!isArray(request, requestKey::containers.identifier))
         platform::logAs(platform::LogLevel::error, "stageContainerForDelete",
                         "Got non-Array input for the identifiers array");
     deletion.identifiers = elementsOf<std::optional<std::string_view>>(
-        request, "IdentifiersArray", [](const auto& element) { return element.asText(); });
+        request, requestKey::containers.identifier, [](const auto& element) { return element.asText(); });
     return codeOf(client.stageForDeleteContainersWithUsers(deletion));
 }
 
 OSTErrorCode OSTDestroyDeathRowCommand(const platform::IPCRequest& /*request*/, platform::IPCReply& reply,
                                        OSTClientConnection& client) {
     client.deleteContainersOnDeathRowWithCompletion([reply = std::move(reply)](std::int64_t code) mutable {
-        reply.set("ReplyError", static_cast<std::uint64_t>(code));
+        reply.set(replyKey::error, static_cast<std::uint64_t>(code));
         reply.send();
     });
     return OSTErrorCode::success;
@@ -102,8 +104,8 @@ OSTErrorCode OSTDeleteCommand(const platform::IPCRequest& request, platform::IPC
         return place.error();
     return codeOf(client.deleteContainerForUser({.userId = place->userId,
                                                  .containerClass = place->containerClass,
-                                                 .identifier = request.stringValue("Identifier"),
-                                                 .transient = request.booleanValue("Transient")}));
+                                                 .identifier = request.stringValue(requestKey::identifier),
+                                                 .transient = request.booleanValue(requestKey::transient)}));
 }
 
 } // namespace ost

@@ -1,5 +1,7 @@
 #include "service/OSTRequestDispatcher.h"
 
+#include "Protocol/OSTEntitlements.h"
+#include "Protocol/OSTKeys.h"
 #include "codesigning/OSTCodeSigningMapping.h"
 #include "model/OSTFailureReport.h"
 #include "platform/base/Log.h"
@@ -16,13 +18,13 @@ using platform::logError;
 
 /// The table's row for the command that a request names; null, with the reason in the log, when there is none to run.
 const OSTCommandEntry* commandOf(const platform::IPCRequest& request) {
-    const auto index = request.unsignedValue("Command");
+    const auto index = request.unsignedValue(requestKey::command);
     if (index >= OSTCommandTable.size()) {
         platform::logAs(platform::LogLevel::error, "OSTProcessVexelEvent", "Invalid command index: %lld", index);
         return nullptr;
     }
     const auto& entry = OSTCommandTable[index];
-    if (entry.index != index) {
+    if (entry.command != static_cast<OSTCommand>(index)) {
         platform::logAs(platform::LogLevel::error, "OSTProcessVexelEvent", "Invalid command at index %llu", index);
         return nullptr;
     }
@@ -88,11 +90,11 @@ void registerCaller(const platform::CodeSigningIdentity& caller) {
 void answer(platform::IPCReply& reply, const OSTResult<OSTErrorCode>& code) {
     if (!code) // an exception may have left half an entry
         reply.clear();
-    reply.set("ReplyError", static_cast<std::uint64_t>(code ? *code : code.error().code()));
+    reply.set(replyKey::error, static_cast<std::uint64_t>(code ? *code : code.error().code()));
     if (!reply.fits()) {
         logError("A reply is too long to be sent");
         reply.clear();
-        reply.set("ReplyError", std::uint64_t{EMSGSIZE});
+        reply.set(replyKey::error, std::uint64_t{EMSGSIZE});
     }
     reply.send();
 }
@@ -101,7 +103,7 @@ void answer(platform::IPCReply& reply, const OSTResult<OSTErrorCode>& code) {
 
 std::optional<OSTClientConnection> checkEntitlementsAndInitClientObject(platform::PeerIdentity& peer,
                                                                         const OSTCommandEntry& command) {
-    const std::string_view required = command.entitlement;
+    const auto required = command.entitlement;
     const platform::CodeSigningIdentity nobody;
     const auto identity = peer.codeSigningIdentity();
     if (!identity)

@@ -6,18 +6,17 @@ namespace ost {
 
 std::expected<OSTRequestedClassAndUser, OSTErrorCode> OSTRequestedPlace(const platform::IPCRequest& request,
                                                                         const OSTClientConnection& client,
-                                                                        std::string_view classKey,
-                                                                        std::string_view userKey) {
-    const auto containerClass = static_cast<OSTContainerClass>(request.unsignedValue(classKey));
+                                                                        const requestKey::Container& keys) {
+    const auto containerClass = static_cast<OSTContainerClass>(request.unsignedValue(keys.containerClass));
     // Only the low half of the number is a user id.
-    const auto userId = static_cast<std::uint32_t>(request.unsignedValue(userKey));
+    const auto userId = static_cast<std::uint32_t>(request.unsignedValue(keys.userId));
     const auto resolved = OST_TRY(validateUserId(userId, containerClass, client.identity().clientUserId));
     return OSTRequestedClassAndUser{containerClass, resolved};
 }
 
 std::optional<std::string_view> OSTRequestedIdentifier(const platform::IPCRequest& request,
                                                        const OSTClientConnection& client) {
-    if (const auto identifier = request.stringValue("Identifier"))
+    if (const auto identifier = request.stringValue(requestKey::identifier))
         return identifier;
     return client.identity().clientBundleIdentifier;
 }

@@ -1,6 +1,7 @@
 #pragma once
 
-#include "model/OSTContainerClass.h"
+#include "Protocol/OSTContainerClass.h"
+#include "Protocol/OSTKeys.h"
 #include "platform/base/OSTError.h"
 #include "platform/ipc/IPCMessage.h"
 #include "store/OSTClientConnection.h"
@@ -21,7 +22,7 @@ struct OSTRequestedClassAndUser {
 /// Reads the class and the user of a request and validates the user for the client. Fails with `invalidParameter`.
 [[nodiscard]] std::expected<OSTRequestedClassAndUser, OSTErrorCode>
 OSTRequestedPlace(const platform::IPCRequest& request, const OSTClientConnection& client,
-                  std::string_view classKey = "ContainerClass", std::string_view userKey = "UserID");
+                  const requestKey::Container& keys = requestKey::container);
 
 /// The identifier that a request names, or else the client's own.
 [[nodiscard]] std::optional<std::string_view> OSTRequestedIdentifier(const platform::IPCRequest& request,

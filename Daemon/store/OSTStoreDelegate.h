@@ -1,6 +1,6 @@
 #pragma once
 
-#include "model/OSTContainerClass.h"
+#include "Protocol/OSTContainerClass.h"
 #include "platform/base/OSTError.h"
 
 #include <functional>

@@ -1,5 +1,6 @@
 #include "upcall/OSTKernServer.h"
 
+#include "Protocol/OSTServices.h"
 #include "platform/base/Log.h"
 #include "upcall/OSTProcessContainers.h"
 

@@ -10,9 +10,6 @@
 
 namespace ost {
 
-/// The service name of the kernel's port to the daemon.
-inline constexpr const char* OSTKernServiceName = "com.tamarok.ostrandd.upcall";
-
 /// Handles one message: the kernel's question which containers a process gets. Whatever else is wrong with a message, a
 /// failure reply says it; a message of an unknown id is not handled. Takes the message's region.
 [[nodiscard]] std::optional<platform::UpcallReply> demux_server(platform::UpcallMessage& message);

@@ -1,7 +1,7 @@
 #include "upcall/OSTProcessContainers.h"
 
+#include "Protocol/OSTContainerClass.h"
 #include "codesigning/OSTCodeSigningMapping.h"
-#include "model/OSTContainerClass.h"
 #include "model/OSTGlobalConfiguration.h"
 #include "platform/base/Log.h"
 #include "platform/base/Path.h"

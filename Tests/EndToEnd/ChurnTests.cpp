@@ -93,7 +93,7 @@ private:
 
     [[nodiscard]] ostrand::ContainerRequest _named(const std::string& identifier, bool transient) const {
         return {.containerClass = _class,
-                .user = ostrand::usualUserOf(_class),
+                .user = ost::usualUserOf(_class),
                 .identifier = identifier,
                 .transient = transient};
     }
@@ -104,7 +104,7 @@ private:
         if (list)
             for (const auto& listed : *list)
                 if (listed.identifier == identifier)
-                    return ostrand::ContainerReference{_class, ostrand::usualUserOf(_class), identifier, listed.uuid};
+                    return ostrand::ContainerReference{_class, ost::usualUserOf(_class), identifier, listed.uuid};
         return std::nullopt;
     }
 
@@ -167,7 +167,7 @@ void ChurnTest::expectOrder(ContainerClass containerClass) {
     for (const bool transient : {false, true}) {
         const auto probe = ostrand::createOrLookup(connection,
                                                    {.containerClass = containerClass,
-                                                    .user = ostrand::usualUserOf(containerClass),
+                                                    .user = ost::usualUserOf(containerClass),
                                                     .identifier = "com.example.probe",
                                                     .transient = transient},
                                                    ostrand::WhenMissing::create);

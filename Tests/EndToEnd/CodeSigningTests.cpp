@@ -139,7 +139,8 @@ TEST_F(CodeSigningTest, AClientGetsWhatItsIdentityAndItsUserGive) {
         std::function<std::string(Connection&)> request;
         std::string outcome;
     } rows[] = {
-        {"own groups, of the current user", appClient, groups(ostrand::currentUser), "group.app" + inAppGroups},
+        {"own groups, of the current user", appClient, groups(ost::OSTCurrentUserPlaceholder),
+         "group.app" + inAppGroups},
         {"own groups, by user id", appClient, groups(mobile), "group.app" + inAppGroups},
         {"groups of another identifier", appClient, groups(mobile, "com.example.Other"), "group.other" + inAppGroups},
         {"groups of nobody", appClient, groups(mobile, "com.example.Nobody"), ""},
@@ -150,7 +151,8 @@ TEST_F(CodeSigningTest, AClientGetsWhatItsIdentityAndItsUserGive) {
         {"no entitlements dictionary", unsignedClient, groups(mobile), "refused"},
 
         {"group identifiers", installerClient, ids(mobile, "com.example.App"), R"({ "group.app" })"},
-        {"group identifiers of nobody", installerClient, ids(ostrand::currentUser, "com.example.Nobody"), "{}"},
+        {"group identifiers of nobody", installerClient, ids(ost::OSTCurrentUserPlaceholder, "com.example.Nobody"),
+         "{}"},
         {"group identifiers for a bundle's user", installerClient, ids(33, "com.example.App"), "error 38"},
         {"group identifiers, not entitled", appClient, ids(mobile), "refused"},
 

@@ -38,7 +38,7 @@ protected:
     static ostrand::Result<ostrand::Container> create(Connection& connection, const std::string& identifier) {
         return ostrand::createOrLookup(connection,
                                        {.containerClass = GetParam().containerClass,
-                                        .user = ostrand::usualUserOf(GetParam().containerClass),
+                                        .user = ost::usualUserOf(GetParam().containerClass),
                                         .identifier = identifier},
                                        ostrand::WhenMissing::create);
     }

@@ -75,7 +75,7 @@ std::string contentOf(const std::filesystem::path& container) {
 }
 
 ostrand::ContainerReference referenceTo(const Container& container, ContainerClass containerClass) {
-    return {containerClass, ostrand::usualUserOf(containerClass), container.identifier, container.uuid};
+    return {containerClass, ost::usualUserOf(containerClass), container.identifier, container.uuid};
 }
 
 /// Replacements of one container by another of the same identifier, in one boot of one device: each time the two are
@@ -171,7 +171,7 @@ private:
     Made _make(ostrand::Connection& connection, const std::string& data, bool transient) {
         const auto made = ostrand::createOrLookup(connection,
                                                   {.containerClass = GetParam().containerClass,
-                                                   .user = ostrand::usualUserOf(GetParam().containerClass),
+                                                   .user = ost::usualUserOf(GetParam().containerClass),
                                                    .identifier = identifier,
                                                    .transient = transient},
                                                   ostrand::WhenMissing::create);

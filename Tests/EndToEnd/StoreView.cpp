@@ -12,7 +12,7 @@ namespace ost::test {
 
 Containers listedContainers(ostrand::Connection& connection, ostrand::ContainerClass containerClass, bool transient) {
     const auto list = ostrand::list(connection, {.containerClass = containerClass,
-                                                 .user = ostrand::usualUserOf(containerClass),
+                                                 .user = ost::usualUserOf(containerClass),
                                                  .identifier = {},
                                                  .transient = transient});
     if (!list)

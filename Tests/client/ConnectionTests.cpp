@@ -104,7 +104,7 @@ TEST(Connection, tellsHowARequestEnded) {
         auto connection = daemon.client();
         daemon.says(bytes);
         daemon.saysNoMore();
-        const auto result = connection.call(Request(0));
+        const auto result = connection.call(Request(ost::OSTCommand{0}));
         EXPECT_EQ(result ? std::nullopt : std::optional(result.error()), error) << what;
     }
 }
@@ -112,11 +112,12 @@ TEST(Connection, tellsHowARequestEnded) {
 TEST(Connection, stillDeliversTheRepliesBeforeARefusal) {
     Daemon daemon;
     auto connection = daemon.client();
-    const auto first = connection.send(Request(0)), second = connection.send(Request(99));
+    const auto first = connection.send(Request(ost::OSTCommand{0})),
+               second = connection.send(Request(ost::OSTCommand{99}));
     ASSERT_TRUE(first && second);
     daemon.says(reply(*first, 1, 5));
     daemon.hangsUp(); // with both requests unread
-    const auto third = connection.send(Request(0));
+    const auto third = connection.send(Request(ost::OSTCommand{0}));
     ASSERT_FALSE(third);
     EXPECT_EQ(third.error(), Error::refused());
     EXPECT_TRUE(connection.receive(*first));
@@ -130,7 +131,7 @@ TEST(Connection, stillDeliversTheRepliesBeforeARefusal) {
 TEST(Connection, waitsNoLongerThanItsTimeoutAndCanWaitAgain) {
     Daemon daemon;
     auto connection = daemon.client(1ms);
-    const auto number = connection.send(Request(0));
+    const auto number = connection.send(Request(ost::OSTCommand{0}));
     ASSERT_TRUE(number);
     daemon.says(reply(*number, 1).substr(0, 5));
     const auto silence = connection.receive(*number);
@@ -141,9 +142,9 @@ TEST(Connection, waitsNoLongerThanItsTimeoutAndCanWaitAgain) {
     EXPECT_TRUE(moved.receive(*number));
 
     std::size_t sent = 0;
-    auto stuck = moved.send(Request(0));
+    auto stuck = moved.send(Request(ost::OSTCommand{0}));
     for (; stuck && sent < 1'000'000; ++sent)
-        stuck = moved.send(Request(0));
+        stuck = moved.send(Request(ost::OSTCommand{0}));
     ASSERT_FALSE(stuck);
     EXPECT_EQ(stuck.error(), Error::transport(ETIMEDOUT));
 }
@@ -173,7 +174,7 @@ TEST(Connection, sendsAnyNumberOfRequestsBeforeItReceivesAnyReply) {
     auto connection = daemon.client(); // goes before the thread, which ends with it
     std::vector<std::uint32_t> numbers;
     for (std::uint64_t i = 0; i < count; ++i) {
-        Request request(i);
+        Request request(ost::OSTCommand{i});
         request.key("Text").text(filling);
         const auto number = connection.send(request);
         ASSERT_TRUE(number);

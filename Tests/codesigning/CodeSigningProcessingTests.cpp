@@ -263,9 +263,9 @@ TEST_F(CodeSigningProcessing, AMappingThatCannotBeReadProcessesNothing) {
     const auto group = makeContainer(sharedAppGroup, "g");
     const auto bundle = makeContainer(bundleApplication, app);
     EXPECT_FALSE(mapping().isAvailable());
-    EXPECT_EQ(OSTNoProcessingResult, registerEntitlements(app, appGroups({"g"})));
-    EXPECT_EQ(OSTNoProcessingResult, remove(app));
-    EXPECT_EQ(OSTNoProcessingResult, mapping().invalidateCodeSigningInfoForAppsWithoutBundleContainer());
+    EXPECT_EQ(OSTErrorCode::noProcessingResult, registerEntitlements(app, appGroups({"g"})));
+    EXPECT_EQ(OSTErrorCode::noProcessingResult, remove(app));
+    EXPECT_EQ(OSTErrorCode::noProcessingResult, mapping().invalidateCodeSigningInfoForAppsWithoutBundleContainer());
     EXPECT_EQ(Identifiers(), mapping().appGroupIdentifiersForIdentifier(app));
     EXPECT_TRUE(store().deleteContainerForUser({33, bundleApplication, app}));
     EXPECT_FALSE(fs::exists(bundle));

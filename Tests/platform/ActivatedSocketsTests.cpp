@@ -1,5 +1,6 @@
 #include "platform/ipc/ActivatedSockets.h"
 
+#include "Protocol/OSTServices.h"
 #include "support/DeviceTest.h"
 
 #include <fcntl.h>
@@ -14,7 +15,7 @@ namespace ost::platform {
 namespace {
 
 constexpr const char* service = "com.tamarok.tests";
-const std::string path = std::string(serviceSocketDirectory) + "/" + service;
+const std::string path = std::string(OSTServiceSocketDirectory) + "/" + service;
 
 class ActivatedSocketsTest : public test::DeviceTest {
 protected:
@@ -71,7 +72,7 @@ TEST_F(ActivatedSocketsTest, bindsWhatWasNotHandedOver) {
         const auto listener =
             ActivatedSockets().takeListener(service, type).value(); // the second time over a stale one
         EXPECT_TRUE(connects(type));
-        EXPECT_EQ(test::tree(serviceSocketDirectory), "srw-rw-rw- 0:0 com.tamarok.tests\n");
+        EXPECT_EQ(test::tree(OSTServiceSocketDirectory), "srw-rw-rw- 0:0 com.tamarok.tests\n");
         EXPECT_EQ(ActivatedSockets().takeListener(service, type).error(), EADDRINUSE);
     }
     std::filesystem::remove(path);
@@ -79,7 +80,7 @@ TEST_F(ActivatedSocketsTest, bindsWhatWasNotHandedOver) {
     EXPECT_EQ(ActivatedSockets().takeListener(service, SOCK_STREAM).error(), EEXIST);
     EXPECT_EQ(test::readFile(path), "precious");
     EXPECT_EQ(ActivatedSockets().takeListener(std::string(200, 'x'), SOCK_STREAM).error(), ENAMETOOLONG);
-    std::filesystem::remove_all(serviceSocketDirectory);
+    std::filesystem::remove_all(OSTServiceSocketDirectory);
     EXPECT_EQ(ActivatedSockets().takeListener(service, SOCK_STREAM).error(), ENOENT);
 }
 

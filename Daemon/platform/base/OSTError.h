@@ -1,5 +1,6 @@
 #pragma once
 
+#include "Protocol/OSTErrorCode.h"
 #include "platform/base/Log.h"
 #include "platform/base/MessageFormat.h"
 #include "platform/base/Try.h"
@@ -14,52 +15,6 @@
 
 namespace ost {
 
-/// The number that tells a caller how an operation ended. What leaves the daemon is this number alone: one of the
-/// system's own codes below, or the errno of an error of the POSIX domain.
-enum class OSTErrorCode : std::int64_t {
-    success = 1,
-    moveAsideFailed = 4,
-    transientRemovalFailed = 5,
-    subDirectoryCreationFailed = 6,
-    stagingCreationFailed = 7,
-    moveToLiveFailed = 8,
-    stagingRemovalFailed = 9,
-    unexpectedPath = 10,
-    invalidObject = 11,
-    metadataUnreadable = 12,
-    moveOldToStagingFailed = 14,
-    replacingMoveFailed = 15,
-    destructionFailed = 17,
-    noIdentifier = 18,
-    notFound = 21,
-    replacedByItself = 22,
-    classesDiffer = 23,
-    noInfoValue = 24,
-    alreadyExists = 27,
-    deletionFailed = 28,
-    metadataInvalid = 29,
-    replaceDescriptionIncomplete = 33,
-    dictionaryWriteFailed = 34,
-    replaceFileInvalid = 35,
-    replaceCleanupFailed = 36,
-    invalidParameter = 38,
-    exceptionCaught = 40,
-    moveToDeathRowFailed = 41,
-    cacheRebuildFailed = 43,
-    cacheInconsistent = 44,
-    cacheAddFailed = 45,
-    cacheRemoveFailed = 46,
-    invalidCacheInput = 47,
-    moveToNewUUIDFailed = 48,
-    notEntitled = 55,
-    usersDiffer = 56,
-    mappingWriteFailed = 59,
-    countsDiffer = 60,
-    lockedWithoutRetry = 61,
-    ownerChangeFailed = 62,
-    accessControlListFailed = 63,
-};
-
 /// A failure: its domain and code, the message, what caused it, and the place that raised it.
 ///
 /// A value, cheap to copy; immutable and safe to share between threads. `OSTCreateError` and `OSTCreatePOSIXError` are
@@ -71,9 +26,6 @@ public:
         posix,   ///< the code is an errno
         general, ///< the platform's own: 2048, a property list that is no dictionary or cannot be parsed
     };
-
-    /// The code of the general domain for a file whose content is not the property list that was expected.
-    static constexpr std::int64_t corruptPropertyList = 2048;
 
     [[nodiscard]] Domain domain() const { return _record->domain; }
     /// The domain as messages name it: "OSTErrorDomain", "POSIX" or "general".
@@ -160,8 +112,8 @@ template<typename... Arguments>
 template<typename... Arguments>
 [[nodiscard]] OSTError OSTCreatePropertyListError(platform::Message<Arguments...> format,
                                                   const Arguments&... arguments) {
-    return makeError(OSTError::Domain::general, static_cast<OSTErrorCode>(OSTError::corruptPropertyList),
-                     format.where(), nullptr, false, platform::formatMessage<Arguments...>(format, arguments...));
+    return makeError(OSTError::Domain::general, OSTErrorCode::corruptPropertyList, format.where(), nullptr, false,
+                     platform::formatMessage<Arguments...>(format, arguments...));
 }
 
 } // namespace ost

@@ -1,5 +1,6 @@
 #include "platform/device/CodeSignature.h"
 
+#include "Protocol/OSTKeys.h"
 #include "platform/codec/PropertyList.h"
 
 #include <fcntl.h>
@@ -66,9 +67,9 @@ CodeSigningIdentity parseCodeSignature(std::string_view raw) {
     const auto* const signature = value ? value->asDictionary() : nullptr;
     if (!signature)
         return identity;
-    if (const auto* const identifier = signature->find("Identifier"); identifier && identifier->asString())
+    if (const auto* const identifier = signature->find(signatureKey::identifier); identifier && identifier->asString())
         identity.identifier = *identifier->asString();
-    if (const auto* const entitlements = signature->find("Entitlements"))
+    if (const auto* const entitlements = signature->find(signatureKey::entitlements))
         identity.entitlements = entitlements->sharedDictionary();
     return identity;
 }

@@ -1,5 +1,6 @@
 #include "platform/ipc/ActivatedSockets.h"
 
+#include "Protocol/OSTServices.h"
 #include "platform/base/Path.h"
 #include "platform/base/Try.h"
 
@@ -74,7 +75,7 @@ std::expected<void, int> removeStaleSocket(const sockaddr_un& address, int type)
 }
 
 std::expected<FileDescriptor, int> bindListener(std::string_view name, int type) {
-    const auto path = pathByAppending(serviceSocketDirectory, name);
+    const auto path = pathByAppending(OSTServiceSocketDirectory, name);
     sockaddr_un address{.sun_family = AF_UNIX, .sun_path = {}};
     if (path.size() >= sizeof address.sun_path)
         return std::unexpected(ENAMETOOLONG);

@@ -9,8 +9,6 @@
 
 namespace ost::platform {
 
-inline constexpr const char* serviceSocketDirectory = "/private/var/run";
-
 /// The listening sockets of the services that the process offers: those that the service launcher hands over, else
 /// sockets that the process binds itself. One object, of the thread that starts the process up.
 class ActivatedSockets {

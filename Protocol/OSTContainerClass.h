@@ -1,5 +1,8 @@
 #pragma once
 
+#include "Protocol/OSTUserId.h"
+
+#include <array>
 #include <cstdint>
 #include <string_view>
 
@@ -24,14 +27,6 @@ enum class OSTContainerClass : std::uint64_t {
     sharedSystemGroup = 13,
     max = 14,
 };
-
-/// User ids that the system gives a meaning.
-inline constexpr std::uint32_t OSTRootUserId = 0;
-inline constexpr std::uint32_t OSTCurrentUserPlaceholder = 1; ///< in a request: the current user
-inline constexpr std::uint32_t OSTInstallerUserId = 33;       ///< owns bundle containers
-inline constexpr std::uint32_t OSTSystemUserId = 499;         ///< owner of system containers
-inline constexpr std::uint32_t OSTHighestSystemUserId = 500;  ///< real users are above
-inline constexpr std::uint32_t OSTDefaultUserId = 501;        ///< assumed for per-user metadata that names no user
 
 /// 1 to 13.
 [[nodiscard]] constexpr bool isValidContainerClass(OSTContainerClass value) {
@@ -63,8 +58,25 @@ inline constexpr std::uint32_t OSTDefaultUserId = 501;        ///< assumed for p
            (isPerUserClass(containerClass) && userId > OSTHighestSystemUserId);
 }
 
-/// The directory, relative to the class's base, that holds all containers of the class: "Data/Application".
-/// The class must lie in 0 to 14.
-[[nodiscard]] std::string_view pathComponentForContainerClass(OSTContainerClass containerClass);
+/// The user to whom containers of the class belong when a caller names none: the installer for bundles, the owner of
+/// system containers for system classes, else the current user.
+[[nodiscard]] constexpr std::uint32_t usualUserOf(OSTContainerClass containerClass) {
+    if (isBundleClass(containerClass))
+        return OSTInstallerUserId;
+    return isSystemClass(containerClass) ? OSTSystemUserId : OSTCurrentUserPlaceholder;
+}
+
+/// By class, the directory, relative to the class's base, that holds all containers of the class. People name the class
+/// by it.
+inline constexpr std::array<std::string_view, 15> OSTContainerClassPathComponents = {
+    "Undefined",           "Bundle/Application", "Data/Application", "Bundle/LoomworkPlugin", "Data/LoomworkPlugin",
+    "Bundle/VPNPlugin",    "Data/VPNPlugin",     "Shared/AppGroup",  "Bundle/Framework",      "Data/VexelService",
+    "Data/InternalDaemon", "Data/TempDir",       "Data/System",      "Shared/SystemGroup",    "MAX",
+};
+
+/// "Data/Application". The class must lie in 0 to 14.
+[[nodiscard]] constexpr std::string_view pathComponentForContainerClass(OSTContainerClass containerClass) {
+    return OSTContainerClassPathComponents.at(static_cast<std::uint64_t>(containerClass));
+}
 
 } // namespace ost
