@@ -96,7 +96,9 @@ OSTResult<void> OSTClientConnection::_checkLookup(const OSTContainerLookup& look
 OSTResult<OSTCacheEntry> OSTClientConnection::_lookUpOrCreate(const OSTContainerLookup& lookup,
                                                               std::string& staging) const {
     {
-        const OSTAllIdentifiersLock lock(OSTLockKind::writing, lookup.useLocking);
+        // Look-ups change nothing, but for the transient container that is thrown away.
+        const OSTAllIdentifiersLock lock(lookup.name.transient ? OSTLockKind::writing : OSTLockKind::reading,
+                                         lookup.useLocking);
         const auto found = OST_TRY(_lookUp(lookup));
         if (found.entry.record)
             return found.entry;

@@ -40,6 +40,7 @@ struct LockTable {
     std::int32_t identifierReaderCount = 0; ///< identifier locks held or being acquired for reading
     std::int32_t identifierWriterCount = 0; ///< identifier locks held or being acquired for writing
     std::int32_t allReaderWriterState = 0;  ///< 0 free, -1 held for writing, n > 0 held by n readers
+    std::int32_t allWritersWaiting = 0;
 };
 
 LockTable gOSTLocks;
@@ -104,6 +105,12 @@ void wait(std::condition_variable& condition, std::unique_lock<std::mutex>& lock
 }
 
 bool noIdentifierLocks() { return gOSTLocks.identifierReaderCount == 0 && gOSTLocks.identifierWriterCount == 0; }
+
+/// Look-ups follow each other so closely that a writer who waited for a moment without readers might wait for ever:
+/// while readers are all that one waits for, no further reader joins them.
+bool writerComesFirst() {
+    return gOSTLocks.allWritersWaiting > 0 && gOSTLocks.allReaderWriterState > 0 && noIdentifierLocks();
+}
 
 void acquire(LockRecord& record, OSTLockKind kind, std::source_location function) {
     if (kind == OSTLockKind::writing) {
@@ -223,12 +230,15 @@ void _lock_all_identifiers(OSTLockKind kind) {
     platform::logDebug("Waiting to lock all identifiers for %s", nameOf(kind));
     std::unique_lock lock(gOSTLocks.mutex);
     if (kind == OSTLockKind::writing) {
+        ++gOSTLocks.allWritersWaiting;
         wait(gOSTLocks.allWriterCondition, lock,
              [] { return noIdentifierLocks() && gOSTLocks.allReaderWriterState == 0; });
+        --gOSTLocks.allWritersWaiting;
         gOSTLocks.allReaderWriterState = -1;
     } else {
-        wait(gOSTLocks.allReaderCondition, lock,
-             [] { return gOSTLocks.identifierWriterCount == 0 && gOSTLocks.allReaderWriterState != -1; });
+        wait(gOSTLocks.allReaderCondition, lock, [] {
+            return gOSTLocks.identifierWriterCount == 0 && gOSTLocks.allReaderWriterState != -1 && !writerComesFirst();
+        });
         ++gOSTLocks.allReaderWriterState;
     }
     heldOfAllIdentifiers = kind;
@@ -253,6 +263,7 @@ void unlock_all_identifiers() {
                 gOSTLocks.identifierWriterCondition.notify_all();
                 if (noIdentifierLocks())
                     gOSTLocks.allWriterCondition.notify_one();
+                gOSTLocks.allReaderCondition.notify_all();
             }
         }
     }

@@ -86,6 +86,21 @@ TEST(Locks, ExcludeEachOtherAsTheirKindsSay) {
     EXPECT_EQ(0U, OSTLockRecordCount());
 }
 
+TEST(Locks, AWaitingWriterIsNotKeptWaitingByFurtherReaders) {
+    const LockName allWriting{"all, writing", {}, writing};
+    const LockName allReading{"all, reading", {}, reading};
+    const auto reader = allReading.hold();
+    reader->waitUntilTaken();
+    const auto writer = allWriting.hold();
+    auto further = allReading.hold();
+    while (further->taken()) // the writer does not wait yet
+        further = allReading.hold();
+    reader->release();
+    writer->release();
+    writer->waitUntilTaken();
+    further->waitUntilTaken();
+}
+
 TEST(Locks, ManyIdentifiersAreTakenOnceAndLeaveNoRecord) {
     {
         const OSTIdentifierLock lock({"b", "a", "b"}, writing);

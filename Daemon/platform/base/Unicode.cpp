@@ -60,7 +60,9 @@ bool isValidText(std::string_view text) {
                 continue;
             }
         }
-        if (!takeCodePoint(text).value_or(0))
+        if (byteAt(text, 0) - 1 < 0x7f)
+            text.remove_prefix(1);
+        else if (!takeCodePoint(text).value_or(0))
             return false;
     }
     return true;

@@ -11,6 +11,7 @@
 #include <sys/xattr.h>
 
 #include <algorithm>
+#include <array>
 #include <cerrno>
 
 namespace ost::platform {
@@ -20,6 +21,9 @@ namespace {
 /// What ordinary signatures fit into. The kernel allocates and clears as much as its caller has room for, so the first
 /// question has room for little.
 constexpr std::size_t ordinarySignature = 1024;
+
+/// Those that date every change of an extended attribute; tmpfs does since Linux 6.1.
+constexpr std::array<long, 4> datingFileSystems = {EXT4_SUPER_MAGIC, XFS_SUPER_MAGIC, BTRFS_SUPER_MAGIC, TMPFS_MAGIC};
 
 bool isTrustworthy(const struct stat& status) {
     return S_ISREG(status.st_mode) && status.st_uid == 0 && (status.st_mode & (S_IWGRP | S_IWOTH)) == 0;
@@ -56,7 +60,7 @@ SignatureFileSystem signatureFileSystem(int fd) {
     const auto type = fileSystem.f_type;
     // What a user mounts never lets set-user-id bits count; what an administrator mounts may.
     return {.ofUser = type == FUSE_SUPER_MAGIC && (fileSystem.f_flags & ST_NOSUID) != 0,
-            .showsChanges = type == EXT4_SUPER_MAGIC || type == XFS_SUPER_MAGIC || type == BTRFS_SUPER_MAGIC};
+            .showsChanges = std::ranges::find(datingFileSystems, type) != datingFileSystems.end()};
 }
 
 CodeSigningIdentity parseCodeSignature(std::string_view raw) {
