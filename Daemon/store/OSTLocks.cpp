@@ -270,7 +270,7 @@ void unlock_all_identifiers() {
     platform::logDebug("Unlocked all identifiers");
 }
 
-bool OSTHoldsAllIdentifiersLock(OSTLockKind kind) { return heldOfAllIdentifiers == kind; }
+bool OSTHoldsAllIdentifiersLock() { return heldOfAllIdentifiers == OSTLockKind::writing; }
 
 std::size_t OSTLockRecordCount() {
     const std::lock_guard lock(gOSTLocks.mutex);

@@ -35,8 +35,8 @@ void _lock_all_identifiers(OSTLockKind kind);
 /// Releases the all-identifiers lock, of either kind.
 void unlock_all_identifiers();
 
-/// Whether the calling thread holds the all-identifiers lock, of that kind.
-[[nodiscard]] bool OSTHoldsAllIdentifiersLock(OSTLockKind kind = OSTLockKind::writing);
+/// Whether the calling thread holds the all-identifiers lock for writing.
+[[nodiscard]] bool OSTHoldsAllIdentifiersLock();
 
 /// The number of live lock records: identifiers that somebody holds or waits for.
 [[nodiscard]] std::size_t OSTLockRecordCount();
@@ -45,12 +45,12 @@ void unlock_all_identifiers();
 class OSTAllIdentifiersLock {
 public:
     explicit OSTAllIdentifiersLock(OSTLockKind kind) : OSTAllIdentifiersLock(kind, true) {}
-    /// Holds nothing when `useLocking` is false: the caller's caller holds the lock, which is asserted.
+    /// Holds nothing when `useLocking` is false: the caller's caller holds the lock for writing, which is asserted.
     OSTAllIdentifiersLock(OSTLockKind kind, bool useLocking) : _locked(useLocking) {
         if (useLocking)
             _lock_all_identifiers(kind);
         else
-            OST_ASSERT(OSTHoldsAllIdentifiersLock(kind));
+            OST_ASSERT(OSTHoldsAllIdentifiersLock());
     }
     OSTAllIdentifiersLock(const OSTAllIdentifiersLock&) = delete;
     OSTAllIdentifiersLock& operator=(const OSTAllIdentifiersLock&) = delete;
