@@ -1,6 +1,6 @@
 #pragma once
 
-#include "service/OSTCommandTable.h"
+#include "service/OSTCommandEntry.h"
 
 namespace ost {
 

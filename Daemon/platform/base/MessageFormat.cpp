@@ -1,6 +1,5 @@
 #include "platform/base/MessageFormat.h"
 
-#include "platform/base/Assert.h"
 #include "platform/base/Unicode.h"
 
 #include <algorithm>
@@ -118,7 +117,6 @@ std::string formatMessage(std::string_view format, std::initializer_list<const M
         do
             ++i;
         while (format[i] == 'l');
-        OST_ASSERT(argument != arguments.end());
         (*argument++)->appendTo(out, format[i]);
     }
     return out;

@@ -131,10 +131,11 @@ private:
 template<typename... Arguments>
 using Message = MessageFormat<std::type_identity_t<Arguments>...>;
 
-/// Replaces the placeholders of `format`, in order, by the arguments. Their numbers must match.
+/// What the next function is made of; call that one, which sees to it that there is an argument for each placeholder.
 [[nodiscard]] std::string formatMessage(std::string_view format,
                                         std::initializer_list<const MessageArgument*> arguments);
 
+/// Replaces the placeholders of `format`, in order, by the arguments.
 template<typename... Arguments>
 [[nodiscard]] std::string formatMessage(Message<Arguments...> format, const Arguments&... arguments) {
     // The temporaries live until the end of the full expression, which is all that the formatter needs.

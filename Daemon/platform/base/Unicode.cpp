@@ -1,7 +1,5 @@
 #include "platform/base/Unicode.h"
 
-#include "platform/base/Assert.h"
-
 #include <cstdint>
 #include <cstring>
 
@@ -89,7 +87,8 @@ void appendUTF8(std::string& out, char32_t codePoint) {
 }
 
 bool appendUTF16BE(std::string& out, std::string_view text) {
-    OST_ASSERT(text.size() % 2 == 0);
+    if (text.size() % 2 != 0)
+        return false;
     const auto unitAt = [&](std::size_t index) { return byteAt(text, index) << 8 | byteAt(text, index + 1); };
     for (std::size_t i = 0; i < text.size(); i += 2) {
         char32_t codePoint = unitAt(i);

@@ -19,8 +19,7 @@ namespace ost::platform {
 /// Appends a code point that is no surrogate and at most U+10FFFF in UTF-8.
 void appendUTF8(std::string& out, char32_t codePoint);
 
-/// Appends `text`, UTF-16 with the high byte first and of even length, in UTF-8. False when it holds half a surrogate
-/// pair.
+/// Appends `text`, UTF-16 with the high byte first, in UTF-8. False when it holds half a unit or half a surrogate pair.
 [[nodiscard]] bool appendUTF16BE(std::string& out, std::string_view text);
 
 } // namespace ost::platform

@@ -1,6 +1,6 @@
 #pragma once
 
-#include "platform/codec/PropertyList.h"
+#include "platform/codec/PropertyListReading.h"
 
 namespace ost::platform {
 

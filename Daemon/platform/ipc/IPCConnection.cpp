@@ -2,7 +2,6 @@
 
 #include "platform/base/Assert.h"
 #include "platform/base/Log.h"
-#include "platform/ipc/IPCConnectionRegistry.h"
 
 #include <poll.h>
 #include <sys/epoll.h>
@@ -189,7 +188,7 @@ void IPCConnection::_closeIfFinished() {
 
 // Sending
 
-void IPCConnection::_sendReply(std::string frame, std::uint64_t sequence) {
+void IPCConnection::sendReply(std::string frame, std::uint64_t sequence) {
     const std::lock_guard lock(_mutex);
     if (_socket && sequence < _repliesEnd) {
         if (frame.size() - IPCFrameHeader::size <= _surroundings.limits.payload) {
@@ -202,7 +201,7 @@ void IPCConnection::_sendReply(std::string frame, std::uint64_t sequence) {
     _replyIsDone();
 }
 
-void IPCConnection::_abandonReply() {
+void IPCConnection::abandonReply() {
     const std::lock_guard lock(_mutex);
     _replyIsDone();
 }
@@ -332,7 +331,7 @@ void IPCConnection::_close() {
     // All descriptors first: whoever waits for some is told by the registry.
     socket.reset();
     _peer.unpin();
-    _surroundings.registry.remove(*this);
+    _surroundings.registry.remove(*this, _peer.effectiveUserId());
 
     _messageHandler = nullptr;
     if (const auto handler = std::exchange(_invalidationHandler, nullptr))

@@ -1,6 +1,7 @@
 #pragma once
 
 #include "platform/base/FileDescriptor.h"
+#include "platform/ipc/IPCConnectionRegistry.h"
 #include "platform/ipc/IPCFrame.h"
 #include "platform/ipc/IPCMessage.h"
 #include "platform/ipc/PeerIdentity.h"
@@ -24,20 +25,6 @@
 
 namespace ost::platform {
 
-class IPCConnectionRegistry;
-
-/// What a client may cost before it loses its connection.
-struct IPCLimits {
-    std::size_t connections = 4096;         ///< in all: three descriptors each
-    std::size_t connectionsOfOneUser = 256; ///< of a user id above 0, so that no user can take them all
-    std::uint32_t payload = IPCFrameHeader::maximumPayload;
-    std::size_t unreadReplies = 64 * 1024 * 1024;                   ///< bytes kept for a client that does not read
-    std::chrono::milliseconds takeReply = std::chrono::seconds(30); ///< to take a reply that the socket cannot hold
-    std::chrono::milliseconds completeFrame =
-        std::chrono::seconds(30);                                    ///< to send a frame whose first byte has arrived
-    std::chrono::milliseconds acceptAgain = std::chrono::seconds(1); ///< pause when the process is out of descriptors
-};
-
 /// One client: a connection that gives its requests, in order and one at a time, to the message handler.
 ///
 /// Threads: the message handler runs on a thread of the listener's pool; requests of different connections run at the
@@ -50,7 +37,7 @@ struct IPCLimits {
 /// The end: the client goes away, or breaks a rule of the wire or a limit, or `cancel` is called. Replies to the
 /// requests before that are still delivered where somebody is left to take them, then the socket is closed and the
 /// invalidation handler is called.
-class IPCConnection final : public EventSource {
+class IPCConnection final : public EventSource, public IPCReplyReceiver {
 public:
     using MessageHandler = std::function<void(const std::shared_ptr<IPCConnection>&, IPCRequest)>;
     using InvalidationHandler = std::function<void(const std::shared_ptr<IPCConnection>&)>;
@@ -84,9 +71,7 @@ public:
     [[nodiscard]] const PeerIdentity& peer() const { return _peer; }
 
 private:
-    friend class IPCReply;
     friend class IPCListener;
-    friend class IPCConnectionRegistry;
     using Time = std::chrono::steady_clock::time_point;
 
     /// Ordered: an end never becomes a milder one.
@@ -109,8 +94,8 @@ private:
     void _refuse(std::string_view reason);
 
     // Sending.
-    void _sendReply(std::string frame, std::uint64_t sequence);
-    void _abandonReply();
+    void sendReply(std::string frame, std::uint64_t sequence) override;
+    void abandonReply() override;
     void _flushUntil(Time deadline);
 
     void _close();

@@ -2,8 +2,8 @@
 
 namespace ost::platform {
 
-std::expected<void, const char*> IPCConnectionRegistry::add(const std::shared_ptr<IPCConnection>& connection) {
-    const auto user = connection->peer().effectiveUserId();
+std::expected<void, const char*> IPCConnectionRegistry::add(const std::shared_ptr<IPCConnection>& connection,
+                                                            uid_t user) {
     const std::lock_guard lock(_mutex);
     if (_connections.size() >= _limits.connections)
         return std::unexpected("too many connections");
@@ -15,12 +15,12 @@ std::expected<void, const char*> IPCConnectionRegistry::add(const std::shared_pt
     return {};
 }
 
-void IPCConnectionRegistry::remove(IPCConnection& connection) {
+void IPCConnectionRegistry::remove(IPCConnection& connection, uid_t user) {
     {
         const std::lock_guard lock(_mutex);
         if (_connections.erase(&connection) == 0)
             return;
-        const auto ofUser = _connectionsOfUser.find(connection.peer().effectiveUserId());
+        const auto ofUser = _connectionsOfUser.find(user);
         if (--ofUser->second == 0)
             _connectionsOfUser.erase(ofUser);
     }

@@ -1,6 +1,6 @@
 #pragma once
 
-#include "platform/ipc/IPCConnection.h"
+#include "platform/ipc/IPCLimits.h"
 
 #include <sys/types.h>
 
@@ -14,6 +14,8 @@
 
 namespace ost::platform {
 
+class IPCConnection;
+
 /// The open connections of a listener, counted for each user. Threads: any.
 class IPCConnectionRegistry {
 public:
@@ -22,9 +24,10 @@ public:
     /// Called after each removal. To be set before the first connection is added.
     void setRemovalHandler(std::function<void()> handler) { _removalHandler = std::move(handler); }
 
-    /// Takes a connection in, or says which limit refuses it.
-    [[nodiscard]] std::expected<void, const char*> add(const std::shared_ptr<IPCConnection>& connection);
-    void remove(IPCConnection& connection);
+    /// Takes a connection of `user` in, or says which limit refuses it.
+    [[nodiscard]] std::expected<void, const char*> add(const std::shared_ptr<IPCConnection>& connection, uid_t user);
+    /// Lets a connection of `user` go; one that was not taken in changes nothing.
+    void remove(IPCConnection& connection, uid_t user);
 
     [[nodiscard]] std::vector<std::shared_ptr<IPCConnection>> all() const;
 

@@ -1,7 +1,6 @@
 #include "platform/ipc/IPCMessage.h"
 
 #include "platform/base/Assert.h"
-#include "platform/ipc/IPCConnection.h"
 
 #include <utility>
 
@@ -36,7 +35,7 @@ std::optional<UUID> IPCRequest::uuidValue(std::string_view key) const {
     return value ? value->asUUID() : std::nullopt;
 }
 
-IPCReply::IPCReply(std::shared_ptr<IPCConnection> connection, std::uint32_t requestNumber, std::uint64_t sequence)
+IPCReply::IPCReply(std::shared_ptr<IPCReplyReceiver> connection, std::uint32_t requestNumber, std::uint64_t sequence)
     : _connection(std::move(connection)), _requestNumber(requestNumber), _sequence(sequence) {
     _frame.reserve(ordinaryReply);
     _frame.resize(headerRoom);
@@ -44,7 +43,7 @@ IPCReply::IPCReply(std::shared_ptr<IPCConnection> connection, std::uint32_t requ
 
 IPCReply::~IPCReply() {
     if (_connection)
-        _connection->_abandonReply();
+        _connection->abandonReply();
 }
 
 CBOREncoder IPCReply::encoder(std::string_view key) {
@@ -88,7 +87,7 @@ void IPCReply::send() {
     // A length that no header can hold is refused by the connection, which knows the limit.
     IPCFrameHeader{.payloadLength = static_cast<std::uint32_t>(payload), .requestNumber = _requestNumber}.write(
         _frame.data());
-    std::exchange(_connection, nullptr)->_sendReply(std::move(_frame), _sequence);
+    std::exchange(_connection, nullptr)->sendReply(std::move(_frame), _sequence);
 }
 
 } // namespace ost::platform

@@ -44,6 +44,21 @@ private:
     bool _hasReply = false;
 };
 
+/// Where replies go: the connection that their requests came in on. Threads: any.
+class IPCReplyReceiver {
+public:
+    virtual ~IPCReplyReceiver() = default;
+    /// Takes the frame that answers the request with that sequence.
+    virtual void sendReply(std::string frame, std::uint64_t sequence) = 0;
+    /// A reply will not come.
+    virtual void abandonReply() = 0;
+
+protected:
+    IPCReplyReceiver() = default;
+    IPCReplyReceiver(const IPCReplyReceiver&) = default;
+    IPCReplyReceiver& operator=(const IPCReplyReceiver&) = default;
+};
+
 /// The reply to one request: a dictionary that goes to the request's sender. Made by `IPCConnection::createReply`;
 /// move-only.
 ///
@@ -93,9 +108,9 @@ public:
 
 private:
     friend class IPCConnection;
-    IPCReply(std::shared_ptr<IPCConnection> connection, std::uint32_t requestNumber, std::uint64_t sequence);
+    IPCReply(std::shared_ptr<IPCReplyReceiver> connection, std::uint32_t requestNumber, std::uint64_t sequence);
 
-    std::shared_ptr<IPCConnection> _connection; ///< null once sent
+    std::shared_ptr<IPCReplyReceiver> _connection; ///< null once sent
     std::uint32_t _requestNumber;
     std::uint64_t _sequence;
     std::string _frame; ///< room for the header and the map's head, then the entries
