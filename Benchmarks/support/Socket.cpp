@@ -24,16 +24,16 @@ sockaddr_un addressOf(const std::string& path) {
 
 } // namespace
 
-FileDescriptor connectTo(const std::string& path) {
+FileDescriptor connectTo(const std::string& path, int type) {
     const auto address = addressOf(path);
-    FileDescriptor socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    FileDescriptor socket(::socket(AF_UNIX, type | SOCK_CLOEXEC, 0));
     require(socket && ::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0, path);
     return socket;
 }
 
-FileDescriptor listenOn(const std::string& path) {
+FileDescriptor listenOn(const std::string& path, int type) {
     const auto address = addressOf(path);
-    FileDescriptor socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+    FileDescriptor socket(::socket(AF_UNIX, type | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
     require(socket && ::bind(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0 &&
                 ::listen(socket.get(), SOMAXCONN) == 0,
             path);

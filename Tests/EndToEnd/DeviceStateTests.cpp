@@ -6,18 +6,12 @@
 
 #include <gtest/gtest.h>
 
-#include <sys/socket.h>
 #include <sys/stat.h>
-#include <sys/un.h>
-#include <unistd.h>
 
 #include <algorithm>
-#include <array>
 #include <map>
 
 namespace ost::test::wire {
-
-using platform::FileDescriptor;
 
 namespace {
 
@@ -34,24 +28,6 @@ protected:
 private:
     std::optional<Client> _caller;
 };
-
-/// A message of the kernel's: 13 words and no region.
-using Upcall = std::array<std::uint32_t, 13>;
-using UpcallReply = std::vector<std::int32_t>;
-
-/// Sends a message to the upcall port and gives the words of its reply.
-UpcallReply upcall(const std::filesystem::path& port, const Upcall& message) {
-    const FileDescriptor socket(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0));
-    sockaddr_un address{.sun_family = AF_UNIX, .sun_path = {}};
-    port.native().copy(address.sun_path, sizeof address.sun_path - 1);
-    if (::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0 ||
-        ::send(socket.get(), message.data(), sizeof message, MSG_NOSIGNAL) != sizeof message)
-        return {};
-    UpcallReply reply(64);
-    const auto size = ::recv(socket.get(), reply.data(), reply.size() * sizeof reply[0], 0);
-    reply.resize(size < 0 ? 0 : static_cast<std::size_t>(size) / sizeof reply[0]);
-    return reply;
-}
 
 } // namespace
 
@@ -93,18 +69,6 @@ TEST_F(DeviceStateTest, FirstBootWorkIsDoneOncePerBoot) {
     expectFirstBoots(1);
     device().reboot();
     expectFirstBoots(2);
-}
-
-TEST_F(DeviceStateTest, TheUpcallPortAnswersAndOutlivesADaemon) {
-    const auto port = device().socket().concat(".upcall");
-    constexpr std::uint32_t forgottenRequest = 322514901;
-    const Upcall message{0x80001513, 52, 0x1234, 0x5678, 0, forgottenRequest, 1};
-    const UpcallReply failure{0x13, 36, 0x1234, 0, 0, forgottenRequest + 100, 0, 1, -303};
-    EXPECT_EQ(upcall(port, message), failure);
-    for (int signal : {SIGKILL, SIGTERM}) {
-        device().killDaemon(signal);
-        EXPECT_EQ(upcall(port, message), failure);
-    }
 }
 
 TEST_F(DeviceStateTest, AnOrderlyEndFinishesWhatIsUnderWay) {
