@@ -1,4 +1,3 @@
-#include "EndToEnd/DeviceLog.h"
 #include "support/BootedDevice.h"
 #include "support/DeviceTest.h"
 
