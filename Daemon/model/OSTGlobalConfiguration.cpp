@@ -1,6 +1,7 @@
 #include "model/OSTGlobalConfiguration.h"
 
 #include "model/OSTMadeDirectory.h"
+#include "platform/base/Immortal.h"
 #include "platform/base/Log.h"
 #include "platform/base/Path.h"
 #include "platform/device/Accounts.h"
@@ -45,9 +46,8 @@ std::expected<bool, int> isBaseOfAUser(std::string_view base) {
 } // namespace
 
 OSTGlobalConfiguration& OSTGlobalConfiguration::sharedInstance() {
-    // Never destroyed: the process may end while somebody asks for a path.
-    static OSTGlobalConfiguration& instance = *new OSTGlobalConfiguration;
-    return instance;
+    static platform::Immortal configuration([] { return OSTGlobalConfiguration(); });
+    return *configuration;
 }
 
 OSTGlobalConfiguration::OSTGlobalConfiguration()
@@ -55,7 +55,7 @@ OSTGlobalConfiguration::OSTGlobalConfiguration()
       _sharedContainersDirectory(pathByAppending(canonical("/private/var"), "containers")) {}
 
 std::string OSTGlobalConfiguration::sharedContainersDirectory() {
-    const std::lock_guard lock(_mutex);
+    const platform::BasicMutexLock lock(_mutex);
     return OSTMadeDirectory(_sharedContainersDirectory, withIntermediates,
                             "Failed to create shared container dir at \"%@\": %@");
 }
@@ -66,49 +66,49 @@ std::string OSTGlobalConfiguration::logDirectory() {
 }
 
 std::string OSTGlobalConfiguration::cachesDirectory() {
-    const std::lock_guard lock(_mutex);
+    const platform::BasicMutexLock lock(_mutex);
     return OSTMadeDirectory(pathByAppending(_homeDirectory, cachesName), unprotected,
                             "Failed to create cache dir at \"%@\": %@");
 }
 
 std::string OSTGlobalConfiguration::libraryDirectory() {
-    const std::lock_guard lock(_mutex);
+    const platform::BasicMutexLock lock(_mutex);
     return OSTMadeDirectory(pathByAppending(_homeDirectory, "Library/Ostrand"), unprotected,
                             "Failed to create library dir at \"%@\": %@");
 }
 
 std::string OSTGlobalConfiguration::transientDirectory() {
-    const std::lock_guard lock(_mutex);
+    const platform::BasicMutexLock lock(_mutex);
     return OSTMadeDirectory(pathByAppending(cachesDirectory(), transientName), withIntermediates,
                             "Failed to create transient dir at \"%@\": %@");
 }
 
 std::string OSTGlobalConfiguration::stagingDirectory() {
-    const std::lock_guard lock(_mutex);
+    const platform::BasicMutexLock lock(_mutex);
     return OSTMadeDirectory(pathByAppending(cachesDirectory(), "Staging"), withIntermediates,
                             "Failed to create staging dir at \"%@\": %@");
 }
 
 std::string OSTGlobalConfiguration::deathrowDirectory() {
-    const std::lock_guard lock(_mutex);
+    const platform::BasicMutexLock lock(_mutex);
     return OSTMadeDirectory(pathByAppending(cachesDirectory(), "Dead"), withIntermediates,
                             "Failed to create deathrow dir at \"%@\": %@");
 }
 
 std::string OSTGlobalConfiguration::replaceDirectory() {
-    const std::lock_guard lock(_mutex);
+    const platform::BasicMutexLock lock(_mutex);
     return OSTMadeDirectory(pathByAppending(libraryDirectory(), "Replace"), withIntermediates,
                             "Failed to create replace dir at \"%@\": %@");
 }
 
 std::string OSTGlobalConfiguration::bundleDirectory() {
-    const std::lock_guard lock(_mutex);
+    const platform::BasicMutexLock lock(_mutex);
     return OSTMadeDirectory(pathByAppending(sharedContainersDirectory(), "Bundle"), withIntermediates,
                             "Failed to create bundle dir at \"%@\": %@");
 }
 
 std::string OSTGlobalConfiguration::transientBundleDirectory() {
-    const std::lock_guard lock(_mutex);
+    const platform::BasicMutexLock lock(_mutex);
     std::string path = _tessalydHomeDirectory;
     for (const auto component : {"Library", "Caches", "com.tamarok.ostrandd"})
         path = OSTMadeDirectory(pathByAppending(path, component), {.mode = 0755, .owner = OSTInstallerUserId},
@@ -117,7 +117,7 @@ std::string OSTGlobalConfiguration::transientBundleDirectory() {
 }
 
 OSTPerUserConfiguration* OSTGlobalConfiguration::getPerUserConfigurationForUserId(std::uint32_t userId) {
-    const std::lock_guard lock(_mutex);
+    const platform::BasicMutexLock lock(_mutex);
     auto found = _perUserConfigurations.find(userId);
     if (found == _perUserConfigurations.end()) {
         auto configuration = OSTPerUserConfiguration::withUserId(userId);
@@ -131,7 +131,7 @@ OSTPerUserConfiguration* OSTGlobalConfiguration::getPerUserConfigurationForUserI
 std::optional<std::string> OSTGlobalConfiguration::containerDirectoryURLForUser(std::uint32_t userId,
                                                                                 OSTContainerClass contentClass,
                                                                                 bool transient) {
-    const std::lock_guard lock(_mutex);
+    const platform::BasicMutexLock lock(_mutex);
     std::string base;
     std::uint32_t owner = OSTRootUserId;
     if (isSystemClass(contentClass)) {

@@ -2,13 +2,13 @@
 
 #include "Protocol/OSTContainerClass.h"
 #include "model/OSTPerUserConfiguration.h"
+#include "platform/base/Mutex.h"
 
 #include <array>
 #include <cstdint>
 #include <expected>
 #include <map>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -66,9 +66,9 @@ private:
     const std::string _tessalydHomeDirectory;
     const std::string _sharedContainersDirectory;
 
-    // Serialises the accessors and guards the dictionary. Recursive: directories lie inside each other.
-    std::recursive_mutex _mutex;
-    std::map<std::uint32_t, std::unique_ptr<OSTPerUserConfiguration>> _perUserConfigurations;
+    // Serialises the accessors. Recursive: directories lie inside each other.
+    platform::RecursiveMutex _mutex;
+    std::map<std::uint32_t, std::unique_ptr<OSTPerUserConfiguration>> _perUserConfigurations OST_GUARDED_BY(_mutex);
 };
 
 } // namespace ost

@@ -57,7 +57,7 @@ std::optional<std::string> OSTPerUserConfiguration::userBaseDirectory() {
     auto path = _inHome(OSTUserBaseDirectoryName);
     if (!path)
         return std::nullopt;
-    const std::lock_guard lock(_mutex);
+    const platform::MutexLock lock(_mutex);
     return OSTMadeDirectory(*std::move(path), _ownedByUser(), "Failed to create user base dir at \"%@\": %@");
 }
 
@@ -65,7 +65,7 @@ std::optional<std::string> OSTPerUserConfiguration::transientDirectory() {
     auto path = _inHome(OSTUserTransientDirectoryName);
     if (!path)
         return std::nullopt;
-    const std::lock_guard lock(_mutex);
+    const platform::MutexLock lock(_mutex);
     return OSTMadeDirectory(*std::move(path), _ownedByUser(), "Failed to create transient dir at \"%@\": %@");
 }
 
@@ -84,7 +84,7 @@ std::optional<std::string> OSTPerUserConfiguration::containerDirectoryURLForCont
     const auto base = transient ? transientDirectory() : userBaseDirectory();
     if (!base)
         return std::nullopt;
-    const std::lock_guard lock(_mutex);
+    const platform::MutexLock lock(_mutex);
     return OSTMadeDirectory(pathByAppending(*base, pathComponentForContainerClass(contentClass)), _ownedByUser(),
                             "Failed to create container dir at \"%@\": %@");
 }

@@ -2,10 +2,10 @@
 
 #include "Protocol/OSTContainerClass.h"
 #include "files/OSTFileManager.h"
+#include "platform/base/Mutex.h"
 
 #include <cstdint>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -54,7 +54,7 @@ private:
     const std::optional<std::string> _userHomeDirectory;
 
     // Serialises the making of the directories.
-    std::mutex _mutex;
+    platform::Mutex _mutex;
 };
 
 } // namespace ost

@@ -1,10 +1,10 @@
 #include "model/OSTUserIdentity.h"
 
 #include "platform/base/Log.h"
+#include "platform/base/Mutex.h"
 #include "platform/device/Accounts.h"
 
 #include <cerrno>
-#include <mutex>
 #include <optional>
 
 namespace ost {
@@ -31,9 +31,9 @@ std::optional<std::uint32_t> resolvedUserId(std::uint32_t userId, OSTContainerCl
 } // namespace
 
 std::uint32_t getCurrentMobileUserId() {
-    static std::mutex mutex;
-    static std::optional<std::uint32_t> mobileUserId;
-    const std::lock_guard lock(mutex);
+    static platform::Mutex mutex;
+    static std::optional<std::uint32_t> mobileUserId OST_GUARDED_BY(mutex);
+    const platform::MutexLock lock(mutex);
     if (mobileUserId)
         return *mobileUserId;
     const auto account = platform::accountForName("mobile");

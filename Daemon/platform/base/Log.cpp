@@ -1,5 +1,7 @@
 #include "platform/base/Log.h"
 
+#include "platform/base/Immortal.h"
+
 #include <fcntl.h>
 #include <poll.h>
 #include <sys/stat.h>
@@ -53,13 +55,12 @@ void copyToStandardError(std::string_view line) {
 } // namespace
 
 Log& Log::shared() {
-    // Never destroyed: threads may still log while the process ends.
-    static Log& log = *new Log;
-    return log;
+    static Immortal log([] { return Log(); });
+    return *log;
 }
 
 std::expected<void, int> Log::open(LogLevel level, DiskFile file) {
-    const std::lock_guard lock(_mutex);
+    const MutexLock lock(_mutex);
     _level = level;
     _disk = std::move(file);
     return _openFile();
@@ -93,7 +94,7 @@ void Log::_rotate() {
             _written = 0;
         return;
     }
-    const auto numbered = [&](unsigned number) {
+    const auto numbered = [&](unsigned number) OST_REQUIRES(_mutex) {
         return number == 0 ? _disk.path : _disk.path + "." + std::to_string(number);
     };
     for (unsigned number = _disk.files - 1; number > 0; --number)
@@ -115,7 +116,7 @@ void Log::write(LogLevel level, std::string_view function, std::string_view mess
     }
     line += '\n';
 
-    const std::lock_guard lock(_mutex);
+    const MutexLock lock(_mutex);
     if (level == LogLevel::error)
         copyToStandardError(line);
     if (_disk.path.empty() || (!_fileIsLinked() && !_openFile()))

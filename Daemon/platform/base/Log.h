@@ -2,11 +2,11 @@
 
 #include "platform/base/FileDescriptor.h"
 #include "platform/base/MessageFormat.h"
+#include "platform/base/Mutex.h"
 
 #include <atomic>
 #include <cstdint>
 #include <expected>
-#include <mutex>
 #include <string>
 #include <string_view>
 
@@ -39,16 +39,15 @@ public:
     void write(LogLevel level, std::string_view function, std::string_view message);
 
 private:
-    [[nodiscard]] bool _fileIsLinked() const;
-    [[nodiscard]] std::expected<void, int> _openFile();
-    void _rotate();
+    [[nodiscard]] bool _fileIsLinked() const OST_REQUIRES(_mutex);
+    [[nodiscard]] std::expected<void, int> _openFile() OST_REQUIRES(_mutex);
+    void _rotate() OST_REQUIRES(_mutex);
 
     std::atomic<LogLevel> _level{LogLevel::notice};
-    std::mutex _mutex;
-    // Guarded by _mutex.
-    DiskFile _disk{};
-    FileDescriptor _file;
-    std::uint64_t _written = 0;
+    Mutex _mutex;
+    DiskFile _disk OST_GUARDED_BY(_mutex){};
+    FileDescriptor _file OST_GUARDED_BY(_mutex);
+    std::uint64_t _written OST_GUARDED_BY(_mutex) = 0;
 };
 
 /// Writes a line whose function field is the calling function's name.

@@ -1,6 +1,7 @@
 #include "platform/device/CrashReport.h"
 
 #include "platform/base/FileDescriptor.h"
+#include "platform/base/Immortal.h"
 
 #include <fcntl.h>
 #include <poll.h>
@@ -63,8 +64,8 @@ void writeToStandardError(std::string_view message) {
 
 void crashWithMessage(std::string_view message) {
     // Never unlocked: the process ends here.
-    static std::mutex& slot = *new std::mutex;
-    slot.lock();
+    static Immortal slot([] { return std::mutex(); });
+    (*slot).lock();
     auto text = std::string(message);
     if (!text.ends_with('\n'))
         text += '\n';

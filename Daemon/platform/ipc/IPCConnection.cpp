@@ -43,7 +43,7 @@ IPCConnection::IPCConnection(FileDescriptor socket, PeerIdentity peer, const Sur
 void IPCConnection::resume() {
     {
         // Requests may be handled before `add` returns; whoever closes the socket needs the watch.
-        const std::lock_guard lock(_mutex);
+        const MutexLock lock(_mutex);
         OST_ASSERT(_watch == WorkerPool::Watch::none && _messageHandler);
         const auto watch = _surroundings.pool.add(shared_from_this(), _socket.get(), receptionEvents);
         if (watch) {
@@ -64,7 +64,7 @@ std::optional<IPCReply> IPCConnection::createReply(IPCRequest& request) {
 }
 
 void IPCConnection::cancel() {
-    const std::lock_guard lock(_mutex);
+    const MutexLock lock(_mutex);
     _endWith(End::cancelled);
 }
 
@@ -80,10 +80,10 @@ void IPCConnection::serve(std::uint32_t events, std::span<char> scratch) {
 }
 
 void IPCConnection::_serveEvents(std::uint32_t events, std::span<char> scratch) {
-    if (!_socket)
+    if (_servedSocket() < 0)
         return;
     if ((events & EPOLLOUT) != 0) {
-        const std::lock_guard lock(_mutex);
+        const MutexLock lock(_mutex);
         _sendKept();
     }
     _readUntilEnd |= (events & (EPOLLRDHUP | hangUpEvents)) != 0;
@@ -120,7 +120,7 @@ void IPCConnection::_receive(std::span<char> scratch) {
 /// of anything further is yet to come. An end that was announced already has to be read, though.
 bool IPCConnection::_receiveSome(std::span<char> scratch) {
     const auto space = _reader.space(scratch);
-    const auto count = ::recv(_socket.get(), space.data(), space.size(), MSG_DONTWAIT);
+    const auto count = ::recv(_servedSocket(), space.data(), space.size(), MSG_DONTWAIT);
     if (count > 0) {
         const auto size = static_cast<std::size_t>(count);
         _reader.received(size);
@@ -128,7 +128,7 @@ bool IPCConnection::_receiveSome(std::span<char> scratch) {
     }
     if (count < 0 && (errno == EAGAIN || errno == EINTR))
         return errno == EAGAIN;
-    const std::lock_guard lock(_mutex);
+    const MutexLock lock(_mutex);
     _endWith(End::noMoreRequests);
     return true;
 }
@@ -150,7 +150,7 @@ void IPCConnection::_watchForFrame(bool drained) {
         return;
     _waitsForFrame = waits;
     _awaitedFrame = _sequence;
-    const std::lock_guard lock(_mutex);
+    const MutexLock lock(_mutex);
     _frameDeadline = waits ? std::optional(Clock::now() + _surroundings.limits.completeFrame) : std::nullopt;
     _updateDeadline();
 }
@@ -160,7 +160,7 @@ void IPCConnection::_checkDeadlines() {
     const auto passed = [&](const std::optional<Time>& deadline) { return deadline && *deadline <= now; };
     bool frame = false;
     {
-        const std::lock_guard lock(_mutex);
+        const MutexLock lock(_mutex);
         frame = passed(_frameDeadline);
         if (passed(_replyDeadline)) {
             logError("connection of pid %d closed: it does not take its replies", _peer.processId());
@@ -178,7 +178,7 @@ void IPCConnection::_refuse(std::string_view reason) {
 
 void IPCConnection::_closeIfFinished() {
     {
-        const std::lock_guard lock(_mutex);
+        const MutexLock lock(_mutex);
         const bool nothingToDeliver = _unsent.empty() && _openReplies.load() == 0;
         if (_end.load() != End::broken && !_hungUp && !nothingToDeliver)
             return;
@@ -189,7 +189,7 @@ void IPCConnection::_closeIfFinished() {
 // Sending
 
 void IPCConnection::sendReply(std::string frame, std::uint64_t sequence) {
-    const std::lock_guard lock(_mutex);
+    const MutexLock lock(_mutex);
     if (_socket && sequence < _repliesEnd) {
         if (frame.size() - IPCFrameHeader::size <= _surroundings.limits.payload) {
             _sendOrKeep(std::move(frame));
@@ -202,7 +202,7 @@ void IPCConnection::sendReply(std::string frame, std::uint64_t sequence) {
 }
 
 void IPCConnection::abandonReply() {
-    const std::lock_guard lock(_mutex);
+    const MutexLock lock(_mutex);
     _replyIsDone();
 }
 
@@ -272,7 +272,7 @@ void IPCConnection::_flushUntil(Time deadline) {
     for (;;) {
         pollfd writable{.fd = -1, .events = POLLOUT, .revents = 0};
         {
-            const std::lock_guard lock(_mutex);
+            const MutexLock lock(_mutex);
             if (!_socket)
                 return;
             _sendKept();
@@ -315,7 +315,7 @@ void IPCConnection::_close() {
     const auto self = std::static_pointer_cast<IPCConnection>(shared_from_this());
     FileDescriptor socket;
     {
-        const std::lock_guard lock(_mutex);
+        const MutexLock lock(_mutex);
         if (!_socket)
             return;
         if (_watch != WorkerPool::Watch::none)
@@ -340,7 +340,7 @@ void IPCConnection::_close() {
 
 void IPCConnection::_closeUnlessResumed() {
     {
-        const std::lock_guard lock(_mutex);
+        const MutexLock lock(_mutex);
         if (_watch != WorkerPool::Watch::none)
             return;
     }

@@ -1,6 +1,7 @@
 #pragma once
 
 #include "platform/base/FileDescriptor.h"
+#include "platform/base/Mutex.h"
 #include "platform/ipc/IPCConnectionRegistry.h"
 #include "platform/ipc/IPCFrame.h"
 #include "platform/ipc/IPCMessage.h"
@@ -17,7 +18,6 @@
 #include <functional>
 #include <limits>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <span>
 #include <string>
@@ -91,6 +91,8 @@ private:
     void _watchForFrame(bool drained);
     void _checkDeadlines();
     void _closeIfFinished();
+    /// The socket, or -1 once it is closed. Only the thread that serves closes it, so that one needs no mutex.
+    [[nodiscard]] int _servedSocket() const OST_NO_THREAD_ANALYSIS { return _socket.get(); }
     void _refuse(std::string_view reason);
 
     // Sending.
@@ -101,13 +103,12 @@ private:
     void _close();
     void _closeUnlessResumed();
 
-    // Only with _mutex held.
-    void _sendOrKeep(std::string frame);
-    void _sendKept();
-    [[nodiscard]] std::optional<std::size_t> _trySending(std::string_view bytes);
-    void _replyIsDone();
-    void _endWith(End end);
-    void _updateDeadline();
+    void _sendOrKeep(std::string frame) OST_REQUIRES(_mutex);
+    void _sendKept() OST_REQUIRES(_mutex);
+    [[nodiscard]] std::optional<std::size_t> _trySending(std::string_view bytes) OST_REQUIRES(_mutex);
+    void _replyIsDone() OST_REQUIRES(_mutex);
+    void _endWith(End end) OST_REQUIRES(_mutex);
+    void _updateDeadline() OST_REQUIRES(_mutex);
 
     Surroundings _surroundings;
     PeerIdentity _peer;
@@ -127,17 +128,20 @@ private:
     std::atomic<std::size_t> _openReplies{0};      ///< made and neither sent nor abandoned
     std::atomic<std::uint64_t> _firstUnhandled{0}; ///< sequence of the request at hand, or else of the next
 
-    std::mutex _mutex;
-    // Guarded by _mutex.
-    FileDescriptor _socket; ///< empty once closed; the surroundings are used only while it is open
-    WorkerPool::Watch _watch = WorkerPool::Watch::none;
-    std::uint64_t _repliesEnd = std::numeric_limits<std::uint64_t>::max(); ///< requests from here on get no reply
-    std::deque<std::string> _unsent;
-    std::size_t _unsentBytes = 0;
-    std::size_t _sentOfFirst = 0; ///< bytes of the first one that the socket has taken
-    std::optional<Time> _frameDeadline;
-    std::optional<Time> _replyDeadline;
-    std::optional<Time> _deadline; ///< the earliest, as the timer knows it
+    Mutex _mutex;
+    /// Empty once closed; the surroundings are used only while it is open.
+    FileDescriptor _socket OST_GUARDED_BY(_mutex);
+    WorkerPool::Watch _watch OST_GUARDED_BY(_mutex) = WorkerPool::Watch::none;
+    /// Requests from here on get no reply.
+    std::uint64_t _repliesEnd OST_GUARDED_BY(_mutex) = std::numeric_limits<std::uint64_t>::max();
+    std::deque<std::string> _unsent OST_GUARDED_BY(_mutex);
+    std::size_t _unsentBytes OST_GUARDED_BY(_mutex) = 0;
+    /// Bytes of the first one that the socket has taken.
+    std::size_t _sentOfFirst OST_GUARDED_BY(_mutex) = 0;
+    std::optional<Time> _frameDeadline OST_GUARDED_BY(_mutex);
+    std::optional<Time> _replyDeadline OST_GUARDED_BY(_mutex);
+    /// The earliest, as the timer knows it.
+    std::optional<Time> _deadline OST_GUARDED_BY(_mutex);
 };
 
 } // namespace ost::platform

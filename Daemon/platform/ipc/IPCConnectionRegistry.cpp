@@ -4,7 +4,7 @@ namespace ost::platform {
 
 std::expected<void, const char*> IPCConnectionRegistry::add(const std::shared_ptr<IPCConnection>& connection,
                                                             uid_t user) {
-    const std::lock_guard lock(_mutex);
+    const MutexLock lock(_mutex);
     if (_connections.size() >= _limits.connections)
         return std::unexpected("too many connections");
     auto& ofUser = _connectionsOfUser[user];
@@ -17,7 +17,7 @@ std::expected<void, const char*> IPCConnectionRegistry::add(const std::shared_pt
 
 void IPCConnectionRegistry::remove(IPCConnection& connection, uid_t user) {
     {
-        const std::lock_guard lock(_mutex);
+        const MutexLock lock(_mutex);
         if (_connections.erase(&connection) == 0)
             return;
         const auto ofUser = _connectionsOfUser.find(user);
@@ -29,7 +29,7 @@ void IPCConnectionRegistry::remove(IPCConnection& connection, uid_t user) {
 }
 
 std::vector<std::shared_ptr<IPCConnection>> IPCConnectionRegistry::all() const {
-    const std::lock_guard lock(_mutex);
+    const MutexLock lock(_mutex);
     std::vector<std::shared_ptr<IPCConnection>> connections;
     connections.reserve(_connections.size());
     for (const auto& [key, connection] : _connections)

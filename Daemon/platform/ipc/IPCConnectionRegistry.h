@@ -1,5 +1,6 @@
 #pragma once
 
+#include "platform/base/Mutex.h"
 #include "platform/ipc/IPCLimits.h"
 
 #include <sys/types.h>
@@ -8,7 +9,6 @@
 #include <expected>
 #include <functional>
 #include <memory>
-#include <mutex>
 #include <unordered_map>
 #include <vector>
 
@@ -35,10 +35,9 @@ private:
     const IPCLimits& _limits;
     std::function<void()> _removalHandler;
 
-    mutable std::mutex _mutex;
-    // Guarded by _mutex.
-    std::unordered_map<IPCConnection*, std::shared_ptr<IPCConnection>> _connections;
-    std::unordered_map<uid_t, std::size_t> _connectionsOfUser;
+    mutable Mutex _mutex;
+    std::unordered_map<IPCConnection*, std::shared_ptr<IPCConnection>> _connections OST_GUARDED_BY(_mutex);
+    std::unordered_map<uid_t, std::size_t> _connectionsOfUser OST_GUARDED_BY(_mutex);
 };
 
 } // namespace ost::platform

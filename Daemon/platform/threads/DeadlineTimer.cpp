@@ -27,13 +27,13 @@ void DeadlineTimer::stop() {
     if (_watch != WorkerPool::Watch::none)
         _pool.remove(std::exchange(_watch, WorkerPool::Watch::none), _timer.get());
     decltype(_deadlines) forgotten;
-    const std::lock_guard lock(_mutex);
+    const MutexLock lock(_mutex);
     forgotten.swap(_deadlines);
 }
 
 void DeadlineTimer::change(const std::shared_ptr<EventSource>& source, std::optional<Time> before,
                            std::optional<Time> after) {
-    const std::lock_guard lock(_mutex);
+    const MutexLock lock(_mutex);
     if (before)
         _deadlines.erase({*before, source.get()});
     if (!after)
@@ -58,7 +58,7 @@ void DeadlineTimer::serve(std::uint32_t /*events*/, std::span<char> /*scratch*/)
     [[maybe_unused]] const auto count = ::read(_timer.get(), &expirations, sizeof expirations);
     std::vector<std::shared_ptr<EventSource>> expired;
     {
-        const std::lock_guard lock(_mutex);
+        const MutexLock lock(_mutex);
         const auto now = std::chrono::steady_clock::now();
         while (!_deadlines.empty() && _deadlines.begin()->first.first <= now)
             expired.push_back(std::move(_deadlines.extract(_deadlines.begin()).mapped()));

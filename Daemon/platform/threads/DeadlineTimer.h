@@ -1,6 +1,7 @@
 #pragma once
 
 #include "platform/base/FileDescriptor.h"
+#include "platform/base/Mutex.h"
 #include "platform/threads/EventSource.h"
 #include "platform/threads/WorkerPool.h"
 
@@ -9,7 +10,6 @@
 #include <expected>
 #include <map>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <span>
 #include <utility>
@@ -37,16 +37,15 @@ public:
 
 private:
     void serve(std::uint32_t events, std::span<char> scratch) override;
-    void _armFor(Time time);
+    void _armFor(Time time) OST_REQUIRES(_mutex);
 
     WorkerPool& _pool;
     WorkerPool::Watch _watch = WorkerPool::Watch::none;
     FileDescriptor _timer;
 
-    std::mutex _mutex;
-    // Guarded by _mutex.
-    std::map<std::pair<Time, EventSource*>, std::shared_ptr<EventSource>> _deadlines;
-    std::optional<Time> _armed; ///< when the timer fires next
+    Mutex _mutex;
+    std::map<std::pair<Time, EventSource*>, std::shared_ptr<EventSource>> _deadlines OST_GUARDED_BY(_mutex);
+    std::optional<Time> _armed OST_GUARDED_BY(_mutex); ///< when the timer fires next
 };
 
 } // namespace ost::platform

@@ -79,7 +79,7 @@ void RunLoop::_remove(std::uint64_t id) noexcept {
 
 void RunLoop::async(Work work) {
     {
-        const std::lock_guard lock(_mutex);
+        const MutexLock lock(_mutex);
         _work.push_back(std::move(work));
     }
     _wake();
@@ -121,7 +121,7 @@ void RunLoop::_runWork() {
     [[maybe_unused]] const auto read = ::read(_wakeUp.get(), &wakeUps, sizeof wakeUps);
     std::vector<Work> taken;
     {
-        const std::lock_guard lock(_mutex);
+        const MutexLock lock(_mutex);
         taken.swap(_work);
     }
     for (auto work = taken.begin(); work != taken.end(); ++work) {
@@ -129,7 +129,7 @@ void RunLoop::_runWork() {
         *work = nullptr;
         if (_stopping) {
             // What was taken but not run keeps its place for the next run.
-            const std::lock_guard lock(_mutex);
+            const MutexLock lock(_mutex);
             _work.insert(_work.begin(), std::make_move_iterator(work + 1), std::make_move_iterator(taken.end()));
             _wake();
             return;

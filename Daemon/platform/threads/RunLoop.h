@@ -1,13 +1,13 @@
 #pragma once
 
 #include "platform/base/FileDescriptor.h"
+#include "platform/base/Mutex.h"
 
 #include <atomic>
 #include <cstdint>
 #include <expected>
 #include <functional>
 #include <memory>
-#include <mutex>
 #include <thread>
 #include <unordered_map>
 #include <utility>
@@ -90,9 +90,8 @@ private:
 
     std::atomic<bool> _stopping = false;
 
-    std::mutex _mutex;
-    // Guarded by _mutex.
-    std::vector<Work> _work;
+    Mutex _mutex;
+    std::vector<Work> _work OST_GUARDED_BY(_mutex);
 };
 
 } // namespace ost::platform

@@ -1,5 +1,7 @@
 #include "platform/threads/Transactions.h"
 
+#include "platform/base/Immortal.h"
+
 #include <iterator>
 #include <map>
 #include <string_view>
@@ -8,18 +10,17 @@
 namespace ost::platform {
 
 Transactions& Transactions::shared() {
-    // Never destroyed: threads may still hold transactions while the process ends.
-    static Transactions& transactions = *new Transactions;
-    return transactions;
+    static Immortal transactions([] { return Transactions(); });
+    return *transactions;
 }
 
 bool Transactions::waitUntilNone(std::chrono::steady_clock::time_point deadline) {
-    std::unique_lock lock(_mutex);
-    return _noneLeft.wait_until(lock, deadline, [this] { return _names.empty(); });
+    MutexLock lock(_mutex);
+    return _noneLeft.waitUntil(lock, deadline, [this]() OST_REQUIRES(_mutex) { return _names.empty(); });
 }
 
 std::string Transactions::describeOpen() {
-    const std::lock_guard lock(_mutex);
+    const MutexLock lock(_mutex);
     std::map<std::string_view, std::size_t> counts;
     for (const auto& name : _names)
         ++counts[name];
@@ -35,17 +36,17 @@ std::string Transactions::describeOpen() {
 Transactions::Names::iterator Transactions::_open(std::string name) {
     Names opened;
     opened.push_back(std::move(name));
-    const std::lock_guard lock(_mutex);
+    const MutexLock lock(_mutex);
     _names.splice(_names.end(), opened);
     return std::prev(_names.end());
 }
 
 void Transactions::_end(Names::iterator transaction) {
     Names ended;
-    const std::lock_guard lock(_mutex);
+    const MutexLock lock(_mutex);
     ended.splice(ended.end(), _names, transaction);
     if (_names.empty())
-        _noneLeft.notify_all();
+        _noneLeft.notifyAll();
 }
 
 Transaction::Transaction(std::string name) : _transaction(Transactions::shared()._open(std::move(name))) {}

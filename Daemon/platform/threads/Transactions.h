@@ -1,11 +1,10 @@
 #pragma once
 
+#include "platform/base/Mutex.h"
 #include "platform/threads/WorkQueue.h"
 
 #include <chrono>
-#include <condition_variable>
 #include <list>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <utility>
@@ -33,10 +32,9 @@ private:
     [[nodiscard]] Names::iterator _open(std::string name);
     void _end(Names::iterator transaction);
 
-    std::mutex _mutex;
-    // Guarded by _mutex.
-    Names _names;
-    std::condition_variable _noneLeft;
+    Mutex _mutex;
+    Names _names OST_GUARDED_BY(_mutex);
+    Condition _noneLeft;
 };
 
 /// One open transaction; ends when destroyed. Move-only. One object belongs to one thread at a time.

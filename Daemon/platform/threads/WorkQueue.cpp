@@ -36,7 +36,7 @@ WorkQueue::~WorkQueue() { stop(); }
 
 void WorkQueue::async(Work work) {
     OST_ASSERT(work);
-    const std::lock_guard lock(_mutex);
+    const MutexLock lock(_mutex);
     if (_stopped)
         return;
     if (!_worker.joinable())
@@ -46,32 +46,32 @@ void WorkQueue::async(Work work) {
 }
 
 void WorkQueue::suspend() {
-    const std::lock_guard lock(_mutex);
+    const MutexLock lock(_mutex);
     ++_suspensions;
 }
 
 void WorkQueue::resume() {
-    const std::lock_guard lock(_mutex);
+    const MutexLock lock(_mutex);
     OST_ASSERT(_suspensions > 0);
     --_suspensions;
     _wakeNext();
 }
 
 void WorkQueue::setTargetBackgroundPriority() {
-    const std::lock_guard lock(_mutex);
+    const MutexLock lock(_mutex);
     OST_ASSERT(!_worker.joinable());
     _background = true;
 }
 
 void WorkQueue::abandon() {
     std::vector<Work> abandoned; // goes last and without the lock: what it holds may do anything when it is let go
-    const std::lock_guard lock(_mutex);
+    const MutexLock lock(_mutex);
     _stopped = true;
     for (auto& entry : _entries)
         if (!entry.waiter)
             abandoned.push_back(std::move(entry.work));
     std::erase_if(_entries, [](const Entry& entry) { return !entry.waiter; });
-    _workerTurnCame.notify_one();
+    _workerTurnCame.notifyOne();
     _wakeNext();
 }
 
@@ -80,7 +80,7 @@ void WorkQueue::stop() {
     abandon();
     std::thread worker;
     {
-        const std::lock_guard lock(_mutex);
+        const MutexLock lock(_mutex);
         worker = std::move(_worker);
     }
     if (worker.joinable())
@@ -89,28 +89,29 @@ void WorkQueue::stop() {
 
 void WorkQueue::_enter() {
     OST_ASSERT(!isCurrent());
-    std::unique_lock lock(_mutex);
+    MutexLock lock(_mutex);
     if (!_mayBegin() || !_entries.empty()) {
         Waiter waiter;
         _entries.push_back({{}, &waiter});
-        waiter.turnCame.wait(lock, [&] { return _mayBegin() && _entries.front().waiter == &waiter; });
+        waiter.turnCame.wait(lock,
+                             [&]() OST_REQUIRES(_mutex) { return _mayBegin() && _entries.front().waiter == &waiter; });
         _entries.pop_front();
     }
     _begin();
 }
 
 void WorkQueue::_leave() {
-    const std::lock_guard lock(_mutex);
+    const MutexLock lock(_mutex);
     _finish();
 }
 
 void WorkQueue::_runWorker() {
     setCurrentThreadName(_label);
-    std::unique_lock lock(_mutex);
+    MutexLock lock(_mutex);
     if (_background)
         takeBackgroundPriority();
     while (true) {
-        _workerTurnCame.wait(lock, [&] { return _stopped || _workerIsNext(); });
+        _workerTurnCame.wait(lock, [&]() OST_REQUIRES(_mutex) { return _stopped || _workerIsNext(); });
         if (_stopped)
             return;
         Work work = std::move(_entries.front().work);
@@ -139,7 +140,7 @@ void WorkQueue::_wakeNext() {
         return;
     // Signalled under the lock: a waiter whose turn came is gone as soon as it can take the lock.
     auto* waiter = _entries.front().waiter;
-    (waiter ? waiter->turnCame : _workerTurnCame).notify_one();
+    (waiter ? waiter->turnCame : _workerTurnCame).notifyOne();
 }
 
 } // namespace ost::platform

@@ -1,10 +1,10 @@
 #pragma once
 
+#include "platform/base/Mutex.h"
+
 #include <atomic>
-#include <condition_variable>
 #include <deque>
 #include <functional>
-#include <mutex>
 #include <string>
 #include <thread>
 #include <type_traits>
@@ -67,7 +67,7 @@ public:
 private:
     /// One thread inside `sync` that waits for its turn.
     struct Waiter {
-        std::condition_variable turnCame;
+        Condition turnCame;
     };
     /// Work, or the thread that waits to run its own.
     struct Entry {
@@ -89,26 +89,26 @@ private:
     void _leave();
     void _runWorker();
 
-    // These require _mutex to be held.
-    [[nodiscard]] bool _mayBegin() const { return !_busy && (_suspensions == 0 || _stopped); }
-    [[nodiscard]] bool _workerIsNext() const { return _mayBegin() && !_entries.empty() && !_entries.front().waiter; }
-    void _begin();
-    void _finish();
-    void _wakeNext();
+    [[nodiscard]] bool _mayBegin() const OST_REQUIRES(_mutex) { return !_busy && (_suspensions == 0 || _stopped); }
+    [[nodiscard]] bool _workerIsNext() const OST_REQUIRES(_mutex) {
+        return _mayBegin() && !_entries.empty() && !_entries.front().waiter;
+    }
+    void _begin() OST_REQUIRES(_mutex);
+    void _finish() OST_REQUIRES(_mutex);
+    void _wakeNext() OST_REQUIRES(_mutex);
 
     const std::string _label;
     /// The thread whose work runs. A thread that compares it with itself needs no lock: only it sets and clears itself.
     std::atomic<std::thread::id> _owner{};
 
-    std::mutex _mutex;
-    // Guarded by _mutex.
-    std::deque<Entry> _entries;
-    std::condition_variable _workerTurnCame;
-    std::thread _worker;
-    unsigned _suspensions = 0;
-    bool _busy = false;
-    bool _stopped = false;
-    bool _background = false;
+    Mutex _mutex;
+    Condition _workerTurnCame;
+    std::deque<Entry> _entries OST_GUARDED_BY(_mutex);
+    std::thread _worker OST_GUARDED_BY(_mutex);
+    unsigned _suspensions OST_GUARDED_BY(_mutex) = 0;
+    bool _busy OST_GUARDED_BY(_mutex) = false;
+    bool _stopped OST_GUARDED_BY(_mutex) = false;
+    bool _background OST_GUARDED_BY(_mutex) = false;
 };
 
 } // namespace ost::platform

@@ -74,7 +74,7 @@ WorkerPool::~WorkerPool() { stop(std::nullopt); }
 std::expected<void, int> WorkerPool::start() {
     for (unsigned started = 0; started < _target; ++started) {
         {
-            const std::lock_guard lock(_mutex);
+            const MutexLock lock(_mutex);
             ++_threads;
             ++_runningThreads;
         }
@@ -86,16 +86,16 @@ std::expected<void, int> WorkerPool::start() {
 
 bool WorkerPool::stop(std::optional<std::chrono::steady_clock::time_point> deadline) {
     OST_ASSERT(currentPool != this);
-    std::unique_lock lock(_mutex);
+    MutexLock lock(_mutex);
     if (!_stopping.exchange(true)) {
         const std::uint64_t count = wakeEverybody;
         OST_ASSERT(::write(_wake.get(), &count, sizeof count) == sizeof count);
-        _called.notify_all();
+        _called.notifyAll();
     }
-    const auto allEnded = [&] { return _threads == 0; };
+    const auto allEnded = [&]() OST_REQUIRES(_mutex) { return _threads == 0; };
     if (!deadline)
         _ended.wait(lock, allEnded);
-    else if (!_ended.wait_until(lock, *deadline, allEnded))
+    else if (!_ended.waitUntil(lock, *deadline, allEnded))
         return false;
     if (const auto last = std::exchange(_lastEnded, std::nullopt)) {
         lock.unlock();
@@ -118,10 +118,10 @@ int WorkerPool::_startThread() {
     ::pthread_attr_destroy(&attributes);
     if (error != 0) {
         logError("cannot start a thread of %@: %s", _name, std::strerror(error));
-        const std::lock_guard lock(_mutex);
+        const MutexLock lock(_mutex);
         --_threads;
         --_runningThreads;
-        _ended.notify_all();
+        _ended.notifyAll();
     }
     return error;
 }
@@ -155,7 +155,7 @@ void WorkerPool::_waitAndServe() {
 bool WorkerPool::_mayGoOn() {
     if (_runningThreads.load(std::memory_order_relaxed) <= _target && !_stopping.load(std::memory_order_relaxed))
         return true;
-    std::unique_lock lock(_mutex);
+    MutexLock lock(_mutex);
     if (_stopping) {
         --_runningThreads;
         return false;
@@ -164,10 +164,10 @@ bool WorkerPool::_mayGoOn() {
 }
 
 /// Waits until the thread is needed again; false when it is not, for so long that it should end.
-bool WorkerPool::_park(std::unique_lock<std::mutex>& lock) {
+bool WorkerPool::_park(MutexLock& lock) {
     --_runningThreads;
     ++_parked;
-    const bool woken = _called.wait_for(lock, _idleTime, [&] { return _calls > 0 || _stopping; });
+    const bool woken = _called.waitFor(lock, _idleTime, [&]() OST_REQUIRES(_mutex) { return _calls > 0 || _stopping; });
     --_parked;
     if (!woken)
         return false;
@@ -185,10 +185,10 @@ bool WorkerPool::_park(std::unique_lock<std::mutex>& lock) {
 void WorkerPool::_endThread() {
     std::optional<pthread_t> previous;
     {
-        const std::lock_guard lock(_mutex);
+        const MutexLock lock(_mutex);
         previous = std::exchange(_lastEnded, ::pthread_self());
         if (--_threads == 0)
-            _ended.notify_all();
+            _ended.notifyAll();
     }
     // From here on the pool may be gone.
     if (previous)
@@ -197,14 +197,14 @@ void WorkerPool::_endThread() {
 
 void WorkerPool::_replaceBlockedThread() {
     {
-        const std::lock_guard lock(_mutex);
+        const MutexLock lock(_mutex);
         --_runningThreads;
         if (_stopping || _runningThreads >= _target)
             return;
         if (_parked > _calls) {
             ++_runningThreads;
             ++_calls;
-            _called.notify_one();
+            _called.notifyOne();
             return;
         }
         if (_threads >= _maximumThreads)
@@ -216,7 +216,7 @@ void WorkerPool::_replaceBlockedThread() {
 }
 
 void WorkerPool::_returnFromBlocking() {
-    const std::lock_guard lock(_mutex);
+    const MutexLock lock(_mutex);
     ++_runningThreads;
 }
 
@@ -236,7 +236,7 @@ std::expected<WorkerPool::Watch, int> WorkerPool::add(std::shared_ptr<EventSourc
                                                       std::uint32_t events) {
     std::uint32_t index = 0;
     {
-        const std::lock_guard lock(_mutex);
+        const MutexLock lock(_mutex);
         if (_freeSlots.empty())
             return std::unexpected(ENOSPC);
         index = _freeSlots.back();
@@ -245,7 +245,7 @@ std::expected<WorkerPool::Watch, int> WorkerPool::add(std::shared_ptr<EventSourc
     auto& slot = _slots[index];
     Watch watch{};
     {
-        const std::lock_guard lock(slot.mutex);
+        const MutexLock lock(slot.mutex);
         slot.source = std::move(source);
         watch = static_cast<Watch>(std::uint64_t{slot.generation} << 32 | index);
     }
@@ -270,13 +270,13 @@ void WorkerPool::remove(Watch watch, int fd) {
         OST_ASSERT(::epoll_ctl(_epoll.get(), EPOLL_CTL_DEL, fd, nullptr) == 0);
     std::shared_ptr<EventSource> source;
     {
-        const std::lock_guard lock(slot.mutex);
+        const MutexLock lock(slot.mutex);
         OST_ASSERT(slot.generation == static_cast<std::uint64_t>(watch) >> 32);
         // 2^32 - 1 would make the last slot's key the wake key.
         slot.generation = (slot.generation + 1) & 0x7fffffff;
         source = std::move(slot.source);
     }
-    const std::lock_guard lock(_mutex);
+    const MutexLock lock(_mutex);
     _freeSlots.push_back(index);
 }
 
@@ -287,7 +287,7 @@ void WorkerPool::post(const std::shared_ptr<EventSource>& source, std::uint32_t 
 
 void WorkerPool::_enqueue(std::shared_ptr<EventSource> source) {
     {
-        const std::lock_guard lock(_postedMutex);
+        const MutexLock lock(_postedMutex);
         _posted.push_back(std::move(source));
     }
     // Fails only once the pool stops and the count is huge; then nobody is to be woken.
@@ -299,7 +299,7 @@ void WorkerPool::_serveWatched(std::uint64_t watch, std::uint32_t events, std::s
     std::shared_ptr<EventSource> source;
     auto& slot = _slots[static_cast<std::uint32_t>(watch)];
     {
-        const std::lock_guard lock(slot.mutex);
+        const MutexLock lock(slot.mutex);
         if (slot.generation == watch >> 32)
             source = slot.source;
     }
@@ -313,7 +313,7 @@ void WorkerPool::_servePosted(std::span<char> scratch) {
         return;
     std::shared_ptr<EventSource> source;
     {
-        const std::lock_guard lock(_postedMutex);
+        const MutexLock lock(_postedMutex);
         if (_posted.empty()) {
             OST_ASSERT(_stopping); // what was read belongs to the huge count
             return;

@@ -1,19 +1,18 @@
 #pragma once
 
 #include "platform/base/FileDescriptor.h"
+#include "platform/base/Mutex.h"
 #include "platform/threads/EventSource.h"
 
 #include <pthread.h>
 
 #include <atomic>
 #include <chrono>
-#include <condition_variable>
 #include <cstddef>
 #include <cstdint>
 #include <deque>
 #include <expected>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <span>
 #include <string>
@@ -73,9 +72,10 @@ private:
     friend class BlockingSection;
 
     struct Slot {
-        std::mutex mutex;
-        std::uint32_t generation = 0; ///< grows at each removal, so that late events find nobody
-        std::shared_ptr<EventSource> source;
+        Mutex mutex;
+        /// Grows at each removal, so that late events find nobody.
+        std::uint32_t generation OST_GUARDED_BY(mutex) = 0;
+        std::shared_ptr<EventSource> source OST_GUARDED_BY(mutex);
     };
 
     WorkerPool(std::string name, const Options& options, FileDescriptor epoll, FileDescriptor wake);
@@ -84,7 +84,7 @@ private:
     [[nodiscard]] int _startThread();
     void _waitAndServe();
     [[nodiscard]] bool _mayGoOn();
-    [[nodiscard]] bool _park(std::unique_lock<std::mutex>& lock);
+    [[nodiscard]] bool _park(MutexLock& lock) OST_REQUIRES(_mutex);
     void _endThread();
     void _replaceBlockedThread();
     void _returnFromBlocking();
@@ -107,19 +107,19 @@ private:
     std::atomic<unsigned> _runningThreads{0}; ///< neither parked nor blocked; written under _mutex
     std::atomic<bool> _stopping{false};       ///< written under _mutex
 
-    std::mutex _mutex;
-    // Guarded by _mutex.
-    std::condition_variable _called; ///< a parked thread is called up, or the pool stops
-    std::condition_variable _ended;  ///< the last thread has ended
-    std::size_t _threads = 0;
-    std::size_t _parked = 0;
-    std::size_t _calls = 0;              ///< parked threads called up that have not woken yet
-    std::optional<pthread_t> _lastEnded; ///< joined by the next one that ends, or by `stop`
-    std::vector<std::uint32_t> _freeSlots;
+    Mutex _mutex;
+    Condition _called; ///< a parked thread is called up, or the pool stops
+    Condition _ended;  ///< the last thread has ended
+    std::size_t _threads OST_GUARDED_BY(_mutex) = 0;
+    std::size_t _parked OST_GUARDED_BY(_mutex) = 0;
+    /// Parked threads that are called up and have not woken yet.
+    std::size_t _calls OST_GUARDED_BY(_mutex) = 0;
+    /// Joined by the next thread that ends, or by `stop`.
+    std::optional<pthread_t> _lastEnded OST_GUARDED_BY(_mutex);
+    std::vector<std::uint32_t> _freeSlots OST_GUARDED_BY(_mutex);
 
-    std::mutex _postedMutex;
-    // Guarded by _postedMutex.
-    std::deque<std::shared_ptr<EventSource>> _posted;
+    Mutex _postedMutex;
+    std::deque<std::shared_ptr<EventSource>> _posted OST_GUARDED_BY(_postedMutex);
 };
 
 } // namespace ost::platform
