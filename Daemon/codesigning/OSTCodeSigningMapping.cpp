@@ -3,6 +3,7 @@
 #include "files/OSTDictionaryFile.h"
 #include "model/OSTGlobalConfiguration.h"
 #include "platform/base/Assert.h"
+#include "platform/base/Immortal.h"
 #include "platform/base/Log.h"
 #include "platform/base/Path.h"
 #include "store/OSTContainerCache.h"
@@ -32,9 +33,8 @@ constinit const OSTGroupKeys OSTGroupKeys::system{"com.tamarok.security.system-g
                                                   "com.tamarok.security.system-group-containers"};
 
 OSTCodeSigningMapping& OSTCodeSigningMapping::sharedInstance() {
-    // Never destroyed: workers may still ask while the process ends.
-    static OSTCodeSigningMapping& mapping = *new OSTCodeSigningMapping;
-    return mapping;
+    static platform::Immortal mapping([] { return OSTCodeSigningMapping(); });
+    return *mapping;
 }
 
 OSTCodeSigningMapping::OSTCodeSigningMapping() {

@@ -1,5 +1,7 @@
 #include "codesigning/OSTWhitelist.h"
 
+#include "platform/base/Immortal.h"
+
 namespace ost {
 
 namespace {
@@ -27,11 +29,14 @@ OSTWhitelist::Mapping toThemselves(std::initializer_list<const char*> identifier
 } // namespace
 
 const OSTWhitelist& OSTWhitelist::sharedWhitelist() {
-    static const OSTWhitelist whitelist(
-        toThemselves({"com.tamarok.pellord", "com.tamarok.quiltrad"}),
-        toThemselves({"systemgroup.com.tamarok.marrowfell", "systemgroup.com.tamarok.dunlin.tessary",
-                      "systemgroup.com.tamarok.ossel.plinthwork", "systemgroup.com.tamarok.corvane.tillet.sorrel"}));
-    return whitelist;
+    static platform::Immortal whitelist([] {
+        return OSTWhitelist(
+            toThemselves({"com.tamarok.pellord", "com.tamarok.quiltrad"}),
+            toThemselves({"systemgroup.com.tamarok.marrowfell", "systemgroup.com.tamarok.dunlin.tessary",
+                          "systemgroup.com.tamarok.ossel.plinthwork",
+                          "systemgroup.com.tamarok.corvane.tillet.sorrel"}));
+    });
+    return *whitelist;
 }
 
 std::optional<std::string> OSTWhitelist::wellknownSystemContainerForId(std::string_view identifier) const {

@@ -3,6 +3,7 @@
 #include "files/OSTPathResolution.h"
 #include "files/OSTTreeCursor.h"
 #include "platform/base/Log.h"
+#include "platform/base/Mutex.h"
 #include "platform/base/Path.h"
 #include "platform/base/Try.h"
 #include "platform/threads/Aside.h"
@@ -12,11 +13,9 @@
 
 #include <algorithm>
 #include <cerrno>
-#include <condition_variable>
 #include <cstring>
 #include <deque>
 #include <iterator>
-#include <mutex>
 #include <optional>
 #include <unordered_set>
 
@@ -56,6 +55,7 @@ public:
         _work();
         if (aside.valid())
             aside.get();
+        const platform::MutexLock lock(_mutex);
         return _total;
     }
 
@@ -67,9 +67,9 @@ private:
         Turn(const Turn&) = delete;
         Turn& operator=(const Turn&) = delete;
         ~Turn() {
-            const std::lock_guard lock(_usage._mutex);
+            const platform::MutexLock lock(_usage._mutex);
             if (--_usage._turns == 0)
-                _usage._changed.notify_all();
+                _usage._changed.notifyAll();
         }
 
     private:
@@ -85,8 +85,8 @@ private:
 
     /// The next directory, or none when all are measured. What is taken is given back with a `Turn`.
     [[nodiscard]] std::optional<std::string> _take() {
-        std::unique_lock lock(_mutex);
-        _changed.wait(lock, [this] { return !_waiting.empty() || _turns == 0; });
+        platform::MutexLock lock(_mutex);
+        _changed.wait(lock, [this]() OST_REQUIRES(_mutex) { return !_waiting.empty() || _turns == 0; });
         if (_waiting.empty())
             return std::nullopt;
         std::optional directory = std::move(_waiting.front());
@@ -100,11 +100,11 @@ private:
         std::vector<std::string> directories;
     };
     void _add(Measured measured) {
-        const std::lock_guard lock(_mutex);
+        const platform::MutexLock lock(_mutex);
         _total += measured.bytes;
         std::ranges::move(measured.directories, std::back_inserter(_waiting));
         if (!measured.directories.empty())
-            _changed.notify_one();
+            _changed.notifyOne();
     }
 
     [[nodiscard]] Measured _measureDirectory(const std::string& relative) {
@@ -155,7 +155,7 @@ private:
     }
 
     [[nodiscard]] bool _isFirstName(ino_t file) {
-        const std::lock_guard lock(_mutex);
+        const platform::MutexLock lock(_mutex);
         return _linked.insert(file).second;
     }
 
@@ -166,13 +166,12 @@ private:
     const dev_t _device;
     const std::string _path;
 
-    std::mutex _mutex;
-    // Guarded by _mutex.
-    std::condition_variable _changed;
-    std::deque<std::string> _waiting{std::string()}; // relative to the top
-    std::size_t _turns = 0;
-    std::unordered_set<ino_t> _linked; // files with several names that are counted
-    std::uint64_t _total = 0;
+    platform::Mutex _mutex;
+    platform::Condition _changed;
+    std::deque<std::string> _waiting OST_GUARDED_BY(_mutex){std::string()}; // relative to the top
+    std::size_t _turns OST_GUARDED_BY(_mutex) = 0;
+    std::unordered_set<ino_t> _linked OST_GUARDED_BY(_mutex); // files with several names that are counted
+    std::uint64_t _total OST_GUARDED_BY(_mutex) = 0;
 };
 
 } // namespace

@@ -2,6 +2,7 @@
 
 #include "files/OSTDictionaryFile.h"
 #include "model/OSTGlobalConfiguration.h"
+#include "platform/base/Immortal.h"
 #include "platform/base/Log.h"
 #include "platform/base/Path.h"
 #include "platform/device/DeviceCapabilities.h"
@@ -24,8 +25,8 @@ std::string currentTimeAsText() {
 } // namespace
 
 const std::optional<std::string>& OSTCurrentBuildVersion() {
-    static const auto& version = *new std::optional<std::string>(platform::buildVersion());
-    return version;
+    static platform::Immortal version([] { return platform::buildVersion(); });
+    return *version;
 }
 
 void writeMigrationFileToDiskWithName(std::string_view name) {

@@ -1,14 +1,14 @@
 #include "protection/OSTLockStateQueue.h"
 
+#include "platform/base/Immortal.h"
 #include "platform/base/Log.h"
 #include "platform/device/DeviceLockState.h"
 
 namespace ost {
 
 platform::WorkQueue& OSTLockStateQueue() {
-    // Never destroyed: the process may end while work is parked.
-    static platform::WorkQueue& queue = *new platform::WorkQueue("com.tamarok.ostrandd.lockstate");
-    return queue;
+    static platform::Immortal queue([] { return platform::WorkQueue("com.tamarok.ostrandd.lockstate"); });
+    return *queue;
 }
 
 void OSTLockStateFollower::brevind_notification_callback() {

@@ -1,6 +1,7 @@
 #include "files/OSTFileManager.h"
 #include "model/OSTFailureReport.h"
 #include "model/OSTGlobalConfiguration.h"
+#include "platform/base/Immortal.h"
 #include "platform/base/Path.h"
 #include "platform/threads/Transactions.h"
 #include "store/OSTClientConnection.h"
@@ -31,9 +32,8 @@ constexpr int removals = 8;
 } // namespace
 
 platform::WorkQueue& OSTDeathRowQueue() {
-    // Never destroyed: the process may end while a pass runs.
-    static platform::WorkQueue& queue = *new platform::WorkQueue("com.tamarok.ostrandd.deathrow");
-    return queue;
+    static platform::Immortal queue([] { return platform::WorkQueue("com.tamarok.ostrandd.deathrow"); });
+    return *queue;
 }
 
 std::expected<void, OSTErrorCode>
@@ -150,9 +150,9 @@ void OSTClientConnection::deleteContainersOnDeathRowWithCompletion(DeathRowCompl
 }
 
 std::optional<OSTError> OSTClientConnection::_emptyDeathRow() {
-    // Asked for once: a pass does not make the directory again, so one that has gone is reported. Never destroyed: the
-    // process may end while a pass runs.
-    static const auto& deathRow = *new std::string(OSTGlobalConfiguration::sharedInstance().deathrowDirectory());
+    // Asked for once: a pass does not make the directory again, so one that has gone is reported.
+    static platform::Immortal held([] { return OSTGlobalConfiguration::sharedInstance().deathrowDirectory(); });
+    const auto& deathRow = *held;
     const auto items = OSTFileManager::defaultManager().urlsForItemsInDirectoryAtURL(deathRow);
     if (!items) {
         if (items.error().isPOSIX(ENOENT))

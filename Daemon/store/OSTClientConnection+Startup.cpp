@@ -1,5 +1,6 @@
 #include "files/OSTFileManager.h"
 #include "model/OSTGlobalConfiguration.h"
+#include "platform/base/Immortal.h"
 #include "platform/base/Path.h"
 #include "store/OSTClientConnection.h"
 #include "store/OSTReplaceFile.h"
@@ -9,13 +10,13 @@
 namespace ost {
 
 OSTClientConnection& OSTClientConnection::sharedClientConnection() {
-    // Never destroyed: workers may still use it while the process ends.
-    static OSTClientConnection& connection = *new OSTClientConnection(
-        {.clientBundleIdentifier = "com.tamarok.ostrandd.internal",
-         .clientUserId = 0,
-         .allowOtherIdLookup = true,
-         .allowGroupIdLookup = true});
-    return connection;
+    static platform::Immortal connection([] {
+        return OSTClientConnection({.clientBundleIdentifier = "com.tamarok.ostrandd.internal",
+                                    .clientUserId = 0,
+                                    .allowOtherIdLookup = true,
+                                    .allowGroupIdLookup = true});
+    });
+    return *connection;
 }
 
 void OSTClientConnection::containerManagerSetup() const {

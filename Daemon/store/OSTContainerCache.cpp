@@ -4,6 +4,7 @@
 #include "files/OSTFileManager.h"
 #include "model/OSTFailureReport.h"
 #include "model/OSTGlobalConfiguration.h"
+#include "platform/base/Immortal.h"
 #include "platform/base/Log.h"
 #include "platform/base/Path.h"
 #include "platform/base/Unicode.h"
@@ -114,9 +115,8 @@ void inTwoHalves(std::size_t count, const WorkOnItems& work) {
 } // namespace
 
 OSTContainerCache& OSTContainerCache::sharedInstance() {
-    // Never destroyed: workers may still ask while the process ends.
-    static OSTContainerCache& cache = *new OSTContainerCache;
-    return cache;
+    static platform::Immortal cache([] { return OSTContainerCache(); });
+    return *cache;
 }
 
 OSTResult<OSTMetadataRecord> OSTContainerCache::containerForUser(const OSTContainerName& name) {

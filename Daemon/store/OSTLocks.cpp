@@ -2,17 +2,16 @@
 
 #include "platform/base/Assert.h"
 #include "platform/base/Log.h"
+#include "platform/base/Mutex.h"
 #include "platform/threads/BlockingSection.h"
 
 #include <algorithm>
 #include <atomic>
 #include <chrono>
-#include <condition_variable>
 #include <cstdint>
 #include <functional>
 #include <map>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <shared_mutex>
 #include <source_location>
@@ -22,20 +21,20 @@ namespace ost {
 
 namespace {
 
+platform::Mutex tableMutex;
+
 /// The lock of one identifier.
 struct LockRecord {
     std::shared_mutex lock;
-    std::uint64_t refCount = 0;             ///< holders and waiters; guarded by the table's mutex
-    std::atomic<std::int32_t> lockState{0}; ///< 0 free, -1 held for writing, n > 0 held by n readers
+    std::uint64_t refCount OST_GUARDED_BY(tableMutex) = 0; ///< holders and waiters
+    std::atomic<std::int32_t> lockState{0};                ///< 0 free, -1 held for writing, n > 0 held by n readers
 };
 
-/// `mutex` guards every other field and the reference counts of the records.
 struct LockTable {
-    std::mutex mutex;
-    std::condition_variable allWriterCondition;
-    std::condition_variable allReaderCondition;
-    std::condition_variable identifierWriterCondition;
-    std::condition_variable identifierReaderCondition;
+    platform::Condition allWriterCondition;
+    platform::Condition allReaderCondition;
+    platform::Condition identifierWriterCondition;
+    platform::Condition identifierReaderCondition;
     std::map<std::string, std::unique_ptr<LockRecord>, std::less<>> identifierToLockMap;
     std::int32_t identifierReaderCount = 0; ///< identifier locks held or being acquired for reading
     std::int32_t identifierWriterCount = 0; ///< identifier locks held or being acquired for writing
@@ -43,7 +42,7 @@ struct LockTable {
     std::int32_t allWritersWaiting = 0;
 };
 
-LockTable gOSTLocks;
+LockTable gOSTLocks OST_GUARDED_BY(tableMutex);
 
 /// The all-identifiers lock is not re-entrant: remembering what the thread holds turns a deadlock into an assertion.
 thread_local std::optional<OSTLockKind> heldOfAllIdentifiers;
@@ -80,11 +79,11 @@ void pauseBeforeLook(unsigned look) {
 }
 
 template<typename Predicate>
-bool comesSoon(std::unique_lock<std::mutex>& lock, Predicate predicate) {
+bool comesSoon(Predicate predicate) OST_REQUIRES(tableMutex) {
     for (unsigned look = 0; look < looksBeforeSleep; ++look) {
-        lock.unlock();
+        tableMutex.unlock();
         pauseBeforeLook(look);
-        lock.lock();
+        tableMutex.lock();
         if (predicate())
             return true;
     }
@@ -97,18 +96,20 @@ constexpr std::chrono::microseconds shortWait{500};
 
 /// Waits for `condition`; a wait that is no longer short does not keep a listener's worker from serving others.
 template<typename Predicate>
-void wait(std::condition_variable& condition, std::unique_lock<std::mutex>& lock, Predicate predicate) {
-    if (predicate() || comesSoon(lock, predicate) || condition.wait_for(lock, shortWait, predicate))
+void wait(platform::Condition& condition, platform::MutexLock& lock, Predicate predicate) OST_REQUIRES(tableMutex) {
+    if (predicate() || comesSoon(predicate) || condition.waitFor(lock, shortWait, predicate))
         return;
     const platform::BlockingSection blocking;
     condition.wait(lock, predicate);
 }
 
-bool noIdentifierLocks() { return gOSTLocks.identifierReaderCount == 0 && gOSTLocks.identifierWriterCount == 0; }
+bool noIdentifierLocks() OST_REQUIRES(tableMutex) {
+    return gOSTLocks.identifierReaderCount == 0 && gOSTLocks.identifierWriterCount == 0;
+}
 
 /// Look-ups follow each other so closely that a writer who waited for a moment without readers might wait for ever:
 /// while readers are all that one waits for, no further reader joins them.
-bool writerComesFirst() {
+bool writerComesFirst() OST_REQUIRES(tableMutex) {
     return gOSTLocks.allWritersWaiting > 0 && gOSTLocks.allReaderWriterState > 0 && noIdentifierLocks();
 }
 
@@ -130,8 +131,8 @@ void acquire(LockRecord& record, OSTLockKind kind, std::source_location function
     }
 }
 
-/// Called with the table's mutex held. Releasing never waits, so it may happen under the mutex.
-void release(LockRecord& record, std::source_location function) {
+/// Releasing never waits, so it may happen under the mutex.
+void release(LockRecord& record, std::source_location function) OST_REQUIRES(tableMutex) {
     if (record.lockState == -1) {
         std::int32_t expected = -1;
         check(record.lockState.compare_exchange_strong(expected, 0),
@@ -140,9 +141,9 @@ void release(LockRecord& record, std::source_location function) {
         check(gOSTLocks.identifierWriterCount > 0, "gOSTLocks.identifierWriterCount > 0", function);
         --gOSTLocks.identifierWriterCount;
         if (noIdentifierLocks())
-            gOSTLocks.allWriterCondition.notify_one();
+            gOSTLocks.allWriterCondition.notifyOne();
         if (gOSTLocks.identifierWriterCount == 0)
-            gOSTLocks.allReaderCondition.notify_all();
+            gOSTLocks.allReaderCondition.notifyAll();
         record.lock.unlock();
     } else {
         check(--record.lockState >= 0, "AtomicDecrement32Barrier(&lockPtr->lockState) >= 0", function);
@@ -150,7 +151,7 @@ void release(LockRecord& record, std::source_location function) {
         check(gOSTLocks.identifierReaderCount > 0, "gOSTLocks.identifierReaderCount > 0", function);
         --gOSTLocks.identifierReaderCount;
         if (noIdentifierLocks() && gOSTLocks.allReaderWriterState == 0)
-            gOSTLocks.allWriterCondition.notify_one();
+            gOSTLocks.allWriterCondition.notifyOne();
         record.lock.unlock_shared();
     }
 }
@@ -170,12 +171,14 @@ void take_one_lock(std::string_view identifier, OSTLockKind kind) {
     OST_ASSERT(!furtherLocksForbidden);
     LockRecord* record = nullptr;
     {
-        std::unique_lock lock(gOSTLocks.mutex);
+        platform::MutexLock lock(tableMutex);
         auto& count = kind == OSTLockKind::writing ? gOSTLocks.identifierWriterCount : gOSTLocks.identifierReaderCount;
         if (kind == OSTLockKind::writing)
-            wait(gOSTLocks.identifierWriterCondition, lock, [] { return gOSTLocks.allReaderWriterState == 0; });
+            wait(gOSTLocks.identifierWriterCondition, lock,
+                 []() OST_REQUIRES(tableMutex) { return gOSTLocks.allReaderWriterState == 0; });
         else
-            wait(gOSTLocks.identifierReaderCondition, lock, [] { return gOSTLocks.allReaderWriterState != -1; });
+            wait(gOSTLocks.identifierReaderCondition, lock,
+                 []() OST_REQUIRES(tableMutex) { return gOSTLocks.allReaderWriterState != -1; });
         auto found = gOSTLocks.identifierToLockMap.find(identifier);
         if (found == gOSTLocks.identifierToLockMap.end())
             found = gOSTLocks.identifierToLockMap.emplace(identifier, std::make_unique<LockRecord>()).first;
@@ -191,7 +194,7 @@ void take_one_lock(std::string_view identifier, OSTLockKind kind) {
 
 void unlock_one_lock(std::string_view identifier) {
     const auto here = std::source_location::current();
-    const std::lock_guard lock(gOSTLocks.mutex);
+    const platform::MutexLock lock(tableMutex);
     const auto found = gOSTLocks.identifierToLockMap.find(identifier);
     check(found != gOSTLocks.identifierToLockMap.end(), "lockPtr", here);
     LockRecord& record = *found->second;
@@ -228,15 +231,15 @@ void _lock_all_identifiers(OSTLockKind kind) {
     OST_ASSERT(!heldOfAllIdentifiers);
     OST_ASSERT(!furtherLocksForbidden);
     platform::logDebug("Waiting to lock all identifiers for %s", nameOf(kind));
-    std::unique_lock lock(gOSTLocks.mutex);
+    platform::MutexLock lock(tableMutex);
     if (kind == OSTLockKind::writing) {
         ++gOSTLocks.allWritersWaiting;
         wait(gOSTLocks.allWriterCondition, lock,
-             [] { return noIdentifierLocks() && gOSTLocks.allReaderWriterState == 0; });
+             []() OST_REQUIRES(tableMutex) { return noIdentifierLocks() && gOSTLocks.allReaderWriterState == 0; });
         --gOSTLocks.allWritersWaiting;
         gOSTLocks.allReaderWriterState = -1;
     } else {
-        wait(gOSTLocks.allReaderCondition, lock, [] {
+        wait(gOSTLocks.allReaderCondition, lock, []() OST_REQUIRES(tableMutex) {
             return gOSTLocks.identifierWriterCount == 0 && gOSTLocks.allReaderWriterState != -1 && !writerComesFirst();
         });
         ++gOSTLocks.allReaderWriterState;
@@ -247,23 +250,23 @@ void _lock_all_identifiers(OSTLockKind kind) {
 
 void unlock_all_identifiers() {
     {
-        const std::lock_guard lock(gOSTLocks.mutex);
+        const platform::MutexLock lock(tableMutex);
         check(gOSTLocks.allReaderWriterState != 0, "gOSTLocks.allReaderWriterState > 0",
               std::source_location::current());
         OST_ASSERT(heldOfAllIdentifiers);
         heldOfAllIdentifiers.reset();
         if (gOSTLocks.allReaderWriterState == -1) {
             gOSTLocks.allReaderWriterState = 0;
-            gOSTLocks.allWriterCondition.notify_one();
-            gOSTLocks.allReaderCondition.notify_all();
-            gOSTLocks.identifierWriterCondition.notify_all();
-            gOSTLocks.identifierReaderCondition.notify_all();
+            gOSTLocks.allWriterCondition.notifyOne();
+            gOSTLocks.allReaderCondition.notifyAll();
+            gOSTLocks.identifierWriterCondition.notifyAll();
+            gOSTLocks.identifierReaderCondition.notifyAll();
         } else {
             if (--gOSTLocks.allReaderWriterState == 0) {
-                gOSTLocks.identifierWriterCondition.notify_all();
+                gOSTLocks.identifierWriterCondition.notifyAll();
                 if (noIdentifierLocks())
-                    gOSTLocks.allWriterCondition.notify_one();
-                gOSTLocks.allReaderCondition.notify_all();
+                    gOSTLocks.allWriterCondition.notifyOne();
+                gOSTLocks.allReaderCondition.notifyAll();
             }
         }
     }
@@ -273,7 +276,7 @@ void unlock_all_identifiers() {
 bool OSTHoldsAllIdentifiersLock() { return heldOfAllIdentifiers == OSTLockKind::writing; }
 
 std::size_t OSTLockRecordCount() {
-    const std::lock_guard lock(gOSTLocks.mutex);
+    const platform::MutexLock lock(tableMutex);
     return gOSTLocks.identifierToLockMap.size();
 }
 

@@ -1,6 +1,7 @@
 #include "platform/ipc/UpcallPort.h"
 
 #include "platform/base/Log.h"
+#include "platform/base/Mutex.h"
 #include "platform/base/Try.h"
 #include "platform/threads/ThreadName.h"
 
@@ -13,7 +14,6 @@
 #include <cerrno>
 #include <cstring>
 #include <future>
-#include <mutex>
 #include <set>
 #include <system_error>
 #include <thread>
@@ -51,7 +51,7 @@ public:
         std::size_t others = 0; ///< those that root has not made
     };
     [[nodiscard]] Count count() {
-        const std::lock_guard lock(_mutex);
+        const MutexLock lock(_mutex);
         return _count;
     }
 
@@ -67,7 +67,7 @@ public:
 
     /// Called on the loop's thread when the port goes: no message reaches it any more.
     void end() {
-        const std::lock_guard lock(_mutex);
+        const MutexLock lock(_mutex);
         _port = nullptr;
         for (const int socket : _sockets)
             ::shutdown(socket, SHUT_RDWR);
@@ -78,7 +78,7 @@ private:
     struct Member {
         Member(std::shared_ptr<Aside> owner, FileDescriptor descriptor, bool madeByRoot)
             : aside(std::move(owner)), socket(std::move(descriptor)), isRoots(madeByRoot) {
-            const std::lock_guard lock(aside->_mutex);
+            const MutexLock lock(aside->_mutex);
             aside->_sockets.insert(socket.get());
             aside->_countOne(isRoots, 1);
         }
@@ -86,11 +86,11 @@ private:
         Member& operator=(const Member&) = delete;
         ~Member() {
             {
-                const std::lock_guard lock(aside->_mutex);
+                const MutexLock lock(aside->_mutex);
                 aside->_sockets.erase(socket.get());
             }
             socket.reset(); // May wait for what lies in it unread.
-            const std::lock_guard lock(aside->_mutex);
+            const MutexLock lock(aside->_mutex);
             aside->_countOne(isRoots, -1);
         }
 
@@ -99,7 +99,7 @@ private:
         const bool isRoots;
     };
 
-    void _countOne(bool isRoots, int difference) {
+    void _countOne(bool isRoots, int difference) OST_REQUIRES(_mutex) {
         _count.all += static_cast<std::size_t>(difference);
         _count.others += static_cast<std::size_t>(isRoots ? 0 : difference);
     }
@@ -128,7 +128,7 @@ private:
         std::promise<std::optional<UpcallReply>> promise;
         auto reply = promise.get_future();
         {
-            const std::lock_guard lock(_mutex);
+            const MutexLock lock(_mutex);
             if (!_port)
                 return std::nullopt;
             _loop.async(
@@ -148,10 +148,9 @@ private:
     RunLoop& _loop;    ///< there as long as the port is
     std::atomic<std::uint32_t> _sequenceNumber{0};
 
-    std::mutex _mutex;
-    // Guarded by _mutex.
-    std::set<int> _sockets; ///< open ones
-    Count _count;
+    Mutex _mutex;
+    std::set<int> _sockets OST_GUARDED_BY(_mutex); ///< open ones
+    Count _count OST_GUARDED_BY(_mutex);
 };
 
 UpcallPort::UpcallPort(RunLoop& loop, FileDescriptor listener, FileDescriptor pauseTimer, Handler handler)
