@@ -17,24 +17,27 @@
 #include <set>
 #include <system_error>
 #include <thread>
+#include <utility>
 
 namespace ost::platform {
 
 namespace {
 
-constexpr std::size_t connectionLimit = 64;
-/// Who is not root is refused anyway, and must not keep root out.
+constexpr std::size_t rootsConnectionLimit = 64;
+/// Others are refused anyway, and do not keep root out.
 constexpr std::size_t othersConnectionLimit = 32;
-/// Connections beyond that limit are closed, by threads too.
-constexpr std::size_t othersThreadLimit = 64;
+/// Connections beyond that limit are closed, by threads too, because that may last. Accepting pauses at this many.
+constexpr std::size_t othersThreadLimit = 256;
 constexpr itimerspec acceptPause{.it_interval = {}, .it_value = {.tv_sec = 0, .tv_nsec = 250'000'000}};
 
 bool isOutOfResources(int error) { return error == EMFILE || error == ENFILE || error == ENOBUFS || error == ENOMEM; }
 
 bool isNothingYet(int error) { return error == EAGAIN || error == EINTR; }
 
+/// That a sender has gone is no failure, and must not let it fill the log.
 void logFailureToReply(int error) {
-    logError("Closing an upcall connection: Failed to reply: %s", std::strerror(error));
+    if (error != EPIPE && error != ECONNRESET)
+        logError("Closing an upcall connection: Failed to reply: %s", std::strerror(error));
 }
 
 } // namespace
@@ -47,8 +50,8 @@ public:
     [[nodiscard]] std::uint32_t nextSequenceNumber() { return _sequenceNumber++; }
 
     struct Count {
-        std::size_t all = 0;
-        std::size_t others = 0; ///< those that root has not made
+        std::size_t roots = 0;
+        std::size_t others = 0; ///< those that root has not made, until they are closed
     };
     [[nodiscard]] Count count() {
         const MutexLock lock(_mutex);
@@ -100,8 +103,7 @@ private:
     };
 
     void _countOne(bool isRoots, int difference) OST_REQUIRES(_mutex) {
-        _count.all += static_cast<std::size_t>(difference);
-        _count.others += static_cast<std::size_t>(isRoots ? 0 : difference);
+        (isRoots ? _count.roots : _count.others) += static_cast<std::size_t>(difference);
     }
 
     void _serve(int socket, std::optional<UpcallPacket> packet) {
@@ -187,18 +189,19 @@ void UpcallPort::_accept() {
             _pauseAccepting(std::strerror(errno));
         return;
     }
+    _hasComplained = false;
     ucred peer{};
     socklen_t size = sizeof peer;
     const bool isRoots = ::getsockopt(socket.get(), SOL_SOCKET, SO_PEERCRED, &peer, &size) == 0 && peer.uid == 0;
-    const bool hasRoom = _connections.size() + aside.all < connectionLimit;
     if (!isRoots)
-        _serveAside(std::move(socket), isRoots, hasRoom && aside.others < othersConnectionLimit, std::nullopt);
-    else if (hasRoom)
+        _serveAside(std::move(socket), isRoots, aside.others < othersConnectionLimit, std::nullopt);
+    else if (_connections.size() + aside.roots < rootsConnectionLimit)
         _serveOnLoop(std::move(socket));
 }
 
 void UpcallPort::_pauseAccepting(const char* reason) {
-    logError("Failed to accept a connection of the upcall port: %s", reason);
+    if (!std::exchange(_hasComplained, true))
+        logError("Failed to accept a connection of the upcall port: %s", reason);
     _listenerSource.setEvents(0);
     ::timerfd_settime(_pauseTimer.get(), 0, &acceptPause, nullptr);
 }

@@ -62,7 +62,8 @@ private:
     Handler _handler;
     RunLoop::Source _listenerSource;
     RunLoop::Source _pauseSource;
-    Connections _connections; ///< those that the loop serves
+    bool _hasComplained = false; ///< that it cannot accept
+    Connections _connections;    ///< those that the loop serves
     const std::shared_ptr<Aside> _aside;
 };
 
