@@ -280,6 +280,7 @@ TEST_F(UpcallPortTest, repliesWithASealedRegion) {
     struct stat status{};
     ASSERT_EQ(::fstat(region.get(), &status), 0);
     EXPECT_EQ(status.st_size, 5000);
+    EXPECT_EQ(::read(region.get(), bytes.data(), bytes.size()), 100) << "from the start";
     EXPECT_EQ(::pwrite(region.get(), "x", 1, 0), -1);
     EXPECT_EQ(::ftruncate(region.get(), 0), -1);
 }

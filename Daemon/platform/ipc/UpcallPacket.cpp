@@ -160,7 +160,8 @@ std::expected<FileDescriptor, int> makeUpcallRegion(std::span<const std::byte> b
     FileDescriptor memory(::memfd_create("upcall answer", MFD_CLOEXEC | MFD_ALLOW_SEALING));
     if (!memory)
         return std::unexpected(errno);
-    const auto written = ::write(memory.get(), bytes.data(), bytes.size());
+    // Leaves the offset at the start, for a receiver that reads on from it.
+    const auto written = ::pwrite(memory.get(), bytes.data(), bytes.size(), 0);
     if (written != static_cast<ssize_t>(bytes.size()))
         return std::unexpected(written < 0 ? errno : ENOSPC);
     if (::fcntl(memory.get(), F_ADD_SEALS, F_SEAL_WRITE | F_SEAL_GROW | F_SEAL_SHRINK | F_SEAL_SEAL) != 0)
