@@ -37,19 +37,19 @@ struct OSTCodeSigningMapping::Batch {
     }
 };
 
-OSTErrorCode OSTCodeSigningMapping::processCodeSigningInfo(const std::shared_ptr<const OSTDictionary>& info,
-                                                           std::optional<std::string_view> identifier,
-                                                           const OSTRegistrationOptions& options) {
+std::expected<void, OSTErrorCode>
+OSTCodeSigningMapping::processCodeSigningInfo(const std::shared_ptr<const OSTDictionary>& info,
+                                              std::optional<std::string_view> identifier,
+                                              const OSTRegistrationOptions& options) {
     if (!_available)
-        return OSTErrorCode::noProcessingResult;
+        return std::unexpected(OSTErrorCode::noProcessingResult);
     if (!identifier)
-        return OSTErrorCode::noIdentifier;
+        return std::unexpected(OSTErrorCode::noIdentifier);
     const OSTAllIdentifiersLock lock(OSTLockKind::writing);
-    const auto result = _sync([&] { return _onQueue_processCodeSigningInfo(info, *identifier, options); });
-    return result ? OSTErrorCode::success : result.error().code();
+    return _sync([&] { return _onQueue_processCodeSigningInfo(info, *identifier, options); });
 }
 
-OSTErrorCode
+std::expected<void, OSTErrorCode>
 OSTCodeSigningMapping::processCallerRegisteredEntitlements(std::shared_ptr<const OSTDictionary> entitlements,
                                                            std::optional<std::string_view> identifier) {
     OSTDictionary info;

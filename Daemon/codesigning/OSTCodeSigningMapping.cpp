@@ -132,11 +132,11 @@ OSTCodeSigningMapping::invalidateCodeSigningInfoForIdentifierAndItsChildren(std:
     });
 }
 
-OSTErrorCode OSTCodeSigningMapping::invalidateCodeSigningInfoForAppsWithoutBundleContainer() {
+std::expected<void, OSTErrorCode> OSTCodeSigningMapping::invalidateCodeSigningInfoForAppsWithoutBundleContainer() {
     if (!_available)
-        return OSTErrorCode::noProcessingResult;
+        return std::unexpected(OSTErrorCode::noProcessingResult);
     const OSTAllIdentifiersLock lock(OSTLockKind::writing);
-    const auto result = _sync([&]() -> OSTResult<void> {
+    return _sync([&]() -> OSTResult<void> {
         for (auto& [identifier, entry] : _codeSigningMappingDict) {
             if (entry->registeredByCaller || _hasBundleContainer(identifier))
                 continue;
@@ -147,7 +147,6 @@ OSTErrorCode OSTCodeSigningMapping::invalidateCodeSigningInfoForAppsWithoutBundl
         }
         return _writeCodeSigningMappingToDisk();
     });
-    return result ? OSTErrorCode::success : result.error().code();
 }
 
 bool OSTCodeSigningMapping::_hasBundleContainer(std::string_view identifier) const {

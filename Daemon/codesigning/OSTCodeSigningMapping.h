@@ -72,18 +72,20 @@ public:
     /// The identifier's code-signing information as a request from outside sees it.
     [[nodiscard]] std::shared_ptr<const OSTDictionary> getCodeSigningInfoForIdentifier(std::string_view identifier);
 
-    /// Registers code-signing information, or with none removes the identifier. Gives `success`, `noIdentifier`,
-    /// `mappingWriteFailed` (memory keeps the change), `exceptionCaught`, or 0 when the mapping is unavailable.
-    [[nodiscard]] OSTErrorCode processCodeSigningInfo(const std::shared_ptr<const OSTDictionary>& info,
-                                                      std::optional<std::string_view> identifier,
-                                                      const OSTRegistrationOptions& options);
+    /// Registers code-signing information, or with none removes the identifier. Fails with `noIdentifier`,
+    /// `mappingWriteFailed` (memory keeps the change), `exceptionCaught`, or `noProcessingResult` when the mapping is
+    /// unavailable.
+    [[nodiscard]] std::expected<void, OSTErrorCode>
+    processCodeSigningInfo(const std::shared_ptr<const OSTDictionary>& info, std::optional<std::string_view> identifier,
+                           const OSTRegistrationOptions& options);
     /// Registers the entitlements that a client carries. Codes as above.
-    [[nodiscard]] OSTErrorCode processCallerRegisteredEntitlements(std::shared_ptr<const OSTDictionary> entitlements,
-                                                                   std::optional<std::string_view> identifier);
+    [[nodiscard]] std::expected<void, OSTErrorCode>
+    processCallerRegisteredEntitlements(std::shared_ptr<const OSTDictionary> entitlements,
+                                        std::optional<std::string_view> identifier);
 
-    /// Marks every entry invalid that the installer registered and whose application has no bundle container. Gives
-    /// `success`, `mappingWriteFailed`, or 0 when the mapping is unavailable.
-    [[nodiscard]] OSTErrorCode invalidateCodeSigningInfoForAppsWithoutBundleContainer();
+    /// Marks every entry invalid that the installer registered and whose application has no bundle container.
+    /// Fails with `mappingWriteFailed`, or `noProcessingResult` when the mapping is unavailable.
+    [[nodiscard]] std::expected<void, OSTErrorCode> invalidateCodeSigningInfoForAppsWithoutBundleContainer();
 
     /// Groups of an identifier, each once, as its entitlements hold them.
     using GroupViews = std::vector<std::string_view>;

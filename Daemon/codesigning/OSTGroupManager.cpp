@@ -48,7 +48,7 @@ std::expected<OSTGroupManager::Paths, OSTErrorCode>
 OSTGroupManager::groupContainerPathsForUser(std::uint32_t userId, OSTClientConnection& client,
                                             std::optional<std::string_view> identifier) const {
     const auto here = std::source_location::current();
-    const auto paths = OSTGuarded([&]() -> OSTResult<Paths> {
+    return OSTGuarded([&]() -> OSTResult<Paths> {
         if (!identifier)
             return std::unexpected(invalidIdentifier(userId, here));
         const OSTAllIdentifiersLock lock(OSTLockKind::writing);
@@ -70,16 +70,13 @@ OSTGroupManager::groupContainerPathsForUser(std::uint32_t userId, OSTClientConne
         }
         return found;
     });
-    if (!paths)
-        return std::unexpected(paths.error().code());
-    return *paths;
 }
 
 std::expected<std::vector<std::string>, OSTErrorCode>
 OSTGroupManager::groupContainerIdentifiersForUser(std::uint32_t userId,
                                                   std::optional<std::string_view> identifier) const {
     const auto here = std::source_location::current();
-    const auto groups = OSTGuarded([&]() -> OSTResult<std::vector<std::string>> {
+    return OSTGuarded([&]() -> OSTResult<std::vector<std::string>> {
         if (!identifier)
             return std::unexpected(invalidIdentifier(userId, here));
         const OSTAllIdentifiersLock lock(OSTLockKind::writing);
@@ -87,9 +84,6 @@ OSTGroupManager::groupContainerIdentifiersForUser(std::uint32_t userId,
             .appGroupIdentifiersForIdentifier(*identifier)
             .value_or(std::vector<std::string>());
     });
-    if (!groups)
-        return std::unexpected(groups.error().code());
-    return *groups;
 }
 
 void OSTGroupManager::handleChangeFromOldGroupContainerIds(const GroupList& oldGroups, const GroupList& newGroups,

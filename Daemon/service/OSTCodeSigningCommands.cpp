@@ -21,19 +21,17 @@ std::expected<std::uint32_t, OSTErrorCode> groupUser(const platform::IPCRequest&
                           OSTContainerClass::sharedAppGroup, client.identity().clientUserId);
 }
 
-OSTErrorCode replyWithGroupPaths(const platform::IPCRequest& request, platform::IPCReply& reply,
-                                 OSTClientConnection& client, std::uint32_t userId) {
-    const auto paths = OSTGroupManager::defaultManager().groupContainerPathsForUser(
-        userId, client, OSTRequestedIdentifier(request, client));
-    if (!paths)
-        return paths.error();
+OSTCommandResult replyWithGroupPaths(const platform::IPCRequest& request, platform::IPCReply& reply,
+                                     OSTClientConnection& client, std::uint32_t userId) {
+    const auto paths = OST_TRY(OSTGroupManager::defaultManager().groupContainerPathsForUser(
+        userId, client, OSTRequestedIdentifier(request, client)));
     auto dictionary = reply.encoder(replyKey::groupContainers);
-    dictionary.beginMap(paths->size());
-    for (const auto& [group, path] : *paths) {
+    dictionary.beginMap(paths.size());
+    for (const auto& [group, path] : paths) {
         dictionary.key(group);
         dictionary.text(path);
     }
-    return OSTErrorCode::success;
+    return {};
 }
 
 /// A value that must be a dictionary when it is there.
@@ -88,46 +86,39 @@ std::optional<std::string> wellknownGroupPath(const std::string& group, OSTClien
 
 } // namespace
 
-OSTErrorCode OSTGroupContainerPathsCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
-                                           OSTClientConnection& client) {
-    const auto userId = groupUser(request, client);
-    return userId ? replyWithGroupPaths(request, reply, client, *userId) : userId.error();
+OSTCommandResult OSTGroupContainerPathsCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
+                                               OSTClientConnection& client) {
+    return replyWithGroupPaths(request, reply, client, OST_TRY(groupUser(request, client)));
 }
 
-OSTErrorCode OSTGroupIdentifiersCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
-                                        OSTClientConnection& client) {
-    const auto userId = groupUser(request, client);
-    if (!userId)
-        return userId.error();
-    const auto groups = OSTGroupManager::defaultManager().groupContainerIdentifiersForUser(
-        *userId, OSTRequestedIdentifier(request, client));
-    if (!groups)
-        return groups.error();
-    reply.set(replyKey::groupIdentifiers, *groups);
-    return OSTErrorCode::success;
+OSTCommandResult OSTGroupIdentifiersCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
+                                            OSTClientConnection& client) {
+    const auto userId = OST_TRY(groupUser(request, client));
+    const auto groups = OST_TRY(OSTGroupManager::defaultManager().groupContainerIdentifiersForUser(
+        userId, OSTRequestedIdentifier(request, client)));
+    reply.set(replyKey::groupIdentifiers, groups);
+    return {};
 }
 
-OSTErrorCode OSTSystemContainerPathCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
-                                           OSTClientConnection& client) {
+OSTCommandResult OSTSystemContainerPathCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
+                                               OSTClientConnection& client) {
     const auto identifier = OSTRequestedIdentifier(request, client);
     const bool isOwn = identifier == client.identity().clientBundleIdentifier;
     if (identifier && !isOwn && OSTWhitelist::sharedWhitelist().systemContainerIdIsWellknown(*identifier))
         client.setAllowOtherIdLookup();
-    const auto record = client.createOrLookupContainerForUser(
-        {.name = {OSTSystemUserId, OSTContainerClass::dataSystem, identifier}, .createIfNecessary = true});
-    if (!record)
-        return record.error();
-    reply.set(replyKey::path, (*record)->url);
-    return OSTErrorCode::success;
+    const auto record = OST_TRY(client.createOrLookupContainerForUser(
+        {.name = {OSTSystemUserId, OSTContainerClass::dataSystem, identifier}, .createIfNecessary = true}));
+    reply.set(replyKey::path, record->url);
+    return {};
 }
 
-OSTErrorCode OSTSystemGroupContainerPathsCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
-                                                 OSTClientConnection& client) {
+OSTCommandResult OSTSystemGroupContainerPathsCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
+                                                     OSTClientConnection& client) {
     return replyWithGroupPaths(request, reply, client, OSTSystemUserId);
 }
 
-OSTErrorCode OSTSystemGroupContainerPathCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
-                                                OSTClientConnection& client) {
+OSTCommandResult OSTSystemGroupContainerPathCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
+                                                    OSTClientConnection& client) {
     constexpr const char* function = "systemGroupContainerPath";
     const auto identifier = OSTRequestedIdentifier(request, client);
     const auto& clientIdentifier = client.identity().clientBundleIdentifier;
@@ -145,43 +136,39 @@ OSTErrorCode OSTSystemGroupContainerPathCommand(const platform::IPCRequest& requ
     } else {
         platform::logAs(platform::LogLevel::error, function, "%@ is not entitled for system group identifier: %@",
                         clientIdentifier, named);
-        return OSTErrorCode::notEntitled;
+        return std::unexpected(OSTErrorCode::notEntitled);
     }
     if (!path) {
         platform::logAs(platform::LogLevel::error, function,
                         "Did not find system group container with identifier: %@ for %@", group, identifier);
-        return OSTErrorCode::notFound;
+        return std::unexpected(OSTErrorCode::notFound);
     }
     reply.set(replyKey::path, *path);
-    return OSTErrorCode::success;
+    return {};
 }
 
-OSTErrorCode OSTRegisterCodeSigningCommand(const platform::IPCRequest& request, platform::IPCReply& /*reply*/,
-                                           OSTClientConnection& /*client*/) {
-    auto info = dictionaryOf(request, requestKey::codeSigningInfo);
-    if (!info)
-        return info.error();
-    const auto options = dictionaryOf(request, requestKey::optionsDictionary);
-    if (!options)
-        return options.error();
+OSTCommandResult OSTRegisterCodeSigningCommand(const platform::IPCRequest& request, platform::IPCReply& /*reply*/,
+                                               OSTClientConnection& /*client*/) {
+    const auto info = OST_TRY(dictionaryOf(request, requestKey::codeSigningInfo));
+    const auto options = OST_TRY(dictionaryOf(request, requestKey::optionsDictionary));
     return OSTCodeSigningMapping::sharedInstance().processCodeSigningInfo(
-        *std::move(info), request.stringValue(requestKey::identifier), optionsOf(options->get()));
+        info, request.stringValue(requestKey::identifier), optionsOf(options.get()));
 }
 
-OSTErrorCode OSTCodeSigningInfoCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
-                                       OSTClientConnection& /*client*/) {
+OSTCommandResult OSTCodeSigningInfoCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
+                                           OSTClientConnection& /*client*/) {
     const auto identifier = request.stringValue(requestKey::identifier);
     const auto info =
         identifier ? OSTCodeSigningMapping::sharedInstance().getCodeSigningInfoForIdentifier(*identifier) : nullptr;
     if (!info)
-        return OSTErrorCode::notFound;
+        return std::unexpected(OSTErrorCode::notFound);
     auto encoder = reply.encoder(replyKey::infoDictionary);
     platform::encodePropertyListValue(encoder, *info);
-    return OSTErrorCode::success;
+    return {};
 }
 
-OSTErrorCode OSTInvalidateCodeSigningCommand(const platform::IPCRequest& /*request*/, platform::IPCReply& /*reply*/,
-                                             OSTClientConnection& /*client*/) {
+OSTCommandResult OSTInvalidateCodeSigningCommand(const platform::IPCRequest& /*request*/, platform::IPCReply& /*reply*/,
+                                                 OSTClientConnection& /*client*/) {
     return OSTCodeSigningMapping::sharedInstance().invalidateCodeSigningInfoForAppsWithoutBundleContainer();
 }
 

@@ -6,14 +6,17 @@
 #include "store/OSTClientConnection.h"
 
 #include <cstdint>
+#include <expected>
 #include <string_view>
 
 namespace ost {
 
-/// Carries a command out: reads its keys from the request, acts for the client, puts the results into the reply. Gives
-/// the reply's code.
-using OSTCommandHandler = OSTErrorCode (*)(const platform::IPCRequest& request, platform::IPCReply& reply,
-                                           OSTClientConnection& client);
+/// How a command ended: with the reply's code unless it succeeded.
+using OSTCommandResult = std::expected<void, OSTErrorCode>;
+
+/// Carries a command out: reads its keys from the request, acts for the client, puts the results into the reply.
+using OSTCommandHandler = OSTCommandResult (*)(const platform::IPCRequest& request, platform::IPCReply& reply,
+                                               OSTClientConnection& client);
 
 /// Who sends the reply of a command.
 enum class OSTReplyBy : std::uint32_t {

@@ -11,10 +11,6 @@ namespace ost {
 
 namespace {
 
-OSTErrorCode codeOf(const std::expected<void, OSTErrorCode>& result) {
-    return result ? OSTErrorCode::success : result.error();
-}
-
 /// Reads every element of an array; a value that is no array has none.
 template<typename T, typename Read>
 std::vector<T> elementsOf(const platform::IPCRequest& request, std::string_view key, Read read) {
@@ -34,30 +30,26 @@ std::uint64_t numberOf(const platform::CBORItem& element) { return element.asUns
 
 } // namespace
 
-OSTErrorCode OSTReplaceCommand(const platform::IPCRequest& request, platform::IPCReply& /*reply*/,
-                               OSTClientConnection& client) {
+OSTCommandResult OSTReplaceCommand(const platform::IPCRequest& request, platform::IPCReply& /*reply*/,
+                                   OSTClientConnection& client) {
     OSTReplacement replacement;
     auto& oldContainer = replacement.oldContainer;
     if ((oldContainer.uuid = request.uuidValue(requestKey::oldContainer.uuid))) {
-        const auto place = OSTRequestedPlace(request, client, requestKey::oldContainer);
-        if (!place)
-            return place.error();
-        oldContainer.name = {.userId = place->userId,
-                             .containerClass = place->containerClass,
+        const auto place = OST_TRY(OSTRequestedPlace(request, client, requestKey::oldContainer));
+        oldContainer.name = {.userId = place.userId,
+                             .containerClass = place.containerClass,
                              .identifier = request.stringValue(requestKey::oldContainer.identifier)};
     }
-    const auto place = OSTRequestedPlace(request, client, requestKey::newContainer);
-    if (!place)
-        return place.error();
-    replacement.newContainer = {.name = {.userId = place->userId,
-                                         .containerClass = place->containerClass,
+    const auto place = OST_TRY(OSTRequestedPlace(request, client, requestKey::newContainer));
+    replacement.newContainer = {.name = {.userId = place.userId,
+                                         .containerClass = place.containerClass,
                                          .identifier = request.stringValue(requestKey::newContainer.identifier)},
                                 .uuid = request.uuidValue(requestKey::newContainer.uuid)};
-    return codeOf(client.replaceContainer(replacement));
+    return client.replaceContainer(replacement);
 }
 
-OSTErrorCode OSTStageForDeleteCommand(const platform::IPCRequest& request, platform::IPCReply& /*reply*/,
-                                      OSTClientConnection& client) {
+OSTCommandResult OSTStageForDeleteCommand(const platform::IPCRequest& request, platform::IPCReply& /*reply*/,
+                                          OSTClientConnection& client) {
     OSTDeletion deletion;
     deletion.classes =
         elementsOf<OSTContainerClass>(request, requestKey::containers.containerClass, [](const auto& element) {
@@ -70,42 +62,37 @@ OSTErrorCode OSTStageForDeleteCommand(const platform::IPCRequest& request, platf
     });
     // A user without a class could not be validated.
     if (userIds.size() > deletion.classes.size())
-        return OSTCreateError(OSTErrorCode::invalidObject,
-                              "Can't act on an invalid input: user ID count: %ld, class count: %ld", userIds.size(),
-                              deletion.classes.size())
-            .code();
+        return std::unexpected(OSTCreateError(OSTErrorCode::invalidObject,
+                                              "Can't act on an invalid input: user ID count: %ld, class count: %ld",
+                                              userIds.size(), deletion.classes.size()));
     for (std::size_t i = 0; i < userIds.size(); ++i) {
-        const auto resolved = validateUserId(userIds[i], deletion.classes[i], client.identity().clientUserId);
-        if (!resolved)
-            return resolved.error();
-        deletion.userIds.push_back(*resolved);
+        deletion.userIds.push_back(
+            OST_TRY(validateUserId(userIds[i], deletion.classes[i], client.identity().clientUserId)));
     }
     if (!isArray(request, requestKey::containers.identifier))
         platform::logAs(platform::LogLevel::error, "stageContainerForDelete",
                         "Got non-Array input for the identifiers array");
     deletion.identifiers = elementsOf<std::optional<std::string_view>>(
         request, requestKey::containers.identifier, [](const auto& element) { return element.asText(); });
-    return codeOf(client.stageForDeleteContainersWithUsers(deletion));
+    return client.stageForDeleteContainersWithUsers(deletion);
 }
 
-OSTErrorCode OSTDestroyDeathRowCommand(const platform::IPCRequest& /*request*/, platform::IPCReply& reply,
-                                       OSTClientConnection& client) {
+OSTCommandResult OSTDestroyDeathRowCommand(const platform::IPCRequest& /*request*/, platform::IPCReply& reply,
+                                           OSTClientConnection& client) {
     client.deleteContainersOnDeathRowWithCompletion([reply = std::move(reply)](std::int64_t code) mutable {
         reply.set(replyKey::error, static_cast<std::uint64_t>(code));
         reply.send();
     });
-    return OSTErrorCode::success;
+    return {};
 }
 
-OSTErrorCode OSTDeleteCommand(const platform::IPCRequest& request, platform::IPCReply& /*reply*/,
-                              OSTClientConnection& client) {
-    const auto place = OSTRequestedPlace(request, client);
-    if (!place)
-        return place.error();
-    return codeOf(client.deleteContainerForUser({.userId = place->userId,
-                                                 .containerClass = place->containerClass,
-                                                 .identifier = request.stringValue(requestKey::identifier),
-                                                 .transient = request.booleanValue(requestKey::transient)}));
+OSTCommandResult OSTDeleteCommand(const platform::IPCRequest& request, platform::IPCReply& /*reply*/,
+                                  OSTClientConnection& client) {
+    const auto place = OST_TRY(OSTRequestedPlace(request, client));
+    return client.deleteContainerForUser({.userId = place.userId,
+                                          .containerClass = place.containerClass,
+                                          .identifier = request.stringValue(requestKey::identifier),
+                                          .transient = request.booleanValue(requestKey::transient)});
 }
 
 } // namespace ost

@@ -80,10 +80,9 @@ void registerCaller(const platform::CodeSigningIdentity& caller) {
     const auto& identifier = caller.identifier;
     if (identifier && !mapping.callerIsToBeRegistered(*identifier, caller.entitlements))
         return;
-    const auto code = mapping.processCallerRegisteredEntitlements(caller.entitlements, identifier);
-    if (code != OSTErrorCode::success)
+    if (const auto done = mapping.processCallerRegisteredEntitlements(caller.entitlements, identifier); !done)
         platform::logAs(platform::LogLevel::error, "checkEntitlementsAndInitClientObject",
-                        "Error processing entitlements for %@ : %llu", identifier, code);
+                        "Error processing entitlements for %@ : %llu", identifier, done.error());
 }
 
 /// Sends the reply with the handler's code, or with the reason why there is no more to it than a code.
@@ -141,8 +140,10 @@ void OSTProcessVexelEvent(const std::shared_ptr<platform::IPCConnection>& connec
         logError("Dictionary does not have reply context");
         return connection->cancel();
     }
-    const auto code =
-        OSTGuarded([&]() -> OSTResult<OSTErrorCode> { return command->handler(request, *reply, *client); });
+    const auto code = OSTGuarded([&]() -> OSTResult<OSTErrorCode> {
+        const auto done = command->handler(request, *reply, *client);
+        return done ? OSTErrorCode::success : done.error();
+    });
     if (command->replyBy == OSTReplyBy::dispatcher)
         answer(*reply, code);
     else if (!code) // the handler took the reply with it

@@ -57,7 +57,7 @@ OSTMetadataRecord asMadeNow(const OSTMetadata& record) {
 
 std::expected<OSTMetadataRecord, OSTErrorCode>
 OSTClientConnection::createOrLookupContainerForUser(const OSTContainerLookup& lookup) const {
-    const auto result = OSTGuarded([&]() -> OSTResult<OSTMetadataRecord> {
+    return OSTGuarded([&]() -> OSTResult<OSTMetadataRecord> {
         OST_TRY(_checkLookup(lookup));
         std::string staging;
         auto entry = OSTGuarded([&] { return _lookUpOrCreate(lookup, staging); });
@@ -71,9 +71,6 @@ OSTClientConnection::createOrLookupContainerForUser(const OSTContainerLookup& lo
             OST_TRY(makePlaceDurable(*record));
         return record;
     });
-    if (!result)
-        return std::unexpected(result.error().code());
-    return *result;
 }
 
 OSTResult<void> OSTClientConnection::_checkLookup(const OSTContainerLookup& lookup) const {
@@ -206,7 +203,7 @@ OSTResult<void> OSTClientConnection::_createDefaultDirectory(const std::string& 
 
 std::expected<std::vector<OSTMetadataRecord>, OSTErrorCode>
 OSTClientConnection::containersForUser(std::uint32_t userId, OSTContainerClass containerClass, bool transient) const {
-    const auto result = OSTGuarded([&]() -> OSTResult<std::vector<OSTMetadataRecord>> {
+    return OSTGuarded([&]() -> OSTResult<std::vector<OSTMetadataRecord>> {
         if (!isValidContainerClass(containerClass))
             return std::unexpected(OSTCreateError(OSTErrorCode::invalidObject,
                                                   "Can't act on an invalid container-userId: %u, class: %ld", userId,
@@ -223,9 +220,6 @@ OSTClientConnection::containersForUser(std::uint32_t userId, OSTContainerClass c
                 records.push_back(record);
         return records;
     });
-    if (!result)
-        return std::unexpected(result.error().code());
-    return *result;
 }
 
 } // namespace ost

@@ -38,7 +38,7 @@ platform::WorkQueue& OSTDeathRowQueue() {
 
 std::expected<void, OSTErrorCode>
 OSTClientConnection::stageForDeleteContainersWithUsers(const OSTDeletion& deletion) const {
-    const auto result = OSTGuarded([&]() -> OSTResult<void> {
+    return OSTGuarded([&]() -> OSTResult<void> {
         if (deletion.uuids.size() != deletion.classes.size() || deletion.uuids.size() != deletion.identifiers.size())
             return std::unexpected(
                 OSTCreateError(OSTErrorCode::invalidObject,
@@ -51,20 +51,14 @@ OSTClientConnection::stageForDeleteContainersWithUsers(const OSTDeletion& deleti
                 {{deletion.userIds.at(i), deletion.classes[i], deletion.identifiers[i]}, deletion.uuids[i]}));
         return {};
     });
-    if (!result)
-        return std::unexpected(result.error().code());
-    return {};
 }
 
 std::expected<void, OSTErrorCode> OSTClientConnection::stageForDeleteContainer(const OSTMetadata& container,
                                                                                bool useLocking) const {
-    const auto result = OSTGuarded([&] {
+    return OSTGuarded([&] {
         const OSTAllIdentifiersLock lock(OSTLockKind::writing, useLocking);
         return _stageForDeletion({container.name(), container.uuid});
     });
-    if (!result)
-        return std::unexpected(result.error().code());
-    return {};
 }
 
 OSTResult<void> OSTClientConnection::_stageForDeletion(const OSTContainerReference& reference) {

@@ -49,7 +49,7 @@ struct OSTClientConnection::ReplaceOperation {
 };
 
 std::expected<void, OSTErrorCode> OSTClientConnection::replaceContainer(const OSTReplacement& replacement) const {
-    const auto result = OSTGuarded([&]() -> OSTResult<void> {
+    return OSTGuarded([&]() -> OSTResult<void> {
         OST_TRY(_checkReplacement(replacement));
         const OSTAllIdentifiersLock lock(OSTLockKind::writing);
         ReplaceOperation operation;
@@ -66,9 +66,6 @@ std::expected<void, OSTErrorCode> OSTClientConnection::replaceContainer(const OS
             OST_TRY(_cleanUpReplacement(replacement, operation));
         return replaced;
     });
-    if (!result)
-        return std::unexpected(result.error().code());
-    return {};
 }
 
 OSTResult<void> OSTClientConnection::_checkReplacement(const OSTReplacement& replacement) {

@@ -48,7 +48,8 @@ TEST_F(CodeSigningMapping, CallersEntitlementsAreWrittenWhenTheyChange) {
     EXPECT_FALSE(mapping().codeSigningInfoExistForIdentifier("org.example.app"));
     EXPECT_FALSE(std::filesystem::exists(mappingFile)) << "nothing is written before the first change";
     const auto entitlements = shared(OSTDictionary({{"key", true}}));
-    ASSERT_EQ(OSTErrorCode::success, mapping().processCallerRegisteredEntitlements(entitlements, "org.example.app"));
+    ASSERT_EQ(OSTErrorCode::success,
+              codeOf(mapping().processCallerRegisteredEntitlements(entitlements, "org.example.app")));
     EXPECT_TRUE(mapping().codeSigningInfoExistForIdentifier("org.example.app"));
     EXPECT_TRUE(mapping().identifierHasCallerRegisteredEntitlements("org.example.app"));
     const auto written = onDisk();
@@ -57,12 +58,14 @@ TEST_F(CodeSigningMapping, CallersEntitlementsAreWrittenWhenTheyChange) {
     EXPECT_EQ(*entitlements, *entry.entitlements());
 
     std::filesystem::remove(mappingFile);
-    ASSERT_EQ(OSTErrorCode::success,
-              mapping().processCallerRegisteredEntitlements(shared(OSTDictionary(*entitlements)), "org.example.app"));
+    ASSERT_EQ(OSTErrorCode::success, codeOf(mapping().processCallerRegisteredEntitlements(
+                                         shared(OSTDictionary(*entitlements)), "org.example.app")));
     EXPECT_FALSE(std::filesystem::exists(mappingFile)) << "an unchanged registration writes nothing";
-    ASSERT_EQ(OSTErrorCode::success, mapping().processCallerRegisteredEntitlements(shared({}), "org.example.app"));
+    ASSERT_EQ(OSTErrorCode::success,
+              codeOf(mapping().processCallerRegisteredEntitlements(shared({}), "org.example.app")));
     EXPECT_EQ(1U, onDisk().size());
-    EXPECT_EQ(OSTErrorCode::noIdentifier, mapping().processCallerRegisteredEntitlements(entitlements, std::nullopt));
+    EXPECT_EQ(OSTErrorCode::noIdentifier,
+              codeOf(mapping().processCallerRegisteredEntitlements(entitlements, std::nullopt)));
 }
 
 TEST_F(CodeSigningMapping, GroupListsAreReadFromTheEntitlements) {
@@ -117,7 +120,8 @@ TEST_F(CodeSigningMapping, PlaceholderAndInvalidEntriesAreHiddenFromOutside) {
 TEST_F(CodeSigningMapping, FileThatCannotBeReadIsNeverOverwritten) {
     test::writeFile(mappingFile, "<plist version=\"1.0\"><array/></plist>");
     EXPECT_FALSE(mapping().codeSigningInfoExistForIdentifier("org.example.app"));
-    EXPECT_NE(OSTErrorCode::success, mapping().processCallerRegisteredEntitlements(shared({}), "org.example.app"));
+    EXPECT_NE(OSTErrorCode::success,
+              codeOf(mapping().processCallerRegisteredEntitlements(shared({}), "org.example.app")));
     EXPECT_FALSE(mapping().getCodeSigningInfoForIdentifier("org.example.app"));
     EXPECT_EQ("<plist version=\"1.0\"><array/></plist>", test::readFile(mappingFile));
 }
@@ -129,10 +133,11 @@ TEST_F(CodeSigningMapping, WriteFailureKeepsTheChangeInMemory) {
     EXPECT_FALSE(mapping().codeSigningInfoExistForIdentifier("org.example.app"));
     std::filesystem::create_directories(std::string(mappingFile) + "/in-the-way");
     EXPECT_EQ(OSTErrorCode::mappingWriteFailed,
-              mapping().processCallerRegisteredEntitlements(shared({}), "org.example.app"));
+              codeOf(mapping().processCallerRegisteredEntitlements(shared({}), "org.example.app")));
     EXPECT_TRUE(mapping().codeSigningInfoExistForIdentifier("org.example.app"));
     std::filesystem::remove_all(mappingFile);
-    EXPECT_EQ(OSTErrorCode::success, mapping().processCallerRegisteredEntitlements(shared({}), "org.example.other"));
+    EXPECT_EQ(OSTErrorCode::success,
+              codeOf(mapping().processCallerRegisteredEntitlements(shared({}), "org.example.other")));
     EXPECT_EQ(2U, onDisk().size()) << "the next successful write stores everything";
 }
 

@@ -74,7 +74,7 @@ TEST_F(CodeSigningProcessing, ARegistrationCountsAndNothingOfTheOneBefore) {
     EXPECT_EQ(0U, onDisk().size());
     EXPECT_FALSE(mapping().codeSigningInfoExistForIdentifier(app));
     EXPECT_FALSE(writes([] { return remove(app); })) << "nothing is left to be removed";
-    EXPECT_EQ(OSTErrorCode::noIdentifier, mapping().processCodeSigningInfo(nullptr, std::nullopt, {}));
+    EXPECT_EQ(OSTErrorCode::noIdentifier, codeOf(mapping().processCodeSigningInfo(nullptr, std::nullopt, {})));
 }
 
 TEST_F(CodeSigningProcessing, ChildrenAreLinkedToTheirParentAndDroppedWithTheirEntries) {
@@ -246,7 +246,8 @@ TEST_F(CodeSigningProcessing, AFailedWriteIsReportedAndMadeGoodByTheNext) {
     EXPECT_EQ(OSTErrorCode::mappingWriteFailed, registerEntitlements(app, OSTDictionary()));
     EXPECT_FALSE(lives(sharedAppGroup, "g", group)) << "the consequences have come before the write";
     EXPECT_EQ(Identifiers(), mapping().appGroupIdentifiersForIdentifier(app));
-    EXPECT_EQ(OSTErrorCode::mappingWriteFailed, mapping().invalidateCodeSigningInfoForAppsWithoutBundleContainer());
+    EXPECT_EQ(OSTErrorCode::mappingWriteFailed,
+              codeOf(mapping().invalidateCodeSigningInfoForAppsWithoutBundleContainer()));
     EXPECT_FALSE(mapping().getCodeSigningInfoForIdentifier(app));
     EXPECT_EQ(OSTErrorCode::mappingWriteFailed, remove(app));
     EXPECT_FALSE(mapping().codeSigningInfoExistForIdentifier(app));
@@ -265,7 +266,8 @@ TEST_F(CodeSigningProcessing, AMappingThatCannotBeReadProcessesNothing) {
     EXPECT_FALSE(mapping().isAvailable());
     EXPECT_EQ(OSTErrorCode::noProcessingResult, registerEntitlements(app, appGroups({"g"})));
     EXPECT_EQ(OSTErrorCode::noProcessingResult, remove(app));
-    EXPECT_EQ(OSTErrorCode::noProcessingResult, mapping().invalidateCodeSigningInfoForAppsWithoutBundleContainer());
+    EXPECT_EQ(OSTErrorCode::noProcessingResult,
+              codeOf(mapping().invalidateCodeSigningInfoForAppsWithoutBundleContainer()));
     EXPECT_EQ(Identifiers(), mapping().appGroupIdentifiersForIdentifier(app));
     EXPECT_TRUE(store().deleteContainerForUser({33, bundleApplication, app}));
     EXPECT_FALSE(fs::exists(bundle));
@@ -314,13 +316,13 @@ TEST_F(CodeSigningProcessing, ApplicationsWithoutABundleAreInvalidatedUnlessThei
                   registerEntitlements(row.identifier, OSTDictionary(), {.registeredByCaller = row.byCaller}));
         EXPECT_EQ(row.bundle == undefined, makeContainer(row.bundle, row.identifier).empty());
     }
-    ASSERT_EQ(OSTErrorCode::success, mapping().invalidateCodeSigningInfoForAppsWithoutBundleContainer());
+    ASSERT_EQ(OSTErrorCode::success, codeOf(mapping().invalidateCodeSigningInfoForAppsWithoutBundleContainer()));
     for (const auto& row : rows) {
         EXPECT_EQ(row.stays, mapping().getCodeSigningInfoForIdentifier(row.identifier) != nullptr) << row.identifier;
         EXPECT_EQ(row.stays, !entryOnDisk(row.identifier)->invalid) << row.identifier;
         EXPECT_TRUE(mapping().codeSigningInfoExistForIdentifier(row.identifier)) << row.identifier;
     }
-    EXPECT_TRUE(writes([] { return mapping().invalidateCodeSigningInfoForAppsWithoutBundleContainer(); }))
+    EXPECT_TRUE(writes([] { return codeOf(mapping().invalidateCodeSigningInfoForAppsWithoutBundleContainer()); }))
         << "it is written even when nothing changes";
     ASSERT_EQ(OSTErrorCode::success, registerEntitlements("gone", OSTDictionary()));
     EXPECT_TRUE(mapping().getCodeSigningInfoForIdentifier("gone")) << "a new registration makes it valid";

@@ -68,17 +68,21 @@ protected:
         return OSTCodeSigningEntry::withSerializedDictionary(*value->asDictionary());
     }
 
+    static OSTErrorCode codeOf(const std::expected<void, OSTErrorCode>& result) {
+        return result ? OSTErrorCode::success : result.error();
+    }
+
     static OSTErrorCode registerInfo(std::string_view identifier, OSTDictionary info,
                                      const OSTRegistrationOptions& options = {}) {
-        return mapping().processCodeSigningInfo(std::make_shared<const OSTDictionary>(std::move(info)), identifier,
-                                                options);
+        return codeOf(mapping().processCodeSigningInfo(std::make_shared<const OSTDictionary>(std::move(info)),
+                                                       identifier, options));
     }
     static OSTErrorCode registerEntitlements(std::string_view identifier, OSTValue entitlements,
                                              const OSTRegistrationOptions& options = {}) {
         return registerInfo(identifier, OSTDictionary({{OSTEntitlementsKey, std::move(entitlements)}}), options);
     }
     static OSTErrorCode remove(std::string_view identifier) {
-        return mapping().processCodeSigningInfo(nullptr, identifier, {});
+        return codeOf(mapping().processCodeSigningInfo(nullptr, identifier, {}));
     }
 
     static void unmount(const std::filesystem::path& directory) { ::umount2(directory.c_str(), MNT_DETACH); }

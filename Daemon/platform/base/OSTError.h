@@ -31,6 +31,8 @@ public:
     /// The domain as messages name it: "OSTErrorDomain", "POSIX" or "general".
     [[nodiscard]] std::string_view domainName() const;
     [[nodiscard]] OSTErrorCode code() const { return _record->code; }
+    /// Where the contract is a code, an error goes on as its code: OST_TRY and `return` make the step.
+    operator OSTErrorCode() const { return code(); }
     [[nodiscard]] const std::optional<std::string>& message() const { return _record->message; }
     [[nodiscard]] const std::shared_ptr<const OSTError>& underlyingError() const { return _record->underlyingError; }
     /// The qualified name of the raising function: "OSTMetadata::writeMetadataToDisk".
