@@ -2,6 +2,7 @@
 
 #include "Protocol/OSTServices.h"
 #include "Protocol/OSTUserId.h"
+#include "platform/base/Errno.h"
 #include "platform/base/Try.h"
 
 #include <fcntl.h>
@@ -206,7 +207,7 @@ Result<FileDescriptor> DeviceImage::openEmptiedRunDirectory() const {
     return directory;
 }
 
-std::expected<void, int> DeviceImage::changeRoot() const noexcept {
+std::expected<void, platform::Errno> DeviceImage::changeRoot() const noexcept {
     if (::fchdir(_root.get()) != 0 || ::chroot(".") != 0 || ::chdir("/") != 0)
         return std::unexpected(errno);
     return {};

@@ -1,5 +1,6 @@
 #pragma once
 
+#include "platform/base/Errno.h"
 #include "platform/base/FileDescriptor.h"
 
 #include <expected>
@@ -49,7 +50,7 @@ public:
 
     /// Makes the image the calling process's root and working directory. Errors: errno, and nothing of it needs memory,
     /// so that it may follow a fork.
-    [[nodiscard]] std::expected<void, int> changeRoot() const noexcept;
+    [[nodiscard]] std::expected<void, platform::Errno> changeRoot() const noexcept;
 
 private:
     explicit DeviceImage(std::filesystem::path path) : _path(std::move(path)) {}

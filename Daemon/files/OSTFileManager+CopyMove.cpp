@@ -1,4 +1,5 @@
 #include "files/OSTFileManager.h"
+#include "platform/base/Errno.h"
 
 #include "files/OSTDurability.h"
 #include "files/OSTPathResolution.h"
@@ -28,7 +29,7 @@ enum class Existing : unsigned { stays = RENAME_NOREPLACE, isReplaced = 0 };
 /// left in it.
 class Workshop {
 public:
-    static std::expected<Workshop, int> make(std::string_view item, int parent) {
+    static std::expected<Workshop, platform::Errno> make(std::string_view item, int parent) {
         auto name = OST_TRY(
             OSTMakeUnique(".temp.", [&](const char* candidate) { return ::mkdirat(parent, candidate, S_IRWXU) == 0; }));
         std::string path = platform::pathByAppending(platform::pathByDeletingLastComponent(item), name);
@@ -56,7 +57,7 @@ private:
     FileDescriptor _directory;
 };
 
-std::expected<void, int> copy(std::string_view source, std::string_view destination, Existing existing) {
+std::expected<void, platform::Errno> copy(std::string_view source, std::string_view destination, Existing existing) {
     const auto from = OST_TRY(OSTItemPlace::find(source));
     const auto to = OST_TRY(OSTItemPlace::find(destination, O_RDONLY));
     const auto workshop = OST_TRY(Workshop::make(destination, to.directory()));
@@ -90,12 +91,12 @@ OSTResult<void> removeSource(std::string_view source) {
 
 OSTResult<void> copied(std::string_view source, std::string_view destination, Existing existing) {
     if (const auto done = copy(source, destination, existing); !done)
-        return std::unexpected(OSTCreatePOSIXError(done.error(), "clonetree of %@ to %@ failed: %s", source,
-                                                   destination, std::strerror(done.error())));
+        return std::unexpected(
+            OSTCreatePOSIXError(done.error(), "clonetree of %@ to %@ failed: %s", source, destination, done.error()));
     return {};
 }
 
-std::expected<void, int> rename(std::string_view source, std::string_view destination) {
+std::expected<void, platform::Errno> rename(std::string_view source, std::string_view destination) {
     const auto from = OST_TRY(OSTItemPlace::find(source));
     const auto to = OST_TRY(OSTItemPlace::find(destination));
     if (::renameat(from.directory(), from.name(), to.directory(), to.name()) != 0)
@@ -107,8 +108,7 @@ std::expected<void, int> rename(std::string_view source, std::string_view destin
 OSTResult<bool> isMissing(std::string_view source) {
     const auto item = OSTOpenItem(AT_FDCWD, source, O_PATH);
     if (!item && item.error() != ENOENT)
-        return std::unexpected(
-            OSTCreatePOSIXError(item.error(), "stat of %@ failed: %s", source, std::strerror(item.error())));
+        return std::unexpected(OSTCreatePOSIXError(item.error(), "stat of %@ failed: %s", source, item.error()));
     return !item;
 }
 
@@ -130,11 +130,11 @@ OSTResult<void> OSTFileManager::_moveItemAtURL(std::string_view source, std::str
         return {};
     if (renamed.error() != EXDEV)
         return std::unexpected(OSTCreatePOSIXError(renamed.error(), "rename of %@ to %@ failed: %s", source,
-                                                   destination, std::strerror(renamed.error())));
+                                                   destination, renamed.error()));
     OST_TRY(copied(source, destination, Existing::isReplaced));
     if (const auto removed = removeSource(source); !removed)
         platform::logError("Failed to remove source %@ : %s", source,
-                           std::strerror(static_cast<int>(removed.error().code())));
+                           platform::Errno(static_cast<int>(removed.error().code())));
     return {};
 }
 

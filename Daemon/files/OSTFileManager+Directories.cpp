@@ -1,4 +1,5 @@
 #include "files/OSTFileManager.h"
+#include "platform/base/Errno.h"
 
 #include "files/OSTDurability.h"
 #include "files/OSTPathResolution.h"
@@ -20,7 +21,7 @@ using platform::FileDescriptor;
 namespace {
 
 /// Makes the directories on the way to the item at `path` that are missing.
-std::expected<void, int> makeParents(std::string_view path, mode_t mode) {
+std::expected<void, platform::Errno> makeParents(std::string_view path, mode_t mode) {
     FileDescriptor held = OST_TRY(OSTOpenItem(AT_FDCWD, "/", O_PATH | O_DIRECTORY));
     for (auto slash = path.find('/'); slash != std::string_view::npos; slash = path.find('/')) {
         const std::string_view name = path.substr(0, slash);
@@ -40,12 +41,12 @@ std::expected<void, int> makeParents(std::string_view path, mode_t mode) {
 
 struct MadeDirectory {
     bool isNew;
-    std::expected<FileDescriptor, int> opened;
+    std::expected<FileDescriptor, platform::Errno> opened;
 };
 
 /// Makes a directory unless something is there, and opens it with `access`.
-std::expected<MadeDirectory, int> makeDirectory(std::string_view path, const OSTDirectoryAttributes& attributes,
-                                                int access) {
+std::expected<MadeDirectory, platform::Errno> makeDirectory(std::string_view path,
+                                                            const OSTDirectoryAttributes& attributes, int access) {
     auto place = OSTItemPlace::find(path);
     if (!place && place.error() == ENOENT && attributes.withIntermediateDirectories) {
         OST_TRY(makeParents(path, attributes.mode));
@@ -92,23 +93,21 @@ OSTResult<void> OSTFileManager::createDirectoryAtURL(std::string_view path,
     if (!directory) {
         auto made = makeDirectory(path, attributes, access);
         if (!made && attributes.withIntermediateDirectories)
-            return std::unexpected(
-                OSTCreatePOSIXError(made.error(), "forgepath of %s failed: %s", path, std::strerror(made.error())));
+            return std::unexpected(OSTCreatePOSIXError(made.error(), "forgepath of %s failed: %s", path, made.error()));
         if (!made)
-            return std::unexpected(
-                OSTCreatePOSIXError(made.error(), "mkdir of %s failed: %s", path, std::strerror(made.error())));
+            return std::unexpected(OSTCreatePOSIXError(made.error(), "mkdir of %s failed: %s", path, made.error()));
         isNew = made->isNew;
         directory = std::move(made->opened);
     }
     if (!directory)
         return std::unexpected(
-            OSTCreatePOSIXError(directory.error(), "opendir of %s failed: %s", path, std::strerror(directory.error())));
+            OSTCreatePOSIXError(directory.error(), "opendir of %s failed: %s", path, directory.error()));
 
     if (setsClass && (isNew || platform::protectionClass(directory->get(), -1) != attributes.protectionClass)) {
         const auto set = platform::setProtectionClass(directory->get(), attributes.protectionClass);
         if (!set)
             return std::unexpected(OSTCreatePOSIXError(set.error(), "Failed to setclass(%d) on directory %s: %s",
-                                                       attributes.protectionClass, path, std::strerror(set.error())));
+                                                       attributes.protectionClass, path, set.error()));
     }
     if (attributes.owner != 0 && (isNew || !belongsTo(directory->get(), attributes.owner)))
         giveDirectory(directory->get(), attributes.owner);
@@ -118,14 +117,13 @@ OSTResult<void> OSTFileManager::createDirectoryAtURL(std::string_view path,
 OSTResult<FileDescriptor> OSTFileManager::openDirectoryAtURL(std::string_view path) const {
     auto opened = OSTOpenItem(AT_FDCWD, path, O_RDONLY | O_DIRECTORY);
     if (!opened)
-        return std::unexpected(
-            OSTCreatePOSIXError(opened.error(), "opendir of %s failed: %s", path, std::strerror(opened.error())));
+        return std::unexpected(OSTCreatePOSIXError(opened.error(), "opendir of %s failed: %s", path, opened.error()));
     return *std::move(opened);
 }
 
 OSTResult<std::string> OSTFileManager::createTemporaryDirectoryInDirectoryURL(std::string_view path,
                                                                               std::uint32_t owner) const {
-    const auto make = [&]() -> std::expected<std::string, int> {
+    const auto make = [&]() -> std::expected<std::string, platform::Errno> {
         const FileDescriptor parent = OST_TRY(OSTOpenItem(AT_FDCWD, path, O_PATH | O_DIRECTORY));
         std::string name = OST_TRY(OSTMakeUnique(
             "temp.", [&](const char* candidate) { return ::mkdirat(parent.get(), candidate, S_IRWXU) == 0; }));
@@ -137,16 +135,14 @@ OSTResult<std::string> OSTFileManager::createTemporaryDirectoryInDirectoryURL(st
     const auto name = make();
     if (!name)
         return std::unexpected(OSTCreatePOSIXError(name.error(), "Failed to create temp dir at path %s : %s",
-                                                   platform::pathByAppending(path, "temp.XXXXXX"),
-                                                   std::strerror(name.error())));
+                                                   platform::pathByAppending(path, "temp.XXXXXX"), name.error()));
     return platform::pathByAppending(path, *name);
 }
 
 OSTResult<void> OSTFileManager::makeDirectoryDurable(std::string_view path) const {
     const FileDescriptor directory = OST_TRY(openDirectoryAtURL(path));
     if (const auto durable = OSTWaitForDisk(directory.get(), ::fsync); !durable)
-        return std::unexpected(
-            OSTCreatePOSIXError(durable.error(), "fsync of %@ failed: %s", path, std::strerror(durable.error())));
+        return std::unexpected(OSTCreatePOSIXError(durable.error(), "fsync of %@ failed: %s", path, durable.error()));
     return {};
 }
 

@@ -1,4 +1,5 @@
 #include "files/OSTFileManager.h"
+#include "platform/base/Errno.h"
 
 #include "files/OSTPathResolution.h"
 #include "files/OSTTreeCursor.h"
@@ -32,7 +33,7 @@ constexpr std::uint64_t allocationUnit = 512; // of st_blocks, on every file sys
 constexpr std::size_t longestPath = PATH_MAX - 1;
 
 /// Opens a directory below `top`, however long its relative path is. The top itself has an empty one.
-std::expected<FileDescriptor, int> openBelow(int top, std::string_view relative) {
+std::expected<FileDescriptor, platform::Errno> openBelow(int top, std::string_view relative) {
     FileDescriptor opened;
     int from = top;
     while (relative.size() > longestPath) {
@@ -114,7 +115,7 @@ private:
         if (!opened) {
             if (opened.error() != EXDEV) // Other file systems are not part of the tree.
                 platform::logAs(platform::LogLevel::error, logName, "Failed to open directory %@ : %s", path,
-                                std::strerror(opened.error()));
+                                opened.error());
             return measured;
         }
         OSTTreeCursor cursor(*std::move(opened), path);
@@ -122,7 +123,7 @@ private:
             const auto found = cursor.next();
             if (!found)
                 platform::logAs(platform::LogLevel::error, logName, "gatherattrs on entry %llu in %@ returned error %s",
-                                number, path, std::strerror(found.error()));
+                                number, path, found.error());
             if (!found || !*found)
                 return measured;
             if (const auto bytes = _measureEntry(cursor))
@@ -132,12 +133,12 @@ private:
                                                                 : pathByAppending(relative, cursor.name()));
             else
                 platform::logAs(platform::LogLevel::error, logName, "Got error %s while processing entry %llu in %@",
-                                std::strerror(bytes.error()), number, path);
+                                bytes.error(), number, path);
         }
     }
 
     /// The bytes that the current item adds to the total. Fails with EISDIR when it is a directory to be measured.
-    [[nodiscard]] std::expected<std::uint64_t, int> _measureEntry(const OSTTreeCursor& cursor) {
+    [[nodiscard]] std::expected<std::uint64_t, platform::Errno> _measureEntry(const OSTTreeCursor& cursor) {
         if (cursor.type() == DT_DIR)
             return std::unexpected(EISDIR);
         struct stat status{};
@@ -186,7 +187,7 @@ std::uint64_t OSTFileManager::diskUsageForURL(std::string_view path) const {
     if (top && ::fstat(top->get(), &status) != 0)
         top = std::unexpected(errno);
     if (!top) {
-        platform::logError("Failed to open directory %@ : %s", path, std::strerror(top.error()));
+        platform::logError("Failed to open directory %@ : %s", path, top.error());
         return 0;
     }
     return DiskUsage(*std::move(top), status.st_dev, path).measure();

@@ -1,4 +1,5 @@
 #include "files/OSTFileManager.h"
+#include "platform/base/Errno.h"
 
 #include "files/OSTPathResolution.h"
 #include "files/OSTTreeCursor.h"
@@ -22,11 +23,11 @@ bool isDirectory(const OSTTreeCursor& item) {
     return ::fstatat(item.directory(), item.name(), &status, AT_SYMLINK_NOFOLLOW) == 0 && S_ISDIR(status.st_mode);
 }
 
-std::expected<std::vector<OSTDirectoryItem>, int> listing(std::string_view path) {
+std::expected<std::vector<OSTDirectoryItem>, platform::Errno> listing(std::string_view path) {
     auto directory = OSTOpenItem(AT_FDCWD, path, O_RDONLY | O_DIRECTORY);
     if (!directory && directory.error() != ENOENT)
         platform::logAs(platform::LogLevel::error, "_IterateDirectory", "opendir of %s failed: %s", path,
-                        std::strerror(directory.error()));
+                        directory.error());
     OSTTreeCursor cursor(OST_TRY(std::move(directory)), std::string());
     std::vector<OSTDirectoryItem> items;
     while (OST_TRY(cursor.next()))
@@ -36,9 +37,9 @@ std::expected<std::vector<OSTDirectoryItem>, int> listing(std::string_view path)
 }
 
 /// 0 when an item is at `path`, else why it cannot be seen.
-int errorOfLooking(std::string_view path) {
+platform::Errno errorOfLooking(std::string_view path) {
     const auto item = OSTOpenItem(AT_FDCWD, path, O_PATH);
-    return item ? 0 : item.error();
+    return item ? platform::Errno(0) : item.error();
 }
 
 } // namespace
@@ -46,43 +47,43 @@ int errorOfLooking(std::string_view path) {
 OSTResult<std::vector<OSTDirectoryItem>> OSTFileManager::urlsForItemsInDirectoryAtURL(std::string_view path) const {
     auto items = listing(path);
     if (!items)
-        return std::unexpected(OSTCreatePOSIXError(items.error(), "_IterateDirectory for %@ returned %s", path,
-                                                   std::strerror(items.error())));
+        return std::unexpected(
+            OSTCreatePOSIXError(items.error(), "_IterateDirectory for %@ returned %s", path, items.error()));
     return *std::move(items);
 }
 
 bool OSTFileManager::itemExistsAtURL(std::string_view path) const {
-    const int error = errorOfLooking(path);
+    const platform::Errno error = errorOfLooking(path);
     if (error != 0 && error != ENOENT)
-        platform::logError("Failed to determine if %@ exists: %s", path, std::strerror(error));
+        platform::logError("Failed to determine if %@ exists: %s", path, error);
     return error == 0;
 }
 
 bool OSTFileManager::itemDoesNotExistAtURL(std::string_view path) const {
-    const int error = errorOfLooking(path);
+    const platform::Errno error = errorOfLooking(path);
     if (error != 0 && error != ENOENT)
-        platform::logError("Failed to determine if %@ exists: %s", path, std::strerror(error));
+        platform::logError("Failed to determine if %@ exists: %s", path, error);
     return error == ENOENT;
 }
 
 bool OSTFileManager::itemDoesNotExist(int directory, std::string_view relativePath) const {
     const auto item = OSTOpenItem(directory, relativePath, O_PATH);
-    const int error = item ? 0 : item.error();
+    const platform::Errno error = item ? platform::Errno(0) : item.error();
     const bool absent = error == ENOENT || error == ENOTDIR || error == ELOOP;
     if (error != 0 && !absent)
-        platform::logError("Failed to determine if %@ exists: %s", relativePath, std::strerror(error));
+        platform::logError("Failed to determine if %@ exists: %s", relativePath, error);
     return absent;
 }
 
 OSTResult<void> OSTFileManager::_traverseDirectory(std::string_view path, const TreeBlock& block) const {
     if (path.empty())
         return std::unexpected(
-            OSTCreatePOSIXError(ENOENT, "fts_open failed for %s with error %s", path, std::strerror(ENOENT)));
+            OSTCreatePOSIXError(ENOENT, "fts_open failed for %s with error %s", path, platform::Errno(ENOENT)));
     OSTResult<void> result;
     OSTWalkTree(path, [&](const OSTTreeEntry& entry) {
         if (entry.visit == OSTTreeEntry::Visit::failure)
-            result = std::unexpected(
-                OSTCreatePOSIXError(entry.error, "Error for path %s: %s", entry.path, std::strerror(entry.error)));
+            result =
+                std::unexpected(OSTCreatePOSIXError(entry.error, "Error for path %s: %s", entry.path, entry.error));
         else
             result = block(entry);
         return result.has_value();

@@ -1,4 +1,5 @@
 #include "files/OSTFileManager.h"
+#include "platform/base/Errno.h"
 
 #include "files/OSTPathResolution.h"
 
@@ -14,7 +15,7 @@ namespace ost {
 namespace {
 
 /// Reads up to `size` bytes to the end of `buffer`, which has that much room, or to the end of the file.
-std::expected<std::size_t, int> readFully(int file, char* buffer, std::size_t size) {
+std::expected<std::size_t, platform::Errno> readFully(int file, char* buffer, std::size_t size) {
     std::size_t filled = 0;
     while (filled < size) {
         const ssize_t count = ::read(file, buffer + filled, size - filled);
@@ -29,8 +30,8 @@ std::expected<std::size_t, int> readFully(int file, char* buffer, std::size_t si
 
 } // namespace
 
-std::expected<void, int> OSTFileManager::readFile(int directory, std::string_view relativePath, std::size_t maximumSize,
-                                                  std::string& buffer) const {
+std::expected<void, platform::Errno> OSTFileManager::readFile(int directory, std::string_view relativePath,
+                                                              std::size_t maximumSize, std::string& buffer) const {
     const auto file = OST_TRY(OSTOpenItem(directory, relativePath, O_RDONLY));
     struct stat status{};
     if (::fstat(file.get(), &status) != 0)
@@ -42,10 +43,10 @@ std::expected<void, int> OSTFileManager::readFile(int directory, std::string_vie
         return std::unexpected(EFBIG);
 
     // What is appended meanwhile is left for the next reader: files that matter here are replaced, never extended.
-    int error = 0;
+    platform::Errno error = 0;
     buffer.resize_and_overwrite(size, [&](char* bytes, std::size_t room) {
         const auto filled = readFully(file.get(), bytes, room);
-        error = filled ? 0 : filled.error();
+        error = filled ? platform::Errno(0) : filled.error();
         return filled.value_or(0);
     });
     if (error != 0)
@@ -56,8 +57,7 @@ std::expected<void, int> OSTFileManager::readFile(int directory, std::string_vie
 OSTResult<std::string> OSTFileManager::readFileAtURL(std::string_view path, std::size_t maximumSize) const {
     std::string bytes;
     if (const auto read = readFile(AT_FDCWD, path, maximumSize, bytes); !read)
-        return std::unexpected(
-            OSTCreatePOSIXError(read.error(), "read of %@ failed: %s", path, std::strerror(read.error())));
+        return std::unexpected(OSTCreatePOSIXError(read.error(), "read of %@ failed: %s", path, read.error()));
     return bytes;
 }
 

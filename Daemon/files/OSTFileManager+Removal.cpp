@@ -1,4 +1,5 @@
 #include "files/OSTFileManager.h"
+#include "platform/base/Errno.h"
 
 #include "files/OSTPathResolution.h"
 #include "files/OSTTreeCursor.h"
@@ -35,13 +36,13 @@ bool isImmutable(const Survivor& item, const char* name, const std::string& path
     struct statx status{};
     if (::statx(item.directory, name, AT_SYMLINK_NOFOLLOW | AT_NO_AUTOMOUNT, STATX_TYPE, &status) != 0) {
         platform::logAs(LogLevel::error, errorCallback, "Failed to stat %s before unsetting UF_IMMUTABLE: %s", path,
-                        std::strerror(errno));
+                        platform::Errno(errno));
         return false;
     }
     return (status.stx_attributes & STATX_ATTR_IMMUTABLE) != 0;
 }
 
-std::expected<void, int> clearImmutableFlag(int directory, const char* name) {
+std::expected<void, platform::Errno> clearImmutableFlag(int directory, const char* name) {
     const FileDescriptor item = OST_TRY(OSTOpenItem(directory, name, O_RDONLY));
     int flags = 0;
     if (::ioctl(item.get(), FS_IOC_GETFLAGS, &flags) != 0)
@@ -57,8 +58,7 @@ bool unsetImmutable(const Survivor& item, const char* name, const std::string& p
     if (!isImmutable(item, name, path))
         return false;
     if (const auto cleared = clearImmutableFlag(item.directory, name); !cleared) {
-        platform::logAs(LogLevel::error, errorCallback, "Failed to lchflags %s: %s", path,
-                        std::strerror(cleared.error()));
+        platform::logAs(LogLevel::error, errorCallback, "Failed to lchflags %s: %s", path, cleared.error());
         return false;
     }
     platform::logAs(LogLevel::notice, errorCallback, "Unset UF_IMMUTABLE on %s", path);
@@ -69,7 +69,7 @@ bool unsetImmutable(const Survivor& item, const char* name, const std::string& p
 class Removal {
 public:
     /// Removes the item at `place`. Fails when nothing could be tried.
-    [[nodiscard]] std::expected<void, int> remove(const OSTItemPlace& place, const std::string& path) {
+    [[nodiscard]] std::expected<void, platform::Errno> remove(const OSTItemPlace& place, const std::string& path) {
         auto top = OSTOpenSubdirectory(place.directory(), place.name());
         if (!top && !isNoDirectory(top.error()))
             return std::unexpected(top.error());
@@ -95,7 +95,7 @@ public:
     }
 
     /// The errno of the first item that was not removed, or 0.
-    [[nodiscard]] int firstError() const { return _firstError; }
+    [[nodiscard]] platform::Errno firstError() const { return _firstError; }
 
 private:
     /// How often something may come into a directory that has just been emptied: a new directory on death row gets its
@@ -104,7 +104,7 @@ private:
 
     static bool isNoDirectory(int error) { return error == ENOTDIR || error == ELOOP; }
 
-    [[nodiscard]] std::expected<void, int> _removeContent(FileDescriptor top, const std::string& path) {
+    [[nodiscard]] std::expected<void, platform::Errno> _removeContent(FileDescriptor top, const std::string& path) {
         OSTTreeCursor cursor(std::move(top), path);
         for (;;) {
             const auto found = cursor.next();
@@ -159,28 +159,29 @@ private:
         if (unset) {
             if (::unlinkat(item.directory, item.name, item.unlinkFlags) == 0)
                 return;
-            platform::logAs(LogLevel::error, errorCallback, "unlink of %s failed: %s", item.path, std::strerror(errno));
+            platform::logAs(LogLevel::error, errorCallback, "unlink of %s failed: %s", item.path,
+                            platform::Errno(errno));
         }
         _keepFirst(EPERM);
     }
 
-    void _record(int error, const std::string& path) {
+    void _record(platform::Errno error, const std::string& path) {
         if (error == ENOENT)
             return;
         _log(error, path);
         _keepFirst(error);
     }
 
-    static void _log(int error, const std::string& path) {
-        platform::logAs(LogLevel::error, errorCallback, "sweeptree hit error for %s : %s", path, std::strerror(error));
+    static void _log(platform::Errno error, const std::string& path) {
+        platform::logAs(LogLevel::error, errorCallback, "sweeptree hit error for %s : %s", path, error);
     }
 
-    void _keepFirst(int error) {
+    void _keepFirst(platform::Errno error) {
         if (_firstError == 0)
             _firstError = error;
     }
 
-    int _firstError = 0;
+    platform::Errno _firstError = 0;
 };
 
 } // namespace
@@ -190,11 +191,11 @@ OSTResult<void> OSTFileManager::removeItemAtURL(std::string_view path) const {
         return std::unexpected(OSTCreatePOSIXError(EFAULT, "nil url passed to -removeItemAtURL:error:"));
     Removal removal;
     const auto place = OSTItemPlace::find(path);
-    const auto removed =
-        place ? removal.remove(*place, std::string(path)) : std::expected<void, int>(std::unexpected(place.error()));
-    const int error = removed || removed.error() == ENOENT ? removal.firstError() : removed.error();
+    const auto removed = place ? removal.remove(*place, std::string(path))
+                               : std::expected<void, platform::Errno>(std::unexpected(place.error()));
+    const platform::Errno error = removed || removed.error() == ENOENT ? removal.firstError() : removed.error();
     if (error != 0)
-        return std::unexpected(OSTCreatePOSIXError(error, "sweeptree of %@ failed: %s", path, std::strerror(error)));
+        return std::unexpected(OSTCreatePOSIXError(error, "sweeptree of %@ failed: %s", path, error));
     return {};
 }
 

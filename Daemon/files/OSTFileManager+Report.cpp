@@ -1,5 +1,6 @@
 #include "files/OSTFileManager.h"
 #include "files/OSTTreeWalk.h"
+#include "platform/base/Errno.h"
 #include "platform/base/Log.h"
 
 #include <cstring>
@@ -17,9 +18,9 @@ void OSTFileManager::printDirectoryStructureAtURL(std::string_view path, std::si
         if (lines == maximumLines)
             logError("\tOrphaned File: only the first %llu items are listed", maximumLines);
         else if (failed && lines == 0)
-            logError("fts_open failed for %@ : %s", path, std::strerror(entry.error));
+            logError("fts_open failed for %@ : %s", path, entry.error);
         else if (failed)
-            logError("FTS returned error for %s : %s", entry.path, std::strerror(entry.error));
+            logError("FTS returned error for %s : %s", entry.path, entry.error);
         else
             logError("\tOrphaned File: %s", entry.path);
         return lines++ < maximumLines;

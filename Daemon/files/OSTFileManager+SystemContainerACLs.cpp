@@ -1,4 +1,5 @@
 #include "files/OSTFileManager.h"
+#include "platform/base/Errno.h"
 
 #include "files/OSTPathResolution.h"
 #include "platform/base/Log.h"
@@ -37,26 +38,24 @@ constexpr mode_t executeBits = S_IXUSR | S_IXGRP | S_IXOTH;
 OSTResult<void> createSystemUserACEInACL(AccessControlList& acl, std::uint32_t permissions, std::uint32_t flags) {
     const auto entry = acl.createEntry();
     if (!entry)
-        return std::unexpected(OSTCreateError(OSTErrorCode::accessControlListFailed, "acl_create_entry() failed: %s",
-                                              std::strerror(entry.error())));
+        return std::unexpected(
+            OSTCreateError(OSTErrorCode::accessControlListFailed, "acl_create_entry() failed: %s", entry.error()));
     const auto group = platform::groupUUIDForName(systemGroup);
     if (!group)
-        return std::unexpected(OSTCreateError(OSTErrorCode::accessControlListFailed, "groupuuid_resolve() failed: %s",
-                                              std::strerror(group.error())));
+        return std::unexpected(
+            OSTCreateError(OSTErrorCode::accessControlListFailed, "groupuuid_resolve() failed: %s", group.error()));
     if (const auto added = (*entry)->addPermissions(permissions); !added)
         return std::unexpected(OSTCreateError(OSTErrorCode::accessControlListFailed,
-                                              "acl_add_perm() failed to set perms %x: %s", permissions,
-                                              std::strerror(added.error())));
+                                              "acl_add_perm() failed to set perms %x: %s", permissions, added.error()));
     if (const auto added = (*entry)->addFlags(flags); !added)
         return std::unexpected(OSTCreateError(OSTErrorCode::accessControlListFailed,
-                                              "acl_add_flag_np() failed to set flags %x: %s", flags,
-                                              std::strerror(added.error())));
+                                              "acl_add_flag_np() failed to set flags %x: %s", flags, added.error()));
     if (const auto set = (*entry)->setTag(AccessControlList::extendedAllow); !set)
-        return std::unexpected(OSTCreateError(OSTErrorCode::accessControlListFailed, "acl_set_tag_type() failed: %s",
-                                              std::strerror(set.error())));
+        return std::unexpected(
+            OSTCreateError(OSTErrorCode::accessControlListFailed, "acl_set_tag_type() failed: %s", set.error()));
     if (const auto set = (*entry)->setQualifier(*group); !set)
-        return std::unexpected(OSTCreateError(OSTErrorCode::accessControlListFailed, "acl_set_qualifier() failed: %s",
-                                              std::strerror(set.error())));
+        return std::unexpected(
+            OSTCreateError(OSTErrorCode::accessControlListFailed, "acl_set_qualifier() failed: %s", set.error()));
     return {};
 }
 
@@ -68,7 +67,7 @@ OSTResult<AccessControlList> copySystemContainerACLWithNumACEs(std::size_t count
     auto acl = AccessControlList::create(count);
     if (!acl)
         return std::unexpected(
-            OSTCreateError(OSTErrorCode::accessControlListFailed, "acl_init() failed: %s", std::strerror(acl.error())));
+            OSTCreateError(OSTErrorCode::accessControlListFailed, "acl_init() failed: %s", acl.error()));
     if (kind == ItemKind::file)
         OST_TRY(createSystemUserACEInACL(*acl, allButDeleteChild, AccessControlList::inherited));
     else if (kind == ItemKind::directory)
@@ -91,7 +90,7 @@ struct HeldItem {
     FileDescriptor descriptor; // O_PATH
     struct stat status;
 
-    static std::expected<HeldItem, int> open(int directory, std::string_view path) {
+    static std::expected<HeldItem, platform::Errno> open(int directory, std::string_view path) {
         HeldItem item{.descriptor = OST_TRY(OSTOpenItem(directory, path, O_PATH)), .status = {}};
         if (::fstat(item.descriptor.get(), &item.status) != 0)
             return std::unexpected(errno);
@@ -99,18 +98,18 @@ struct HeldItem {
     }
 };
 
-std::expected<void, int> changeOwner(const HeldItem& item, std::uint32_t userId, std::uint32_t groupId) {
+std::expected<void, platform::Errno> changeOwner(const HeldItem& item, std::uint32_t userId, std::uint32_t groupId) {
     if (::fchownat(item.descriptor.get(), "", userId, groupId, AT_EMPTY_PATH) != 0)
         return std::unexpected(errno);
     return {};
 }
 
-void logChown(const std::string& path, int error) {
-    platform::logError("Could not chown %s: %s", path, std::strerror(error));
+void logChown(const std::string& path, platform::Errno error) {
+    platform::logError("Could not chown %s: %s", path, error);
 }
 
-void logChmod(const std::string& path, int error) {
-    platform::logError("Could not chmod %s: %s", path, std::strerror(error));
+void logChmod(const std::string& path, platform::Errno error) {
+    platform::logError("Could not chmod %s: %s", path, error);
 }
 
 /// Tells which files of a tree are the tree's own. A user can give any file a second name inside his container; such a
@@ -152,7 +151,7 @@ struct SystemContainerStandard {
         if (!S_ISDIR(item.status.st_mode))
             return _apply(file, item, path);
         if (const auto applied = topDirectory.apply(item.descriptor.get()); !applied)
-            platform::logError("Failed to set top level ACL on dir %s: %s", path, std::strerror(applied.error()));
+            platform::logError("Failed to set top level ACL on dir %s: %s", path, applied.error());
     }
 
     void applyBelowTop(const HeldItem& item, const std::string& path) const {
@@ -166,7 +165,7 @@ struct SystemContainerStandard {
 private:
     static void _apply(const AccessControlList& acl, const HeldItem& item, const std::string& path) {
         if (const auto applied = acl.apply(item.descriptor.get()); !applied)
-            platform::logError("Failed to set ACL on dir %s: %s", path, std::strerror(applied.error()));
+            platform::logError("Failed to set ACL on dir %s: %s", path, applied.error());
     }
 };
 
@@ -203,7 +202,7 @@ OSTResult<void> OSTFileManager::setTopLevelSystemContainerACLAtURL(std::string_v
     const auto applied = directory ? acl.apply(directory->get()) : std::unexpected(directory.error());
     if (!applied)
         return std::unexpected(OSTCreateError(OSTErrorCode::accessControlListFailed, "Failed to set ACL on %@: %s",
-                                              path, std::strerror(applied.error())));
+                                              path, applied.error()));
     return {};
 }
 
@@ -263,8 +262,7 @@ OSTResult<void> OSTFileManager::standardizeOwnershipAtURL(std::string_view path,
     // A walk that stopped early may have left the top as it was.
     const auto top = HeldItem::open(AT_FDCWD, path);
     if (!top)
-        return std::unexpected(
-            OSTCreatePOSIXError(top.error(), "Could not stat %s: %s", path, std::strerror(top.error())));
+        return std::unexpected(OSTCreatePOSIXError(top.error(), "Could not stat %s: %s", path, top.error()));
     const std::string topPath(path);
     if (!isMetadataFile(topPath) && OwnFiles().contains(*top, topPath))
         change(*top, topPath);

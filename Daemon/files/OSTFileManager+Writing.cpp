@@ -1,4 +1,5 @@
 #include "files/OSTFileManager.h"
+#include "platform/base/Errno.h"
 
 #include "files/OSTDurability.h"
 #include "files/OSTPathResolution.h"
@@ -51,7 +52,7 @@ FileDescriptor createExclusively(int directory, const char* name, mode_t mode) {
 
 /// A directory may hand an ACL down to what is made in it, which then takes from the mode, and a file of the daemon is
 /// nobody else's to write.
-std::expected<void, int> insistOnMode(int file, mode_t mode) {
+std::expected<void, platform::Errno> insistOnMode(int file, mode_t mode) {
     struct stat status{};
     if (::fstat(file, &status) != 0)
         return std::unexpected(errno);
@@ -62,7 +63,7 @@ std::expected<void, int> insistOnMode(int file, mode_t mode) {
     return platform::setModeKeepingMask(file, mode);
 }
 
-std::expected<void, int> finish(int file, std::string_view bytes, const OSTFileAttributes& attributes) {
+std::expected<void, platform::Errno> finish(int file, std::string_view bytes, const OSTFileAttributes& attributes) {
     OST_TRY(insistOnMode(file, attributes.mode));
     if (attributes.protectionClass != OSTKeepProtectionClass) {
         const auto set = platform::setProtectionClass(file, attributes.protectionClass);
@@ -80,8 +81,8 @@ std::expected<void, int> finish(int file, std::string_view bytes, const OSTFileA
     return {};
 }
 
-std::expected<void, int> writeAtomically(std::string_view path, std::string_view bytes,
-                                         const OSTFileAttributes& attributes) {
+std::expected<void, platform::Errno> writeAtomically(std::string_view path, std::string_view bytes,
+                                                     const OSTFileAttributes& attributes) {
     const auto place = OST_TRY(OSTItemPlace::find(path, O_RDONLY));
     FileDescriptor file;
     UnfinishedFile unfinished(place.directory(), OST_TRY(OSTMakeUnique(unfinishedPrefix, [&](const char* candidate) {
@@ -101,8 +102,7 @@ std::expected<void, int> writeAtomically(std::string_view path, std::string_view
 OSTResult<void> OSTFileManager::writeFileAtomicallyAtURL(std::string_view path, std::string_view bytes,
                                                          const OSTFileAttributes& attributes) const {
     if (const auto written = writeAtomically(path, bytes, attributes); !written)
-        return std::unexpected(
-            OSTCreatePOSIXError(written.error(), "write of %@ failed: %s", path, std::strerror(written.error())));
+        return std::unexpected(OSTCreatePOSIXError(written.error(), "write of %@ failed: %s", path, written.error()));
     return {};
 }
 
@@ -119,7 +119,7 @@ void OSTFileManager::removeUnfinishedItemsInDirectoryURL(std::string_view path) 
 
 OSTResult<OSTNewFile> OSTFileManager::createFileAtURL(std::string_view path, std::string_view bytes,
                                                       const OSTFileAttributes& attributes) const {
-    const auto create = [&]() -> std::expected<OSTNewFile, int> {
+    const auto create = [&]() -> std::expected<OSTNewFile, platform::Errno> {
         auto place = OST_TRY(OSTItemPlace::find(path, O_RDONLY));
         FileDescriptor file = createExclusively(place.directory(), place.name(), attributes.mode);
         if (!file)
@@ -131,8 +131,7 @@ OSTResult<OSTNewFile> OSTFileManager::createFileAtURL(std::string_view path, std
     };
     auto created = create();
     if (!created)
-        return std::unexpected(
-            OSTCreatePOSIXError(created.error(), "write of %@ failed: %s", path, std::strerror(created.error())));
+        return std::unexpected(OSTCreatePOSIXError(created.error(), "write of %@ failed: %s", path, created.error()));
     return *std::move(created);
 }
 
@@ -141,8 +140,7 @@ OSTResult<void> OSTNewFile::makeDurable() {
     if (durable)
         durable = OSTWaitForDisk(_directory.get(), ::fsync);
     if (!durable)
-        return std::unexpected(
-            OSTCreatePOSIXError(durable.error(), "fsync of %@ failed: %s", _path, std::strerror(durable.error())));
+        return std::unexpected(OSTCreatePOSIXError(durable.error(), "fsync of %@ failed: %s", _path, durable.error()));
     return {};
 }
 

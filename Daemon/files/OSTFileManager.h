@@ -1,6 +1,7 @@
 #pragma once
 
 #include "files/OSTTreeWalk.h"
+#include "platform/base/Errno.h"
 #include "platform/base/FileDescriptor.h"
 #include "platform/base/OSTError.h"
 
@@ -136,8 +137,8 @@ public:
     [[nodiscard]] OSTResult<std::string> readFileAtURL(std::string_view path, std::size_t maximumSize) const;
     /// The same into `buffer`, for a path relative to `directory`, where many files are read. Fails with the bare
     /// errno.
-    [[nodiscard]] std::expected<void, int> readFile(int directory, std::string_view relativePath,
-                                                    std::size_t maximumSize, std::string& buffer) const;
+    [[nodiscard]] std::expected<void, platform::Errno> readFile(int directory, std::string_view relativePath,
+                                                                std::size_t maximumSize, std::string& buffer) const;
 
     /// Writes a file in one step: whoever opens `path`, now or after a power cut, finds the old content or all of the
     /// new. The new file is on disk when this returns.

@@ -1,5 +1,6 @@
 #include "files/OSTPathResolution.h"
 
+#include "platform/base/Errno.h"
 #include "platform/base/Try.h"
 
 #include <linux/openat2.h>
@@ -21,7 +22,8 @@ std::string_view withoutTrailingSlashes(std::string_view path) {
 
 } // namespace
 
-std::expected<FileDescriptor, int> OSTOpenItem(int base, std::string_view path, int flags, OSTMounts mounts) {
+std::expected<FileDescriptor, platform::Errno> OSTOpenItem(int base, std::string_view path, int flags,
+                                                           OSTMounts mounts) {
     path = withoutTrailingSlashes(path);
     char terminated[PATH_MAX];
     if (path.size() >= sizeof terminated)
@@ -34,7 +36,7 @@ std::expected<FileDescriptor, int> OSTOpenItem(int base, std::string_view path, 
                                       mounts == OSTMounts::stayOut ? RESOLVE_NO_XDEV : 0);
 }
 
-std::expected<OSTItemPlace, int> OSTItemPlace::find(std::string_view path, int access) {
+std::expected<OSTItemPlace, platform::Errno> OSTItemPlace::find(std::string_view path, int access) {
     path = withoutTrailingSlashes(path);
     const auto slash = path.rfind('/');
     const std::string_view name = path.substr(slash + 1);

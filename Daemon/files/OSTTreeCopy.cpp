@@ -2,6 +2,7 @@
 
 #include "files/OSTPathResolution.h"
 #include "files/OSTTreeCursor.h"
+#include "platform/base/Errno.h"
 #include "platform/base/Try.h"
 
 #include <fcntl.h>
@@ -20,7 +21,7 @@
 namespace ost {
 
 using platform::FileDescriptor;
-using Result = std::expected<void, int>;
+using Result = std::expected<void, platform::Errno>;
 
 namespace {
 
@@ -143,7 +144,7 @@ Result copyOwnerAndTimes(int to, const char* newName, const struct stat& status)
 }
 
 /// Copies one item; a directory is only made, without its attributes. Answers whether it is one.
-std::expected<bool, int> copyItem(int from, const char* name, int to, const char* newName) {
+std::expected<bool, platform::Errno> copyItem(int from, const char* name, int to, const char* newName) {
     struct stat status{};
     OST_TRY(succeeded(::fstatat(from, name, &status, AT_SYMLINK_NOFOLLOW | AT_NO_AUTOMOUNT)));
     if (S_ISDIR(status.st_mode)) {

@@ -1,5 +1,7 @@
 #pragma once
 
+#include "platform/base/Errno.h"
+
 #include <expected>
 
 namespace ost {
@@ -9,6 +11,6 @@ namespace ost {
 /// as links; further names of one file become files of their own. Fails with EXDEV at a mount point in the source.
 ///
 /// Requires that nobody else gets into `to` until the copy is done. After a failure a part of it is there.
-[[nodiscard]] std::expected<void, int> OSTCopyTree(int from, const char* name, int to, const char* newName);
+[[nodiscard]] std::expected<void, platform::Errno> OSTCopyTree(int from, const char* name, int to, const char* newName);
 
 } // namespace ost

@@ -2,6 +2,7 @@
 
 #include "files/OSTPathResolution.h"
 #include "platform/base/Assert.h"
+#include "platform/base/Errno.h"
 #include "platform/base/Try.h"
 
 #include <dirent.h>
@@ -39,7 +40,7 @@ void OSTTreeCursor::OpenDirectory::restart(FileDescriptor opened, off_t from) {
     position = from;
 }
 
-std::expected<bool, int> OSTTreeCursor::next() {
+std::expected<bool, platform::Errno> OSTTreeCursor::next() {
     OpenDirectory& current = _open[depth() % maximumOpenDirectories];
     for (;;) {
         if (current.consumed == current.filled) {
@@ -64,7 +65,7 @@ std::expected<bool, int> OSTTreeCursor::next() {
     }
 }
 
-std::expected<void, int> OSTTreeCursor::enter() {
+std::expected<void, platform::Errno> OSTTreeCursor::enter() {
     FileDescriptor opened = OST_TRY(OSTOpenSubdirectory(directory(), name()));
     const std::size_t depthOfItem = _levels.size();
     if (depthOfItem >= maximumOpenDirectories)
@@ -74,12 +75,12 @@ std::expected<void, int> OSTTreeCursor::enter() {
     return {};
 }
 
-std::expected<void, int> OSTTreeCursor::enter(const char* name) {
+std::expected<void, platform::Errno> OSTTreeCursor::enter(const char* name) {
     _setItem(name);
     return enter();
 }
 
-std::expected<void, int> OSTTreeCursor::leave() {
+std::expected<void, platform::Errno> OSTTreeCursor::leave() {
     OST_ASSERT(depth() > 0);
     const std::size_t above = depth() - 1;
     const FileDescriptor left = std::move(_open[depth() % maximumOpenDirectories].descriptor);
@@ -96,7 +97,7 @@ void OSTTreeCursor::_setItem(const char* name) {
     _path.append(1, '/').append(name);
 }
 
-std::expected<void, int> OSTTreeCursor::_closeForNow(std::size_t depth) {
+std::expected<void, platform::Errno> OSTTreeCursor::_closeForNow(std::size_t depth) {
     OpenDirectory& open = _open[depth % maximumOpenDirectories];
     if (!open.descriptor)
         return {}; // since an earlier way down
@@ -111,7 +112,7 @@ std::expected<void, int> OSTTreeCursor::_closeForNow(std::size_t depth) {
     return {};
 }
 
-std::expected<void, int> OSTTreeCursor::_reopen(std::size_t depth, int child) {
+std::expected<void, platform::Errno> OSTTreeCursor::_reopen(std::size_t depth, int child) {
     FileDescriptor parent = OST_TRY(OSTOpenSubdirectory(child, ".."));
     const Level& level = _levels[depth];
     struct stat status{};

@@ -1,5 +1,6 @@
 #pragma once
 
+#include "platform/base/Errno.h"
 #include "platform/base/FileDescriptor.h"
 
 #include <sys/types.h>
@@ -26,17 +27,17 @@ public:
     OSTTreeCursor(platform::FileDescriptor top, std::string path);
 
     /// Steps to the next item of the current directory, in the order of the directory; false when there is none left.
-    [[nodiscard]] std::expected<bool, int> next();
+    [[nodiscard]] std::expected<bool, platform::Errno> next();
 
     /// Enters the current item, before its first item. Fails with ENOTDIR or ELOOP when it is no directory, with EXDEV
     /// at a mount point; the position is kept then.
-    [[nodiscard]] std::expected<void, int> enter();
+    [[nodiscard]] std::expected<void, platform::Errno> enter();
     /// The same for the item `name` of the current directory, which becomes the current item.
-    [[nodiscard]] std::expected<void, int> enter(const char* name);
+    [[nodiscard]] std::expected<void, platform::Errno> enter(const char* name);
 
     /// Goes back to the directory above, where the one that was left becomes the current item. Requires a depth above
     /// 0. Fails with ESTALE when somebody has moved a directory in the meantime; the cursor is of no use then.
-    [[nodiscard]] std::expected<void, int> leave();
+    [[nodiscard]] std::expected<void, platform::Errno> leave();
 
     /// How many directories lie between the top and the current directory, the latter counted.
     [[nodiscard]] std::size_t depth() const { return _levels.size() - 1; }
@@ -69,8 +70,8 @@ private:
     };
 
     void _setItem(const char* name);
-    [[nodiscard]] std::expected<void, int> _closeForNow(std::size_t depth);
-    [[nodiscard]] std::expected<void, int> _reopen(std::size_t depth, int child);
+    [[nodiscard]] std::expected<void, platform::Errno> _closeForNow(std::size_t depth);
+    [[nodiscard]] std::expected<void, platform::Errno> _reopen(std::size_t depth, int child);
 
     std::vector<Level> _levels;
     std::array<OpenDirectory, maximumOpenDirectories> _open; // level n, when open, has place n modulo the size

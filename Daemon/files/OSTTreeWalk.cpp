@@ -2,6 +2,7 @@
 
 #include "files/OSTPathResolution.h"
 #include "files/OSTTreeCursor.h"
+#include "platform/base/Errno.h"
 
 #include <dirent.h>
 #include <sys/stat.h>
@@ -22,7 +23,7 @@ struct ItemStatus {
     bool isMountPoint;
 };
 
-std::expected<ItemStatus, int> statusOf(int directory, const char* name) {
+std::expected<ItemStatus, platform::Errno> statusOf(int directory, const char* name) {
     struct statx read{};
     if (::statx(directory, name, AT_SYMLINK_NOFOLLOW | AT_NO_AUTOMOUNT, STATX_BASIC_STATS, &read) != 0)
         return std::unexpected(errno);

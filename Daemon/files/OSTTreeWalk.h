@@ -1,5 +1,7 @@
 #pragma once
 
+#include "platform/base/Errno.h"
+
 #include <sys/types.h>
 
 #include <cstdint>
@@ -28,7 +30,7 @@ struct OSTTreeEntry {
     };
 
     Visit visit;
-    int error; ///< errno of a failure, else 0
+    platform::Errno error; ///< errno of a failure, else 0
     /// The directory that holds the item, open at least for the *at calls, and the item's name there.
     int directory;
     const char* name;

@@ -30,7 +30,7 @@ constexpr std::string_view cachesName = "Library/Caches/com.tamarok.ostrandd";
 constexpr std::string_view transientName = "Temp";
 
 /// Whether `base` holds class directories of real users. Fails with the errno of reading the accounts.
-std::expected<bool, int> isBaseOfAUser(std::string_view base) {
+std::expected<bool, platform::Errno> isBaseOfAUser(std::string_view base) {
     const auto user = platform::accountMatching([&](const platform::Account& account) {
         if (account.uid <= OSTHighestSystemUserId)
             return false;
@@ -149,7 +149,7 @@ std::optional<std::string> OSTGlobalConfiguration::containerDirectoryURLForUser(
                             "Failed to create container dir at \"%@\": %@");
 }
 
-std::expected<bool, int> OSTGlobalConfiguration::isContainerURL(std::string_view url) const {
+std::expected<bool, platform::Errno> OSTGlobalConfiguration::isContainerURL(std::string_view url) const {
     const auto name = platform::lastPathComponent(url);
     if (!url.starts_with('/') || name.empty() || name == "." || name == "..")
         return false;

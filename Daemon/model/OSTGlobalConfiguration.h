@@ -2,6 +2,7 @@
 
 #include "Protocol/OSTContainerClass.h"
 #include "model/OSTPerUserConfiguration.h"
+#include "platform/base/Errno.h"
 #include "platform/base/Mutex.h"
 
 #include <array>
@@ -49,7 +50,7 @@ public:
 
     /// Whether `url` could be the path of a container: a name directly inside the class directory of a class and user.
     /// Makes no directory. Fails with the errno of reading the accounts.
-    [[nodiscard]] std::expected<bool, int> isContainerURL(std::string_view url) const;
+    [[nodiscard]] std::expected<bool, platform::Errno> isContainerURL(std::string_view url) const;
 
     /// The items at the top of an application's data container that belong to the user's data.
     [[nodiscard]] static const std::array<std::string_view, 4>& appUserDataItemNames();

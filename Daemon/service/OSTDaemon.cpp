@@ -4,6 +4,7 @@
 #include "codesigning/OSTCodeSigningStoreDelegate.h"
 #include "migration/OSTContainerMigrator.h"
 #include "model/OSTGlobalConfiguration.h"
+#include "platform/base/Errno.h"
 #include "platform/base/Log.h"
 #include "platform/base/Path.h"
 #include "platform/device/DeviceCapabilities.h"
@@ -21,7 +22,6 @@
 
 #include <chrono>
 #include <csignal>
-#include <cstring>
 #include <exception>
 
 namespace ost {
@@ -48,7 +48,7 @@ constexpr LogSize customerLog{.files = 1, .fileSize = 102400};
 
 void set_first_boot_work_completed() {
     if (const auto created = platform::createNamedSemaphore(firstBootMarker, firstBootMarkerMode, 0); !created)
-        platform::logError("Failed to create semaphore %s: %s", firstBootMarker, std::strerror(created.error()));
+        platform::logError("Failed to create semaphore %s: %s", firstBootMarker, created.error());
 }
 
 } // namespace
@@ -145,7 +145,7 @@ void OSTDaemon::_followLockState() {
 }
 
 void OSTDaemon::_startListener() {
-    const auto start = [this]() -> std::expected<void, int> {
+    const auto start = [this]() -> std::expected<void, platform::Errno> {
         auto socket = OST_TRY(_sockets.takeListener(OSTServiceName, SOCK_STREAM));
         auto listener = OST_TRY(platform::IPCListener::create(
             std::move(socket), listenerQueueName, [](const std::shared_ptr<platform::IPCConnection>& connection) {

@@ -106,7 +106,7 @@ std::optional<OSTClientConnection> checkEntitlementsAndInitClientObject(platform
     const platform::CodeSigningIdentity nobody;
     const auto identity = peer.codeSigningIdentity();
     if (!identity)
-        logError("Failed to copy signing ID for pid %d : %@", peer.processId(), std::strerror(identity.error()));
+        logError("Failed to copy signing ID for pid %d : %@", peer.processId(), identity.error());
     const auto& caller = identity ? **identity : nobody;
     if (caller.entitlements && !caller.identifier)
         logError("Failed to copy signing ID for pid %d : %@", peer.processId(), "its signature has none");

@@ -77,8 +77,7 @@ OSTMetadataRecord readItem(int open, const std::string& directory, const std::st
                                                                 OSTSmallDictionaryFileSize, buffer);
     auto metadata = OSTMetadata::readAndValidateMetadataAtUrl(
         read ? OSTResult<std::string_view>(buffer)
-             : std::unexpected(
-                   OSTCreatePOSIXError(read.error(), "read of %@ failed: %s", url, std::strerror(read.error()))),
+             : std::unexpected(OSTCreatePOSIXError(read.error(), "read of %@ failed: %s", url, read.error())),
         url, userId, OSTCheckClassPath::yes);
     if (!metadata)
         return nullptr;

@@ -3,6 +3,7 @@
 #include "files/OSTDictionaryFile.h"
 #include "files/OSTFileManager.h"
 #include "model/OSTGlobalConfiguration.h"
+#include "platform/base/Errno.h"
 #include "platform/base/Path.h"
 #include "platform/base/Try.h"
 
@@ -22,7 +23,7 @@ constexpr const char* destinationKey = "OSTReplaceOperationDestURL";
 
 /// Whether a container may be parked there: directly in the staging directory. What is there must not be a link or a
 /// file. Fails with the errno of looking.
-std::expected<bool, int> isStagingURL(const std::string& url) {
+std::expected<bool, platform::Errno> isStagingURL(const std::string& url) {
     const auto name = platform::lastPathComponent(url);
     const auto directory = platform::pathByDeletingLastComponent(url);
     if (name.empty() || name == "." || name == ".." ||
@@ -38,7 +39,7 @@ std::expected<bool, int> isStagingURL(const std::string& url) {
 }
 
 /// Whether all the paths are such as a replacement has. Fails with the errno of looking.
-std::expected<bool, int> isPlausible(const OSTReplaceFile& file) {
+std::expected<bool, platform::Errno> isPlausible(const OSTReplaceFile& file) {
     const auto& layout = OSTGlobalConfiguration::sharedInstance();
     for (const auto* const url : {&file.oldURL, &file.newURL, &file.destinationURL})
         if (!OST_TRY(layout.isContainerURL(*url)))
@@ -84,8 +85,8 @@ OSTResult<OSTReplaceFile> OSTReplaceFile::_readAndValidateReplaceFileAtUrl(const
     if (!plausible || !*plausible) {
         std::optional<OSTError> cause;
         if (!plausible)
-            cause = OSTCreatePOSIXError(plausible.error(), "check of the paths in %@ failed: %s", url,
-                                        std::strerror(plausible.error()));
+            cause =
+                OSTCreatePOSIXError(plausible.error(), "check of the paths in %@ failed: %s", url, plausible.error());
         return std::unexpected(OSTCreateError(OSTErrorCode::replaceFileInvalid, OSTLogging::logged,
                                               cause ? &*cause : nullptr,
                                               "Invalid replace data: Old: %@, New: %@, Staging: %@, Dest: %@",

@@ -1,6 +1,7 @@
 #include "upcall/OSTKernServer.h"
 
 #include "Protocol/OSTServices.h"
+#include "platform/base/Errno.h"
 #include "platform/base/Log.h"
 #include "upcall/OSTProcessContainers.h"
 
@@ -152,17 +153,15 @@ std::optional<platform::UpcallReply> demux_server(platform::UpcallMessage& messa
     return replyTo(message, request);
 }
 
-std::unique_ptr<platform::UpcallPort> OSTKernServerStart(platform::RunLoop& loop,
-                                                         std::expected<platform::FileDescriptor, int> receiveRight) {
+std::unique_ptr<platform::UpcallPort>
+OSTKernServerStart(platform::RunLoop& loop, std::expected<platform::FileDescriptor, platform::Errno> receiveRight) {
     if (!receiveRight) {
-        platform::logError("Failed to check in service %s: %s", OSTKernServiceName,
-                           std::strerror(receiveRight.error()));
+        platform::logError("Failed to check in service %s: %s", OSTKernServiceName, receiveRight.error());
         return nullptr;
     }
     auto port = platform::UpcallPort::open(loop, *std::move(receiveRight), demux_server);
     if (!port) {
-        platform::logError("Failed to create the receive source of %s: %s", OSTKernServiceName,
-                           std::strerror(port.error()));
+        platform::logError("Failed to create the receive source of %s: %s", OSTKernServiceName, port.error());
         return nullptr;
     }
     return *std::move(port);

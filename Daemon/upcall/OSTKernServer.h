@@ -1,5 +1,6 @@
 #pragma once
 
+#include "platform/base/Errno.h"
 #include "platform/base/FileDescriptor.h"
 #include "platform/ipc/UpcallPort.h"
 #include "platform/threads/RunLoop.h"
@@ -17,6 +18,6 @@ namespace ost {
 /// Starts to answer the kernel's messages on `loop`, one at a time. `receiveRight` is the port's listening socket, or
 /// the errno of its check-in. Null, with the reason in the log, when the port or its receive source cannot be had.
 [[nodiscard]] std::unique_ptr<platform::UpcallPort>
-OSTKernServerStart(platform::RunLoop& loop, std::expected<platform::FileDescriptor, int> receiveRight);
+OSTKernServerStart(platform::RunLoop& loop, std::expected<platform::FileDescriptor, platform::Errno> receiveRight);
 
 } // namespace ost

@@ -66,7 +66,7 @@ TEST_F(ProtectionClassTest, needsAnUnlockedDeviceForClassesWithKeys) {
         const auto before = _classOfFile();
         _lock(true);
         const auto set = setProtectionClass(_file.get(), wanted);
-        EXPECT_EQ(set ? 0 : set.error(), error) << recorded << " to " << wanted;
+        EXPECT_EQ(set ? Errno(0) : set.error(), error) << recorded << " to " << wanted;
         EXPECT_EQ(_classOfFile(), error == 0 ? wanted : before);
         _lock(false);
         EXPECT_TRUE(setProtectionClass(_file.get(), wanted));

@@ -18,7 +18,7 @@ class SandboxUserState : public test::DeviceTest {
 protected:
     static int set(std::uint32_t user, std::uint64_t type, std::string_view key, std::optional<std::string_view> path) {
         const auto done = setSandboxUserStateItem(user, type, key, path);
-        return done ? 0 : done.error();
+        return done ? Errno(0) : done.error();
     }
     static std::string state() { return test::tree(sandboxStateDirectory); }
 };

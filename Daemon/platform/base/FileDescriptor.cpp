@@ -1,5 +1,7 @@
 #include "platform/base/FileDescriptor.h"
 
+#include "platform/base/Errno.h"
+
 #include <fcntl.h>
 #include <linux/openat2.h>
 #include <sys/syscall.h>
@@ -18,7 +20,7 @@ void FileDescriptor::reset(int fd) noexcept {
     _fd = fd;
 }
 
-std::expected<FileDescriptor, int> openWithoutLinks(int base, const char* path, int flags, std::uint64_t resolve) {
+std::expected<FileDescriptor, Errno> openWithoutLinks(int base, const char* path, int flags, std::uint64_t resolve) {
     open_how how{};
     how.flags = static_cast<std::uint32_t>(flags | O_NOFOLLOW | O_CLOEXEC);
     how.resolve = RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS | resolve;

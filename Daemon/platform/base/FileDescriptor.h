@@ -1,5 +1,7 @@
 #pragma once
 
+#include "platform/base/Errno.h"
+
 #include <unistd.h>
 
 #include <cstdint>
@@ -38,7 +40,7 @@ private:
 
 /// Opens `path`, relative to the directory `base` or absolute, and follows no symbolic link, neither on the way (ELOOP)
 /// nor at its end. Close-on-exec. `resolve` adds further RESOLVE_ flags of openat2.
-[[nodiscard]] std::expected<FileDescriptor, int> openWithoutLinks(int base, const char* path, int flags,
-                                                                  std::uint64_t resolve = 0);
+[[nodiscard]] std::expected<FileDescriptor, Errno> openWithoutLinks(int base, const char* path, int flags,
+                                                                    std::uint64_t resolve = 0);
 
 } // namespace ost::platform

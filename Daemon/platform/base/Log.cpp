@@ -59,14 +59,14 @@ Log& Log::shared() {
     return *log;
 }
 
-std::expected<void, int> Log::open(LogLevel level, DiskFile file) {
+std::expected<void, Errno> Log::open(LogLevel level, DiskFile file) {
     const MutexLock lock(_mutex);
     _level = level;
     _disk = std::move(file);
     return _openFile();
 }
 
-std::expected<void, int> Log::_openFile() {
+std::expected<void, Errno> Log::_openFile() {
     _file.reset(::open(_disk.path.c_str(),
                        O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY, 0644));
     struct stat status{};

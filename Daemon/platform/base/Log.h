@@ -1,5 +1,6 @@
 #pragma once
 
+#include "platform/base/Errno.h"
 #include "platform/base/FileDescriptor.h"
 #include "platform/base/MessageFormat.h"
 #include "platform/base/Mutex.h"
@@ -31,7 +32,7 @@ public:
 
     /// Writes lines of `level` and below to `file` from now on. Fails with the errno of opening the file; the file is
     /// then tried again at each line.
-    std::expected<void, int> open(LogLevel level, DiskFile file);
+    std::expected<void, Errno> open(LogLevel level, DiskFile file);
 
     [[nodiscard]] bool accepts(LogLevel level) const { return level <= _level.load(std::memory_order_relaxed); }
 
@@ -40,7 +41,7 @@ public:
 
 private:
     [[nodiscard]] bool _fileIsLinked() const OST_REQUIRES(_mutex);
-    [[nodiscard]] std::expected<void, int> _openFile() OST_REQUIRES(_mutex);
+    [[nodiscard]] std::expected<void, Errno> _openFile() OST_REQUIRES(_mutex);
     void _rotate() OST_REQUIRES(_mutex);
 
     std::atomic<LogLevel> _level{LogLevel::notice};

@@ -98,6 +98,12 @@ void MessageArgument::appendTo(std::string& out, char conversion) const {
     case Kind::unsignedNumber:
         appendNumber(out, _unsigned, base);
         break;
+    case Kind::error:
+        if (const Errno error(static_cast<int>(_signed)); conversion == 'd')
+            appendNumber(out, static_cast<int>(error), base);
+        else
+            appendShown(out, error.description());
+        break;
     case Kind::pointer:
         out += "0x";
         appendNumber(out, _unsigned, 16);

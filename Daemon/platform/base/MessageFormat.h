@@ -1,5 +1,7 @@
 #pragma once
 
+#include "platform/base/Errno.h"
+
 #include <concepts>
 #include <cstdint>
 #include <initializer_list>
@@ -38,6 +40,7 @@ public:
     MessageArgument(const char* text) : _kind(Kind::text), _text(text ? text : "(null)") {}
     MessageArgument(std::nullptr_t) : _kind(Kind::text), _text("(null)") {}
     MessageArgument(const void* pointer) : _kind(Kind::pointer), _unsigned(reinterpret_cast<std::uintptr_t>(pointer)) {}
+    MessageArgument(Errno error) : _kind(Kind::error), _signed(error) {}
     template<typename T>
         requires requires(const T& value) {
             { value.description() } -> std::convertible_to<std::string>;
@@ -57,7 +60,7 @@ public:
     void appendTo(std::string& out, char conversion) const;
 
 private:
-    enum class Kind : std::uint8_t { text, signedNumber, unsignedNumber, pointer };
+    enum class Kind : std::uint8_t { text, signedNumber, unsignedNumber, pointer, error };
     struct Owned {
         std::string text;
     };

@@ -1,5 +1,6 @@
 #include "platform/base/SmallFile.h"
 
+#include "platform/base/Errno.h"
 #include "platform/base/FileDescriptor.h"
 
 #include <fcntl.h>
@@ -11,7 +12,7 @@
 
 namespace ost::platform {
 
-std::expected<std::string, int> readSmallFile(int base, const char* path, std::size_t limit, FinalLink finalLink) {
+std::expected<std::string, Errno> readSmallFile(int base, const char* path, std::size_t limit, FinalLink finalLink) {
     const int noFollow = finalLink == FinalLink::refuse ? O_NOFOLLOW : 0;
     const FileDescriptor file(::openat(base, path, O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY | noFollow));
     struct stat status{};
@@ -31,7 +32,7 @@ std::expected<std::string, int> readSmallFile(int base, const char* path, std::s
     return content;
 }
 
-std::expected<std::string, int> readSmallFile(const char* path, std::size_t limit, FinalLink finalLink) {
+std::expected<std::string, Errno> readSmallFile(const char* path, std::size_t limit, FinalLink finalLink) {
     return readSmallFile(AT_FDCWD, path, limit, finalLink);
 }
 

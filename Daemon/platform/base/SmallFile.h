@@ -1,5 +1,7 @@
 #pragma once
 
+#include "platform/base/Errno.h"
+
 #include <cstddef>
 #include <expected>
 #include <string>
@@ -11,9 +13,9 @@ enum class FinalLink { follow, refuse };
 
 /// Reads a whole regular file of at most `limit` bytes without ever waiting for what stands in its place. Fails with
 /// the errno of opening or reading it, EINVAL when it is not a regular file, EFBIG when it is larger.
-[[nodiscard]] std::expected<std::string, int> readSmallFile(const char* path, std::size_t limit, FinalLink finalLink);
+[[nodiscard]] std::expected<std::string, Errno> readSmallFile(const char* path, std::size_t limit, FinalLink finalLink);
 /// The same with a path relative to the directory `base`.
-[[nodiscard]] std::expected<std::string, int> readSmallFile(int base, const char* path, std::size_t limit,
-                                                            FinalLink finalLink);
+[[nodiscard]] std::expected<std::string, Errno> readSmallFile(int base, const char* path, std::size_t limit,
+                                                              FinalLink finalLink);
 
 } // namespace ost::platform

@@ -1,5 +1,6 @@
 #include "platform/device/AccessControlList.h"
 
+#include "platform/base/Errno.h"
 #include "platform/base/Try.h"
 #include "platform/device/ExtendedAttributes.h"
 #include "platform/device/Membership.h"
@@ -58,7 +59,7 @@ std::uint16_t permissionsOf(PosixACL& acl, PosixTag tag) {
 }
 
 /// The ACL kept in an attribute; empty when there is none, or none possible.
-std::expected<PosixACL, int> read(int fd, const char* attribute) {
+std::expected<PosixACL, Errno> read(int fd, const char* attribute) {
     std::array<std::byte, usualAttributeSize> usual;
     std::vector<std::byte> large;
     std::span<std::byte> buffer(usual);
@@ -79,14 +80,14 @@ std::expected<PosixACL, int> read(int fd, const char* attribute) {
     return acl;
 }
 
-std::expected<void, int> write(int fd, const char* attribute, const PosixACL& acl) {
+std::expected<void, Errno> write(int fd, const char* attribute, const PosixACL& acl) {
     std::vector<std::byte> value(sizeof posixVersion + acl.size() * sizeof(PosixEntry));
     std::memcpy(value.data(), &posixVersion, sizeof posixVersion);
     std::memcpy(value.data() + sizeof posixVersion, acl.data(), acl.size() * sizeof(PosixEntry));
     return setAttribute(fd, attribute, value);
 }
 
-std::expected<void, int> removeDefaultACL(int fd) {
+std::expected<void, Errno> removeDefaultACL(int fd) {
     const auto removed = removeAttribute(fd, defaultAttribute);
     if (!removed && removed.error() != ENODATA && removed.error() != EOPNOTSUPP)
         return removed;
@@ -94,7 +95,7 @@ std::expected<void, int> removeDefaultACL(int fd) {
 }
 
 /// A symbolic link, which alone does not support it, keeps its mode.
-std::expected<void, int> changeMode(int fd, mode_t mode) {
+std::expected<void, Errno> changeMode(int fd, mode_t mode) {
     if (::fchmod(fd, mode) == 0 || (errno == EBADF && ::chmod(DescriptorPath(fd).text, mode) == 0) ||
         errno == EOPNOTSUPP)
         return {};
@@ -109,7 +110,7 @@ struct OwnPermissions {
     bool isExtended; ///< the item has an extended ACL now
 };
 
-std::expected<OwnPermissions, int> ownPermissions(int fd, mode_t mode) {
+std::expected<OwnPermissions, Errno> ownPermissions(int fd, mode_t mode) {
     const auto bits = [&](unsigned shift) { return static_cast<std::uint16_t>(mode >> shift & everything); };
     auto acl = OST_TRY(read(fd, accessAttribute));
     return OwnPermissions{bits(6), acl.empty() ? bits(3) : permissionsOf(acl, owningGroup), bits(0), !acl.empty()};
@@ -138,35 +139,35 @@ std::uint16_t posixPermissions(std::uint32_t permissions) {
 
 } // namespace
 
-std::expected<void, int> AccessControlList::Entry::addPermissions(std::uint32_t permissions) {
+std::expected<void, Errno> AccessControlList::Entry::addPermissions(std::uint32_t permissions) {
     if ((permissions & ~allPermissions) != 0)
         return std::unexpected(EINVAL);
     _permissions |= permissions;
     return {};
 }
 
-std::expected<void, int> AccessControlList::Entry::addFlags(std::uint32_t flags) {
+std::expected<void, Errno> AccessControlList::Entry::addFlags(std::uint32_t flags) {
     if ((flags & ~allFlags) != 0)
         return std::unexpected(EINVAL);
     _flags |= flags;
     return {};
 }
 
-std::expected<void, int> AccessControlList::Entry::setTag(std::uint32_t tag) {
+std::expected<void, Errno> AccessControlList::Entry::setTag(std::uint32_t tag) {
     if (tag != extendedAllow)
         return std::unexpected(EINVAL);
     _tag = tag;
     return {};
 }
 
-std::expected<void, int> AccessControlList::Entry::setQualifier(const UUID& group) {
+std::expected<void, Errno> AccessControlList::Entry::setQualifier(const UUID& group) {
     if (!groupIdForUUID(group))
         return std::unexpected(EINVAL);
     _qualifier = group;
     return {};
 }
 
-std::expected<AccessControlList, int> AccessControlList::create(std::size_t entries) {
+std::expected<AccessControlList, Errno> AccessControlList::create(std::size_t entries) {
     if (entries > maximumEntries)
         return std::unexpected(EINVAL);
     AccessControlList acl;
@@ -174,13 +175,13 @@ std::expected<AccessControlList, int> AccessControlList::create(std::size_t entr
     return acl;
 }
 
-std::expected<AccessControlList::Entry*, int> AccessControlList::createEntry() {
+std::expected<AccessControlList::Entry*, Errno> AccessControlList::createEntry() {
     if (_entries.size() == maximumEntries)
         return std::unexpected(ENOMEM);
     return &_entries.emplace_back();
 }
 
-std::expected<void, int> AccessControlList::apply(int fd) const {
+std::expected<void, Errno> AccessControlList::apply(int fd) const {
     struct stat status{};
     if (::fstat(fd, &status) != 0)
         return std::unexpected(errno);
@@ -211,7 +212,7 @@ std::expected<void, int> AccessControlList::apply(int fd) const {
                  makeACL({.owner = everything, .group = 0, .other = 0, .isExtended = true}, handedDown));
 }
 
-std::expected<void, int> setModeKeepingMask(int fd, mode_t mode) {
+std::expected<void, Errno> setModeKeepingMask(int fd, mode_t mode) {
     auto acl = OST_TRY(read(fd, accessAttribute));
     auto* group = find(acl, owningGroup);
     const auto* maskEntry = find(acl, mask);
@@ -228,7 +229,7 @@ std::expected<void, int> setModeKeepingMask(int fd, mode_t mode) {
     return write(fd, accessAttribute, acl);
 }
 
-std::expected<bool, int> applyInheritedEntries(int parentFd, int childFd) {
+std::expected<bool, Errno> applyInheritedEntries(int parentFd, int childFd) {
     auto acl = OST_TRY(read(parentFd, defaultAttribute));
     if (acl.empty())
         return false;

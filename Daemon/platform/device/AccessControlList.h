@@ -1,5 +1,6 @@
 #pragma once
 
+#include "platform/base/Errno.h"
 #include "platform/base/UUID.h"
 
 #include <sys/types.h>
@@ -41,11 +42,11 @@ public:
     /// qualifiers that the model does not have.
     class Entry {
     public:
-        std::expected<void, int> addPermissions(std::uint32_t permissions);
-        std::expected<void, int> addFlags(std::uint32_t flags);
-        std::expected<void, int> setTag(std::uint32_t tag);
+        std::expected<void, Errno> addPermissions(std::uint32_t permissions);
+        std::expected<void, Errno> addFlags(std::uint32_t flags);
+        std::expected<void, Errno> setTag(std::uint32_t tag);
         /// `group` is a group's UUID of the membership service.
-        std::expected<void, int> setQualifier(const UUID& group);
+        std::expected<void, Errno> setQualifier(const UUID& group);
 
         [[nodiscard]] std::uint32_t permissions() const { return _permissions; }
         [[nodiscard]] std::uint32_t flags() const { return _flags; }
@@ -64,10 +65,10 @@ public:
 
     /// An empty list with room for `entries` entries; it takes more of them, too. EINVAL for more than it can ever
     /// take.
-    [[nodiscard]] static std::expected<AccessControlList, int> create(std::size_t entries);
+    [[nodiscard]] static std::expected<AccessControlList, Errno> create(std::size_t entries);
 
     /// Appends an empty entry, which stays where it is until the next one is created. ENOMEM when the list is full.
-    [[nodiscard]] std::expected<Entry*, int> createEntry();
+    [[nodiscard]] std::expected<Entry*, Errno> createEntry();
 
     [[nodiscard]] const std::vector<Entry>& entries() const { return _entries; }
 
@@ -79,7 +80,7 @@ public:
     /// access to what it makes itself, and the owning group and others have nothing, so that nobody else gets any. A
     /// symbolic link is left alone: on Linux its permissions are never looked at. Fails with the errno of reading or
     /// writing the ACL.
-    [[nodiscard]] std::expected<void, int> apply(int fd) const;
+    [[nodiscard]] std::expected<void, Errno> apply(int fd) const;
 
 private:
     AccessControlList() = default;
@@ -90,11 +91,11 @@ private:
 /// Sets the mode of the item behind `fd`, which may have been opened with O_PATH. When the item has an extended ACL,
 /// the bits of the group go to the owning group and the mask stays, so that no entry loses or gains anything. A
 /// symbolic link, which has no mode of its own on Linux, is left alone. Fails with the errno of changing the mode.
-[[nodiscard]] std::expected<void, int> setModeKeepingMask(int fd, mode_t mode);
+[[nodiscard]] std::expected<void, Errno> setModeKeepingMask(int fd, mode_t mode);
 
 /// Gives the directory just made behind `childFd` what it inherits from the directory behind `parentFd`, without the
 /// mode it was made with masking it. The rest of its mode stays. True when there was something to inherit. Both may
 /// have been opened with O_PATH. Fails with the errno of reading or writing an ACL.
-[[nodiscard]] std::expected<bool, int> applyInheritedEntries(int parentFd, int childFd);
+[[nodiscard]] std::expected<bool, Errno> applyInheritedEntries(int parentFd, int childFd);
 
 } // namespace ost::platform

@@ -1,5 +1,6 @@
 #include "platform/device/Accounts.h"
 
+#include "platform/base/Errno.h"
 #include "platform/base/SmallFile.h"
 #include "platform/base/Try.h"
 
@@ -67,7 +68,7 @@ std::optional<Group> parseGroup(std::string_view line) {
 }
 
 template<typename Record, typename Matches>
-std::expected<Record, int> find(const char* file, std::optional<Record> (*parse)(std::string_view), Matches matches) {
+std::expected<Record, Errno> find(const char* file, std::optional<Record> (*parse)(std::string_view), Matches matches) {
     const auto content = OST_TRY(readSmallFile(file, databaseLimit, FinalLink::follow));
     for (std::string_view rest = content; !rest.empty();) {
         const auto line = rest.substr(0, rest.find('\n'));
@@ -80,23 +81,23 @@ std::expected<Record, int> find(const char* file, std::optional<Record> (*parse)
 
 } // namespace
 
-std::expected<Account, int> accountForName(std::string_view name) {
+std::expected<Account, Errno> accountForName(std::string_view name) {
     return find(passwdFile, parseAccount, [&](const Account& account) { return account.name == name; });
 }
 
-std::expected<Account, int> accountForUserId(uid_t uid) {
+std::expected<Account, Errno> accountForUserId(uid_t uid) {
     return find(passwdFile, parseAccount, [&](const Account& account) { return account.uid == uid; });
 }
 
-std::expected<Account, int> accountMatching(const std::function<bool(const Account&)>& matches) {
+std::expected<Account, Errno> accountMatching(const std::function<bool(const Account&)>& matches) {
     return find(passwdFile, parseAccount, matches);
 }
 
-std::expected<gid_t, int> groupForName(std::string_view name) {
+std::expected<gid_t, Errno> groupForName(std::string_view name) {
     return OST_TRY(find(groupFile, parseGroup, [&](const Group& group) { return group.name == name; })).gid;
 }
 
-std::expected<std::string, int> groupForId(gid_t gid) {
+std::expected<std::string, Errno> groupForId(gid_t gid) {
     return OST_TRY(find(groupFile, parseGroup, [&](const Group& group) { return group.gid == gid; })).name;
 }
 

@@ -1,5 +1,7 @@
 #pragma once
 
+#include "platform/base/Errno.h"
+
 #include <sys/types.h>
 
 #include <expected>
@@ -24,11 +26,11 @@ struct Account {
     friend bool operator==(const Account&, const Account&) = default;
 };
 
-[[nodiscard]] std::expected<Account, int> accountForName(std::string_view name);
-[[nodiscard]] std::expected<Account, int> accountForUserId(uid_t uid);
+[[nodiscard]] std::expected<Account, Errno> accountForName(std::string_view name);
+[[nodiscard]] std::expected<Account, Errno> accountForUserId(uid_t uid);
 /// The first account for which `matches` gives true.
-[[nodiscard]] std::expected<Account, int> accountMatching(const std::function<bool(const Account&)>& matches);
-[[nodiscard]] std::expected<gid_t, int> groupForName(std::string_view name);
-[[nodiscard]] std::expected<std::string, int> groupForId(gid_t gid);
+[[nodiscard]] std::expected<Account, Errno> accountMatching(const std::function<bool(const Account&)>& matches);
+[[nodiscard]] std::expected<gid_t, Errno> groupForName(std::string_view name);
+[[nodiscard]] std::expected<std::string, Errno> groupForId(gid_t gid);
 
 } // namespace ost::platform

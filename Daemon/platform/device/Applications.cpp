@@ -1,5 +1,6 @@
 #include "platform/device/Applications.h"
 
+#include "platform/base/Errno.h"
 #include "platform/base/FileName.h"
 #include "platform/base/Path.h"
 #include "platform/base/SmallFile.h"
@@ -37,7 +38,7 @@ std::string_view take(std::string_view& text, char separator) {
     return front;
 }
 
-std::expected<std::vector<std::string>, int> finishedNames(const FileDescriptor& directory) {
+std::expected<std::vector<std::string>, Errno> finishedNames(const FileDescriptor& directory) {
     // A descriptor of its own, because reading moves its position.
     FileDescriptor listed = OST_TRY(openWithoutLinks(directory.get(), ".", directoryFlags));
     const std::unique_ptr<DIR, int (*)(DIR*)> stream(::fdopendir(listed.get()), &::closedir);
@@ -54,7 +55,7 @@ std::expected<std::vector<std::string>, int> finishedNames(const FileDescriptor&
 }
 
 /// The content of a record; absent when the record has gone meanwhile.
-std::expected<std::optional<std::string>, int> contentOf(const FileDescriptor& directory, const std::string& name) {
+std::expected<std::optional<std::string>, Errno> contentOf(const FileDescriptor& directory, const std::string& name) {
     auto content = readSmallFile(directory.get(), name.c_str(), recordLimit, FinalLink::refuse);
     if (content)
         return *std::move(content);
@@ -63,7 +64,7 @@ std::expected<std::optional<std::string>, int> contentOf(const FileDescriptor& d
     return std::unexpected(content.error());
 }
 
-std::expected<void, int> makeRecord(const FileDescriptor& directory, const std::string& name, std::string_view text) {
+std::expected<void, Errno> makeRecord(const FileDescriptor& directory, const std::string& name, std::string_view text) {
     const FileDescriptor file(
         ::openat(directory.get(), name.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_CLOEXEC, 0644));
     if (!file)
@@ -77,8 +78,8 @@ std::expected<void, int> makeRecord(const FileDescriptor& directory, const std::
 }
 
 /// The process of an application's record, absent when it is not running.
-std::expected<std::optional<ProcessInstance>, int> processOfRecord(const FileDescriptor& directory,
-                                                                   const std::string& name) {
+std::expected<std::optional<ProcessInstance>, Errno> processOfRecord(const FileDescriptor& directory,
+                                                                     const std::string& name) {
     const auto pid = numberOf<pid_t>(name);
     if (!pid || *pid <= 0)
         return std::nullopt;
@@ -112,8 +113,8 @@ Assertion parseAssertion(std::string_view text) {
 }
 
 /// The assertion of a record when it is held, absent when its holder or the record itself has gone.
-std::expected<std::optional<Assertion>, int> assertionOfRecord(const FileDescriptor& directory,
-                                                               const std::string& name) {
+std::expected<std::optional<Assertion>, Errno> assertionOfRecord(const FileDescriptor& directory,
+                                                                 const std::string& name) {
     const auto content = OST_TRY(contentOf(directory, name));
     if (!content)
         return std::nullopt;
@@ -130,7 +131,7 @@ public:
         : _path(image + kind), _name(fileNameForKey(identifier)) {}
 
     /// The directory of the records, absent when there is none.
-    [[nodiscard]] std::expected<std::optional<FileDescriptor>, int> existing() const {
+    [[nodiscard]] std::expected<std::optional<FileDescriptor>, Errno> existing() const {
         auto directory = openWithoutLinks(AT_FDCWD, pathByAppending(_path, _name).c_str(), directoryFlags);
         if (directory)
             return *std::move(directory);
@@ -140,7 +141,7 @@ public:
     }
 
     /// Makes a record with the help of `make`, in a directory that may go and come at any time.
-    std::expected<ApplicationRecord, int> add(const std::string& name, const auto& make) const {
+    std::expected<ApplicationRecord, Errno> add(const std::string& name, const auto& make) const {
         if (_name.empty())
             return std::unexpected(EINVAL);
         auto parent = OST_TRY(_openOrMake(AT_FDCWD, _path));
@@ -157,7 +158,7 @@ public:
 private:
     static constexpr int attempts = 100;
 
-    static std::expected<FileDescriptor, int> _openOrMake(int parent, const std::string& path) {
+    static std::expected<FileDescriptor, Errno> _openOrMake(int parent, const std::string& path) {
         if (::mkdirat(parent, path.c_str(), 0755) != 0 && errno != EEXIST)
             return std::unexpected(errno);
         return openWithoutLinks(parent, path.c_str(), directoryFlags);
@@ -185,10 +186,10 @@ ApplicationRecord::~ApplicationRecord() {
     ::unlinkat(_parent.get(), _directoryName.c_str(), AT_REMOVEDIR);
 }
 
-std::expected<ApplicationRecord, int> registerApplication(std::string_view identifier, const ProcessInstance& process,
-                                                          const std::string& image) {
+std::expected<ApplicationRecord, Errno> registerApplication(std::string_view identifier, const ProcessInstance& process,
+                                                            const std::string& image) {
     const auto name = std::to_string(process.pid);
-    const auto make = [&](const FileDescriptor& directory) -> std::expected<void, int> {
+    const auto make = [&](const FileDescriptor& directory) -> std::expected<void, Errno> {
         // A number that was free when its record was looked at may be taken and recorded before it is removed.
         if (::flock(directory.get(), LOCK_EX) != 0)
             return std::unexpected(errno);
@@ -200,8 +201,8 @@ std::expected<ApplicationRecord, int> registerApplication(std::string_view ident
     return ApplicationRecords(applicationsDirectory, identifier, image).add(name, make);
 }
 
-std::expected<std::vector<ProcessInstance>, int> applicationProcesses(std::string_view identifier,
-                                                                      const std::string& image) {
+std::expected<std::vector<ProcessInstance>, Errno> applicationProcesses(std::string_view identifier,
+                                                                        const std::string& image) {
     std::vector<ProcessInstance> processes;
     const auto directory = OST_TRY(ApplicationRecords(applicationsDirectory, identifier, image).existing());
     if (!directory)
@@ -212,14 +213,14 @@ std::expected<std::vector<ProcessInstance>, int> applicationProcesses(std::strin
     return processes;
 }
 
-std::expected<ApplicationRecord, int> recordTerminationAssertion(std::string_view identifier, std::string_view reason,
-                                                                 const std::string& image) {
+std::expected<ApplicationRecord, Errno> recordTerminationAssertion(std::string_view identifier, std::string_view reason,
+                                                                   const std::string& image) {
     static std::atomic<unsigned> count = 0;
     const auto holder = OST_TRY(processInstance(::getpid()));
     const auto number = std::to_string(holder.pid), start = std::to_string(holder.startTime);
     const auto name = number + "-" + start + "-" + std::to_string(count++);
     const auto text = std::string(reason) + "\n" + number + " " + start + "\n";
-    const auto make = [&](const FileDescriptor& directory) -> std::expected<void, int> {
+    const auto make = [&](const FileDescriptor& directory) -> std::expected<void, Errno> {
         // Half a record would be one of which the holder cannot be told.
         const auto unfinished = "." + name;
         OST_TRY(makeRecord(directory, unfinished, text));
@@ -232,8 +233,8 @@ std::expected<ApplicationRecord, int> recordTerminationAssertion(std::string_vie
     return ApplicationRecords(assertionsDirectory, identifier, image).add(name, make);
 }
 
-std::expected<std::optional<std::string>, int> terminationAssertion(std::string_view identifier,
-                                                                    const std::string& image) {
+std::expected<std::optional<std::string>, Errno> terminationAssertion(std::string_view identifier,
+                                                                      const std::string& image) {
     const auto directory = OST_TRY(ApplicationRecords(assertionsDirectory, identifier, image).existing());
     if (!directory)
         return std::nullopt;

@@ -1,5 +1,6 @@
 #pragma once
 
+#include "platform/base/Errno.h"
 #include "platform/base/FileDescriptor.h"
 #include "platform/device/ProcessInstance.h"
 
@@ -45,20 +46,20 @@ private:
 
 /// Records that a process runs as the application. The record must go before the process is waited for, because then
 /// its number is free for another one. Records that killed launchers left behind are removed.
-[[nodiscard]] std::expected<ApplicationRecord, int>
+[[nodiscard]] std::expected<ApplicationRecord, Errno>
 registerApplication(std::string_view identifier, const ProcessInstance& process, const std::string& image = "");
 
 /// The processes that run as the application; records of others are passed over.
-[[nodiscard]] std::expected<std::vector<ProcessInstance>, int> applicationProcesses(std::string_view identifier,
-                                                                                    const std::string& image = "");
+[[nodiscard]] std::expected<std::vector<ProcessInstance>, Errno> applicationProcesses(std::string_view identifier,
+                                                                                      const std::string& image = "");
 
 /// Holds an assertion, for the calling process, that the application does not run. `reason` is one line.
-[[nodiscard]] std::expected<ApplicationRecord, int>
+[[nodiscard]] std::expected<ApplicationRecord, Errno>
 recordTerminationAssertion(std::string_view identifier, std::string_view reason, const std::string& image = "");
 
 /// The reason of an assertion that is held for the application, absent when there is none. One whose holder cannot be
 /// told counts as held.
-[[nodiscard]] std::expected<std::optional<std::string>, int> terminationAssertion(std::string_view identifier,
-                                                                                  const std::string& image = "");
+[[nodiscard]] std::expected<std::optional<std::string>, Errno> terminationAssertion(std::string_view identifier,
+                                                                                    const std::string& image = "");
 
 } // namespace ost::platform

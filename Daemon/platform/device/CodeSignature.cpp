@@ -1,6 +1,7 @@
 #include "platform/device/CodeSignature.h"
 
 #include "Protocol/OSTKeys.h"
+#include "platform/base/Errno.h"
 #include "platform/codec/PropertyList.h"
 
 #include <fcntl.h>
@@ -31,14 +32,14 @@ bool isTrustworthy(const struct stat& status) {
 
 } // namespace
 
-std::expected<RawCodeSignature, int> readCodeSignature(int fd, std::span<char> buffer) {
+std::expected<RawCodeSignature, Errno> readCodeSignature(int fd, std::span<char> buffer) {
     struct stat status{};
     if (::fstat(fd, &status) != 0)
         return std::unexpected(errno);
     return readCodeSignature(fd, status, buffer);
 }
 
-std::expected<RawCodeSignature, int> readCodeSignature(int fd, const struct stat& status, std::span<char> buffer) {
+std::expected<RawCodeSignature, Errno> readCodeSignature(int fd, const struct stat& status, std::span<char> buffer) {
     RawCodeSignature signature{.bytes = {}, .device = status.st_dev};
     if (!isTrustworthy(status))
         return signature;
@@ -78,7 +79,7 @@ CodeSigningIdentity parseCodeSignature(std::string_view raw) {
     return identity;
 }
 
-std::expected<FileDescriptor, int> openProgram(const std::string& path) {
+std::expected<FileDescriptor, Errno> openProgram(const std::string& path) {
     FileDescriptor program(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY));
     struct stat status{};
     if (!program || ::fstat(program.get(), &status) != 0)
@@ -88,7 +89,7 @@ std::expected<FileDescriptor, int> openProgram(const std::string& path) {
     return program;
 }
 
-std::expected<void, int> writeCodeSignature(int fd, const OSTDictionary& signature) {
+std::expected<void, Errno> writeCodeSignature(int fd, const OSTDictionary& signature) {
     const auto raw = serializeBinaryPropertyList(signature);
     if (::fsetxattr(fd, codeSignatureAttribute, raw.data(), raw.size(), 0) != 0)
         return std::unexpected(errno);

@@ -1,5 +1,6 @@
 #pragma once
 
+#include "platform/base/Errno.h"
 #include "platform/base/FileDescriptor.h"
 #include "platform/base/OSTValue.h"
 
@@ -37,10 +38,10 @@ struct RawCodeSignature {
 
 /// Reads the signature of the open program `fd` into `buffer`. It does not count unless the file is a regular one of
 /// root that nobody else may write. Fails with the errno of reading it.
-[[nodiscard]] std::expected<RawCodeSignature, int> readCodeSignature(int fd, std::span<char> buffer);
+[[nodiscard]] std::expected<RawCodeSignature, Errno> readCodeSignature(int fd, std::span<char> buffer);
 /// The same for a caller that has just asked for the file's status.
-[[nodiscard]] std::expected<RawCodeSignature, int> readCodeSignature(int fd, const struct stat& status,
-                                                                     std::span<char> buffer);
+[[nodiscard]] std::expected<RawCodeSignature, Errno> readCodeSignature(int fd, const struct stat& status,
+                                                                       std::span<char> buffer);
 
 /// What the file system of a program means for the program's signature.
 struct SignatureFileSystem {
@@ -58,10 +59,10 @@ struct SignatureFileSystem {
 [[nodiscard]] CodeSigningIdentity parseCodeSignature(std::string_view raw);
 
 /// Opens the program at `path` to sign it; a symbolic link or anything but a regular file is refused (ELOOP, EINVAL).
-[[nodiscard]] std::expected<FileDescriptor, int> openProgram(const std::string& path);
+[[nodiscard]] std::expected<FileDescriptor, Errno> openProgram(const std::string& path);
 
 /// Signs the open program `fd`. Fails with an errno, ENOSPC or E2BIG when the file system cannot hold so large a
 /// signature.
-[[nodiscard]] std::expected<void, int> writeCodeSignature(int fd, const OSTDictionary& signature);
+[[nodiscard]] std::expected<void, Errno> writeCodeSignature(int fd, const OSTDictionary& signature);
 
 } // namespace ost::platform

@@ -1,5 +1,6 @@
 #include "platform/device/DeviceLockState.h"
 
+#include "platform/base/Errno.h"
 #include "platform/base/Path.h"
 #include "platform/base/SmallFile.h"
 #include "platform/base/Try.h"
@@ -52,7 +53,7 @@ int deviceLockState(const std::string& image) {
     return error == std::errc{} && state >= 0 && (rest.empty() || rest == "\n") ? state : deviceLockStateUnknown;
 }
 
-std::expected<void, int> writeDeviceLockState(int state, const std::string& image) {
+std::expected<void, Errno> writeDeviceLockState(int state, const std::string& image) {
     const auto file = image + deviceLockStateFile;
     const auto newFile = file + "." + std::to_string(::getpid());
     const auto text = std::to_string(state) + "\n";
@@ -69,8 +70,8 @@ std::expected<void, int> writeDeviceLockState(int state, const std::string& imag
     return std::unexpected(error);
 }
 
-std::expected<DeviceLockStateNotification, int> DeviceLockStateNotification::registerHandler(RunLoop& loop,
-                                                                                             Handler handler) {
+std::expected<DeviceLockStateNotification, Errno> DeviceLockStateNotification::registerHandler(RunLoop& loop,
+                                                                                               Handler handler) {
     FileDescriptor watch(::inotify_init1(IN_NONBLOCK | IN_CLOEXEC));
     // The directory is watched, because the file itself may be replaced or missing.
     const std::string directory(pathByDeletingLastComponent(deviceLockStateFile));

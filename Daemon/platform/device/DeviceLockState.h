@@ -1,5 +1,6 @@
 #pragma once
 
+#include "platform/base/Errno.h"
 #include "platform/threads/RunLoop.h"
 
 #include <expected>
@@ -23,7 +24,7 @@ inline constexpr int deviceLockStateUnknown = -1;
 
 /// Replaces the state of a device, given like above. Fails with the errno of writing the file, and then leaves the old
 /// state.
-[[nodiscard]] std::expected<void, int> writeDeviceLockState(int state, const std::string& image = "");
+[[nodiscard]] std::expected<void, Errno> writeDeviceLockState(int state, const std::string& image = "");
 
 /// The notification of a changed lock state. Belongs to the thread of its run loop.
 class DeviceLockStateNotification {
@@ -32,8 +33,8 @@ public:
 
     /// Calls `handler` on `loop` after the state's file was written, replaced or removed; changes that come together
     /// are one call. Fails with the errno of the watch on the file's directory.
-    [[nodiscard]] static std::expected<DeviceLockStateNotification, int> registerHandler(RunLoop& loop,
-                                                                                         Handler handler);
+    [[nodiscard]] static std::expected<DeviceLockStateNotification, Errno> registerHandler(RunLoop& loop,
+                                                                                           Handler handler);
 
 private:
     DeviceLockStateNotification(FileDescriptor watch, RunLoop::Source source)

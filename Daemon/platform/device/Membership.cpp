@@ -1,5 +1,6 @@
 #include "platform/device/Membership.h"
 
+#include "platform/base/Errno.h"
 #include "platform/base/Try.h"
 #include "platform/device/Accounts.h"
 
@@ -27,9 +28,9 @@ UUID uuidForGroup(gid_t gid) {
 
 } // namespace
 
-std::expected<UUID, int> groupUUIDForName(std::string_view name) { return uuidForGroup(OST_TRY(groupForName(name))); }
+std::expected<UUID, Errno> groupUUIDForName(std::string_view name) { return uuidForGroup(OST_TRY(groupForName(name))); }
 
-std::expected<std::string, int> groupNameForUUID(const UUID& uuid) {
+std::expected<std::string, Errno> groupNameForUUID(const UUID& uuid) {
     const auto gid = groupIdForUUID(uuid);
     if (!gid)
         return std::unexpected(ENOENT);

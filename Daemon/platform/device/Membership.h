@@ -1,5 +1,6 @@
 #pragma once
 
+#include "platform/base/Errno.h"
 #include "platform/base/UUID.h"
 
 #include <sys/types.h>
@@ -16,8 +17,8 @@ namespace ost::platform {
 ///
 /// Threads: any. Errors: ENOENT when there is no such group, otherwise the errno of reading the group database.
 
-[[nodiscard]] std::expected<UUID, int> groupUUIDForName(std::string_view name);
-[[nodiscard]] std::expected<std::string, int> groupNameForUUID(const UUID& uuid);
+[[nodiscard]] std::expected<UUID, Errno> groupUUIDForName(std::string_view name);
+[[nodiscard]] std::expected<std::string, Errno> groupNameForUUID(const UUID& uuid);
 
 /// The number of the group, which need not exist; absent when the UUID is not that of a group.
 [[nodiscard]] std::optional<gid_t> groupIdForUUID(const UUID& uuid);

@@ -1,5 +1,7 @@
 #include "platform/device/NamedSemaphore.h"
 
+#include "platform/base/Errno.h"
+
 #include <fcntl.h>
 #include <semaphore.h>
 
@@ -15,7 +17,7 @@ bool namedSemaphoreExists(const std::string& name) {
     return true;
 }
 
-std::expected<void, int> createNamedSemaphore(const std::string& name, mode_t mode, unsigned initialValue) {
+std::expected<void, Errno> createNamedSemaphore(const std::string& name, mode_t mode, unsigned initialValue) {
     auto* semaphore = ::sem_open(("/" + name).c_str(), O_CREAT, mode, initialValue);
     if (semaphore == SEM_FAILED)
         return std::unexpected(errno);

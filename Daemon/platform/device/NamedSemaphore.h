@@ -1,5 +1,7 @@
 #pragma once
 
+#include "platform/base/Errno.h"
+
 #include <sys/types.h>
 
 #include <expected>
@@ -13,7 +15,7 @@ namespace ost::platform {
 [[nodiscard]] bool namedSemaphoreExists(const std::string& name);
 
 /// Makes the semaphore; one that exists stays as it is. Fails with the errno of sem_open.
-[[nodiscard]] std::expected<void, int> createNamedSemaphore(const std::string& name, mode_t mode,
-                                                            unsigned initialValue);
+[[nodiscard]] std::expected<void, Errno> createNamedSemaphore(const std::string& name, mode_t mode,
+                                                              unsigned initialValue);
 
 } // namespace ost::platform

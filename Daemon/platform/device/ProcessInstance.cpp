@@ -1,5 +1,6 @@
 #include "platform/device/ProcessInstance.h"
 
+#include "platform/base/Errno.h"
 #include "platform/base/FileDescriptor.h"
 #include "platform/base/Try.h"
 
@@ -22,7 +23,7 @@ namespace {
 // Positions behind the process's name, which may itself hold spaces and parentheses.
 constexpr std::size_t stateField = 0, threadCountField = 17, startTimeField = 19, fieldCount = 20;
 
-std::expected<std::string, int> statusLine(pid_t pid) {
+std::expected<std::string, Errno> statusLine(pid_t pid) {
     const auto path = "/proc/" + std::to_string(pid) + "/stat";
     const FileDescriptor file(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
     if (!file) {
@@ -61,7 +62,7 @@ bool hasEnded(const std::array<std::string_view, fieldCount>& fields) {
 
 } // namespace
 
-std::expected<ProcessInstance, int> processInstance(pid_t pid) {
+std::expected<ProcessInstance, Errno> processInstance(pid_t pid) {
     const auto line = OST_TRY(statusLine(pid));
     const auto fields = fieldsOf(line);
     if (!fields)
@@ -75,7 +76,7 @@ std::expected<ProcessInstance, int> processInstance(pid_t pid) {
     return process;
 }
 
-std::expected<bool, int> isRunning(const ProcessInstance& process) {
+std::expected<bool, Errno> isRunning(const ProcessInstance& process) {
     const auto now = processInstance(process.pid);
     if (!now && now.error() != ESRCH)
         return std::unexpected(now.error());

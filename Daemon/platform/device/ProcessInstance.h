@@ -1,5 +1,7 @@
 #pragma once
 
+#include "platform/base/Errno.h"
+
 #include <sys/types.h>
 
 #include <cstdint>
@@ -17,9 +19,9 @@ struct ProcessInstance {
 
 /// The process that has the number now. Fails with ESRCH when there is none; one of which all threads have ended is
 /// none, although its parent has not waited for it yet. Any other errno means that nobody could look.
-[[nodiscard]] std::expected<ProcessInstance, int> processInstance(pid_t pid);
+[[nodiscard]] std::expected<ProcessInstance, Errno> processInstance(pid_t pid);
 
 /// Whether that very process still runs. Fails like `processInstance`, but never with ESRCH.
-[[nodiscard]] std::expected<bool, int> isRunning(const ProcessInstance& process);
+[[nodiscard]] std::expected<bool, Errno> isRunning(const ProcessInstance& process);
 
 } // namespace ost::platform

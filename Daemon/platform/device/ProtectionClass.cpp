@@ -1,5 +1,6 @@
 #include "platform/device/ProtectionClass.h"
 
+#include "platform/base/Errno.h"
 #include "platform/base/Try.h"
 #include "platform/device/DeviceLockState.h"
 #include "platform/device/ExtendedAttributes.h"
@@ -25,7 +26,7 @@ bool needsKeys(std::int32_t protectionClass) { return protectionClass >= 1 && pr
 int errorOfAttribute(int error) { return error == EOPNOTSUPP ? EBADF : error; }
 
 /// Absent when none is recorded, or nothing that could be one.
-std::expected<std::optional<std::int32_t>, int> recordedClass(int fd) {
+std::expected<std::optional<std::int32_t>, Errno> recordedClass(int fd) {
     std::array<char, classTextLimit> text;
     const auto size = getAttribute(fd, classAttribute, std::as_writable_bytes(std::span(text)));
     if (!size && (size.error() == ENODATA || size.error() == ERANGE))
@@ -39,7 +40,7 @@ std::expected<std::optional<std::int32_t>, int> recordedClass(int fd) {
     return number;
 }
 
-std::expected<void, int> recordClass(int fd, std::int32_t protectionClass, int flags) {
+std::expected<void, Errno> recordClass(int fd, std::int32_t protectionClass, int flags) {
     std::array<char, classTextLimit> text;
     const auto end = std::to_chars(text.data(), text.data() + text.size(), protectionClass).ptr;
     return setAttribute(fd, classAttribute, std::as_bytes(std::span(text.data(), end)), flags);
@@ -47,7 +48,7 @@ std::expected<void, int> recordClass(int fd, std::int32_t protectionClass, int f
 
 } // namespace
 
-std::expected<std::int32_t, int> protectionClass(int fd, int parentFd) {
+std::expected<std::int32_t, Errno> protectionClass(int fd, int parentFd) {
     if (const auto recorded = OST_TRY(recordedClass(fd)))
         return *recorded;
     struct stat status{};
@@ -61,7 +62,7 @@ std::expected<std::int32_t, int> protectionClass(int fd, int parentFd) {
     return defaultFileProtectionClass;
 }
 
-std::expected<void, int> setProtectionClass(int fd, std::int32_t protectionClass) {
+std::expected<void, Errno> setProtectionClass(int fd, std::int32_t protectionClass) {
     // The common case is one call: an item without a recorded class may always be given one that needs no keys.
     if (!needsKeys(protectionClass)) {
         const auto recorded = recordClass(fd, protectionClass, XATTR_CREATE);

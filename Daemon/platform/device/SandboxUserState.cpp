@@ -1,5 +1,6 @@
 #include "platform/device/SandboxUserState.h"
 
+#include "platform/base/Errno.h"
 #include "platform/base/FileDescriptor.h"
 #include "platform/base/FileName.h"
 #include "platform/base/Try.h"
@@ -19,7 +20,7 @@ namespace {
 
 /// Makes a link under a name that nothing else has, and gives the name. A crash may have left such a link behind, made
 /// by a process that had our number.
-std::expected<std::string, int> makeTemporaryLink(int directory, const std::string& path) {
+std::expected<std::string, Errno> makeTemporaryLink(int directory, const std::string& path) {
     static std::atomic<unsigned> links = 0;
     for (;;) {
         auto name = "." + std::to_string(::getpid()) + "." + std::to_string(links++);
@@ -30,7 +31,7 @@ std::expected<std::string, int> makeTemporaryLink(int directory, const std::stri
     }
 }
 
-std::expected<FileDescriptor, int> openOrMake(int parent, const std::string& name) {
+std::expected<FileDescriptor, Errno> openOrMake(int parent, const std::string& name) {
     constexpr mode_t searchable = 0755;
     constexpr int flags = O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
     FileDescriptor directory(::openat(parent, name.c_str(), flags));
@@ -45,7 +46,7 @@ std::expected<FileDescriptor, int> openOrMake(int parent, const std::string& nam
 }
 
 /// The directory of a user's items of one type, which is there as a rule.
-std::expected<FileDescriptor, int> openItems(std::uint32_t userId, std::uint64_t type) {
+std::expected<FileDescriptor, Errno> openItems(std::uint32_t userId, std::uint64_t type) {
     const auto user = std::to_string(userId), items = std::to_string(type);
     const auto path = std::string(sandboxStateDirectory) + "/" + user + "/" + items;
     if (auto existing = openWithoutLinks(AT_FDCWD, path.c_str(), O_PATH | O_DIRECTORY))
@@ -57,8 +58,8 @@ std::expected<FileDescriptor, int> openItems(std::uint32_t userId, std::uint64_t
 
 } // namespace
 
-std::expected<void, int> setSandboxUserStateItem(std::uint32_t userId, std::uint64_t type, std::string_view key,
-                                                 std::optional<std::string_view> path) {
+std::expected<void, Errno> setSandboxUserStateItem(std::uint32_t userId, std::uint64_t type, std::string_view key,
+                                                   std::optional<std::string_view> path) {
     const auto items = OST_TRY(openItems(userId, type));
     const auto name = fileNameForKey(key);
     if (!path) {

@@ -1,5 +1,7 @@
 #pragma once
 
+#include "platform/base/Errno.h"
+
 #include <cstdint>
 #include <expected>
 #include <optional>
@@ -16,8 +18,8 @@ inline constexpr const char* sandboxStateDirectory = "/private/var/db/sandbox-st
 /// the key is too long for a file name.
 ///
 /// Threads: any, but not two at a time for one item.
-[[nodiscard]] std::expected<void, int> setSandboxUserStateItem(std::uint32_t userId, std::uint64_t type,
-                                                               std::string_view key,
-                                                               std::optional<std::string_view> path);
+[[nodiscard]] std::expected<void, Errno> setSandboxUserStateItem(std::uint32_t userId, std::uint64_t type,
+                                                                 std::string_view key,
+                                                                 std::optional<std::string_view> path);
 
 } // namespace ost::platform

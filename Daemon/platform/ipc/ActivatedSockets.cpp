@@ -1,6 +1,7 @@
 #include "platform/ipc/ActivatedSockets.h"
 
 #include "Protocol/OSTServices.h"
+#include "platform/base/Errno.h"
 #include "platform/base/Path.h"
 #include "platform/base/Try.h"
 
@@ -57,10 +58,10 @@ FileDescriptor makeSocket(int type) {
 }
 
 /// Makes the name free, if it is that of a socket on which nobody listens.
-std::expected<void, int> removeStaleSocket(const sockaddr_un& address, int type) {
+std::expected<void, Errno> removeStaleSocket(const sockaddr_un& address, int type) {
     struct stat status{};
     if (::lstat(address.sun_path, &status) != 0)
-        return errno == ENOENT ? std::expected<void, int>() : std::unexpected(errno);
+        return errno == ENOENT ? std::expected<void, Errno>() : std::unexpected(errno);
     if (!S_ISSOCK(status.st_mode))
         return std::unexpected(EEXIST);
     const auto probe = makeSocket(type);
@@ -74,7 +75,7 @@ std::expected<void, int> removeStaleSocket(const sockaddr_un& address, int type)
     return {};
 }
 
-std::expected<FileDescriptor, int> bindListener(std::string_view name, int type) {
+std::expected<FileDescriptor, Errno> bindListener(std::string_view name, int type) {
     const auto path = pathByAppending(OSTServiceSocketDirectory, name);
     sockaddr_un address{.sun_family = AF_UNIX, .sun_path = {}};
     if (path.size() >= sizeof address.sun_path)
@@ -110,7 +111,7 @@ ActivatedSockets ActivatedSockets::fromEnvironment() {
     return sockets;
 }
 
-std::expected<FileDescriptor, int> ActivatedSockets::takeListener(std::string_view name, int type) {
+std::expected<FileDescriptor, Errno> ActivatedSockets::takeListener(std::string_view name, int type) {
     const auto found = std::ranges::find(_handed, name, &Handed::name);
     if (found == _handed.end())
         return bindListener(name, type);

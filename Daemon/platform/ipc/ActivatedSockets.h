@@ -1,5 +1,6 @@
 #pragma once
 
+#include "platform/base/Errno.h"
 #include "platform/base/FileDescriptor.h"
 
 #include <expected>
@@ -23,7 +24,7 @@ public:
     /// of a socket on which nobody listens any more. Fails with EPROTOTYPE when what was handed over is no such socket,
     /// EADDRINUSE when somebody listens on the name, EEXIST when the name is that of something else, else with the
     /// errno of binding.
-    [[nodiscard]] std::expected<FileDescriptor, int> takeListener(std::string_view name, int type);
+    [[nodiscard]] std::expected<FileDescriptor, Errno> takeListener(std::string_view name, int type);
 
 private:
     struct Handed {

@@ -1,5 +1,6 @@
 #include "platform/ipc/IPCListener.h"
 
+#include "platform/base/Errno.h"
 #include "platform/base/Log.h"
 #include "platform/base/Try.h"
 #include "platform/ipc/PeerIdentity.h"
@@ -47,7 +48,7 @@ public:
     Acceptor(FileDescriptor socket, EventHandler eventHandler, const IPCConnection::Surroundings& surroundings)
         : _socket(std::move(socket)), _eventHandler(std::move(eventHandler)), _surroundings(surroundings) {}
 
-    std::expected<void, int> start() {
+    std::expected<void, Errno> start() {
         _accepting = true;
         _watch = OST_TRY(_surroundings.pool.add(shared_from_this(), _socket.get(), EPOLLIN));
         return {};
@@ -115,9 +116,9 @@ private:
 
     /// A client that waits already causes no further event, so it is a descriptor that is given back, or the time, that
     /// makes us try again.
-    void _pause(int error, unsigned goneBefore) {
+    void _pause(Errno error, unsigned goneBefore) {
         if (!std::exchange(_complained, true))
-            logError("accepting pauses: %s", std::strerror(error));
+            logError("accepting pauses: %s", error);
         _retry = Clock::now() + _surroundings.limits.acceptAgain;
         _surroundings.timer.change(shared_from_this(), std::nullopt, _retry);
         _paused = true;
@@ -140,9 +141,9 @@ private:
     std::optional<Clock::time_point> _retry;
 };
 
-std::expected<std::unique_ptr<IPCListener>, int> IPCListener::create(FileDescriptor listeningSocket, std::string label,
-                                                                     EventHandler eventHandler,
-                                                                     const IPCLimits& limits) {
+std::expected<std::unique_ptr<IPCListener>, Errno> IPCListener::create(FileDescriptor listeningSocket,
+                                                                       std::string label, EventHandler eventHandler,
+                                                                       const IPCLimits& limits) {
     raiseDescriptorLimit();
     const int flags = ::fcntl(listeningSocket.get(), F_GETFL);
     if (flags < 0 || ::fcntl(listeningSocket.get(), F_SETFL, flags | O_NONBLOCK) != 0)
@@ -175,7 +176,7 @@ IPCListener::~IPCListener() {
     _timer->stop();
 }
 
-std::expected<void, int> IPCListener::resume() {
+std::expected<void, Errno> IPCListener::resume() {
     OST_TRY(_acceptor->start());
     return _pool->start();
 }

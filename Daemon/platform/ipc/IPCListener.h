@@ -1,5 +1,6 @@
 #pragma once
 
+#include "platform/base/Errno.h"
 #include "platform/base/FileDescriptor.h"
 #include "platform/ipc/IPCConnection.h"
 #include "platform/ipc/IPCConnectionRegistry.h"
@@ -26,7 +27,7 @@ public:
 
     /// Takes a socket that listens already, and raises the process's limit of open descriptors as far as it may.
     /// `label` names the threads. Fails with an errno.
-    [[nodiscard]] static std::expected<std::unique_ptr<IPCListener>, int>
+    [[nodiscard]] static std::expected<std::unique_ptr<IPCListener>, Errno>
     create(FileDescriptor listeningSocket, std::string label, EventHandler eventHandler, const IPCLimits& limits = {});
 
     /// Finishes without a bound for the requests under way, closes all connections, and calls their invalidation
@@ -36,7 +37,7 @@ public:
     IPCListener& operator=(const IPCListener&) = delete;
 
     /// Starts to accept and to serve. Fails with the errno of starting a thread or watching the socket.
-    [[nodiscard]] std::expected<void, int> resume();
+    [[nodiscard]] std::expected<void, Errno> resume();
 
     /// Leaves further clients to whoever else has the socket; those that are there are still served.
     void stopAccepting();

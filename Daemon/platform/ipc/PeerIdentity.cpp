@@ -1,5 +1,6 @@
 #include "platform/ipc/PeerIdentity.h"
 
+#include "platform/base/Errno.h"
 #include "platform/base/Try.h"
 
 #include <fcntl.h>
@@ -42,7 +43,7 @@ bool haveSameChangeTime(const struct stat& one, const struct stat& other) {
 /// The directory of a live process in /proc. Once it is open it names one process for good: after that has ended,
 /// everything below it fails with ESRCH. That it was opened for the right one is sure if the right one still exists
 /// afterwards.
-std::expected<FileDescriptor, int> openProcess(int socket, pid_t processId) {
+std::expected<FileDescriptor, Errno> openProcess(int socket, pid_t processId) {
     const FileDescriptor peer(openPeer(socket, processId));
     if (!peer)
         return std::unexpected(errno);
@@ -57,7 +58,7 @@ std::expected<FileDescriptor, int> openProcess(int socket, pid_t processId) {
 
 } // namespace
 
-std::expected<PeerIdentity, int> PeerIdentity::ofSocket(int socket) {
+std::expected<PeerIdentity, Errno> PeerIdentity::ofSocket(int socket) {
     ucred credentials{};
     socklen_t size = sizeof credentials;
     if (::getsockopt(socket, SOL_SOCKET, SO_PEERCRED, &credentials, &size) != 0)
@@ -68,7 +69,7 @@ std::expected<PeerIdentity, int> PeerIdentity::ofSocket(int socket) {
     return PeerIdentity(credentials.pid, credentials.uid, process ? *std::move(process) : FileDescriptor());
 }
 
-std::expected<const CodeSigningIdentity*, int> PeerIdentity::codeSigningIdentity() {
+std::expected<const CodeSigningIdentity*, Errno> PeerIdentity::codeSigningIdentity() {
     timespec now{}; // of before the status is read; by the clock that dates changes
     ::clock_gettime(CLOCK_REALTIME_COARSE, &now);
     const auto status = OST_TRY(_holdProgram());
@@ -81,7 +82,7 @@ std::expected<const CodeSigningIdentity*, int> PeerIdentity::codeSigningIdentity
     return &_identity;
 }
 
-std::expected<void, int> PeerIdentity::_readSignature(const struct stat& status) {
+std::expected<void, Errno> PeerIdentity::_readSignature(const struct stat& status) {
     std::array<char, maximumCodeSignature> buffer;
     const auto signature = OST_TRY(readCodeSignature(_program.get(), status, buffer));
     if (signature.bytes != _raw || signature.device != _device) {
@@ -95,7 +96,7 @@ std::expected<void, int> PeerIdentity::_readSignature(const struct stat& status)
 /// Holds the program that the process runs now, and gives its status. Opening it at every request would cost more than
 /// the rest of this file; a file that is held open keeps its number, so looking at that tells whether it is still the
 /// one.
-std::expected<struct stat, int> PeerIdentity::_holdProgram() {
+std::expected<struct stat, Errno> PeerIdentity::_holdProgram() {
     if (!_process)
         return std::unexpected(ESRCH);
     struct stat status{};

@@ -1,5 +1,6 @@
 #pragma once
 
+#include "platform/base/Errno.h"
 #include "platform/base/FileDescriptor.h"
 #include "platform/device/CodeSignature.h"
 
@@ -24,7 +25,7 @@ class PeerIdentity {
 public:
     /// Pins the peer of a connected Unix socket. A peer that has gone already is pinned to nobody. Fails with an errno
     /// when the socket has no peer, or when no descriptor is left (EMFILE, ENFILE).
-    [[nodiscard]] static std::expected<PeerIdentity, int> ofSocket(int socket);
+    [[nodiscard]] static std::expected<PeerIdentity, Errno> ofSocket(int socket);
 
     [[nodiscard]] pid_t processId() const { return _processId; }
     [[nodiscard]] uid_t effectiveUserId() const { return _effectiveUserId; }
@@ -33,7 +34,7 @@ public:
     /// has changed, because a process may execute another one, and one may be signed anew. As long as the signature
     /// stays the same, so do the objects in the identity. Valid until the next call. Fails with an errno when the
     /// program cannot be determined: ESRCH when the process has ended.
-    [[nodiscard]] std::expected<const CodeSigningIdentity*, int> codeSigningIdentity();
+    [[nodiscard]] std::expected<const CodeSigningIdentity*, Errno> codeSigningIdentity();
 
     /// Gives the descriptors back; no program can be determined any more.
     void unpin() {
@@ -45,8 +46,8 @@ private:
     PeerIdentity(pid_t processId, uid_t effectiveUserId, FileDescriptor process)
         : _processId(processId), _effectiveUserId(effectiveUserId), _process(std::move(process)) {}
 
-    [[nodiscard]] std::expected<struct stat, int> _holdProgram();
-    [[nodiscard]] std::expected<void, int> _readSignature(const struct stat& status);
+    [[nodiscard]] std::expected<struct stat, Errno> _holdProgram();
+    [[nodiscard]] std::expected<void, Errno> _readSignature(const struct stat& status);
 
     pid_t _processId;
     uid_t _effectiveUserId;

@@ -1,5 +1,6 @@
 #include "platform/ipc/UpcallPacket.h"
 
+#include "platform/base/Errno.h"
 #include "platform/base/Log.h"
 
 #include <fcntl.h>
@@ -89,7 +90,7 @@ std::optional<std::vector<std::byte>> readRegion(int file, std::size_t size) {
 
 } // namespace
 
-std::expected<UpcallPacket, int> receiveUpcallPacket(int socket, std::uint32_t sequenceNumber, int flags) {
+std::expected<UpcallPacket, Errno> receiveUpcallPacket(int socket, std::uint32_t sequenceNumber, int flags) {
     UpcallPacket packet{};
     const Bytes bytes(packet.message.bytes);
     iovec data{.iov_base = bytes.data(), .iov_len = upcallMessageSize};
@@ -135,7 +136,7 @@ void takeUpcallRegion(UpcallPacket& packet) {
         packet.message.region = readRegion(descriptors.front().get(), size);
 }
 
-std::expected<void, int> sendUpcallReply(int socket, const UpcallReply& reply, int flags) {
+std::expected<void, Errno> sendUpcallReply(int socket, const UpcallReply& reply, int flags) {
     iovec data{.iov_base = const_cast<std::byte*>(reply.bytes.data()), .iov_len = reply.bytes.size()};
     msghdr header{};
     header.msg_iov = &data;
@@ -156,7 +157,7 @@ std::expected<void, int> sendUpcallReply(int socket, const UpcallReply& reply, i
     return {};
 }
 
-std::expected<FileDescriptor, int> makeUpcallRegion(std::span<const std::byte> bytes) {
+std::expected<FileDescriptor, Errno> makeUpcallRegion(std::span<const std::byte> bytes) {
     FileDescriptor memory(::memfd_create("upcall answer", MFD_CLOEXEC | MFD_ALLOW_SEALING));
     if (!memory)
         return std::unexpected(errno);

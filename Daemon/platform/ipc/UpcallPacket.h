@@ -1,5 +1,6 @@
 #pragma once
 
+#include "platform/base/Errno.h"
 #include "platform/base/FileDescriptor.h"
 
 #include <sys/socket.h>
@@ -44,7 +45,8 @@ struct UpcallPacket {
 };
 
 /// Receives the next packet. Fails with the errno of the socket; ENOTCONN says that the sender has closed it.
-[[nodiscard]] std::expected<UpcallPacket, int> receiveUpcallPacket(int socket, std::uint32_t sequenceNumber, int flags);
+[[nodiscard]] std::expected<UpcallPacket, Errno> receiveUpcallPacket(int socket, std::uint32_t sequenceNumber,
+                                                                     int flags);
 
 /// Whether everything that was passed is shared memory or a file of a tmpfs: neither reading nor closing it waits.
 [[nodiscard]] bool upcallRegionLiesInMemory(const UpcallPacket& packet);
@@ -54,9 +56,9 @@ struct UpcallPacket {
 void takeUpcallRegion(UpcallPacket& packet);
 
 /// Fails with the errno of the socket.
-[[nodiscard]] std::expected<void, int> sendUpcallReply(int socket, const UpcallReply& reply, int flags);
+[[nodiscard]] std::expected<void, Errno> sendUpcallReply(int socket, const UpcallReply& reply, int flags);
 
 /// A copy of `bytes` to be sent along with a reply, sealed. Fails with the errno of making it.
-[[nodiscard]] std::expected<FileDescriptor, int> makeUpcallRegion(std::span<const std::byte> bytes);
+[[nodiscard]] std::expected<FileDescriptor, Errno> makeUpcallRegion(std::span<const std::byte> bytes);
 
 } // namespace ost::platform

@@ -1,5 +1,6 @@
 #include "platform/ipc/UpcallPort.h"
 
+#include "platform/base/Errno.h"
 #include "platform/base/Log.h"
 #include "platform/base/Mutex.h"
 #include "platform/base/Try.h"
@@ -12,7 +13,6 @@
 
 #include <atomic>
 #include <cerrno>
-#include <cstring>
 #include <future>
 #include <set>
 #include <system_error>
@@ -35,9 +35,9 @@ bool isOutOfResources(int error) { return error == EMFILE || error == ENFILE || 
 bool isNothingYet(int error) { return error == EAGAIN || error == EINTR; }
 
 /// That a sender has gone is no failure, and must not let it fill the log.
-void logFailureToReply(int error) {
+void logFailureToReply(Errno error) {
     if (error != EPIPE && error != ECONNRESET)
-        logError("Closing an upcall connection: Failed to reply: %s", std::strerror(error));
+        logError("Closing an upcall connection: Failed to reply: %s", error);
 }
 
 } // namespace
@@ -161,8 +161,8 @@ UpcallPort::UpcallPort(RunLoop& loop, FileDescriptor listener, FileDescriptor pa
 
 UpcallPort::~UpcallPort() { _aside->end(); }
 
-std::expected<std::unique_ptr<UpcallPort>, int> UpcallPort::open(RunLoop& loop, FileDescriptor listener,
-                                                                 Handler handler) {
+std::expected<std::unique_ptr<UpcallPort>, Errno> UpcallPort::open(RunLoop& loop, FileDescriptor listener,
+                                                                   Handler handler) {
     // Accepted sockets inherit it, so that no packet comes without its sender's credentials.
     const int on = 1;
     if (::setsockopt(listener.get(), SOL_SOCKET, SO_PASSCRED, &on, sizeof on) != 0)
@@ -186,7 +186,7 @@ void UpcallPort::_accept() {
     FileDescriptor socket(::accept4(_listener.get(), nullptr, nullptr, SOCK_CLOEXEC));
     if (!socket) {
         if (isOutOfResources(errno))
-            _pauseAccepting(std::strerror(errno));
+            _pauseAccepting(Errno(errno).description());
         return;
     }
     _hasComplained = false;
@@ -199,7 +199,7 @@ void UpcallPort::_accept() {
         _serveOnLoop(std::move(socket));
 }
 
-void UpcallPort::_pauseAccepting(const char* reason) {
+void UpcallPort::_pauseAccepting(const std::string& reason) {
     if (!std::exchange(_hasComplained, true))
         logError("Failed to accept a connection of the upcall port: %s", reason);
     _listenerSource.setEvents(0);

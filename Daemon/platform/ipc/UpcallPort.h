@@ -1,5 +1,6 @@
 #pragma once
 
+#include "platform/base/Errno.h"
 #include "platform/base/FileDescriptor.h"
 #include "platform/ipc/UpcallPacket.h"
 #include "platform/threads/RunLoop.h"
@@ -10,6 +11,7 @@
 #include <list>
 #include <memory>
 #include <optional>
+#include <string>
 
 namespace ost::platform {
 
@@ -28,8 +30,8 @@ public:
     using Handler = std::move_only_function<std::optional<UpcallReply>(UpcallMessage& message)>;
 
     /// Serves `listener`, a listening SOCK_SEQPACKET socket, on `loop`. Fails with the errno of the missing source.
-    [[nodiscard]] static std::expected<std::unique_ptr<UpcallPort>, int> open(RunLoop& loop, FileDescriptor listener,
-                                                                              Handler handler);
+    [[nodiscard]] static std::expected<std::unique_ptr<UpcallPort>, Errno> open(RunLoop& loop, FileDescriptor listener,
+                                                                                Handler handler);
     UpcallPort(const UpcallPort&) = delete;
     UpcallPort& operator=(const UpcallPort&) = delete;
     ~UpcallPort();
@@ -47,7 +49,7 @@ private:
     UpcallPort(RunLoop& loop, FileDescriptor listener, FileDescriptor pauseTimer, Handler handler);
 
     void _accept();
-    void _pauseAccepting(const char* reason);
+    void _pauseAccepting(const std::string& reason);
     void _resumeAccepting();
     void _serveOnLoop(FileDescriptor socket);
     void _serveAside(FileDescriptor socket, bool isRoots, bool isServed, std::optional<UpcallPacket> first);

@@ -1,6 +1,7 @@
 #include "platform/threads/DeadlineTimer.h"
 
 #include "platform/base/Assert.h"
+#include "platform/base/Errno.h"
 
 #include <sys/epoll.h>
 #include <sys/timerfd.h>
@@ -11,7 +12,7 @@
 
 namespace ost::platform {
 
-std::expected<void, int> DeadlineTimer::start() {
+std::expected<void, Errno> DeadlineTimer::start() {
     // steady_clock counts CLOCK_MONOTONIC.
     _timer.reset(::timerfd_create(CLOCK_MONOTONIC, TFD_CLOEXEC | TFD_NONBLOCK));
     if (!_timer)

@@ -1,5 +1,6 @@
 #pragma once
 
+#include "platform/base/Errno.h"
 #include "platform/base/FileDescriptor.h"
 #include "platform/base/Mutex.h"
 #include "platform/threads/EventSource.h"
@@ -28,7 +29,7 @@ public:
     explicit DeadlineTimer(WorkerPool& pool) : _pool(pool) {}
 
     /// Fails with an errno when the kernel has no descriptor left for it.
-    [[nodiscard]] std::expected<void, int> start();
+    [[nodiscard]] std::expected<void, Errno> start();
     /// Forgets all deadlines.
     void stop();
 

@@ -1,6 +1,7 @@
 #include "platform/threads/RunLoop.h"
 
 #include "platform/base/Assert.h"
+#include "platform/base/Errno.h"
 
 #include <sys/epoll.h>
 #include <sys/eventfd.h>
@@ -39,7 +40,7 @@ void RunLoop::Source::remove() noexcept {
         loop->_remove(_id);
 }
 
-std::expected<std::unique_ptr<RunLoop>, int> RunLoop::create() {
+std::expected<std::unique_ptr<RunLoop>, Errno> RunLoop::create() {
     FileDescriptor epoll(::epoll_create1(EPOLL_CLOEXEC));
     FileDescriptor wakeUp(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK));
     epoll_event event{.events = EPOLLIN, .data = {.u64 = wakeUpId}};
@@ -48,7 +49,7 @@ std::expected<std::unique_ptr<RunLoop>, int> RunLoop::create() {
     return std::unique_ptr<RunLoop>(new RunLoop(std::move(epoll), std::move(wakeUp)));
 }
 
-std::expected<RunLoop::Source, int> RunLoop::addSource(int fd, std::uint32_t events, Handler handler) {
+std::expected<RunLoop::Source, Errno> RunLoop::addSource(int fd, std::uint32_t events, Handler handler) {
     OST_ASSERT(_thread == std::this_thread::get_id());
     const auto id = ++_lastId;
     epoll_event event{.events = events, .data = {.u64 = id}};

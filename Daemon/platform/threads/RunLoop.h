@@ -1,5 +1,6 @@
 #pragma once
 
+#include "platform/base/Errno.h"
 #include "platform/base/FileDescriptor.h"
 #include "platform/base/Mutex.h"
 
@@ -50,13 +51,13 @@ public:
     };
 
     /// Fails with the errno of a missing descriptor.
-    [[nodiscard]] static std::expected<std::unique_ptr<RunLoop>, int> create();
+    [[nodiscard]] static std::expected<std::unique_ptr<RunLoop>, Errno> create();
     RunLoop(const RunLoop&) = delete;
     RunLoop& operator=(const RunLoop&) = delete;
 
     /// Calls `handler` whenever `fd` has one of `events` (level-triggered). `fd` stays its owner's and must not be
     /// closed before the source is removed. Fails with the errno of epoll.
-    [[nodiscard]] std::expected<Source, int> addSource(int fd, std::uint32_t events, Handler handler);
+    [[nodiscard]] std::expected<Source, Errno> addSource(int fd, std::uint32_t events, Handler handler);
 
     /// Runs `work` on the loop's thread, in order. Work that the loop no longer comes to is destroyed with the loop.
     void async(Work work);

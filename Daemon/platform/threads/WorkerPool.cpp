@@ -1,6 +1,7 @@
 #include "platform/threads/WorkerPool.h"
 
 #include "platform/base/Assert.h"
+#include "platform/base/Errno.h"
 #include "platform/base/Log.h"
 #include "platform/threads/BlockingSection.h"
 #include "platform/threads/ThreadName.h"
@@ -50,7 +51,7 @@ sigset_t signalsOfOthers() {
 
 } // namespace
 
-std::expected<std::unique_ptr<WorkerPool>, int> WorkerPool::create(std::string name, const Options& options) {
+std::expected<std::unique_ptr<WorkerPool>, Errno> WorkerPool::create(std::string name, const Options& options) {
     FileDescriptor epoll(::epoll_create1(EPOLL_CLOEXEC));
     FileDescriptor wake(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK | EFD_SEMAPHORE));
     if (!epoll || !wake)
@@ -71,7 +72,7 @@ WorkerPool::WorkerPool(std::string name, const Options& options, FileDescriptor 
 
 WorkerPool::~WorkerPool() { stop(std::nullopt); }
 
-std::expected<void, int> WorkerPool::start() {
+std::expected<void, Errno> WorkerPool::start() {
     for (unsigned started = 0; started < _target; ++started) {
         {
             const MutexLock lock(_mutex);
@@ -114,10 +115,10 @@ int WorkerPool::_startThread() {
     const auto signals = signalsOfOthers();
     ::pthread_attr_setsigmask_np(&attributes, &signals);
     pthread_t thread{};
-    const int error = ::pthread_create(&thread, &attributes, &_threadMain, this);
+    const Errno error = ::pthread_create(&thread, &attributes, &_threadMain, this);
     ::pthread_attr_destroy(&attributes);
     if (error != 0) {
-        logError("cannot start a thread of %@: %s", _name, std::strerror(error));
+        logError("cannot start a thread of %@: %s", _name, error);
         const MutexLock lock(_mutex);
         --_threads;
         --_runningThreads;
@@ -232,8 +233,8 @@ BlockingSection::~BlockingSection() {
 
 // Sources
 
-std::expected<WorkerPool::Watch, int> WorkerPool::add(std::shared_ptr<EventSource> source, int fd,
-                                                      std::uint32_t events) {
+std::expected<WorkerPool::Watch, Errno> WorkerPool::add(std::shared_ptr<EventSource> source, int fd,
+                                                        std::uint32_t events) {
     std::uint32_t index = 0;
     {
         const MutexLock lock(_mutex);

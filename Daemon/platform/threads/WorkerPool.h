@@ -1,5 +1,6 @@
 #pragma once
 
+#include "platform/base/Errno.h"
 #include "platform/base/FileDescriptor.h"
 #include "platform/base/Mutex.h"
 #include "platform/threads/EventSource.h"
@@ -40,14 +41,14 @@ public:
     };
 
     /// Fails with an errno when the kernel has no descriptors left for it. `name` becomes the name of the threads.
-    [[nodiscard]] static std::expected<std::unique_ptr<WorkerPool>, int> create(std::string name,
-                                                                                const Options& options);
+    [[nodiscard]] static std::expected<std::unique_ptr<WorkerPool>, Errno> create(std::string name,
+                                                                                  const Options& options);
     ~WorkerPool();
     WorkerPool(const WorkerPool&) = delete;
     WorkerPool& operator=(const WorkerPool&) = delete;
 
     /// Starts the threads. Fails with an errno when not even one can be started.
-    [[nodiscard]] std::expected<void, int> start();
+    [[nodiscard]] std::expected<void, Errno> start();
 
     /// Lets no source be served any more and waits until every thread has ended, at most until `deadline`. Gives
     /// whether all have. Not from a thread of the pool.
@@ -59,7 +60,7 @@ public:
     enum class Watch : std::uint64_t { none = ~std::uint64_t{0} };
 
     /// Watches `fd` for the epoll `events` and serves `source` when they occur; keeps `source` until `remove`.
-    [[nodiscard]] std::expected<Watch, int> add(std::shared_ptr<EventSource> source, int fd, std::uint32_t events);
+    [[nodiscard]] std::expected<Watch, Errno> add(std::shared_ptr<EventSource> source, int fd, std::uint32_t events);
     /// Watches for other events; those that are there already are reported at once.
     void change(Watch watch, int fd, std::uint32_t events);
     /// Ends a watch and lets go of its source. Events that a thread has already taken are still served.
