@@ -3,6 +3,7 @@
 #include "Protocol/OSTServices.h"
 #include "Protocol/OSTUserId.h"
 #include "platform/base/Errno.h"
+#include "platform/base/SmallFile.h"
 #include "platform/base/Try.h"
 
 #include <fcntl.h>
@@ -72,16 +73,6 @@ constexpr std::array files{
 
 std::string procPathOf(const FileDescriptor& file) { return "/proc/self/fd/" + std::to_string(file.get()); }
 
-bool writeWhole(const FileDescriptor& file, std::string_view content) {
-    while (!content.empty()) {
-        const ssize_t written = ::write(file.get(), content.data(), content.size());
-        if (written < 0)
-            return false;
-        content.remove_prefix(static_cast<std::size_t>(written));
-    }
-    return true;
-}
-
 } // namespace
 
 std::string Failure::description() const { return "Failed to " + what + ": " + std::strerror(error); }
@@ -136,7 +127,7 @@ Result<void> DeviceImage::_makeFile(const char* name, std::string_view content) 
     const std::string temporary = std::string(name) + ".new";
     const FileDescriptor file(
         ::openat(_root.get(), temporary.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_CLOEXEC, 0644));
-    if (!file || ::fchmod(file.get(), 0644) != 0 || !writeWhole(file, content) ||
+    if (!file || ::fchmod(file.get(), 0644) != 0 || !platform::writeAll(file.get(), content) ||
         (::renameat2(_root.get(), temporary.c_str(), _root.get(), name, RENAME_NOREPLACE) != 0 && errno != EEXIST))
         return std::unexpected(_failure("write", name));
     ::unlinkat(_root.get(), temporary.c_str(), 0);

@@ -1,6 +1,7 @@
 #include "Client/ctl/Output.h"
 
 #include "platform/base/MessageFormat.h"
+#include "platform/base/Text.h"
 #include "platform/base/Unicode.h"
 
 #include <charconv>
@@ -13,12 +14,6 @@ namespace ostrand::ctl {
 namespace {
 
 constexpr char32_t replacementCharacter = 0xfffd;
-constexpr char hexDigits[] = "0123456789abcdef";
-
-void appendHex(std::string& out, unsigned char byte) {
-    out += hexDigits[byte >> 4];
-    out += hexDigits[byte & 15];
-}
 
 void appendNumber(std::string& out, auto number) {
     char digits[32];
@@ -35,7 +30,7 @@ void appendString(std::string& out, std::string_view text) {
             ost::platform::appendUTF8(out, character);
         } else {
             out += "\\u00";
-            appendHex(out, static_cast<unsigned char>(character));
+            ost::platform::appendHex(out, static_cast<unsigned char>(character));
         }
     }
     out += '"';
@@ -72,7 +67,7 @@ struct Appender {
     void operator()(const ost::OSTData& value) const {
         out += '"';
         for (const char byte : value.bytes)
-            appendHex(out, static_cast<unsigned char>(byte));
+            ost::platform::appendHex(out, static_cast<unsigned char>(byte));
         out += '"';
     }
     void operator()(const std::shared_ptr<const ost::OSTArray>& value) const {

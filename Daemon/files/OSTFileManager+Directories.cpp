@@ -1,5 +1,4 @@
 #include "files/OSTFileManager.h"
-#include "platform/base/Errno.h"
 
 #include "files/OSTDurability.h"
 #include "files/OSTPathResolution.h"

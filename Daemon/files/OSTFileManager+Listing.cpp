@@ -1,5 +1,4 @@
 #include "files/OSTFileManager.h"
-#include "platform/base/Errno.h"
 
 #include "files/OSTPathResolution.h"
 #include "files/OSTTreeCursor.h"

@@ -1,6 +1,5 @@
 #include "files/OSTFileManager.h"
 #include "files/OSTTreeWalk.h"
-#include "platform/base/Errno.h"
 #include "platform/base/Log.h"
 
 #include <cstring>

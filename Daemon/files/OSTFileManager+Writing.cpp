@@ -1,10 +1,10 @@
 #include "files/OSTFileManager.h"
-#include "platform/base/Errno.h"
 
 #include "files/OSTDurability.h"
 #include "files/OSTPathResolution.h"
 #include "files/OSTUniqueName.h"
 #include "platform/base/Path.h"
+#include "platform/base/SmallFile.h"
 #include "platform/device/AccessControlList.h"
 #include "platform/device/ProtectionClass.h"
 
@@ -71,14 +71,7 @@ std::expected<void, platform::Errno> finish(int file, std::string_view bytes, co
         if (!set && set.error() != EBADF)
             return std::unexpected(set.error());
     }
-    while (!bytes.empty()) {
-        const ssize_t count = ::write(file, bytes.data(), bytes.size());
-        if (count < 0 && errno != EINTR)
-            return std::unexpected(errno);
-        if (count > 0)
-            bytes.remove_prefix(static_cast<std::size_t>(count));
-    }
-    return {};
+    return platform::writeAll(file, bytes);
 }
 
 std::expected<void, platform::Errno> writeAtomically(std::string_view path, std::string_view bytes,

@@ -1,6 +1,5 @@
 #include "files/OSTPathResolution.h"
 
-#include "platform/base/Errno.h"
 #include "platform/base/Try.h"
 
 #include <linux/openat2.h>

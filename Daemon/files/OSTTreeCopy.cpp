@@ -2,7 +2,6 @@
 
 #include "files/OSTPathResolution.h"
 #include "files/OSTTreeCursor.h"
-#include "platform/base/Errno.h"
 #include "platform/base/Try.h"
 
 #include <fcntl.h>

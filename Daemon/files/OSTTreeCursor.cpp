@@ -2,7 +2,6 @@
 
 #include "files/OSTPathResolution.h"
 #include "platform/base/Assert.h"
-#include "platform/base/Errno.h"
 #include "platform/base/Try.h"
 
 #include <dirent.h>

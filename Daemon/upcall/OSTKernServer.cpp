@@ -1,7 +1,6 @@
 #include "upcall/OSTKernServer.h"
 
 #include "Protocol/OSTServices.h"
-#include "platform/base/Errno.h"
 #include "platform/base/Log.h"
 #include "upcall/OSTProcessContainers.h"
 

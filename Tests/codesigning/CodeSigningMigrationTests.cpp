@@ -49,7 +49,7 @@ protected:
 };
 
 TEST_F(CodeSigningMigration, GroupsOfDataContainersBecomeInvalidEntriesOnce) {
-    writeMapping(OSTDictionary({{"registered", entryWith(OSTDictionary({{"from", "installer"}}))}}));
+    writeMapping(OSTDictionary({{"registered", entryWith(OSTDictionary({{"from", std::string("installer")}}))}}));
     makeWithInfo(dataVPNPlugin, "new", groupIdsKey, strings({"group.new"}));
     makeWithInfo(dataApplication, "registered", groupIdsKey, strings({"group.registered"}));
     const auto kept = makeContainer(sharedAppGroup, "group.new");
@@ -74,7 +74,7 @@ TEST_F(CodeSigningMigration, GroupsOfDataContainersBecomeInvalidEntriesOnce) {
 }
 
 TEST_F(CodeSigningMigration, CachedInfoWinsOverTheLegacyFileWhichWinsOverGroupsAndNothingOverAValidEntry) {
-    writeMapping(OSTDictionary({{"valid", entryWith(OSTDictionary({{"from", "installer"}}))}}));
+    writeMapping(OSTDictionary({{"valid", entryWith(OSTDictionary({{"from", std::string("installer")}}))}}));
     OSTDictionary legacy;
     for (const auto* const identifier : {"valid", "cached", "legacy", "caller's"}) {
         makeWithInfo(dataApplication, identifier, groupIdsKey, strings({"group"}));

@@ -1,7 +1,5 @@
 #include "platform/base/FileDescriptor.h"
 
-#include "platform/base/Errno.h"
-
 #include <fcntl.h>
 #include <linux/openat2.h>
 #include <sys/syscall.h>

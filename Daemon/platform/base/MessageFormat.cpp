@@ -1,5 +1,6 @@
 #include "platform/base/MessageFormat.h"
 
+#include "platform/base/Text.h"
 #include "platform/base/Unicode.h"
 
 #include <algorithm>
@@ -56,7 +57,6 @@ void appendEscaped(std::string& out, std::string_view text) {
         if (length > 0) {
             out.append(text.substr(0, length));
         } else {
-            constexpr char digits[] = "0123456789abcdef";
             const auto byte = static_cast<unsigned char>(text[0]);
             switch (byte) {
             case '\n':
@@ -70,8 +70,7 @@ void appendEscaped(std::string& out, std::string_view text) {
                 break;
             default:
                 out += "\\x";
-                out += digits[byte >> 4];
-                out += digits[byte & 15];
+                appendHex(out, byte);
             }
             length = 1;
         }

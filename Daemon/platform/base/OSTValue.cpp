@@ -1,6 +1,7 @@
 #include "platform/base/OSTValue.h"
 
 #include "platform/base/Assert.h"
+#include "platform/base/Text.h"
 
 #include <algorithm>
 #include <charconv>
@@ -62,14 +63,11 @@ private:
     void _append(double value) { _appendNumber(value); }
 
     void _append(const OSTData& data) {
-        constexpr char digits[] = "0123456789abcdef";
         _append(std::string_view("<"));
         for (const char c : data.bytes) {
             if (_isFull())
                 return;
-            const auto byte = static_cast<unsigned char>(c);
-            _text += digits[byte >> 4];
-            _text += digits[byte & 15];
+            platform::appendHex(_text, static_cast<unsigned char>(c));
         }
         _append(std::string_view(">"));
     }

@@ -1,6 +1,5 @@
 #include "platform/base/SmallFile.h"
 
-#include "platform/base/Errno.h"
 #include "platform/base/FileDescriptor.h"
 
 #include <fcntl.h>
@@ -34,6 +33,17 @@ std::expected<std::string, Errno> readSmallFile(int base, const char* path, std:
 
 std::expected<std::string, Errno> readSmallFile(const char* path, std::size_t limit, FinalLink finalLink) {
     return readSmallFile(AT_FDCWD, path, limit, finalLink);
+}
+
+std::expected<void, Errno> writeAll(int file, std::string_view bytes) {
+    while (!bytes.empty()) {
+        const ssize_t count = ::write(file, bytes.data(), bytes.size());
+        if (count < 0 && errno != EINTR)
+            return std::unexpected(errno);
+        if (count > 0)
+            bytes.remove_prefix(static_cast<std::size_t>(count));
+    }
+    return {};
 }
 
 } // namespace ost::platform

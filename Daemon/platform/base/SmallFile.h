@@ -5,6 +5,7 @@
 #include <cstddef>
 #include <expected>
 #include <string>
+#include <string_view>
 
 namespace ost::platform {
 
@@ -17,5 +18,8 @@ enum class FinalLink { follow, refuse };
 /// The same with a path relative to the directory `base`.
 [[nodiscard]] std::expected<std::string, Errno> readSmallFile(int base, const char* path, std::size_t limit,
                                                               FinalLink finalLink);
+
+/// Writes all of `bytes`, however little the file takes at a time. Fails with the errno of writing.
+[[nodiscard]] std::expected<void, Errno> writeAll(int file, std::string_view bytes);
 
 } // namespace ost::platform

@@ -2,6 +2,7 @@
 
 #include "platform/base/Try.h"
 #include "platform/base/Unicode.h"
+#include "platform/codec/BigEndian.h"
 #include "platform/codec/BinaryPropertyListFormat.h"
 
 #include <algorithm>
@@ -25,14 +26,6 @@ constexpr std::size_t memoryAllowance = std::size_t{1} << 20;
 
 std::unexpected<PropertyListError> malformed(const char* what) {
     return std::unexpected(PropertyListError{std::string("Malformed binary property list: ") + what});
-}
-
-/// `bytes`, at most 8, as one number.
-std::uint64_t bigEndian(std::string_view bytes) {
-    std::uint64_t value = 0;
-    for (const char byte : bytes)
-        value = value << 8 | static_cast<unsigned char>(byte);
-    return value;
 }
 
 class Reader {

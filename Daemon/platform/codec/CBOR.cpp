@@ -197,11 +197,6 @@ void CBOREntries::Iterator::_skipNulls() {
     }
 }
 
-void CBOREncoder::_bigEndian(std::uint64_t value, std::size_t width) {
-    for (std::size_t i = width; i-- > 0;)
-        _out += static_cast<char>(value >> (8 * i) & 0xff);
-}
-
 void CBOREncoder::_head(unsigned majorType, std::uint64_t argument) {
     const auto initial = [&](std::uint64_t information) {
         _out += static_cast<char>(majorType << 5 | static_cast<unsigned>(information));
@@ -210,7 +205,7 @@ void CBOREncoder::_head(unsigned majorType, std::uint64_t argument) {
         return initial(argument);
     const unsigned exponent = argument <= 0xff ? 0 : argument <= 0xffff ? 1 : argument <= 0xffffffff ? 2 : 3;
     initial(oneByteArgument + exponent);
-    _bigEndian(argument, std::size_t{1} << exponent);
+    appendBigEndian(_out, argument, std::size_t{1} << exponent);
 }
 
 void CBOREncoder::beginMap(std::uint64_t count) { _head(mapItem, count); }
@@ -229,7 +224,7 @@ void CBOREncoder::null() { _head(simple, nullValue); }
 
 void CBOREncoder::real(double value) {
     _out += static_cast<char>(simple << 5 | doubleFloat);
-    _bigEndian(std::bit_cast<std::uint64_t>(value), sizeof value);
+    appendBigEndian(_out, std::bit_cast<std::uint64_t>(value), sizeof value);
 }
 
 void CBOREncoder::text(std::string_view value) {

@@ -179,7 +179,6 @@ public:
 
 private:
     void _head(unsigned majorType, std::uint64_t argument);
-    void _bigEndian(std::uint64_t value, std::size_t width);
 
     std::string& _out;
 };

@@ -1,5 +1,7 @@
 #pragma once
 
+#include "platform/codec/BigEndian.h"
+
 #include <cstddef>
 #include <cstdint>
 #include <optional>
@@ -32,9 +34,7 @@ inline Head readHead(const char* at) {
     const unsigned initial = static_cast<std::uint8_t>(*at++);
     Head head{.major = initial >> 5U, .information = initial & 0x1fU, .argument = initial & 0x1fU, .next = at};
     if (const auto width = argumentWidth(head.information); width > 0) {
-        head.argument = 0;
-        for (std::size_t i = 0; i < width; ++i)
-            head.argument = head.argument << 8 | static_cast<std::uint8_t>(at[i]);
+        head.argument = bigEndian({at, width});
         head.next += width;
     }
     return head;

@@ -1,6 +1,5 @@
 #include "platform/device/AccessControlList.h"
 
-#include "platform/base/Errno.h"
 #include "platform/base/Try.h"
 #include "platform/device/ExtendedAttributes.h"
 #include "platform/device/Membership.h"

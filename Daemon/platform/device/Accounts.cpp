@@ -1,7 +1,7 @@
 #include "platform/device/Accounts.h"
 
-#include "platform/base/Errno.h"
 #include "platform/base/SmallFile.h"
+#include "platform/base/Text.h"
 #include "platform/base/Try.h"
 
 #include <algorithm>
@@ -71,8 +71,7 @@ template<typename Record, typename Matches>
 std::expected<Record, Errno> find(const char* file, std::optional<Record> (*parse)(std::string_view), Matches matches) {
     const auto content = OST_TRY(readSmallFile(file, databaseLimit, FinalLink::follow));
     for (std::string_view rest = content; !rest.empty();) {
-        const auto line = rest.substr(0, rest.find('\n'));
-        rest.remove_prefix(std::min(line.size() + 1, rest.size()));
+        const auto line = takeUntil(rest, '\n');
         if (auto record = parse(line); record && matches(*record))
             return *std::move(record);
     }

@@ -1,6 +1,5 @@
 #include "platform/device/Applications.h"
 
-#include "platform/base/Errno.h"
 #include "platform/base/FileName.h"
 #include "platform/base/Path.h"
 #include "platform/base/SmallFile.h"

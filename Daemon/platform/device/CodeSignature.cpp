@@ -1,7 +1,6 @@
 #include "platform/device/CodeSignature.h"
 
 #include "Protocol/OSTKeys.h"
-#include "platform/base/Errno.h"
 #include "platform/codec/PropertyList.h"
 
 #include <fcntl.h>

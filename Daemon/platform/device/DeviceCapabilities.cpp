@@ -1,6 +1,7 @@
 #include "platform/device/DeviceCapabilities.h"
 
 #include "platform/base/SmallFile.h"
+#include "platform/base/Text.h"
 
 #include <algorithm>
 
@@ -17,8 +18,7 @@ std::optional<std::string> assignedValue(const char* file, std::string_view name
         return std::nullopt;
     std::optional<std::string> value;
     for (std::string_view rest = *content; !rest.empty();) {
-        const auto line = rest.substr(0, rest.find('\n'));
-        rest.remove_prefix(std::min(line.size() + 1, rest.size()));
+        const auto line = takeUntil(rest, '\n');
         if (line.starts_with(name) && line.substr(name.size()).starts_with('='))
             value = line.substr(name.size() + 1);
     }

@@ -1,6 +1,5 @@
 #include "platform/device/DeviceLockState.h"
 
-#include "platform/base/Errno.h"
 #include "platform/base/Path.h"
 #include "platform/base/SmallFile.h"
 #include "platform/base/Try.h"

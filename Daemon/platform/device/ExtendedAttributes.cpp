@@ -1,7 +1,5 @@
 #include "platform/device/ExtendedAttributes.h"
 
-#include "platform/base/Errno.h"
-
 #include <sys/xattr.h>
 
 #include <cerrno>

@@ -1,6 +1,5 @@
 #include "platform/device/Membership.h"
 
-#include "platform/base/Errno.h"
 #include "platform/base/Try.h"
 #include "platform/device/Accounts.h"
 

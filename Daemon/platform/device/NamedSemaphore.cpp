@@ -1,7 +1,5 @@
 #include "platform/device/NamedSemaphore.h"
 
-#include "platform/base/Errno.h"
-
 #include <fcntl.h>
 #include <semaphore.h>
 

@@ -1,7 +1,7 @@
 #include "platform/device/ProcessInstance.h"
 
-#include "platform/base/Errno.h"
 #include "platform/base/FileDescriptor.h"
+#include "platform/base/Text.h"
 #include "platform/base/Try.h"
 
 #include <fcntl.h>
@@ -46,10 +46,9 @@ std::optional<std::array<std::string_view, fieldCount>> fieldsOf(std::string_vie
         return std::nullopt;
     line.remove_prefix(nameEnd + 2);
     for (auto& field : fields) {
-        field = line.substr(0, line.find(' '));
+        field = takeUntil(line, ' ');
         if (field.empty())
             return std::nullopt;
-        line.remove_prefix(std::min(field.size() + 1, line.size()));
     }
     return fields;
 }

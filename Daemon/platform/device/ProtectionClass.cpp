@@ -1,6 +1,5 @@
 #include "platform/device/ProtectionClass.h"
 
-#include "platform/base/Errno.h"
 #include "platform/base/Try.h"
 #include "platform/device/DeviceLockState.h"
 #include "platform/device/ExtendedAttributes.h"

@@ -1,6 +1,5 @@
 #include "platform/device/SandboxUserState.h"
 
-#include "platform/base/Errno.h"
 #include "platform/base/FileDescriptor.h"
 #include "platform/base/FileName.h"
 #include "platform/base/Try.h"

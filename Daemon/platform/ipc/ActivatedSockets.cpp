@@ -1,8 +1,8 @@
 #include "platform/ipc/ActivatedSockets.h"
 
 #include "Protocol/OSTServices.h"
-#include "platform/base/Errno.h"
 #include "platform/base/Path.h"
+#include "platform/base/Text.h"
 #include "platform/base/Try.h"
 
 #include <fcntl.h>
@@ -102,8 +102,7 @@ ActivatedSockets ActivatedSockets::fromEnvironment() {
         return sockets;
     std::string_view names = nameList;
     for (int descriptor = firstHandedDescriptor; descriptor < firstHandedDescriptor + *count; ++descriptor) {
-        const auto name = names.substr(0, names.find(':'));
-        names.remove_prefix(std::min(name.size() + 1, names.size()));
+        const auto name = takeUntil(names, ':');
         const int flags = ::fcntl(descriptor, F_GETFD);
         if (flags >= 0 && ::fcntl(descriptor, F_SETFD, flags | FD_CLOEXEC) == 0)
             sockets._handed.push_back({std::string(name), FileDescriptor(descriptor)});

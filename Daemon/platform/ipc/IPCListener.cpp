@@ -1,6 +1,5 @@
 #include "platform/ipc/IPCListener.h"
 
-#include "platform/base/Errno.h"
 #include "platform/base/Log.h"
 #include "platform/base/Try.h"
 #include "platform/ipc/PeerIdentity.h"

@@ -1,6 +1,5 @@
 #include "platform/ipc/PeerIdentity.h"
 
-#include "platform/base/Errno.h"
 #include "platform/base/Try.h"
 
 #include <fcntl.h>

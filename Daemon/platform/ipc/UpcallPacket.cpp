@@ -1,6 +1,5 @@
 #include "platform/ipc/UpcallPacket.h"
 
-#include "platform/base/Errno.h"
 #include "platform/base/Log.h"
 
 #include <fcntl.h>

@@ -1,6 +1,5 @@
 #include "platform/ipc/UpcallPort.h"
 
-#include "platform/base/Errno.h"
 #include "platform/base/Log.h"
 #include "platform/base/Mutex.h"
 #include "platform/base/Try.h"

@@ -1,7 +1,6 @@
 #include "platform/threads/RunLoop.h"
 
 #include "platform/base/Assert.h"
-#include "platform/base/Errno.h"
 
 #include <sys/epoll.h>
 #include <sys/eventfd.h>

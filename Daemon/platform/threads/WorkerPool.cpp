@@ -1,7 +1,6 @@
 #include "platform/threads/WorkerPool.h"
 
 #include "platform/base/Assert.h"
-#include "platform/base/Errno.h"
 #include "platform/base/Log.h"
 #include "platform/threads/BlockingSection.h"
 #include "platform/threads/ThreadName.h"
