@@ -86,7 +86,7 @@ MessageArgument::MessageArgument(double value) : _kind(Kind::text), _unsigned(0)
 }
 
 void MessageArgument::appendTo(std::string& out, char conversion) const {
-    const int base = conversion == 'x' || conversion == 'p' ? 16 : 10;
+    const int base = conversion == 'x' || conversion == 'p' ? 16 : conversion == 'o' ? 8 : 10;
     switch (_kind) {
     case Kind::text:
         appendShown(out, _text);

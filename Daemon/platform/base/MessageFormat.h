@@ -56,7 +56,7 @@ public:
     MessageArgument(const MessageArgument&) = delete;
     MessageArgument& operator=(const MessageArgument&) = delete;
 
-    /// Appends the argument as the placeholder's conversion letter asks (`x` and `p` print hexadecimal).
+    /// Appends the argument as the placeholder's conversion letter asks (`x` and `p` print hexadecimal, `o` octal).
     void appendTo(std::string& out, char conversion) const;
 
 private:
@@ -94,7 +94,7 @@ private:
     std::string_view _text;
 };
 
-/// Counts the placeholders of a message: `%` with an optional `l` or `ll` and one of `@ u d s x c p`.
+/// Counts the placeholders of a message: `%` with an optional `l` or `ll` and one of `@ u d s x o c p`.
 /// A malformed placeholder is a compile-time error.
 consteval std::size_t messagePlaceholders(std::string_view format) {
     std::size_t count = 0;
@@ -104,7 +104,7 @@ consteval std::size_t messagePlaceholders(std::string_view format) {
         ++i;
         while (i < format.size() && format[i] == 'l')
             ++i;
-        if (i == format.size() || std::string_view("@udsxcp").find(format[i]) == std::string_view::npos)
+        if (i == format.size() || std::string_view("@udsxocp").find(format[i]) == std::string_view::npos)
             throw "malformed placeholder";
         ++count;
     }

@@ -166,13 +166,13 @@ private:
     std::string _path, _name;
 };
 
-/// Removes the records of processes that are gone. What cannot be told stays.
-void removeStaleApplications(const FileDescriptor& directory) {
+/// Removes the records of which `read` says that there is nothing to them any more. What cannot be told stays.
+void removeStale(const FileDescriptor& directory, const auto& read) {
     const auto names = finishedNames(directory);
     if (!names)
         return;
     for (const auto& name : *names)
-        if (const auto process = processOfRecord(directory, name); process && !*process)
+        if (const auto meaning = read(directory, name); meaning && !*meaning)
             ::unlinkat(directory.get(), name.c_str(), 0);
 }
 
@@ -192,7 +192,7 @@ std::expected<ApplicationRecord, Errno> registerApplication(std::string_view ide
         // A number that was free when its record was looked at may be taken and recorded before it is removed.
         if (::flock(directory.get(), LOCK_EX) != 0)
             return std::unexpected(errno);
-        removeStaleApplications(directory);
+        removeStale(directory, processOfRecord);
         auto made = makeRecord(directory, name, std::to_string(process.startTime));
         ::flock(directory.get(), LOCK_UN);
         return made;
@@ -220,6 +220,7 @@ std::expected<ApplicationRecord, Errno> recordTerminationAssertion(std::string_v
     const auto name = number + "-" + start + "-" + std::to_string(count++);
     const auto text = std::string(reason) + "\n" + number + " " + start + "\n";
     const auto make = [&](const FileDescriptor& directory) -> std::expected<void, Errno> {
+        removeStale(directory, assertionOfRecord);
         // Half a record would be one of which the holder cannot be told.
         const auto unfinished = "." + name;
         OST_TRY(makeRecord(directory, unfinished, text));

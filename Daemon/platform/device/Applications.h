@@ -53,7 +53,8 @@ registerApplication(std::string_view identifier, const ProcessInstance& process,
 [[nodiscard]] std::expected<std::vector<ProcessInstance>, Errno> applicationProcesses(std::string_view identifier,
                                                                                       const std::string& image = "");
 
-/// Holds an assertion, for the calling process, that the application does not run. `reason` is one line.
+/// Holds an assertion, for the calling process, that the application does not run. `reason` is one line. Those that
+/// ended holders left behind are removed.
 [[nodiscard]] std::expected<ApplicationRecord, Errno>
 recordTerminationAssertion(std::string_view identifier, std::string_view reason, const std::string& image = "");
 

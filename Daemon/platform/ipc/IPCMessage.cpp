@@ -20,6 +20,11 @@ std::uint64_t IPCRequest::unsignedValue(std::string_view key) const {
     return value ? value->asUnsigned().value_or(0) : 0;
 }
 
+std::int64_t IPCRequest::signedValue(std::string_view key) const {
+    const auto value = item(key);
+    return value ? value->asSigned().value_or(0) : 0;
+}
+
 bool IPCRequest::booleanValue(std::string_view key) const {
     const auto value = item(key);
     return value && value->asBoolean().value_or(false);

@@ -25,6 +25,8 @@ class IPCRequest {
 public:
     /// The number of `key`, 0 when it is missing or anything but an unsigned number.
     [[nodiscard]] std::uint64_t unsignedValue(std::string_view key) const;
+    /// The number of `key` in either integer form, 0 when it is missing or does not fit.
+    [[nodiscard]] std::int64_t signedValue(std::string_view key) const;
     /// The boolean of `key`, false when it is missing or anything else.
     [[nodiscard]] bool booleanValue(std::string_view key) const;
     [[nodiscard]] std::optional<std::string_view> stringValue(std::string_view key) const;
