@@ -38,9 +38,10 @@ OSTResult<std::string> OST_contentsOfDictionary(const OSTDictionary& dictionary,
     return bytes;
 }
 
-OSTResult<void> OST_writeToURL(const OSTDictionary& dictionary, std::string_view path, std::size_t maximumSize) {
+OSTResult<void> OST_writeToURL(const OSTDictionary& dictionary, std::string_view path, std::size_t maximumSize,
+                               OSTWorkshop workshop) {
     const std::string bytes = OST_TRY(OST_contentsOfDictionary(dictionary, path, maximumSize));
-    return OSTFileManager::defaultManager().writeFileAtomicallyAtURL(path, bytes);
+    return OSTFileManager::defaultManager().writeFileAtomicallyAtURL(path, bytes, {}, workshop);
 }
 
 } // namespace ost

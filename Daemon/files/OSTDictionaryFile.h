@@ -1,5 +1,6 @@
 #pragma once
 
+#include "files/OSTFileManager.h"
 #include "platform/base/OSTError.h"
 #include "platform/base/OSTValue.h"
 
@@ -29,6 +30,6 @@ inline constexpr std::size_t OSTLargeDictionaryFileSize = std::size_t{64} << 20U
 /// Writes a dictionary file: atomically, without data protection, and durable when this returns. Fails as above or with
 /// the write error.
 [[nodiscard]] OSTResult<void> OST_writeToURL(const OSTDictionary& dictionary, std::string_view path,
-                                             std::size_t maximumSize);
+                                             std::size_t maximumSize, OSTWorkshop workshop = OSTWorkshop::ownDirectory);
 
 } // namespace ost

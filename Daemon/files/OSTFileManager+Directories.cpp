@@ -138,11 +138,19 @@ OSTResult<std::string> OSTFileManager::createTemporaryDirectoryInDirectoryURL(st
     return platform::pathByAppending(path, *name);
 }
 
-OSTResult<void> OSTFileManager::makeDirectoryDurable(std::string_view path) const {
+OSTResult<void> OSTFileManager::_waitForDirectory(std::string_view path, int (*synchronise)(int)) const {
     const FileDescriptor directory = OST_TRY(openDirectoryAtURL(path));
-    if (const auto durable = OSTWaitForDisk(directory.get(), ::fsync); !durable)
+    if (const auto durable = OSTWaitForDisk(directory.get(), synchronise); !durable)
         return std::unexpected(OSTCreatePOSIXError(durable.error(), "fsync of %@ failed: %s", path, durable.error()));
     return {};
+}
+
+OSTResult<void> OSTFileManager::makeDirectoryDurable(std::string_view path) const {
+    return _waitForDirectory(path, ::fsync);
+}
+
+OSTResult<void> OSTFileManager::makeFileSystemDurable(std::string_view path) const {
+    return _waitForDirectory(path, ::syncfs);
 }
 
 } // namespace ost

@@ -1,5 +1,6 @@
 #include "files/OSTFileManager.h"
 
+#include "files/OSTOwnFiles.h"
 #include "files/OSTPathResolution.h"
 #include "platform/base/Log.h"
 #include "platform/base/Path.h"
@@ -11,7 +12,6 @@
 
 #include <cerrno>
 #include <cstring>
-#include <map>
 #include <vector>
 
 namespace ost {
@@ -111,34 +111,10 @@ void logChmod(const std::string& path, platform::Errno error) {
     platform::logError("Could not chmod %s: %s", path, error);
 }
 
-/// Tells which files of a tree are the tree's own. A user can give any file a second name inside his container; such a
-/// file is changed only when all its names have been seen in the tree, at the last of them.
-class OwnFiles {
-public:
-    /// To be asked once at each name of an item.
-    [[nodiscard]] bool contains(const HeldItem& item, const std::string& path) {
-        const auto& status = item.status;
-        if (S_ISDIR(status.st_mode) || status.st_nlink <= 1)
-            return true;
-        auto& names = _incomplete.try_emplace(status.st_ino, Names{.seen = 0, .first = path}).first->second;
-        if (++names.seen < status.st_nlink)
-            return false;
-        _incomplete.erase(status.st_ino);
-        return true;
-    }
-
-    void logTheRest() const {
-        for (const auto& [inode, names] : _incomplete)
-            logChown(names.first, EMLINK);
-    }
-
-private:
-    struct Names {
-        nlink_t seen;
-        std::string first;
-    };
-    std::map<ino_t, Names> _incomplete;
-};
+void logForeignFiles(const OSTOwnFiles& ownFiles) {
+    for (const auto& path : ownFiles.others())
+        logChown(path, EMLINK);
+}
 
 /// The three ACLs of a system container and how its items get them.
 struct SystemContainerStandard {
@@ -180,14 +156,14 @@ void applyStandardOwnership(const HeldItem& item, const std::string& path, std::
 }
 
 /// What a walk calls to have `change` applied to each item once.
-auto changingItems(OwnFiles& ownFiles, auto change) {
+auto changingItems(OSTOwnFiles& ownFiles, auto change) {
     return [&ownFiles, change](const OSTTreeEntry& entry) -> OSTResult<void> {
         if (entry.visit == OSTTreeEntry::Visit::directoryAfter || isMetadataFile(entry.path))
             return {};
         const auto item = HeldItem::open(entry.directory, entry.name);
         if (!item)
             logChown(entry.path, item.error());
-        else if (ownFiles.contains(*item, entry.path))
+        else if (ownFiles.contains(item->status, entry.path))
             change(*item, entry.path);
         return {};
     };
@@ -210,7 +186,7 @@ OSTResult<void> OSTFileManager::standardizeACLsForSystemContainerAtURL(std::stri
                                            .directory =
                                                OST_TRY(copySystemContainerACLWithNumACEs(1, ItemKind::directory)),
                                            .file = OST_TRY(copySystemContainerACLWithNumACEs(1, ItemKind::file))};
-    OwnFiles ownFiles;
+    OSTOwnFiles ownFiles;
     auto walked =
         _traverseDirectory(path, changingItems(ownFiles, [&](const HeldItem& item, const std::string& itemPath) {
                                if (itemPath == path)
@@ -218,7 +194,7 @@ OSTResult<void> OSTFileManager::standardizeACLsForSystemContainerAtURL(std::stri
                                else
                                    standard.applyBelowTop(item, itemPath);
                            }));
-    ownFiles.logTheRest();
+    logForeignFiles(ownFiles);
     return walked;
 }
 
@@ -254,16 +230,16 @@ OSTResult<void> OSTFileManager::standardizeOwnershipAtURL(std::string_view path,
     const auto change = [&](const HeldItem& item, const std::string& itemPath) {
         applyStandardOwnership(item, itemPath, userId, groupId);
     };
-    OwnFiles ownFiles;
+    OSTOwnFiles ownFiles;
     auto walked = _traverseDirectory(path, changingItems(ownFiles, change));
-    ownFiles.logTheRest();
+    logForeignFiles(ownFiles);
 
     // A walk that stopped early may have left the top as it was.
     const auto top = HeldItem::open(AT_FDCWD, path);
     if (!top)
         return std::unexpected(OSTCreatePOSIXError(top.error(), "Could not stat %s: %s", path, top.error()));
     const std::string topPath(path);
-    if (!isMetadataFile(topPath) && OwnFiles().contains(*top, topPath))
+    if (!isMetadataFile(topPath) && OSTOwnFiles().contains(top->status, topPath))
         change(*top, topPath);
     return walked;
 }

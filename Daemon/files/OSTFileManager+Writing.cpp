@@ -24,9 +24,6 @@ using platform::FileDescriptor;
 
 namespace {
 
-/// What the name of an unfinished file begins with.
-constexpr std::string_view unfinishedPrefix = ".temp.";
-
 /// The name of a file that is removed again unless it was kept.
 class UnfinishedFile {
 public:
@@ -74,27 +71,40 @@ std::expected<void, platform::Errno> finish(int file, std::string_view bytes, co
     return platform::writeAll(file, bytes);
 }
 
-std::expected<void, platform::Errno> writeAtomically(std::string_view path, std::string_view bytes,
+/// `workshop` is the directory in which the file is unfinished.
+std::expected<void, platform::Errno> writeAtomically(const OSTItemPlace& place, int workshop, std::string_view bytes,
                                                      const OSTFileAttributes& attributes) {
-    const auto place = OST_TRY(OSTItemPlace::find(path, O_RDONLY));
     FileDescriptor file;
-    UnfinishedFile unfinished(place.directory(), OST_TRY(OSTMakeUnique(unfinishedPrefix, [&](const char* candidate) {
-                                  file = createExclusively(place.directory(), candidate, attributes.mode);
+    UnfinishedFile unfinished(workshop, OST_TRY(OSTMakeUnique(OSTUnfinishedPrefix, [&](const char* candidate) {
+                                  file = createExclusively(workshop, candidate, attributes.mode);
                                   return static_cast<bool>(file);
                               })));
     OST_TRY(finish(file.get(), bytes, attributes));
     OST_TRY(OSTWaitForDisk(file.get(), ::fdatasync));
-    if (::renameat(place.directory(), unfinished.name(), place.directory(), place.name()) != 0)
+    if (::renameat(workshop, unfinished.name(), place.directory(), place.name()) != 0)
         return std::unexpected(errno);
     unfinished.keep();
     return OSTWaitForDisk(place.directory(), ::fsync);
 }
 
+std::expected<void, platform::Errno> writeAtomically(std::string_view path, std::string_view bytes,
+                                                     const OSTFileAttributes& attributes, OSTWorkshop workshop) {
+    const auto place = OST_TRY(OSTItemPlace::find(path, O_RDONLY));
+    if (workshop == OSTWorkshop::directoryAbove) {
+        const auto above = OST_TRY(OSTItemPlace::find(platform::pathByDeletingLastComponent(path)));
+        const auto written = writeAtomically(place, above.directory(), bytes, attributes);
+        if (written || written.error() != EXDEV)
+            return written;
+    }
+    return writeAtomically(place, place.directory(), bytes, attributes);
+}
+
 } // namespace
 
 OSTResult<void> OSTFileManager::writeFileAtomicallyAtURL(std::string_view path, std::string_view bytes,
-                                                         const OSTFileAttributes& attributes) const {
-    if (const auto written = writeAtomically(path, bytes, attributes); !written)
+                                                         const OSTFileAttributes& attributes,
+                                                         OSTWorkshop workshop) const {
+    if (const auto written = writeAtomically(path, bytes, attributes, workshop); !written)
         return std::unexpected(OSTCreatePOSIXError(written.error(), "write of %@ failed: %s", path, written.error()));
     return {};
 }
@@ -106,7 +116,7 @@ void OSTFileManager::removeUnfinishedItemsInDirectoryURL(std::string_view path) 
     if (!stream)
         return;
     while (const dirent* const entry = ::readdir(stream.get()))
-        if (std::string_view(entry->d_name).starts_with(unfinishedPrefix))
+        if (std::string_view(entry->d_name).starts_with(OSTUnfinishedPrefix))
             static_cast<void>(removeItemAtURL(platform::pathByAppending(path, entry->d_name)));
 }
 

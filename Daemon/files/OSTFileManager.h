@@ -37,6 +37,21 @@ struct OSTFileAttributes {
     std::int32_t protectionClass = OSTNoProtectionClass;
 };
 
+/// Where a file is while it is being written: in its own directory, or in the one that holds that.
+enum class OSTWorkshop : bool { ownDirectory, directoryAbove };
+
+/// What an item is whatever its path, as long as it exists.
+struct OSTItemIdentity {
+    dev_t device;
+    ino_t inode;
+    friend bool operator==(const OSTItemIdentity&, const OSTItemIdentity&) = default;
+};
+
+/// Decides from the class that an item has whether it gets another one.
+using OSTClassPredicate = std::function<bool(std::int32_t itemClass)>;
+
+class OSTOwnFiles;
+
 /// One item of a directory listing; its path is that of the directory and the name.
 struct OSTDirectoryItem {
     std::string name;
@@ -90,6 +105,9 @@ public:
     /// Waits until the names in the directory at `path` are on disk, and so what was last moved there.
     [[nodiscard]] OSTResult<void> makeDirectoryDurable(std::string_view path) const;
 
+    /// Waits until everything that was changed on the file system of the directory at `path` is on disk.
+    [[nodiscard]] OSTResult<void> makeFileSystemDurable(std::string_view path) const;
+
     // Removal
 
     /// Removes the item at `path` with everything below it; an item that is missing is success. Immutable flags are
@@ -113,6 +131,9 @@ public:
 
     /// The items of a directory in the directory's own order, without those whose name begins with a dot.
     [[nodiscard]] OSTResult<std::vector<OSTDirectoryItem>> urlsForItemsInDirectoryAtURL(std::string_view path) const;
+    /// The same for a directory in which nobody is writing: removes what a crash left unfinished there.
+    [[nodiscard]] OSTResult<std::vector<OSTDirectoryItem>>
+    urlsForItemsInDirectoryRemovingUnfinished(std::string_view path) const;
 
     /// Whether anything is at `path`. What cannot be found out is logged and false in both questions.
     [[nodiscard]] bool itemExistsAtURL(std::string_view path) const;
@@ -130,6 +151,9 @@ public:
     /// Writes the items of the tree at `path` to the log, the first `maximumLines` of them and a line that says so.
     void printDirectoryStructureAtURL(std::string_view path, std::size_t maximumLines) const;
 
+    /// What lies at `path` now.
+    [[nodiscard]] OSTResult<OSTItemIdentity> identityOfItemAtURL(std::string_view path) const;
+
     // Reading and writing files
 
     /// Reads a regular file of at most `maximumSize` bytes. Anything else in its place fails at once: EFBIG for a
@@ -141,15 +165,31 @@ public:
                                                                 std::size_t maximumSize, std::string& buffer) const;
 
     /// Writes a file in one step: whoever opens `path`, now or after a power cut, finds the old content or all of the
-    /// new. The new file is on disk when this returns.
+    /// new. The new file is on disk when this returns. A crash may leave an unfinished file in the workshop.
     [[nodiscard]] OSTResult<void> writeFileAtomicallyAtURL(std::string_view path, std::string_view bytes,
-                                                           const OSTFileAttributes& attributes = {}) const;
+                                                           const OSTFileAttributes& attributes = {},
+                                                           OSTWorkshop workshop = OSTWorkshop::ownDirectory) const;
     /// Removes the unfinished files and copies that a crash left in a directory. Nobody may be writing there.
     void removeUnfinishedItemsInDirectoryURL(std::string_view path) const;
     /// Writes a file that must not exist yet (EEXIST), in a directory that nobody else looks into, and leaves the wait
     /// for the disk to the caller.
     [[nodiscard]] OSTResult<OSTNewFile> createFileAtURL(std::string_view path, std::string_view bytes,
                                                         const OSTFileAttributes& attributes = {}) const;
+
+    // Data-protection classes (OSTFileManager+ProtectionClasses.cpp).
+    // The item is opened like any file and never followed. EPERM stands for a locked device, or for an item that may
+    // not be changed; EBADF for one that carries no class.
+
+    /// The class of an item.
+    [[nodiscard]] OSTResult<std::int32_t> dataProtectionClassOfItemAtURL(std::string_view path) const;
+    /// Sets the class of an item, unless the predicate declines.
+    [[nodiscard]] OSTResult<void> setDataProtectionClassOfItemAtURL(std::string_view path, std::int32_t toClass,
+                                                                    const OSTClassPredicate& ifPredicate = {}) const;
+    /// The same for the item to which a walk has come. An item that has become one of another kind meanwhile is left
+    /// alone, and so is a file that is not the tree's own.
+    [[nodiscard]] OSTResult<void> setDataProtectionClassOfItem(const OSTTreeEntry& entry, OSTOwnFiles& ownFiles,
+                                                               std::int32_t toClass,
+                                                               const OSTClassPredicate& ifPredicate) const;
 
     // Access control lists and owners of whole containers (OSTFileManager+SystemContainerACLs.cpp).
     // Metadata files are left alone. An item that cannot be changed is logged and the next one follows; a file with a
@@ -174,6 +214,7 @@ private:
 
     OSTFileManager() = default;
 
+    [[nodiscard]] OSTResult<void> _waitForDirectory(std::string_view path, int (*synchronise)(int)) const;
     [[nodiscard]] OSTResult<void> _copyItemAtURL(std::string_view source, std::string_view destination,
                                                  MissingSource missingSource) const;
     [[nodiscard]] OSTResult<void> _moveItemAtURL(std::string_view source, std::string_view destination,

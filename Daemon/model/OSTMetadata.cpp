@@ -118,7 +118,9 @@ OSTResult<T> OSTMetadata::_written(OSTResult<T> result) const {
 }
 
 OSTResult<void> OSTMetadata::writeMetadataToDisk() const {
-    return _written(OST_writeToURL(dictionary(), metadataFileURL(), OSTSmallDictionaryFileSize));
+    // Unfinished files are looked for where they are few: in the class directory, when it is read.
+    return _written(
+        OST_writeToURL(dictionary(), metadataFileURL(), OSTSmallDictionaryFileSize, OSTWorkshop::directoryAbove));
 }
 
 OSTResult<OSTNewFile> OSTMetadata::writeMetadataToNewDirectory() const {

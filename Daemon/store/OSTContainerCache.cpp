@@ -145,12 +145,17 @@ OSTResult<OSTCacheEntry> OSTContainerCache::entryForUser(const OSTContainerName&
 }
 
 OSTMetadataRecord OSTContainerCache::containerForUser(OSTContainerName name, const platform::UUID& uuid) {
+    auto entry = entryForUser(name, uuid);
+    return entry ? std::move(entry->record) : nullptr;
+}
+
+std::optional<OSTCacheEntry> OSTContainerCache::entryForUser(OSTContainerName name, const platform::UUID& uuid) {
     for (name.transient = false;; name.transient = true) {
-        auto found = containerForUser(name);
-        if (found && (*found)->uuid == uuid)
+        auto found = entryForUser(name);
+        if (found && found->record->uuid == uuid)
             return *std::move(found);
         if (name.transient)
-            return nullptr;
+            return std::nullopt;
     }
 }
 
@@ -233,7 +238,7 @@ void OSTContainerCache::placementReachedDisk(const OSTMetadata& metadata) {
     if (!table)
         return;
     const auto found = (*table)->find(metadata.identifier);
-    if (found != (*table)->end() && found->second.record->uuid == metadata.uuid)
+    if (found != (*table)->end() && found->second.record->url == metadata.url)
         found->second.placement = OSTPlacement::durable;
 }
 
@@ -284,7 +289,8 @@ OSTResult<OSTContainerCache::ClassTable*> OSTContainerCache::_getCacheForUserId(
 OSTResult<OSTContainerCache::ClassTable> OSTContainerCache::_readClassDirectory(const std::string& directory,
                                                                                 std::uint32_t userId, bool transient) {
     const auto& files = OSTFileManager::defaultManager();
-    const auto items = OST_TRY(files.urlsForItemsInDirectoryAtURL(directory));
+    // Everybody who writes here has asked for this table first.
+    const auto items = OST_TRY(files.urlsForItemsInDirectoryRemovingUnfinished(directory));
     const auto open = OST_TRY(files.openDirectoryAtURL(directory));
     std::vector<OSTMetadataRecord> records(items.size());
     const auto read = [&](std::size_t first, std::size_t last) {

@@ -8,6 +8,7 @@
 #include <functional>
 #include <map>
 #include <mutex>
+#include <optional>
 #include <source_location>
 #include <string>
 #include <string_view>
@@ -47,6 +48,7 @@ public:
 
     /// Finds the container with that internal UUID, among the live ones first; null when neither table has it.
     [[nodiscard]] OSTMetadataRecord containerForUser(OSTContainerName name, const platform::UUID& uuid);
+    [[nodiscard]] std::optional<OSTCacheEntry> entryForUser(OSTContainerName name, const platform::UUID& uuid);
 
     /// All containers whose metadata file is on disk; the errors of others are logged and not returned.
     [[nodiscard]] OSTResult<std::vector<OSTMetadataRecord>>
@@ -63,7 +65,7 @@ public:
     /// Fails with `invalidCacheInput` or `cacheRebuildFailed`.
     [[nodiscard]] OSTResult<OSTMetadataRecord> addContainerMetadata(OSTMetadata metadata,
                                                                     OSTPlacement placement = OSTPlacement::durable);
-    /// Ends the pending of the container's place, unless another container has its name by now.
+    /// Ends the pending of the place that the record speaks of, unless its name stands for another one by now.
     void placementReachedDisk(const OSTMetadata& metadata);
 
     /// Forgets a container; one that is not there is no error. Fails with `invalidCacheInput` or `cacheRebuildFailed`.
