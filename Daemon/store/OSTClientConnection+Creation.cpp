@@ -35,17 +35,6 @@ std::span<const std::string_view> subDirectoriesOf(OSTContainerClass containerCl
     return dataSubDirectories;
 }
 
-/// Waits until the rename that put the record's container in place has reached the disk. The look-up that made the
-/// container does so when it has given back the lock; one that finds it too early does it as well, before it answers.
-OSTResult<void> makePlaceDurable(const OSTMetadata& record) {
-    const auto durable = OSTFileManager::defaultManager().makeDirectoryDurable(pathByDeletingLastComponent(record.url));
-    if (!durable)
-        return std::unexpected(OSTCreateError(OSTErrorCode::moveToLiveFailed, durable.error(),
-                                              "Failed to make sure of live dir: %@", record.url));
-    OSTContainerCache::sharedInstance().placementReachedDisk(record);
-    return {};
-}
-
 /// The record of a container as the answer of the look-up that made it: later ones get the shared record.
 OSTMetadataRecord asMadeNow(const OSTMetadata& record) {
     auto copy = std::make_shared<OSTMetadata>(record);
@@ -68,9 +57,18 @@ OSTClientConnection::createOrLookupContainerForUser(const OSTContainerLookup& lo
         }
         const auto [record, placement] = OST_TRY(std::move(entry));
         if (placement == OSTPlacement::pending)
-            OST_TRY(makePlaceDurable(*record));
+            OST_TRY(_makePlaceDurable(*record));
         return record;
     });
+}
+
+OSTResult<void> OSTClientConnection::_makePlaceDurable(const OSTMetadata& record) {
+    const auto durable = OSTFileManager::defaultManager().makeDirectoryDurable(pathByDeletingLastComponent(record.url));
+    if (!durable)
+        return std::unexpected(OSTCreateError(OSTErrorCode::moveToLiveFailed, durable.error(),
+                                              "Failed to make sure of live dir: %@", record.url));
+    OSTContainerCache::sharedInstance().placementReachedDisk(record);
+    return {};
 }
 
 OSTResult<void> OSTClientConnection::_checkLookup(const OSTContainerLookup& lookup) const {
@@ -216,7 +214,7 @@ OSTClientConnection::containersForUser(std::uint32_t userId, OSTContainerClass c
         records.reserve(entries.size());
         // What may be forgotten in a power cut is not said to be there; the log has the reason.
         for (const auto& [record, placement] : entries)
-            if (placement == OSTPlacement::durable || makePlaceDurable(*record))
+            if (placement == OSTPlacement::durable || _makePlaceDurable(*record))
                 records.push_back(record);
         return records;
     });

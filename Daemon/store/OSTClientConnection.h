@@ -3,6 +3,7 @@
 #include "model/OSTContainerName.h"
 #include "model/OSTMetadata.h"
 #include "platform/base/OSTError.h"
+#include "platform/base/OSTValue.h"
 #include "platform/base/UUID.h"
 #include "platform/threads/WorkQueue.h"
 #include "store/OSTContainerCache.h"
@@ -32,6 +33,9 @@ struct OSTContainerLookup {
     bool createIfNecessary = false;
     bool useLocking = true; ///< false when the caller holds the all-identifiers lock for writing
 };
+
+/// No: the caller holds the container's lock.
+enum class OSTUseLocking : bool { no, yes };
 
 /// Containers to be deleted as a client lists them, one for each index of lists that may differ in length.
 struct OSTDeletion {
@@ -86,6 +90,38 @@ public:
     /// All containers of the user and class. Codes: `invalidObject`, those of the cache.
     [[nodiscard]] std::expected<std::vector<OSTMetadataRecord>, OSTErrorCode>
     containersForUser(std::uint32_t userId, OSTContainerClass containerClass, bool transient) const;
+
+    // Attributes of one container
+    //
+    // Each works on the container that has that internal UUID, under a lock of its own on that. What is answered has
+    // reached the disk. Codes of all: `invalidObject` (no UUID, or no class), `notFound`, `moveToLiveFailed` (the
+    // container's place cannot be made sure of).
+
+    /// Sets the info value of a key, or removes the key when there is no value. When that fails, file and cache hold
+    /// what they held before. Codes: `invalidParameter` (no key), `dictionaryWriteFailed`, `cacheAddFailed`.
+    [[nodiscard]] std::expected<void, OSTErrorCode> setInfoValue(const std::optional<OSTValue>& value,
+                                                                 std::optional<std::string_view> key,
+                                                                 const OSTContainerReference& container,
+                                                                 OSTUseLocking useLocking = OSTUseLocking::yes) const;
+
+    /// The info value of a key. Codes: `invalidParameter` (no key), `noInfoValue`, which is not logged.
+    [[nodiscard]] std::expected<OSTValue, OSTErrorCode>
+    infoValueForKey(std::optional<std::string_view> key, const OSTContainerReference& container,
+                    OSTUseLocking useLocking = OSTUseLocking::yes) const;
+
+    /// The container's record.
+    [[nodiscard]] std::expected<OSTMetadataRecord, OSTErrorCode>
+    metadataForUser(const OSTContainerReference& container) const;
+
+    /// Makes the directories again that a new container of the class has, and standardises the ACLs of a system
+    /// container. Codes: `subDirectoryCreationFailed`, those of the ACLs.
+    [[nodiscard]] std::expected<void, OSTErrorCode>
+    recreateDefaultStructureForUser(const OSTContainerReference& container) const;
+
+    /// Gives the container's directory a new name. Codes: `moveToNewUUIDFailed`, also for a container whose name is
+    /// well known, `cacheAddFailed`, after which it has the new name.
+    [[nodiscard]] std::expected<void, OSTErrorCode>
+    regenerateDirectoryUUIDForUser(const OSTContainerReference& container) const;
 
     // Deletion
 
@@ -163,6 +199,19 @@ private:
                                                                OSTContainerClass containerClass);
     [[nodiscard]] static OSTResult<void> _createDefaultDirectory(const std::string& url, std::uint16_t mode,
                                                                  std::uint32_t owner);
+
+    /// Waits until the rename that put the record's container in place has reached the disk. Whoever finds one that is
+    /// not there yet does so before he answers with it. Fails with `moveToLiveFailed`.
+    [[nodiscard]] static OSTResult<void> _makePlaceDurable(const OSTMetadata& record);
+
+    // +Attributes
+    struct MovedContainer {
+        OSTMetadataRecord before, after;
+    };
+    /// The container that is meant, in a place that is on disk.
+    [[nodiscard]] static OSTResult<OSTMetadataRecord> _container(const OSTContainerReference& container);
+    [[nodiscard]] static OSTResult<void> _changeInfo(const OSTMetadata& record, OSTDictionary info);
+    [[nodiscard]] static OSTResult<MovedContainer> _moveToNewUUID(const OSTContainerReference& container);
 
     // +Replacement
     struct ReplaceOperation;

@@ -39,10 +39,14 @@ struct LockTable {
     std::int32_t identifierReaderCount = 0; ///< identifier locks held or being acquired for reading
     std::int32_t identifierWriterCount = 0; ///< identifier locks held or being acquired for writing
     std::int32_t allReaderWriterState = 0;  ///< 0 free, -1 held for writing, n > 0 held by n readers
-    std::int32_t allWritersWaiting = 0;
+    std::uint64_t allWriterTurns = 0;       ///< how often it was taken for writing
 };
 
 LockTable gOSTLocks OST_GUARDED_BY(tableMutex);
+
+/// How many wait to take the all-identifiers lock for writing. Written under the mutex; one who holds an identifier
+/// lock looks without it.
+std::atomic<std::int32_t> allWritersWaiting{0};
 
 /// The all-identifiers lock is not re-entrant: remembering what the thread holds turns a deadlock into an assertion.
 thread_local std::optional<OSTLockKind> heldOfAllIdentifiers;
@@ -110,7 +114,7 @@ bool noIdentifierLocks() OST_REQUIRES(tableMutex) {
 /// Look-ups follow each other so closely that a writer who waited for a moment without readers might wait for ever:
 /// while readers are all that one waits for, no further reader joins them.
 bool writerComesFirst() OST_REQUIRES(tableMutex) {
-    return gOSTLocks.allWritersWaiting > 0 && gOSTLocks.allReaderWriterState > 0 && noIdentifierLocks();
+    return allWritersWaiting > 0 && gOSTLocks.allReaderWriterState > 0 && noIdentifierLocks();
 }
 
 void acquire(LockRecord& record, OSTLockKind kind, std::source_location function) {
@@ -233,11 +237,12 @@ void _lock_all_identifiers(OSTLockKind kind) {
     platform::logDebug("Waiting to lock all identifiers for %s", nameOf(kind));
     platform::MutexLock lock(tableMutex);
     if (kind == OSTLockKind::writing) {
-        ++gOSTLocks.allWritersWaiting;
+        ++allWritersWaiting;
         wait(gOSTLocks.allWriterCondition, lock,
              []() OST_REQUIRES(tableMutex) { return noIdentifierLocks() && gOSTLocks.allReaderWriterState == 0; });
-        --gOSTLocks.allWritersWaiting;
+        --allWritersWaiting;
         gOSTLocks.allReaderWriterState = -1;
+        ++gOSTLocks.allWriterTurns;
     } else {
         wait(gOSTLocks.allReaderCondition, lock, []() OST_REQUIRES(tableMutex) {
             return gOSTLocks.identifierWriterCount == 0 && gOSTLocks.allReaderWriterState != -1 && !writerComesFirst();
@@ -271,6 +276,25 @@ void unlock_all_identifiers() {
         }
     }
     platform::logDebug("Unlocked all identifiers");
+}
+
+bool OSTGiveWayToAllIdentifiersWriter(const std::vector<std::string_view>& identifiers, OSTLockKind kind) {
+    if (allWritersWaiting.load(std::memory_order_relaxed) == 0)
+        return false;
+    std::uint64_t before = 0;
+    {
+        const platform::MutexLock lock(tableMutex);
+        before = gOSTLocks.allWriterTurns;
+    }
+    unlock_identifier(identifiers);
+    {
+        // Nobody stops waiting before his turn, and he tells readers when it is over.
+        platform::MutexLock lock(tableMutex);
+        wait(gOSTLocks.identifierReaderCondition, lock,
+             [&]() OST_REQUIRES(tableMutex) { return gOSTLocks.allWriterTurns != before; });
+    }
+    _lock_identifier(identifiers, kind);
+    return true;
 }
 
 bool OSTHoldsAllIdentifiersLock() { return heldOfAllIdentifiers == OSTLockKind::writing; }

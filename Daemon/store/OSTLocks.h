@@ -35,6 +35,10 @@ void _lock_all_identifiers(OSTLockKind kind);
 /// Releases the all-identifiers lock, of either kind.
 void unlock_all_identifiers();
 
+/// Releases the locks of these identifiers for the turn of one who waits to take the all-identifiers lock for writing.
+/// False, at the cost of a look, when nobody waits.
+[[nodiscard]] bool OSTGiveWayToAllIdentifiersWriter(const std::vector<std::string_view>& identifiers, OSTLockKind kind);
+
 /// Whether the calling thread holds the all-identifiers lock for writing.
 [[nodiscard]] bool OSTHoldsAllIdentifiersLock();
 
@@ -68,17 +72,24 @@ private:
 /// Holds the locks of some identifiers from construction to destruction.
 class OSTIdentifierLock {
 public:
-    OSTIdentifierLock(std::vector<std::string> identifiers, OSTLockKind kind) : _identifiers(std::move(identifiers)) {
+    /// Holds nothing when `useLocking` is false: the caller's caller holds the locks.
+    OSTIdentifierLock(std::vector<std::string> identifiers, OSTLockKind kind, bool useLocking = true)
+        : _identifiers(useLocking ? std::move(identifiers) : std::vector<std::string>()), _kind(kind) {
         _lock_identifier(_views(), kind);
     }
     OSTIdentifierLock(const OSTIdentifierLock&) = delete;
     OSTIdentifierLock& operator=(const OSTIdentifierLock&) = delete;
     ~OSTIdentifierLock() { unlock_identifier(_views()); }
 
+    /// For long work: when somebody waits for all identifiers, gives the locks back, lets him have his turn and takes
+    /// them again. Gives whether it did; what they guard may be another then.
+    [[nodiscard]] bool giveWay() { return OSTGiveWayToAllIdentifiersWriter(_views(), _kind); }
+
 private:
     [[nodiscard]] std::vector<std::string_view> _views() const { return {_identifiers.begin(), _identifiers.end()}; }
 
     const std::vector<std::string> _identifiers;
+    const OSTLockKind _kind;
 };
 
 /// Forbids the calling thread to take any of these locks, from construction to destruction; giving one back stays
