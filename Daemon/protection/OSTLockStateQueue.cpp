@@ -3,6 +3,9 @@
 #include "platform/base/Immortal.h"
 #include "platform/base/Log.h"
 #include "platform/device/DeviceLockState.h"
+#include "platform/threads/Transactions.h"
+
+#include <mutex>
 
 namespace ost {
 
@@ -11,18 +14,25 @@ platform::WorkQueue& OSTLockStateQueue() {
     return *queue;
 }
 
-void OSTLockStateFollower::brevind_notification_callback() {
+void brevind_notification_callback() {
+    static std::mutex mutex;
+    static bool isSuspended = false; // guarded by the mutex, as is the order of looking and acting
+    const std::lock_guard lock(mutex);
     const auto state = platform::deviceLockState();
     platform::logDebug("LockState=%d", state);
-    if (state == static_cast<std::int64_t>(State::locked)) {
-        if (_remembered != State::locked)
-            OSTLockStateQueue().suspend();
-        _remembered = State::locked;
-    } else if (state == static_cast<std::int64_t>(State::unlocked)) {
-        if (_remembered == State::locked)
-            OSTLockStateQueue().resume();
-        _remembered = State::unlocked;
+    if (state == platform::deviceLocked && !isSuspended) {
+        OSTLockStateQueue().suspend();
+        isSuspended = true;
+    } else if (state == platform::deviceUnlocked && isSuspended) {
+        OSTLockStateQueue().resume();
+        isSuspended = false;
     }
+}
+
+void run_when_unlocked(platform::WorkQueue::Work work) {
+    // The notification of a lock that the caller has just met may still be on its way.
+    brevind_notification_callback();
+    async_with_transaction(OSTLockStateQueue(), std::move(work));
 }
 
 } // namespace ost

@@ -2,26 +2,17 @@
 
 #include "platform/threads/WorkQueue.h"
 
-#include <cstdint>
-
 namespace ost {
 
 /// The serial queue of data-protection changes that wait until the device is unlocked. Suspended while it is locked.
 [[nodiscard]] platform::WorkQueue& OSTLockStateQueue();
 
-/// Keeps the lock-state queue in step with the device: suspends it once when the device is locked and resumes it once
-/// when it is unlocked, however often either is reported.
-///
-/// Threads: the main thread alone.
-class OSTLockStateFollower {
-public:
-    /// Acts on the device's current lock state.
-    void brevind_notification_callback();
+/// Brings the lock-state queue in step with the device's lock state as it is now: suspends it once when the device is
+/// locked and resumes it once when it is unlocked, however often either is reported. Threads: any.
+void brevind_notification_callback();
 
-private:
-    enum class State : std::int64_t { unlocked = 0, locked = 1, none = 3 };
-
-    State _remembered = State::none; ///< the last state acted upon
-};
+/// Opens a transaction and runs `work` on the lock-state queue as soon as the device is unlocked, after what came
+/// before.
+void run_when_unlocked(platform::WorkQueue::Work work);
 
 } // namespace ost

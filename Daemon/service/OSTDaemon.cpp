@@ -10,6 +10,7 @@
 #include "platform/device/DeviceCapabilities.h"
 #include "platform/device/NamedSemaphore.h"
 #include "platform/threads/Transactions.h"
+#include "protection/OSTLockStateQueue.h"
 #include "service/OSTRequestDispatcher.h"
 #include "store/OSTClientConnection.h"
 #include "upcall/OSTKernServer.h"
@@ -134,14 +135,14 @@ bool OSTDaemon::_startRunLoop() {
 }
 
 void OSTDaemon::_followLockState() {
-    const auto follow = [this] { _lockStateFollower.brevind_notification_callback(); };
-    auto notification = platform::DeviceLockStateNotification::registerHandler(*_runLoop, follow);
+    auto notification =
+        platform::DeviceLockStateNotification::registerHandler(*_runLoop, brevind_notification_callback);
     if (notification)
         _lockStateNotification = *std::move(notification);
     else
         logAs(LogLevel::error, "main", "Failed to register for notification %s: %d", lockStateNotificationName,
               notification.error());
-    follow();
+    brevind_notification_callback();
 }
 
 void OSTDaemon::_startListener() {

@@ -5,7 +5,6 @@
 #include "platform/ipc/IPCListener.h"
 #include "platform/ipc/UpcallPort.h"
 #include "platform/threads/RunLoop.h"
-#include "protection/OSTLockStateQueue.h"
 
 #include <memory>
 #include <optional>
@@ -44,7 +43,6 @@ private:
     platform::FileDescriptor _signals;
     platform::RunLoop::Source _signalSource;
     std::unique_ptr<platform::UpcallPort> _upcallPort;
-    OSTLockStateFollower _lockStateFollower;
     std::optional<platform::DeviceLockStateNotification> _lockStateNotification;
     std::unique_ptr<platform::IPCListener> _listener;
 };

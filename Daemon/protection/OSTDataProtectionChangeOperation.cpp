@@ -1,0 +1,102 @@
+#include "protection/OSTDataProtectionChangeOperation.h"
+
+#include "model/OSTFailureReport.h"
+#include "platform/base/Log.h"
+#include "platform/device/DeviceLockState.h"
+#include "platform/threads/BlockingSection.h"
+#include "protection/OSTDataProtectionPass.h"
+#include "protection/OSTLockStateQueue.h"
+
+#include <cerrno>
+#include <utility>
+
+namespace ost {
+
+namespace {
+
+std::optional<OSTItemIdentity> identityOf(const OSTMetadata& metadata) {
+    const auto identity = OSTFileManager::defaultManager().identityOfItemAtURL(metadata.url);
+    return identity ? std::optional(*identity) : std::nullopt;
+}
+
+} // namespace
+
+std::shared_ptr<OSTDataProtectionChangeOperation>
+OSTDataProtectionChangeOperation::withChange(OSTDataProtectionChange change) {
+    return std::shared_ptr<OSTDataProtectionChangeOperation>(new OSTDataProtectionChangeOperation(std::move(change)));
+}
+
+OSTDataProtectionChangeOperation::OSTDataProtectionChangeOperation(OSTDataProtectionChange change)
+    : _change(std::move(change)), _directory(identityOf(*_change.dataContainerMetadata)) {}
+
+void OSTDataProtectionChangeOperation::performChangeOperation() {
+    const auto& metadata = *_change.dataContainerMetadata;
+    const auto pass = _runChangeOperationNeedToRetry();
+    if (!pass) {
+        platform::logNotice("Operation to update protection classes for user: %u, id: %@, containerClass: %llu to "
+                            "class %d failed with error %@",
+                            metadata.uid, metadata.identifier, metadata.containerClass, _change.newDataProtectionClass,
+                            pass.error());
+        return _complete(false, &pass.error());
+    }
+    const auto& lockedError = *pass;
+    if (!lockedError)
+        return _complete(false, nullptr);
+    if (_change.retryIfLocked)
+        return _parkUntilUnlocked();
+    const auto error =
+        OSTCreateError(OSTErrorCode::lockedWithoutRetry, *lockedError,
+                       "Tried to update user: %u, id: %@, containerClass: %llu to protection class "
+                       "%d, but was locked and didn't retry",
+                       metadata.uid, metadata.identifier, metadata.containerClass, _change.newDataProtectionClass);
+    _complete(true, &error);
+}
+
+OSTResult<OSTDataProtectionChangeOperation::LockedError>
+OSTDataProtectionChangeOperation::_runChangeOperationNeedToRetry() const {
+    return OSTGuarded([&]() -> OSTResult<LockedError> {
+        const platform::BlockingSection blocking;
+        auto lockedError = OST_TRY(_changeItems());
+        // The class is recorded next, and what is recorded has happened.
+        if (!lockedError)
+            OST_TRY(OSTFileManager::defaultManager().makeFileSystemDurable(_change.dataContainerMetadata->url));
+        return lockedError;
+    });
+}
+
+OSTResult<OSTDataProtectionChangeOperation::LockedError> OSTDataProtectionChangeOperation::_changeItems() const {
+    std::string refusedItem;
+    for (;;) {
+        OSTDataProtectionPass pass(_change, _directory);
+        auto ended = pass.run();
+        if (ended)
+            return std::nullopt;
+        if (!ended.error().isPOSIX(EPERM))
+            return std::unexpected(ended.error());
+        if (platform::deviceLockState() == platform::deviceLocked)
+            return ended.error();
+        // The device may have been locked for a moment only. An item that is refused without that is immutable.
+        if (pass.failedItem() == refusedItem)
+            return std::unexpected(ended.error());
+        refusedItem = pass.failedItem();
+    }
+}
+
+void OSTDataProtectionChangeOperation::_parkUntilUnlocked() {
+    const auto& metadata = *_change.dataContainerMetadata;
+    platform::logNotice("Retrying container protection update to %d on next unlock for user: %u, id: %@, "
+                        "containerClass: %llu",
+                        _change.newDataProtectionClass, metadata.uid, metadata.identifier, metadata.containerClass);
+    run_when_unlocked([self = shared_from_this()] {
+        if (!std::exchange(self->_retried, true) && self->_retryStartBlock)
+            self->_retryStartBlock();
+        self->performChangeOperation();
+    });
+}
+
+void OSTDataProtectionChangeOperation::_complete(bool wasLocked, const OSTError* error) {
+    if (_completionBlock)
+        _completionBlock(wasLocked, error);
+}
+
+} // namespace ost
