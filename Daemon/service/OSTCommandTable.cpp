@@ -1,6 +1,7 @@
 #include "service/OSTCommandTable.h"
 
 #include "Protocol/OSTEntitlements.h"
+#include "service/OSTAttributeCommands.h"
 #include "service/OSTCodeSigningCommands.h"
 #include "service/OSTContainerCommands.h"
 #include "service/OSTRemovalCommands.h"
@@ -25,11 +26,11 @@ const std::array<OSTCommandEntry, OSTCommandCount> OSTCommandTable = {{
     {replace, OSTReplaceCommand, allowed, dispatcher},
     {stageForDelete, OSTStageForDeleteCommand, allowed, dispatcher},
     {destroyDeathRow, OSTDestroyDeathRowCommand, allowed, handler},
-    {setInfoValue, nullptr, allowed, dispatcher},
-    {infoValue, nullptr, allowed, dispatcher},
-    {metadata, nullptr, allowed, dispatcher},
-    {recreateDefaultStructure, nullptr, allowed, dispatcher},
-    {regenerateDirectoryUUID, nullptr, allowed, dispatcher},
+    {setInfoValue, OSTSetInfoValueCommand, allowed, dispatcher},
+    {infoValue, OSTInfoValueCommand, allowed, dispatcher},
+    {metadata, OSTMetadataCommand, allowed, dispatcher},
+    {recreateDefaultStructure, OSTRecreateDefaultStructureCommand, allowed, dispatcher},
+    {regenerateDirectoryUUID, OSTRegenerateDirectoryUUIDCommand, allowed, dispatcher},
     {deleteContainer, OSTDeleteCommand, allowed, dispatcher},
     {wipePlugInData, nullptr, wipeContainer, dispatcher},
     {wipeData, nullptr, allowed, dispatcher},
@@ -41,8 +42,8 @@ const std::array<OSTCommandEntry, OSTCommandCount> OSTCommandTable = {{
     {registerCodeSigning, OSTRegisterCodeSigningCommand, allowed, dispatcher},
     {codeSigningInfo, OSTCodeSigningInfoCommand, allowed, dispatcher},
     {invalidateCodeSigning, OSTInvalidateCodeSigningCommand, allowed, dispatcher},
-    {setDataProtection, nullptr, allowed, handler},
-    {recreateDefaultStructureAgain, nullptr, allowed, dispatcher},
+    {setDataProtection, OSTSetDataProtectionCommand, allowed, handler},
+    {recreateDefaultStructureAgain, OSTRecreateDefaultStructureCommand, allowed, dispatcher},
     {diskUsage, nullptr, allowed, dispatcher},
     {performDataMigration, nullptr, dataMigration, dispatcher},
     {retryTest, nullptr, allowed, dispatcher},

@@ -1,5 +1,6 @@
 #include "EndToEnd/Wire.h"
 
+#include "platform/codec/IPCValue.h"
 #include "platform/device/CodeSignature.h"
 #include "platform/ipc/IPCFrame.h"
 #include "support/BootedDevice.h"
@@ -128,6 +129,11 @@ std::string Reply::text(std::string_view key) const {
 bool Reply::truth(std::string_view key) const {
     const auto value = _root().find(key);
     return value && value->asBoolean().value_or(false);
+}
+
+std::optional<OSTValue> Reply::value(std::string_view key) const {
+    const auto value = _root().find(key);
+    return value ? platform::propertyListValue(*value) : std::nullopt;
 }
 
 platform::UUID Reply::uuid(std::string_view key) const {

@@ -49,6 +49,8 @@ public:
     [[nodiscard]] std::uint64_t error() const;
     [[nodiscard]] std::string text(std::string_view key) const;
     [[nodiscard]] bool truth(std::string_view key) const;
+    /// As a property-list value; none when the reply has no such key.
+    [[nodiscard]] std::optional<OSTValue> value(std::string_view key) const;
     [[nodiscard]] platform::UUID uuid(std::string_view key) const;
     [[nodiscard]] std::vector<std::string> texts(std::string_view key) const;
     [[nodiscard]] std::vector<platform::UUID> uuids(std::string_view key) const;

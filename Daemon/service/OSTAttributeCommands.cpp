@@ -1,0 +1,101 @@
+#include "service/OSTAttributeCommands.h"
+
+#include "Protocol/OSTKeys.h"
+#include "platform/base/Log.h"
+#include "platform/codec/IPCValue.h"
+#include "protection/OSTDataProtectionManager.h"
+#include "service/OSTRequestReaders.h"
+
+#include <utility>
+
+namespace ost {
+
+namespace {
+
+/// The container that a request names, its user resolved for the client.
+std::expected<OSTContainerReference, OSTErrorCode> containerOf(const platform::IPCRequest& request,
+                                                               const OSTClientConnection& client) {
+    const auto place = OST_TRY(OSTRequestedPlace(request, client));
+    return OSTContainerReference{.name = {.userId = place.userId,
+                                          .containerClass = place.containerClass,
+                                          .identifier = request.stringValue(requestKey::identifier)},
+                                 .uuid = request.uuidValue(requestKey::container.uuid)};
+}
+
+/// The info value of a request; none when it has none.
+std::expected<std::optional<OSTValue>, OSTErrorCode> infoValueOf(const platform::IPCRequest& request) {
+    const auto item = request.item(requestKey::infoValue);
+    if (!item)
+        return std::nullopt;
+    auto value = platform::propertyListValue(*item);
+    if (!value) {
+        // To take it for a missing one would remove what is stored.
+        platform::logAs(platform::LogLevel::error, "setInfoValue", "Value of %@ is no property-list value",
+                        requestKey::infoValue);
+        return std::unexpected(OSTErrorCode::invalidParameter);
+    }
+    return value;
+}
+
+} // namespace
+
+OSTCommandResult OSTSetInfoValueCommand(const platform::IPCRequest& request, platform::IPCReply& /*reply*/,
+                                        OSTClientConnection& client) {
+    const auto container = OST_TRY(containerOf(request, client));
+    const auto value = OST_TRY(infoValueOf(request));
+    return client.setInfoValue(value, request.stringValue(requestKey::infoKey), container);
+}
+
+OSTCommandResult OSTInfoValueCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
+                                     OSTClientConnection& client) {
+    const auto container = OST_TRY(containerOf(request, client));
+    const auto value = OST_TRY(client.infoValueForKey(request.stringValue(requestKey::infoKey), container));
+    auto encoder = reply.encoder(replyKey::infoValue);
+    platform::encodePropertyListValue(encoder, value);
+    return {};
+}
+
+OSTCommandResult OSTMetadataCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
+                                    OSTClientConnection& client) {
+    const auto container = OST_TRY(containerOf(request, client));
+    const auto record = OST_TRY(client.metadataForUser(container));
+    reply.set(replyKey::path, record->url);
+    reply.set(replyKey::transient, record->transient);
+    if (request.booleanValue(requestKey::infoDictRequested) && record->info) {
+        auto encoder = reply.encoder(replyKey::infoDictionary);
+        platform::encodePropertyListValue(encoder, *record->info);
+    }
+    return {};
+}
+
+OSTCommandResult OSTRecreateDefaultStructureCommand(const platform::IPCRequest& request, platform::IPCReply& /*reply*/,
+                                                    OSTClientConnection& client) {
+    return client.recreateDefaultStructureForUser(OST_TRY(containerOf(request, client)));
+}
+
+OSTCommandResult OSTRegenerateDirectoryUUIDCommand(const platform::IPCRequest& request, platform::IPCReply& /*reply*/,
+                                                   OSTClientConnection& client) {
+    return client.regenerateDirectoryUUIDForUser(OST_TRY(containerOf(request, client)));
+}
+
+OSTCommandResult OSTSetDataProtectionCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
+                                             OSTClientConnection& client) {
+    auto answer = [reply = std::move(reply)](OSTErrorCode code) mutable {
+        reply.set(replyKey::error, static_cast<std::uint64_t>(code));
+        reply.send();
+    };
+    const auto container = containerOf(request, client);
+    if (!container) {
+        answer(container.error());
+        return {};
+    }
+    OSTDataProtectionManager::defaultManager().setDataProtectionOnDataContainerForUser(
+        {.container = container->name,
+         .dataProtectionClass = static_cast<std::int32_t>(request.signedValue(requestKey::dataProtectionClass)),
+         .isSecondOrThirdPartyApp = request.booleanValue(requestKey::isThirdParty),
+         .retryIfLocked = request.booleanValue(requestKey::retryIfLocked)},
+        std::move(answer));
+    return {};
+}
+
+} // namespace ost

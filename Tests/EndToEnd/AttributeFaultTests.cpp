@@ -1,0 +1,180 @@
+#include "Client/Attributes.h"
+#include "EndToEnd/GatedDevice.h"
+#include "EndToEnd/StoreView.h"
+#include "model/OSTMetadata.h"
+#include "support/DeviceTest.h"
+
+#include <gtest/gtest.h>
+
+#include <sys/xattr.h>
+
+#include <cerrno>
+#include <filesystem>
+#include <set>
+#include <string>
+
+using namespace ost::test;
+using ost::OSTValue;
+using ostrand::Connection;
+
+namespace {
+
+namespace fs = std::filesystem;
+
+constexpr const char* classDirectory = "/private/var/mobile/Containers/Data/Application";
+
+/// A daemon whose file-system calls fail or kill it while it changes what one container carries.
+class AttributeFaultTest : public GatedDeviceTest {
+protected:
+    void SetUp() override {
+        GatedDeviceTest::SetUp();
+        if (IsSkipped())
+            return;
+        ASSERT_TRUE(device().waitForFirstPass());
+        auto connection = device().connect();
+        const auto made = ostrand::createOrLookup(
+            connection, {.containerClass = ostrand::ContainerClass::dataApplication, .user = 501, .identifier = "a"},
+            ostrand::WhenMissing::create);
+        ASSERT_TRUE(made);
+        container = {ostrand::ContainerClass::dataApplication, 501, "a", made->uuid};
+    }
+
+    /// Has the fault befall one call after the other of what `act` asks of the daemon, until it comes to none. `check`
+    /// gets what `act` answered, and a connection to a daemon that serves.
+    void atEveryCall(Fault::Kind kind, const auto& act, const auto& check) {
+        for (unsigned call = 1; !HasFailure(); ++call) {
+            auto connection = device().connect();
+            ASSERT_TRUE(ostrand::metadata(connection, container));
+            device().daemon().prepare({.kind = kind, .call = call, .error = EIO});
+            const auto answer = act(connection);
+            const auto course = device().daemon().conclude();
+            SCOPED_TRACE("fault at call " + std::to_string(call) + ", " + course.faultedCall);
+            if (kind == Fault::Kind::kill && !course.faultedCall.empty()) {
+                device().startDaemon();
+                ASSERT_TRUE(device().waitForFirstPass());
+            }
+            auto again = device().connect();
+            EXPECT_EQ(listedContainers(again, container.containerClass, false),
+                      containersOnDisk(device().onHost(classDirectory)));
+            check(again, answer);
+            EXPECT_EQ(leftovers(device().image()), std::vector<std::string>());
+            if (course.faultedCall.empty()) {
+                EXPECT_TRUE(answer);
+                return;
+            }
+        }
+    }
+
+    [[nodiscard]] std::string valueAnswered(Connection& connection, const std::string& key) const {
+        const auto value = ostrand::infoValue(connection, container, key);
+        return value ? value->description() : value.error() == ostrand::Error::failed(24) ? "none" : "no answer";
+    }
+    [[nodiscard]] std::string valueOnDisk(const std::string& key) {
+        const auto url = device().onHost(classDirectory) / namesIn(device().onHost(classDirectory)).at(0);
+        const auto read = ost::OSTMetadata::readAndValidateMetadataAtUrl(url.native(), 501, ost::OSTCheckClassPath::no);
+        const auto* const value = read && read->info ? read->info->find(key) : nullptr;
+        return value ? value->description() : read ? "none" : "no file";
+    }
+
+    ostrand::ContainerReference container;
+};
+
+/// A setter that gives a key another number each time.
+class Setter {
+public:
+    explicit Setter(const ostrand::ContainerReference& container) : _container(container) {}
+
+    ostrand::Result<void> operator()(Connection& connection) {
+        before = current;
+        current = std::to_string(++_number);
+        return ostrand::setInfoValue(connection, _container, "k", OSTValue(_number));
+    }
+    std::string before = "none", current = "none";
+
+private:
+    const ostrand::ContainerReference& _container;
+    std::uint64_t _number = 0;
+};
+
+} // namespace
+
+TEST_F(AttributeFaultTest, AKillAtAnyMomentOfASetLeavesTheOldValueOrTheNew) {
+    Setter set(container);
+    std::set<bool> isNew;
+    atEveryCall(
+        Fault::Kind::kill, [&](auto& connection) { return set(connection); },
+        [&](auto& connection, const auto& answer) {
+            const auto value = valueAnswered(connection, "k");
+            EXPECT_TRUE(value == set.current || (value == set.before && !answer)) << value;
+            EXPECT_EQ(valueOnDisk("k"), value);
+            isNew.insert(value == set.current);
+            set.current = value;
+        });
+    EXPECT_EQ((std::set{false, true}), isNew);
+}
+
+TEST_F(AttributeFaultTest, ASetThatFailsChangesNeitherFileNorMemory) {
+    Setter set(container);
+    atEveryCall(
+        Fault::Kind::fail, [&](auto& connection) { return set(connection); },
+        [&](auto& connection, const auto& answer) {
+            EXPECT_TRUE(answer || answer.error() == ostrand::Error::refused() ||
+                        answer.error() == ostrand::Error::failed(34) || answer.error() == ostrand::Error::failed(21))
+                << answer.error().description();
+            const auto value = valueAnswered(connection, "k");
+            EXPECT_EQ(value, answer ? set.current : set.before);
+            EXPECT_EQ(valueOnDisk("k"), value);
+            set.current = value;
+        });
+}
+
+TEST_F(AttributeFaultTest, AKillAtAnyMomentOfARegenerationLeavesOneContainerWithItsUUID) {
+    std::set<bool> isRenamed;
+    auto before = namesIn(device().onHost(classDirectory));
+    atEveryCall(
+        Fault::Kind::kill, [&](auto& connection) { return ostrand::regenerateDirectoryUUID(connection, container); },
+        [&](auto& connection, const auto& answer) {
+            const auto now = namesIn(device().onHost(classDirectory));
+            const auto found = ostrand::metadata(connection, container);
+            ASSERT_TRUE(found);
+            EXPECT_EQ(std::vector<std::string>{fs::path(found->path).filename()}, now);
+            EXPECT_TRUE(!answer || now != before);
+            isRenamed.insert(now != before);
+            before = now;
+        });
+    EXPECT_EQ((std::set{false, true}), isRenamed);
+}
+
+TEST_F(AttributeFaultTest, AKillAtAnyMomentOfAClassChangeLeavesEveryItemAndTheRecordOldOrNew) {
+    const auto url = device().onHost(classDirectory) / namesIn(device().onHost(classDirectory)).at(0);
+    for (const auto* const name : {"Documents/a", "tmp/b"})
+        writeFile(url / name, "");
+    const auto classOf = [&](const char* item) {
+        char text[16];
+        const auto size = ::lgetxattr((url / item).c_str(), "trusted.ostrand.protection-class", text, sizeof text);
+        return std::string(text, size < 0 ? 0 : static_cast<std::size_t>(size));
+    };
+    // Lowers and raises in turn, so that each change has something to do; files are only ever lowered, once.
+    int number = 0;
+    std::string before = "3", current;
+    atEveryCall(
+        Fault::Kind::kill,
+        [&](auto& connection) {
+            current = before == "1" ? "3" : "1";
+            number = std::stoi(current);
+            return ostrand::setDataProtection(connection, {.user = 501, .identifier = "a", .protectionClass = number});
+        },
+        [&](auto& connection, const auto& answer) {
+            const auto answered = valueAnswered(connection, ostrand::protectionClassKey);
+            const auto now = answered == "none" ? "3" : answered;
+            EXPECT_TRUE(now == current || (now == before && !answer)) << now;
+            for (const auto* const directory : {"Documents", "Library/Caches", "tmp"}) {
+                const auto has = classOf(directory);
+                EXPECT_TRUE(now == current ? has == current : has.empty() || has == "1" || has == "3")
+                    << directory << " " << has;
+            }
+            for (const auto* const file : {"Documents/a", "tmp/b"})
+                EXPECT_TRUE(classOf(file).empty() || classOf(file) == "1") << file;
+            before = now;
+        });
+}
