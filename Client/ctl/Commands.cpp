@@ -14,7 +14,8 @@ const CommandTable& commandTable() {
                         {"json", "", "print one JSON object instead of text for people"}},
             .commands = {},
         };
-        for (const auto part : {containerCommands, codeSigningCommands, signingCommands, deviceCommands})
+        for (const auto part : {containerCommands, attributeCommands, protectionCommands, codeSigningCommands,
+                                signingCommands, deviceCommands})
             std::ranges::move(part(), std::back_inserter(all.commands));
         return all;
     }();

@@ -11,6 +11,8 @@ namespace ostrand::ctl {
 
 /// The rows of the command table, by what they are about.
 [[nodiscard]] std::vector<Command> containerCommands();
+[[nodiscard]] std::vector<Command> attributeCommands();
+[[nodiscard]] std::vector<Command> protectionCommands();
 [[nodiscard]] std::vector<Command> codeSigningCommands();
 [[nodiscard]] std::vector<Command> signingCommands();
 [[nodiscard]] std::vector<Command> deviceCommands();

@@ -1,5 +1,6 @@
 #include "Client/Containers.h"
 #include "Client/ctl/Commands.h"
+#include "Client/ctl/ContainerArguments.h"
 #include "Client/ctl/Values.h"
 #include "platform/base/Try.h"
 
@@ -11,11 +12,7 @@ namespace ostrand::ctl {
 
 namespace {
 
-constexpr Option classOption{"class", "C", "the container class: 1 to 13, or its name, such as Data/Application",
-                             Option::Count::required};
-constexpr Option userOption{"user", "U", "the user: a number, or the name of one of the device's accounts"};
 constexpr Option identifierOption{"identifier", "ID", "the container's identifier; without it, the program's own"};
-constexpr Option transientOption{"transient", "", "ask for a transient container"};
 constexpr Operand identifierOperand{"ID", "another way to give the identifier", Operand::Count::optional};
 constexpr Operand identifierOperands{"ID", "the containers' identifiers", Operand::Count::several};
 constexpr Option oldOption{"old", "ID", "the container that goes; without it, the new one is moved to a free place"};
@@ -23,24 +20,6 @@ constexpr Option newOption{"new", "ID", "the container that takes its place", Op
 constexpr Option newTransientOption{"new-transient", "", "the new container is a transient one"};
 constexpr Option oldUUIDOption{"old-uuid", "UUID", "the old container's UUID; else found by listing the live ones"};
 constexpr Option newUUIDOption{"new-uuid", "UUID", "the new container's UUID; else found by listing"};
-
-constexpr std::string_view classesAndUsers =
-    "Classes:\n"
-    "   1 Bundle/Application      2 Data/Application      3 Bundle/LoomworkPlugin\n"
-    "   4 Data/LoomworkPlugin     5 Bundle/VPNPlugin      6 Data/VPNPlugin\n"
-    "   7 Shared/AppGroup         8 Bundle/Framework      9 Data/VexelService\n"
-    "  10 Data/InternalDaemon    11 Data/TempDir         12 Data/System\n"
-    "  13 Shared/SystemGroup\n"
-    "Without --user, bundles belong to user 33, system containers to 499 and all others to the current user (1).";
-
-std::expected<ContainerClass, Failure> classOf(const Arguments& arguments) {
-    return classNamed(*arguments.value(classOption.name));
-}
-
-std::expected<std::uint64_t, Failure> userOf(const Arguments& arguments, ContainerClass containerClass) {
-    const auto text = arguments.value(userOption.name);
-    return text ? userNamed(*text, deviceDirectory(arguments)) : usualUserOf(containerClass);
-}
 
 std::expected<ContainerRequest, Failure> containerRequestOf(const Arguments& arguments) {
     if (arguments.has(identifierOption.name) && arguments.has(identifierOperand.name))
@@ -57,24 +36,6 @@ ost::OSTDictionary jsonOf(const std::string& identifier, const std::string& uuid
     json.set("identifier", identifier);
     json.set("uuid", uuid);
     return json;
-}
-
-/// The containers of these identifiers, found by listing, because a look-up would throw a transient one away.
-std::expected<std::vector<ContainerReference>, Failure>
-listedContainers(Connection& connection, const ContainerRequest& about, const std::vector<std::string>& identifiers) {
-    constexpr std::uint64_t noSuchContainer = 21;
-    const auto listed = OST_TRY(orFailure(ostrand::list(connection, about)));
-    std::vector<ContainerReference> containers;
-    for (const auto& identifier : identifiers) {
-        const auto found = std::ranges::find(listed, identifier, &ListedContainer::identifier);
-        if (found == listed.end()) {
-            auto failure = Failure::of(Error::failed(noSuchContainer));
-            failure.message += ": " + escaped(identifier);
-            return std::unexpected(std::move(failure));
-        }
-        containers.push_back({about.containerClass, about.user, identifier, found->uuid});
-    }
-    return containers;
 }
 
 Outcome createOrLookup(const Arguments& arguments, WhenMissing whenMissing) {

@@ -55,6 +55,14 @@ std::expected<std::string, Failure> contentOf(const std::string& path, std::size
     return content;
 }
 
+std::expected<ost::OSTValue, Failure> propertyListIn(const std::string& path, std::size_t largest, const char* kind) {
+    const auto content = OST_TRY(contentOf(path, largest));
+    auto value = ost::platform::parsePropertyList(content, {.depth = deepestValue, .objectCount = content.size()});
+    if (!value)
+        return std::unexpected(Failure::local(escaped(path) + " is no " + kind + ": " + escaped(value.error().reason)));
+    return *std::move(value);
+}
+
 } // namespace
 
 std::expected<ContainerClass, Failure> classNamed(const std::string& text) {
@@ -78,14 +86,16 @@ std::expected<std::uint64_t, Failure> userNamed(const std::string& text, const s
     return std::unexpected(Failure::usage("the device has no account \"" + escaped(text) + "\""));
 }
 
+std::expected<ost::OSTValue, Failure> propertyListIn(const std::string& path) {
+    return propertyListIn(path, largestPropertyList, "property list");
+}
+
 std::expected<ost::OSTDictionary, Failure> dictionaryIn(const std::string& path, std::size_t largest) {
-    const auto content = OST_TRY(contentOf(path, largest));
-    const auto value =
-        ost::platform::parsePropertyList(content, {.depth = deepestValue, .objectCount = content.size()});
-    if (!value || !value->asDictionary())
-        return std::unexpected(Failure::local(escaped(path) + " is no property-list dictionary" +
-                                              (value ? "" : ": " + escaped(value.error().reason))));
-    return *value->asDictionary();
+    constexpr const char* kind = "property-list dictionary";
+    const auto value = OST_TRY(propertyListIn(path, largest, kind));
+    if (!value.asDictionary())
+        return std::unexpected(Failure::local(escaped(path) + " is no " + kind));
+    return *value.asDictionary();
 }
 
 } // namespace ostrand::ctl

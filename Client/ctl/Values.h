@@ -21,7 +21,9 @@ namespace ostrand::ctl {
 /// The largest property list that is read for a request: XML is longer than what becomes of it.
 inline constexpr std::size_t largestPropertyList = std::size_t{64} << 20U;
 
-/// The dictionary in a property-list file of either encoding; "-" is standard input.
+/// The value in a property-list file of either encoding; "-" is standard input.
+[[nodiscard]] std::expected<ost::OSTValue, Failure> propertyListIn(const std::string& path);
+/// The same, which must be a dictionary.
 [[nodiscard]] std::expected<ost::OSTDictionary, Failure> dictionaryIn(const std::string& path,
                                                                       std::size_t largest = largestPropertyList);
 

@@ -120,6 +120,52 @@ TEST_F(CommandLine, deletesStagesDestroysAndReplacesContainers) {
     EXPECT_TRUE(ostrandctl({"purge", "--json"}).output.starts_with("{\"seconds\": "));
 }
 
+TEST_F(CommandLine, showsAndChangesWhatAContainerCarries) {
+    const auto made = ostrandctl({"create", "--class", "2", "com.example.a"});
+    const auto with = [](std::vector<std::string> words, const std::vector<std::string>& more = {}) {
+        words.insert(words.end(), {"--class", "2", "com.example.a"});
+        words.insert(words.end(), more.begin(), more.end());
+        return words;
+    };
+    const auto file = scratch / "plist";
+    writeFile(file, "<plist version=\"1.0\"><array><integer>-1</integer></array></plist>");
+    const struct {
+        std::vector<std::string> value;
+        std::string shown;
+    } rows[] = {
+        {{R"({"a": [1, true, "\u00e4"]})"}, R"({"k": {"a": [1, true, "ä"]}})"},
+        {{"--string", "1"}, R"({"k": "1"})"},
+        {{"--integer", "-5"}, R"({"k": -5})"},
+        {{"--boolean", "true"}, R"({"k": true})"},
+        {{"--data", "00ff"}, R"({"k": "00ff"})"},
+        {{"--date", "1970-01-01T00:00:10Z"}, R"({"k": 10})"},
+        {{"--plist", file}, R"({"k": [-1]})"},
+    };
+    for (const auto& [value, shown] : rows) {
+        auto words = with({"info", "set"}, {"k"});
+        words.insert(words.end(), value.begin(), value.end());
+        const auto set = ostrandctl(words);
+        EXPECT_EQ(set.status, 0) << set.errors;
+        EXPECT_EQ(ostrandctl(with({"info", "get", "--json"}, {"k"})).output, shown + "\n");
+    }
+    EXPECT_EQ(ostrandctl(with({"info", "set"}, {"k"})).status, 2);
+    EXPECT_EQ(ostrandctl(with({"info", "set", "--string", "x"}, {"k", "1"})).status, 2);
+    EXPECT_EQ(ostrandctl(with({"info", "set"}, {"k", "null"})).status, 2);
+
+    const auto shown = ostrandctl(with({"show"})).output;
+    for (const auto* const name : {"identifier", "uuid", "path"})
+        EXPECT_EQ(field(shown, name), field(made.output, name));
+    EXPECT_EQ(field(shown, "protection"), "never set (counts as 3)");
+    EXPECT_EQ(ostrandctl({"protect", "--class", "1", "com.example.a"}).output,
+              "com.example.a has protection class 1\n");
+    EXPECT_EQ(field(ostrandctl(with({"show"})).output, "protection"), "1");
+    EXPECT_EQ(ostrandctl(with({"info", "remove"}, {"k"})).status, 0);
+    EXPECT_EQ(ostrandctl(with({"info", "list"})).output, "com.tamarok.Tessaly.ContentProtectionClass 1\n");
+    EXPECT_EQ(ostrandctl(with({"restore-structure"})).status, 0);
+    const auto renamed = ostrandctl(with({"rename-directory"})).output;
+    EXPECT_EQ(renamed.substr(renamed.find('\n') + 1), field(ostrandctl(with({"show"})).output, "path") + "\n");
+}
+
 TEST_F(CommandLine, saysHowARequestFailedAndLeavesTheDeviceAlone) {
     const struct {
         std::string program;
@@ -137,6 +183,8 @@ TEST_F(CommandLine, saysHowARequestFailedAndLeavesTheDeviceAlone) {
         {signedProgram, {"delete", "--class", "2"}, 2, "no identifier given"},
         {signedProgram, {"replace", "--class", "2", "--new", "a", "--new-uuid", "x"}, 2, "\"x\" is no UUID"},
         {signedProgram, {"replace", "--class", "2", "--new", "a", "--old-uuid", "x"}, 2, "--old-uuid needs --old"},
+        {signedProgram, {"protect", "--class", "2", "com.example.b"}, 1, "error 21: no such container"},
+        {signedProgram, {"protect", "--class", "x", "com.example.b"}, 2, "\"x\" is no protection class"},
         {unsignedProgram, {"purge"}, 1, "the daemon refused the request"},
         {signedProgram, {"create", "com.example.b"}, 2, "missing --class C\nusage: ostrandctl "},
     };
