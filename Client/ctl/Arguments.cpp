@@ -36,8 +36,18 @@ std::string inUsage(const Operand& operand) {
         return name;
     case Operand::Count::several:
         return name + "...";
+    case Operand::Count::any:
+        return "[" + name + "...]";
     }
     return {};
+}
+
+bool mayRepeat(const Operand& operand) {
+    return operand.count == Operand::Count::several || operand.count == Operand::Count::any;
+}
+
+bool mayBeMissing(const Operand& operand) {
+    return operand.count == Operand::Count::optional || operand.count == Operand::Count::any;
 }
 
 /// What the usage line and the help of every level begin with.
@@ -154,7 +164,7 @@ private:
         if (!_command)
             return _takeCommandWord(word);
         if (_operandsSeen == _command->operands.size()) {
-            if (_operandsSeen == 0 || _command->operands.back().count != Operand::Count::several)
+            if (_operandsSeen == 0 || !mayRepeat(_command->operands.back()))
                 return "unexpected argument \"" + escaped(word) + "\"";
             --_operandsSeen;
         }
@@ -178,7 +188,7 @@ private:
         if (!_command)
             return _group.empty() ? "no command given" : "\"" + _group + "\" needs a further word";
         for (std::size_t i = _operandsSeen; i < _command->operands.size(); ++i)
-            if (_command->operands[i].count != Operand::Count::optional)
+            if (!mayBeMissing(_command->operands[i]))
                 return "missing " + std::string(_command->operands[i].name);
         for (const auto& option : _command->options)
             if (option.count == Option::Count::required && !_arguments.has(option.name))

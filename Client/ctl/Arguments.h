@@ -24,11 +24,11 @@ struct Option {
 
 /// One argument without a name.
 struct Operand {
-    enum class Count : std::uint8_t { optional, required, several };
+    enum class Count : std::uint8_t { optional, required, several, any };
 
     std::string_view name; ///< "FILE"
     std::string_view help;
-    Count count = Count::required; ///< several: one at least; only the last operand
+    Count count = Count::required; ///< several: one at least; it and any: only the last operand
 };
 
 /// What the user typed behind a command, checked against its options and operands.

@@ -4,6 +4,7 @@
 #include "platform/base/OSTValue.h"
 
 #include <expected>
+#include <optional>
 #include <string>
 #include <string_view>
 
@@ -13,6 +14,8 @@ namespace ostrand::ctl {
 struct Report {
     std::string text; ///< whole lines, already escaped
     ost::OSTDictionary json;
+    /// The exit status of a program that the command ran. Standard output is then the program's; nothing is added.
+    std::optional<int> exitStatus = std::nullopt;
 };
 
 /// Why a command did not do what it was asked.

@@ -23,6 +23,8 @@ void complain(const std::string& message, const std::string& usage = {}) {
 
 int printOutcome(const Invocation& invocation, const Outcome& outcome) {
     const bool asJSON = invocation.arguments.has("json");
+    if (outcome && outcome->exitStatus)
+        return *outcome->exitStatus;
     if (outcome)
         return print(asJSON ? jsonText(outcome->json) + "\n" : outcome->text);
     const auto& failure = outcome.error();
