@@ -1,4 +1,5 @@
 #include "Device/ServiceLauncher.h"
+#include "platform/base/FileDescriptor.h"
 
 #include <fcntl.h>
 #include <getopt.h>
@@ -61,15 +62,6 @@ std::expected<BootOptions, int> parse(int count, char** arguments) {
     return boot;
 }
 
-/// Keeps descriptors 0 to 2 from becoming a socket or the image when the launcher was started without them.
-void openMissingStandardFiles() {
-    int file = 0;
-    do
-        file = ::open("/dev/null", O_RDWR | O_CLOEXEC);
-    while (file >= 0 && file <= STDERR_FILENO);
-    ::close(file);
-}
-
 int boot(BootOptions options) {
     if (options.daemon.empty())
         options.daemon = defaultDaemon();
@@ -84,7 +76,7 @@ int boot(BootOptions options) {
 } // namespace
 
 int main(int count, char** arguments) {
-    openMissingStandardFiles();
+    ost::platform::openMissingStandardFiles();
     const std::string_view verb = count > 1 ? arguments[1] : "";
     if (verb == "--help") {
         std::fputs(help, stdout);

@@ -15,4 +15,12 @@ inline constexpr std::string_view OSTEntitlementOtherIdLookup = "com.tamarok.pri
 inline constexpr std::string_view OSTEntitlementWipeContainer = "com.tamarok.private.Ostrand.wipeContainer";
 inline constexpr std::string_view OSTEntitlementDataMigration = "com.tamarok.private.Ostrand.dataMigration";
 
+/// The entitlements that give an identifier containers beside its own.
+inline constexpr const char* OSTApplicationGroupsKey = "com.tamarok.security.application-groups";
+inline constexpr const char* OSTSystemGroupsKey = "com.tamarok.security.system-groups";
+inline constexpr const char* OSTSystemGroupsFallbackKey = "com.tamarok.security.system-group-containers";
+inline constexpr const char* OSTSystemContainerKey = "com.tamarok.security.system-container"; ///< a boolean
+/// What the identifiers of system groups begin with; others do not count.
+inline constexpr std::string_view OSTSystemGroupPrefix = "systemgroup.";
+
 } // namespace ost

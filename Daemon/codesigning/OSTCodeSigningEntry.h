@@ -14,9 +14,6 @@ namespace ost {
 /// The key of an entry's code-signing information that holds the entitlements dictionary.
 inline constexpr const char* OSTEntitlementsKey = "com.tamarok.Ostrand.Entitlements";
 
-/// The entitlement, a boolean, that gives an identifier a system container.
-inline constexpr const char* OSTSystemContainerKey = "com.tamarok.security.system-container";
-
 /// Where older releases cached code-signing information: in the info values of a bundle container.
 inline constexpr const char* OSTCachedCodeSigningInfoKey = "com.tamarok.Tessaly.CachedCodeSigningInfo";
 

@@ -1,3 +1,4 @@
+#include "Protocol/OSTEntitlements.h"
 #include "codesigning/OSTCodeSigningMapping.h"
 #include "codesigning/OSTGroupManager.h"
 #include "model/OSTFailureReport.h"

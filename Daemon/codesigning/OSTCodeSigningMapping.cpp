@@ -1,5 +1,6 @@
 #include "codesigning/OSTCodeSigningMapping.h"
 
+#include "Protocol/OSTEntitlements.h"
 #include "files/OSTDictionaryFile.h"
 #include "model/OSTGlobalConfiguration.h"
 #include "platform/base/Assert.h"
@@ -17,8 +18,6 @@ namespace ost {
 
 namespace {
 
-constexpr std::string_view systemGroupPrefix = "systemgroup.";
-
 /// Whether a client that carries the entitlements would change nothing by registering itself again.
 bool isOwnRegistration(const OSTCodeSigningEntry& entry, const std::shared_ptr<const OSTDictionary>& entitlements) {
     const auto* const held = entry.codeSigningInfo->size() == 1 ? entry.entitlements() : nullptr;
@@ -28,9 +27,8 @@ bool isOwnRegistration(const OSTCodeSigningEntry& entry, const std::shared_ptr<c
 
 } // namespace
 
-constinit const OSTGroupKeys OSTGroupKeys::application{"com.tamarok.security.application-groups", nullptr};
-constinit const OSTGroupKeys OSTGroupKeys::system{"com.tamarok.security.system-groups",
-                                                  "com.tamarok.security.system-group-containers"};
+constinit const OSTGroupKeys OSTGroupKeys::application{OSTApplicationGroupsKey, nullptr};
+constinit const OSTGroupKeys OSTGroupKeys::system{OSTSystemGroupsKey, OSTSystemGroupsFallbackKey};
 
 OSTCodeSigningMapping& OSTCodeSigningMapping::sharedInstance() {
     static platform::Immortal mapping([] { return OSTCodeSigningMapping(); });
@@ -255,7 +253,7 @@ OSTCodeSigningMapping::_onQueue_systemGroupIdentifiersForIdentifier(std::string_
     auto groups = _groupList(identifier, entry ? entry->entitlements() : nullptr, OSTGroupKeys::system);
     if (groups)
         std::erase_if(*groups, [](const std::string& group) {
-            if (group.starts_with(systemGroupPrefix))
+            if (group.starts_with(OSTSystemGroupPrefix))
                 return false;
             platform::logAs(platform::LogLevel::error, "_onQueue_systemGroupIdentifiersForIdentifier",
                             "System group ID %@ does not have proper prefix, ignoring.", group);

@@ -1,6 +1,7 @@
 #include "upcall/OSTKernServer.h"
 
 #include "Protocol/OSTServices.h"
+#include "Protocol/OSTUpcall.h"
 #include "platform/base/Log.h"
 #include "upcall/OSTProcessContainers.h"
 
@@ -12,16 +13,14 @@ namespace ost {
 
 namespace {
 
+using namespace upcall;
+
 static_assert(std::endian::native == std::endian::little, "messages are in native byte order");
 
-constexpr std::uint32_t processContainersRequest = 322514900;
 constexpr std::uint32_t forgottenRequest = 322514901;
-constexpr std::uint32_t replyIdOffset = 100;
 
-constexpr std::uint32_t complexMessage = 0x80000000;
 /// Bits of the header that name the kind of the reply port's right.
 constexpr std::uint32_t replyPortDisposition = 0x1f;
-constexpr std::uint8_t outOfLineMemory = 1;
 constexpr std::uint32_t shortestTrailer = 32;
 constexpr std::size_t processIdInToken = 5;
 
@@ -31,40 +30,7 @@ constexpr std::int32_t unknownRequest = -303;
 constexpr std::int32_t wrongShape = -304;
 constexpr std::int32_t wrongTrailer = -309;
 
-struct Header {
-    std::uint32_t bits;
-    std::uint32_t size;
-    std::uint32_t replyPort;
-    std::uint32_t localPort;
-    std::uint32_t reserved;
-    std::uint32_t messageId;
-};
-
-using DataRepresentation = std::array<std::uint8_t, 8>;
-/// Little-endian integers, ASCII, IEEE reals.
-constexpr DataRepresentation nativeRepresentation{0, 0, 0, 0, 1, 0, 0, 0};
-
-/// A request and the reply that answers it.
-struct RegionMessage {
-    Header header;
-    std::uint32_t descriptorCount;
-    std::uint32_t regionAddress;
-    std::uint32_t regionSize;
-    std::uint8_t deallocate;
-    std::uint8_t copyOption;
-    std::uint8_t padding;
-    std::uint8_t descriptorType;
-    DataRepresentation dataRepresentation;
-    std::uint32_t count;
-};
 static_assert(sizeof(RegionMessage) == platform::upcallMessageSize);
-
-struct FailureReply {
-    Header header;
-    DataRepresentation dataRepresentation;
-    std::int32_t returnCode;
-};
-static_assert(sizeof(FailureReply) == 36);
 
 /// What the receiver has appended to a message.
 struct Trailer {

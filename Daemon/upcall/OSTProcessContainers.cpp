@@ -1,6 +1,7 @@
 #include "upcall/OSTProcessContainers.h"
 
 #include "Protocol/OSTContainerClass.h"
+#include "Protocol/OSTUpcall.h"
 #include "codesigning/OSTCodeSigningMapping.h"
 #include "model/OSTGlobalConfiguration.h"
 #include "platform/base/Log.h"
@@ -22,40 +23,12 @@ namespace ost {
 
 namespace {
 
+using namespace upcall;
 using platform::LogLevel;
 
 constexpr std::size_t answerBlockSize = 4096;
 constexpr const char* rootHome = "/private/var/root";
 constexpr const char* temporaryDirectoryName = "tmp";
-
-/// What the items of a request mean.
-enum RequestValue : std::uint16_t {
-    codeSignatureId = 0,
-    containerId = 1,
-    applicationId = 2,
-    personaId = 3,
-    appGroupId = 4,
-    containerType = 5,
-    systemContainerId = 6,
-    systemGroupId = 7,
-};
-
-/// What the items of an answer mean.
-enum AnswerValue : std::uint16_t {
-    successFlag = 0,
-    dataContainerPath = 1,
-    temporaryPath = 2,
-    answeredAppGroupId = 3,
-    appGroupPath = 4,
-    homePath = 100,
-    systemContainerPath = 101,
-    answeredSystemGroupId = 102,
-    systemGroupPath = 103,
-};
-
-/// The sandbox's kinds of processes.
-constexpr std::uint32_t applicationType = 0;
-constexpr std::uint32_t pluginType = 1;
 
 /// A line under the name of the one operation that all this is.
 template<typename... Arguments>

@@ -1,5 +1,6 @@
 #include "codesigning/CodeSigningTest.h"
 
+#include "Protocol/OSTEntitlements.h"
 #include "store/OSTContainerCache.h"
 
 #include <filesystem>

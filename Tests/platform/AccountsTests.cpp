@@ -32,6 +32,10 @@ TEST_F(AccountsTest, findsUsersAndGroupsByNameAndNumber) {
     EXPECT_EQ(groupForId(600), "systemusers");
     EXPECT_EQ(groupForName("broken").error(), ENOENT);
     EXPECT_EQ(groupForId(7).error(), ENOENT);
+
+    test::writeFile("/other/etc/group", "one:x:1:ab\ntwo:x:2:b,a\nthree:x:3:\nown:x:4:a\nfive:x:5:a,aa,a\n");
+    EXPECT_EQ(groupsOf({"a", 700, 4, ""}, "/other"), (std::vector<gid_t>{4, 2, 5}));
+    EXPECT_EQ(groupsOf({"c", 700, 9, ""}, "/other"), std::vector<gid_t>{9});
 }
 
 TEST_F(AccountsTest, failWhenTheDatabaseCannotBeRead) {

@@ -18,6 +18,14 @@ void FileDescriptor::reset(int fd) noexcept {
     _fd = fd;
 }
 
+void openMissingStandardFiles() {
+    int file = 0;
+    do
+        file = ::open("/dev/null", O_RDWR);
+    while (file >= 0 && file <= STDERR_FILENO);
+    ::close(file);
+}
+
 std::expected<FileDescriptor, Errno> openWithoutLinks(int base, const char* path, int flags, std::uint64_t resolve) {
     open_how how{};
     how.flags = static_cast<std::uint32_t>(flags | O_NOFOLLOW | O_CLOEXEC);

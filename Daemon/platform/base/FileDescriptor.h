@@ -38,6 +38,9 @@ private:
     int _fd = -1;
 };
 
+/// Keeps the descriptors 0 to 2 from becoming something else in a process that was started without them.
+void openMissingStandardFiles();
+
 /// Opens `path`, relative to the directory `base` or absolute, and follows no symbolic link, neither on the way (ELOOP)
 /// nor at its end. Close-on-exec. `resolve` adds further RESOLVE_ flags of openat2.
 [[nodiscard]] std::expected<FileDescriptor, Errno> openWithoutLinks(int base, const char* path, int flags,

@@ -22,6 +22,7 @@ constexpr std::size_t databaseLimit = 4 << 20; // far above what fits a device, 
 struct Group {
     std::string name;
     gid_t gid;
+    std::string members; ///< names, separated by commas
 };
 
 /// Cuts a line into exactly `count` fields at its colons.
@@ -64,28 +65,46 @@ std::optional<Group> parseGroup(std::string_view line) {
     const auto gid = numberOf((*fields)[2]);
     if ((*fields)[0].empty() || !gid)
         return std::nullopt;
-    return Group{std::string((*fields)[0]), *gid};
+    return Group{std::string((*fields)[0]), *gid, std::string((*fields)[3])};
 }
 
-template<typename Record, typename Matches>
-std::expected<Record, Errno> find(const char* file, std::optional<Record> (*parse)(std::string_view), Matches matches) {
-    const auto content = OST_TRY(readSmallFile(file, databaseLimit, FinalLink::follow));
+bool hasMember(std::string_view members, std::string_view name) {
+    return ("," + std::string(members) + ",").contains("," + std::string(name) + ",");
+}
+
+template<typename Record>
+std::expected<void, Errno> forEachRecord(const std::string& file, std::optional<Record> (*parse)(std::string_view),
+                                         const auto& visit) {
+    const auto content = OST_TRY(readSmallFile(file.c_str(), databaseLimit, FinalLink::follow));
     for (std::string_view rest = content; !rest.empty();) {
         const auto line = takeUntil(rest, '\n');
-        if (auto record = parse(line); record && matches(*record))
-            return *std::move(record);
+        if (auto record = parse(line))
+            visit(*record);
     }
-    return std::unexpected(ENOENT);
+    return {};
+}
+
+template<typename Record>
+std::expected<Record, Errno> find(const std::string& file, std::optional<Record> (*parse)(std::string_view),
+                                  const auto& matches) {
+    std::optional<Record> found;
+    OST_TRY(forEachRecord(file, parse, [&](Record& record) {
+        if (!found && matches(record))
+            found = std::move(record);
+    }));
+    if (!found)
+        return std::unexpected(ENOENT);
+    return *std::move(found);
 }
 
 } // namespace
 
-std::expected<Account, Errno> accountForName(std::string_view name) {
-    return find(passwdFile, parseAccount, [&](const Account& account) { return account.name == name; });
+std::expected<Account, Errno> accountForName(std::string_view name, const std::string& image) {
+    return find(image + passwdFile, parseAccount, [&](const Account& account) { return account.name == name; });
 }
 
-std::expected<Account, Errno> accountForUserId(uid_t uid) {
-    return find(passwdFile, parseAccount, [&](const Account& account) { return account.uid == uid; });
+std::expected<Account, Errno> accountForUserId(uid_t uid, const std::string& image) {
+    return find(image + passwdFile, parseAccount, [&](const Account& account) { return account.uid == uid; });
 }
 
 std::expected<Account, Errno> accountMatching(const std::function<bool(const Account&)>& matches) {
@@ -98,6 +117,15 @@ std::expected<gid_t, Errno> groupForName(std::string_view name) {
 
 std::expected<std::string, Errno> groupForId(gid_t gid) {
     return OST_TRY(find(groupFile, parseGroup, [&](const Group& group) { return group.gid == gid; })).name;
+}
+
+std::expected<std::vector<gid_t>, Errno> groupsOf(const Account& account, const std::string& image) {
+    std::vector<gid_t> groups{account.gid};
+    OST_TRY(forEachRecord(image + groupFile, parseGroup, [&](const Group& group) {
+        if (hasMember(group.members, account.name) && std::ranges::find(groups, group.gid) == groups.end())
+            groups.push_back(group.gid);
+    }));
+    return groups;
 }
 
 } // namespace ost::platform
