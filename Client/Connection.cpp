@@ -1,20 +1,17 @@
 #include "Client/Connection.h"
 
+#include "Client/ServiceSocket.h"
 #include "Protocol/OSTErrorCode.h"
 #include "Protocol/OSTKeys.h"
 #include "Protocol/OSTServices.h"
 #include "platform/base/Assert.h"
-#include "platform/base/Path.h"
 #include "platform/base/Try.h"
 
 #include <algorithm>
 #include <cerrno>
-#include <fcntl.h>
 #include <limits>
 #include <poll.h>
 #include <sys/socket.h>
-#include <sys/time.h>
-#include <sys/un.h>
 
 namespace ostrand {
 
@@ -35,24 +32,6 @@ std::unexpected<Error> transportError(int errnoValue) { return std::unexpected(E
 
 /// The errnos by which a socket tells that the other side has gone.
 bool meansClosed(int errnoValue) { return errnoValue == EPIPE || errnoValue == ECONNRESET; }
-
-/// An address that is too long for a socket is reached through a descriptor of its directory, which `directory` keeps
-/// open.
-Result<sockaddr_un> serviceAddress(const std::string& device, FileDescriptor& directory) {
-    const auto directoryPath =
-        ost::platform::pathByAppending(device, std::string_view(ost::OSTServiceSocketDirectory).substr(1));
-    auto path = ost::platform::pathByAppending(directoryPath, ost::OSTServiceName);
-    sockaddr_un address{};
-    if (path.size() >= sizeof address.sun_path) {
-        directory.reset(::open(directoryPath.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
-        if (!directory)
-            return transportError(errno);
-        path = ost::platform::pathByAppending("/proc/self/fd/" + std::to_string(directory.get()), ost::OSTServiceName);
-    }
-    address.sun_family = AF_UNIX;
-    path.copy(address.sun_path, sizeof address.sun_path - 1);
-    return address;
-}
 
 } // namespace
 
@@ -78,22 +57,7 @@ std::string Request::_frame(std::uint32_t requestNumber) const {
 }
 
 Result<Connection> Connection::open(const std::string& device, Timeout timeout) {
-    FileDescriptor directory;
-    const auto address = OST_TRY(serviceAddress(device, directory));
-    FileDescriptor socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-    if (!socket)
-        return transportError(errno);
-    if (timeout) {
-        using namespace std::chrono;
-        // Bounds the wait for a place among those that the daemon has not accepted yet; nothing else asks this option.
-        const auto wait = duration_cast<microseconds>(std::max(*timeout, milliseconds(1)));
-        const timeval limit{.tv_sec = wait / seconds(1), .tv_usec = (wait % seconds(1)).count()};
-        if (setsockopt(socket.get(), SOL_SOCKET, SO_SNDTIMEO, &limit, sizeof limit) != 0)
-            return transportError(errno);
-    }
-    while (connect(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0)
-        if (errno != EINTR)
-            return transportError(errno == EAGAIN ? ETIMEDOUT : errno);
+    auto socket = OST_TRY(connectToService(device, ost::OSTServiceName, SOCK_STREAM, timeout));
     return Connection(std::move(socket), timeout);
 }
 
