@@ -15,7 +15,7 @@ const CommandTable& commandTable() {
             .commands = {},
         };
         for (const auto part : {containerCommands, attributeCommands, protectionCommands, codeSigningCommands,
-                                signingCommands, deviceCommands})
+                                signingCommands, deviceCommands, runCommands})
             std::ranges::move(part(), std::back_inserter(all.commands));
         return all;
     }();

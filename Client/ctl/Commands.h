@@ -16,6 +16,7 @@ namespace ostrand::ctl {
 [[nodiscard]] std::vector<Command> codeSigningCommands();
 [[nodiscard]] std::vector<Command> signingCommands();
 [[nodiscard]] std::vector<Command> deviceCommands();
+[[nodiscard]] std::vector<Command> runCommands();
 
 /// The whole table, and what is common to all commands.
 [[nodiscard]] const CommandTable& commandTable();
