@@ -26,9 +26,10 @@ std::string contentOf(const std::filesystem::path& file) {
 
 } // namespace
 
+std::string builtProgram(const std::string& name) { return OSTRAND_BIN_DIR "/" + name; }
+
 BootedDevice::BootedDevice(const std::filesystem::path& image)
-    : _image(image),
-      _launcher({OSTRAND_BIN_DIR "/ostrand-device", "boot", "--image", image.string()}, messagesOf(image)) {
+    : _image(image), _launcher({builtProgram("ostrand-device"), "boot", "--image", image.string()}, messagesOf(image)) {
     const auto deadline = std::chrono::steady_clock::now() + patience;
     // An image that was booted before may still have the sockets of then, which nobody serves.
     auto connection = ostrand::Connection::open(_image, patience);

@@ -11,6 +11,9 @@
 
 namespace ost::benchmarks {
 
+/// The program of this build with that name.
+[[nodiscard]] std::string builtProgram(const std::string& name);
+
 /// A device image with the daemon running in it, from construction to destruction. The image stays, and may be booted
 /// again.
 class BootedDevice {
