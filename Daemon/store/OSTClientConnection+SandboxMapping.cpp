@@ -1,6 +1,9 @@
+#include "model/OSTGlobalConfiguration.h"
 #include "platform/base/Log.h"
+#include "platform/base/Path.h"
 #include "platform/device/SandboxUserState.h"
 #include "store/OSTClientConnection.h"
+#include "store/OSTContainerCache.h"
 
 namespace ost {
 
@@ -23,7 +26,37 @@ SandboxItem itemOf(std::uint32_t userId, OSTContainerClass containerClass) {
             containerClass == OSTContainerClass::sharedAppGroup ? SandboxItemType::appGroup : SandboxItemType::data};
 }
 
+/// The live container of which the item speaks: that of the class in whose directory its path lies.
+std::optional<OSTContainerName> containerOf(const platform::SandboxUserStateItem& item) {
+    const auto holder = platform::pathByDeletingLastComponent(item.path);
+    for (auto number = 1U; number < static_cast<unsigned>(OSTContainerClass::max); ++number) {
+        const auto containerClass = static_cast<OSTContainerClass>(number);
+        const auto userId = isSystemClass(containerClass) ? OSTSystemUserId : item.userId;
+        const auto [ofUser, type] = itemOf(userId, containerClass);
+        if (isBundleClass(containerClass) || ofUser != item.userId || static_cast<std::uint64_t>(type) != item.type)
+            continue;
+        const auto directory =
+            OSTGlobalConfiguration::sharedInstance().containerDirectoryURLForUser(userId, containerClass, false);
+        if (directory && *directory == holder)
+            return OSTContainerName{userId, containerClass, item.key};
+    }
+    return std::nullopt;
+}
+
 } // namespace
+
+void OSTClientConnection::_repairSandboxContainerMappings() {
+    for (const auto& item : platform::danglingSandboxUserStateItems()) {
+        const auto name = containerOf(item);
+        if (!name)
+            continue;
+        const auto found = OSTContainerCache::sharedInstance().containerForUser(*name);
+        if (found)
+            _setSandboxContainerMappingForUser(*name, (*found)->url);
+        else if (found.error().is(OSTErrorCode::notFound))
+            _setSandboxContainerMappingForUser(*name, std::nullopt);
+    }
+}
 
 bool OSTClientConnection::_setSandboxContainerMappingForUser(const OSTContainerName& name,
                                                              std::optional<std::string_view> url) {
@@ -37,6 +70,9 @@ bool OSTClientConnection::_setSandboxContainerMappingForUser(const OSTContainerN
     const auto item = itemOf(name.userId, containerClass);
     const auto identifier = *name.identifier;
     const auto type = static_cast<std::uint64_t>(item.type);
+    // In one step where that works: a crash between two would leave the sandbox without the item.
+    if (url && platform::setSandboxUserStateItem(item.userId, type, identifier, url))
+        return true;
     if (const auto removed = platform::setSandboxUserStateItem(item.userId, type, identifier, std::nullopt); !removed) {
         platform::logError(
             "Failed to remove mapping for user: %u, itemType: %llu, identifier: %s, class: %llu, path: %s : %d",

@@ -24,6 +24,7 @@ void OSTClientConnection::containerManagerSetup() const {
         OSTGlobalConfiguration::sharedInstance().libraryDirectory());
     if (!_recoverFromReplaceOperations())
         platform::logError("Failed recovering from replace operations");
+    _repairSandboxContainerMappings();
 }
 
 void OSTClientConnection::containerManagerCleanup() const {

@@ -241,6 +241,8 @@ private:
     /// Tells the sandbox where the container of an identifier lies, or with no URL that there is none. False, with the
     /// reason in the log, when that failed. Bundle classes are not the sandbox's business.
     static bool _setSandboxContainerMappingForUser(const OSTContainerName& name, std::optional<std::string_view> url);
+    /// Tells the sandbox of the containers that a crash had moved or removed when it was still to be told.
+    static void _repairSandboxContainerMappings();
 
     // +Deletion
     [[nodiscard]] static OSTResult<void> _stageForDeletion(const OSTContainerReference& reference);

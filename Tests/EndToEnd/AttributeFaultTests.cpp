@@ -76,6 +76,11 @@ protected:
         return value ? value->description() : read ? "none" : "no file";
     }
 
+    /// Where the sandbox finds the container.
+    [[nodiscard]] std::string sandboxPath() {
+        return fs::read_symlink(device().onHost("/private/var/db/sandbox-state/501/1/a"));
+    }
+
     ostrand::ContainerReference container;
 };
 
@@ -129,6 +134,8 @@ TEST_F(AttributeFaultTest, ASetThatFailsChangesNeitherFileNorMemory) {
 }
 
 TEST_F(AttributeFaultTest, AKillAtAnyMomentOfARegenerationLeavesOneContainerWithItsUUID) {
+    auto first = device().connect();
+    ASSERT_TRUE(ostrand::regenerateDirectoryUUID(first, container));
     std::set<bool> isRenamed;
     auto before = namesIn(device().onHost(classDirectory));
     atEveryCall(
@@ -139,10 +146,24 @@ TEST_F(AttributeFaultTest, AKillAtAnyMomentOfARegenerationLeavesOneContainerWith
             ASSERT_TRUE(found);
             EXPECT_EQ(std::vector<std::string>{fs::path(found->path).filename()}, now);
             EXPECT_TRUE(!answer || now != before);
+            EXPECT_EQ(sandboxPath(), found->path);
             isRenamed.insert(now != before);
             before = now;
         });
     EXPECT_EQ((std::set{false, true}), isRenamed);
+}
+
+TEST_F(AttributeFaultTest, ARegenerationThatFailsLeavesOneContainerThatEverybodyFinds) {
+    auto first = device().connect();
+    ASSERT_TRUE(ostrand::regenerateDirectoryUUID(first, container));
+    atEveryCall(
+        Fault::Kind::fail, [&](auto& connection) { return ostrand::regenerateDirectoryUUID(connection, container); },
+        [&](auto& connection, const auto& /*answer*/) {
+            const auto found = ostrand::metadata(connection, container);
+            ASSERT_TRUE(found);
+            EXPECT_EQ(std::vector<std::string>{fs::path(found->path).filename()},
+                      namesIn(device().onHost(classDirectory)));
+        });
 }
 
 TEST_F(AttributeFaultTest, AKillAtAnyMomentOfAClassChangeLeavesEveryItemAndTheRecordOldOrNew) {

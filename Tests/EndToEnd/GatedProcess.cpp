@@ -43,6 +43,7 @@ constexpr std::array gatedCalls{
     Call{SYS_symlinkat, "symlinkat", false},
     Call{SYS_linkat, "linkat", false},
     Call{SYS_newfstatat, "newfstatat", false},
+    Call{SYS_statx, "statx", false},
     Call{SYS_fchmodat, "fchmodat", false},
     Call{SYS_fchownat, "fchownat", false},
     Call{SYS_setxattr, "setxattr", false},

@@ -104,5 +104,20 @@ TEST_F(SandboxUserState, ItemsAreSetFromAllThreads) {
     EXPECT_EQ(expected, state());
 }
 
+TEST_F(SandboxUserState, TheItemsAtWhosePathsNothingIsAreTold) {
+    EXPECT_TRUE(danglingSandboxUserStateItems().empty());
+    const std::string key = ".a/%\xc3\xa4";
+    EXPECT_EQ(0, set(501, 1, key, "/gone"));
+    EXPECT_EQ(0, set(501, 1, "kept", "/tmp"));
+    fs::create_symlink("/gone", fs::path(sandboxStateDirectory) / "501/1/%4"); // no key's name
+    fs::create_directories(fs::path(sandboxStateDirectory) / "nobody/1");
+    const auto items = danglingSandboxUserStateItems();
+    ASSERT_EQ(1U, items.size());
+    EXPECT_EQ(501U, items[0].userId);
+    EXPECT_EQ(1U, items[0].type);
+    EXPECT_EQ(key, items[0].key);
+    EXPECT_EQ("/gone", items[0].path);
+}
+
 } // namespace
 } // namespace ost::platform

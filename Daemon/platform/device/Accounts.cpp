@@ -39,20 +39,12 @@ std::optional<std::array<std::string_view, count>> fieldsOf(std::string_view lin
     return fields;
 }
 
-std::optional<std::uint32_t> numberOf(std::string_view text) {
-    std::uint32_t number = 0;
-    const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), number);
-    if (error != std::errc{} || end != text.data() + text.size())
-        return std::nullopt;
-    return number;
-}
-
 std::optional<Account> parseAccount(std::string_view line) {
     const auto fields = fieldsOf<7>(line); // name, password, user id, group id, comment, home, shell
     if (!fields)
         return std::nullopt;
-    const auto uid = numberOf((*fields)[2]);
-    const auto gid = numberOf((*fields)[3]);
+    const auto uid = numberIn<std::uint32_t>((*fields)[2]);
+    const auto gid = numberIn<std::uint32_t>((*fields)[3]);
     if ((*fields)[0].empty() || !uid || !gid)
         return std::nullopt;
     return Account{std::string((*fields)[0]), *uid, *gid, std::string((*fields)[5])};
@@ -62,7 +54,7 @@ std::optional<Group> parseGroup(std::string_view line) {
     const auto fields = fieldsOf<4>(line); // name, password, group id, members
     if (!fields)
         return std::nullopt;
-    const auto gid = numberOf((*fields)[2]);
+    const auto gid = numberIn<std::uint32_t>((*fields)[2]);
     if ((*fields)[0].empty() || !gid)
         return std::nullopt;
     return Group{std::string((*fields)[0]), *gid, std::string((*fields)[3])};

@@ -1,11 +1,12 @@
 #include "platform/device/Applications.h"
 
+#include "platform/base/DirectoryNames.h"
 #include "platform/base/FileName.h"
 #include "platform/base/Path.h"
 #include "platform/base/SmallFile.h"
+#include "platform/base/Text.h"
 #include "platform/base/Try.h"
 
-#include <dirent.h>
 #include <fcntl.h>
 #include <sys/file.h>
 #include <sys/stat.h>
@@ -13,8 +14,6 @@
 
 #include <atomic>
 #include <cerrno>
-#include <charconv>
-#include <memory>
 
 namespace ost::platform {
 
@@ -22,36 +21,6 @@ namespace {
 
 constexpr std::size_t recordLimit = 4096; // far above a reason and two numbers
 constexpr int directoryFlags = O_RDONLY | O_DIRECTORY;
-
-template<typename Number>
-std::optional<Number> numberOf(std::string_view text) {
-    Number number = 0;
-    const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), number);
-    return error == std::errc{} && end == text.data() + text.size() ? std::optional(number) : std::nullopt;
-}
-
-/// Takes the text before the separator, and the separator, off the front.
-std::string_view take(std::string_view& text, char separator) {
-    const auto front = text.substr(0, text.find(separator));
-    text.remove_prefix(std::min(front.size() + 1, text.size()));
-    return front;
-}
-
-std::expected<std::vector<std::string>, Errno> finishedNames(const FileDescriptor& directory) {
-    // A descriptor of its own, because reading moves its position.
-    FileDescriptor listed = OST_TRY(openWithoutLinks(directory.get(), ".", directoryFlags));
-    const std::unique_ptr<DIR, int (*)(DIR*)> stream(::fdopendir(listed.get()), &::closedir);
-    if (!stream)
-        return std::unexpected(errno);
-    [[maybe_unused]] const int owned = listed.release();
-    std::vector<std::string> names;
-    for (errno = 0; const auto* const entry = ::readdir(stream.get()); errno = 0)
-        if (*entry->d_name != '.')
-            names.emplace_back(entry->d_name);
-    if (errno != 0)
-        return std::unexpected(errno);
-    return names;
-}
 
 /// The content of a record; absent when the record has gone meanwhile.
 std::expected<std::optional<std::string>, Errno> contentOf(const FileDescriptor& directory, const std::string& name) {
@@ -79,7 +48,7 @@ std::expected<void, Errno> makeRecord(const FileDescriptor& directory, const std
 /// The process of an application's record, absent when it is not running.
 std::expected<std::optional<ProcessInstance>, Errno> processOfRecord(const FileDescriptor& directory,
                                                                      const std::string& name) {
-    const auto pid = numberOf<pid_t>(name);
+    const auto pid = numberIn<pid_t>(name);
     if (!pid || *pid <= 0)
         return std::nullopt;
     const auto content = OST_TRY(contentOf(directory, name));
@@ -89,8 +58,8 @@ std::expected<std::optional<ProcessInstance>, Errno> processOfRecord(const FileD
     if (!process && process.error() != ESRCH)
         return std::unexpected(process.error());
     std::string_view text = *content;
-    const auto startTime = take(text, '\n');
-    if (!process || (!startTime.empty() && numberOf<std::uint64_t>(startTime) != process->startTime))
+    const auto startTime = takeUntil(text, '\n');
+    if (!process || (!startTime.empty() && numberIn<std::uint64_t>(startTime) != process->startTime))
         return std::nullopt;
     return *process;
 }
@@ -102,10 +71,10 @@ struct Assertion {
 };
 
 Assertion parseAssertion(std::string_view text) {
-    Assertion assertion{.reason = std::string(take(text, '\n')), .holder = {}};
-    auto line = take(text, '\n');
-    const auto pid = numberOf<pid_t>(take(line, ' '));
-    const auto startTime = numberOf<std::uint64_t>(line);
+    Assertion assertion{.reason = std::string(takeUntil(text, '\n')), .holder = {}};
+    auto line = takeUntil(text, '\n');
+    const auto pid = numberIn<pid_t>(takeUntil(line, ' '));
+    const auto startTime = numberIn<std::uint64_t>(line);
     if (pid && startTime)
         assertion.holder = ProcessInstance{*pid, *startTime};
     return assertion;
@@ -168,7 +137,7 @@ private:
 
 /// Removes the records of which `read` says that there is nothing to them any more. What cannot be told stays.
 void removeStale(const FileDescriptor& directory, const auto& read) {
-    const auto names = finishedNames(directory);
+    const auto names = plainNames(directory);
     if (!names)
         return;
     for (const auto& name : *names)
@@ -206,7 +175,7 @@ std::expected<std::vector<ProcessInstance>, Errno> applicationProcesses(std::str
     const auto directory = OST_TRY(ApplicationRecords(applicationsDirectory, identifier, image).existing());
     if (!directory)
         return processes;
-    for (const auto& name : OST_TRY(finishedNames(*directory)))
+    for (const auto& name : OST_TRY(plainNames(*directory)))
         if (const auto process = OST_TRY(processOfRecord(*directory, name)))
             processes.push_back(*process);
     return processes;
@@ -238,7 +207,7 @@ std::expected<std::optional<std::string>, Errno> terminationAssertion(std::strin
     const auto directory = OST_TRY(ApplicationRecords(assertionsDirectory, identifier, image).existing());
     if (!directory)
         return std::nullopt;
-    for (const auto& name : OST_TRY(finishedNames(*directory)))
+    for (const auto& name : OST_TRY(plainNames(*directory)))
         if (auto assertion = OST_TRY(assertionOfRecord(*directory, name)))
             return std::move(assertion->reason);
     return std::nullopt;

@@ -1,15 +1,19 @@
 #include "platform/device/SandboxUserState.h"
 
+#include "platform/base/DirectoryNames.h"
 #include "platform/base/FileDescriptor.h"
 #include "platform/base/FileName.h"
+#include "platform/base/Text.h"
 #include "platform/base/Try.h"
 
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <array>
 #include <atomic>
 #include <cerrno>
+#include <climits>
 #include <cstdio>
 #include <string>
 
@@ -44,6 +48,25 @@ std::expected<FileDescriptor, Errno> openOrMake(int parent, const std::string& n
     return directory;
 }
 
+/// Calls `act` with each item of a directory and with the directory itself.
+void forEachItem(int parent, const std::string& name, const auto& act) {
+    const auto directory = openWithoutLinks(parent, name.c_str(), O_RDONLY | O_DIRECTORY);
+    const auto names = directory ? plainNames(*directory) : std::unexpected(directory.error());
+    for (const auto& item : names.value_or(std::vector<std::string>()))
+        act(directory->get(), item);
+}
+
+/// The path of a link at which nothing is; none also when that cannot be told.
+std::optional<std::string> danglingPath(int directory, const std::string& link) {
+    std::array<char, PATH_MAX> path;
+    const auto length = ::readlinkat(directory, link.c_str(), path.data(), path.size() - 1);
+    if (length <= 0)
+        return std::nullopt;
+    path[static_cast<std::size_t>(length)] = '\0';
+    const bool dangles = ::faccessat(AT_FDCWD, path.data(), F_OK, AT_SYMLINK_NOFOLLOW) != 0 && errno == ENOENT;
+    return dangles ? std::optional<std::string>(path.data()) : std::nullopt;
+}
+
 /// The directory of a user's items of one type, which is there as a rule.
 std::expected<FileDescriptor, Errno> openItems(std::uint32_t userId, std::uint64_t type) {
     const auto user = std::to_string(userId), items = std::to_string(type);
@@ -73,6 +96,22 @@ std::expected<void, Errno> setSandboxUserStateItem(std::uint32_t userId, std::ui
         return std::unexpected(error);
     }
     return {};
+}
+
+std::vector<SandboxUserStateItem> danglingSandboxUserStateItems() {
+    std::vector<SandboxUserStateItem> items;
+    forEachItem(AT_FDCWD, sandboxStateDirectory, [&](int top, const std::string& user) {
+        forEachItem(top, user, [&](int ofUser, const std::string& type) {
+            forEachItem(ofUser, type, [&](int ofType, const std::string& name) {
+                const auto userId = numberIn<std::uint32_t>(user);
+                const auto number = numberIn<std::uint64_t>(type);
+                const auto key = keyOfFileName(name);
+                if (auto path = danglingPath(ofType, name); path && userId && number && key)
+                    items.push_back({*userId, *number, *key, *std::move(path)});
+            });
+        });
+    });
+    return items;
 }
 
 } // namespace ost::platform

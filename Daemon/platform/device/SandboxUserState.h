@@ -5,7 +5,9 @@
 #include <cstdint>
 #include <expected>
 #include <optional>
+#include <string>
 #include <string_view>
+#include <vector>
 
 namespace ost::platform {
 
@@ -21,5 +23,16 @@ inline constexpr const char* sandboxStateDirectory = "/private/var/db/sandbox-st
 [[nodiscard]] std::expected<void, Errno> setSandboxUserStateItem(std::uint32_t userId, std::uint64_t type,
                                                                  std::string_view key,
                                                                  std::optional<std::string_view> path);
+
+/// An item as its link has it.
+struct SandboxUserStateItem {
+    std::uint32_t userId;
+    std::uint64_t type;
+    std::string key;
+    std::string path;
+};
+
+/// The items at whose path nothing is. What cannot be looked at is passed over.
+[[nodiscard]] std::vector<SandboxUserStateItem> danglingSandboxUserStateItems();
 
 } // namespace ost::platform
