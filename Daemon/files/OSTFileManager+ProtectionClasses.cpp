@@ -85,4 +85,11 @@ OSTResult<void> OSTFileManager::setDataProtectionClassOfItem(const OSTTreeEntry&
     return setClass(item, toClass, ifPredicate);
 }
 
+bool OSTFileManager::itemIsFixed(const OSTTreeEntry& entry) const {
+    struct statx status{};
+    constexpr std::uint64_t fixed = STATX_ATTR_IMMUTABLE | STATX_ATTR_APPEND;
+    return ::statx(entry.directory, entry.name, AT_SYMLINK_NOFOLLOW, STATX_TYPE, &status) == 0 &&
+           (status.stx_attributes & fixed) != 0;
+}
+
 } // namespace ost

@@ -190,6 +190,8 @@ public:
     [[nodiscard]] OSTResult<void> setDataProtectionClassOfItem(const OSTTreeEntry& entry, OSTOwnFiles& ownFiles,
                                                                std::int32_t toClass,
                                                                const OSTClassPredicate& ifPredicate) const;
+    /// Whether nobody may change the item to which a walk has come: it is immutable or append-only.
+    [[nodiscard]] bool itemIsFixed(const OSTTreeEntry& entry) const;
 
     // Access control lists and owners of whole containers (OSTFileManager+SystemContainerACLs.cpp).
     // Metadata files are left alone. An item that cannot be changed is logged and the next one follows; a file with a

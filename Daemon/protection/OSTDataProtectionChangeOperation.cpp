@@ -14,6 +14,9 @@ namespace ost {
 
 namespace {
 
+/// No device is locked and unlocked again that often, each time at the wrong moment.
+constexpr unsigned mostPasses = 50;
+
 std::optional<OSTItemIdentity> identityOf(const OSTMetadata& metadata) {
     const auto identity = OSTFileManager::defaultManager().identityOfItemAtURL(metadata.url);
     return identity ? std::optional(*identity) : std::nullopt;
@@ -65,8 +68,7 @@ OSTDataProtectionChangeOperation::_runChangeOperationNeedToRetry() const {
 }
 
 OSTResult<OSTDataProtectionChangeOperation::LockedError> OSTDataProtectionChangeOperation::_changeItems() const {
-    std::string refusedItem;
-    for (;;) {
+    for (unsigned passes = 1;; ++passes) {
         OSTDataProtectionPass pass(_change, _directory);
         auto ended = pass.run();
         if (ended)
@@ -75,10 +77,9 @@ OSTResult<OSTDataProtectionChangeOperation::LockedError> OSTDataProtectionChange
             return std::unexpected(ended.error());
         if (platform::deviceLockState() == platform::deviceLocked)
             return ended.error();
-        // The device may have been locked for a moment only. An item that is refused without that is immutable.
-        if (pass.failedItem() == refusedItem)
+        // The device was locked for a moment, unless something else forbids it.
+        if (pass.metFixedItem() || passes == mostPasses)
             return std::unexpected(ended.error());
-        refusedItem = pass.failedItem();
     }
 }
 

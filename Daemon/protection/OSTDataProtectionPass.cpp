@@ -139,7 +139,7 @@ OSTResult<void> OSTDataProtectionPass::_setClass(const OSTTreeEntry& entry, std:
                            entry.status.mode, set.error());
         return {};
     }
-    _failedItem = entry.path;
+    _metFixedItem = OSTFileManager::defaultManager().itemIsFixed(entry);
     return set;
 }
 

@@ -24,8 +24,8 @@ public:
     /// the one that was meant, else with the error of the item that could not be changed.
     [[nodiscard]] OSTResult<void> run();
 
-    /// The item that could not be changed; empty when there is none.
-    [[nodiscard]] const std::string& failedItem() const { return _failedItem; }
+    /// Whether the pass came to its end at an item that nobody may change.
+    [[nodiscard]] bool metFixedItem() const { return _metFixedItem; }
 
 private:
     [[nodiscard]] OSTResult<void> _checkContainer();
@@ -42,7 +42,7 @@ private:
     OSTIdentifierLock _lock;
     OSTMetadataRecord _live; ///< the container's record at the last look
     OSTOwnFiles _ownFiles;
-    std::string _failedItem;
+    bool _metFixedItem = false;
 };
 
 } // namespace ost
