@@ -6,6 +6,7 @@
 #include "protection/OSTDataProtectionManager.h"
 #include "service/OSTRequestReaders.h"
 
+#include <cerrno>
 #include <utility>
 
 namespace ost {
@@ -37,6 +38,17 @@ std::expected<std::optional<OSTValue>, OSTErrorCode> infoValueOf(const platform:
     return value;
 }
 
+/// Puts a value into the reply. A user may have put one into a metadata file that no message holds.
+OSTCommandResult put(platform::IPCReply& reply, std::string_view key, const OSTValue& value) {
+    if (!platform::fitsIntoMessage(value)) {
+        reply.clear();
+        return std::unexpected(static_cast<OSTErrorCode>(EMSGSIZE));
+    }
+    auto encoder = reply.encoder(key);
+    platform::encodePropertyListValue(encoder, value);
+    return {};
+}
+
 } // namespace
 
 OSTCommandResult OSTSetInfoValueCommand(const platform::IPCRequest& request, platform::IPCReply& /*reply*/,
@@ -50,9 +62,7 @@ OSTCommandResult OSTInfoValueCommand(const platform::IPCRequest& request, platfo
                                      OSTClientConnection& client) {
     const auto container = OST_TRY(containerOf(request, client));
     const auto value = OST_TRY(client.infoValueForKey(request.stringValue(requestKey::infoKey), container));
-    auto encoder = reply.encoder(replyKey::infoValue);
-    platform::encodePropertyListValue(encoder, value);
-    return {};
+    return put(reply, replyKey::infoValue, value);
 }
 
 OSTCommandResult OSTMetadataCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
@@ -61,10 +71,8 @@ OSTCommandResult OSTMetadataCommand(const platform::IPCRequest& request, platfor
     const auto record = OST_TRY(client.metadataForUser(container));
     reply.set(replyKey::path, record->url);
     reply.set(replyKey::transient, record->transient);
-    if (request.booleanValue(requestKey::infoDictRequested) && record->info) {
-        auto encoder = reply.encoder(replyKey::infoDictionary);
-        platform::encodePropertyListValue(encoder, *record->info);
-    }
+    if (request.booleanValue(requestKey::infoDictRequested) && record->info)
+        return put(reply, replyKey::infoDictionary, OSTValue(record->info));
     return {};
 }
 

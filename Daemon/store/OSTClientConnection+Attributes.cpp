@@ -29,10 +29,10 @@ bool holdsInfo(const OSTMetadata& metadata, const std::shared_ptr<const OSTDicti
     return metadata.info && info ? *metadata.info == *info : metadata.info == info;
 }
 
-/// A write that failed at its last step has put a file in place that may not last.
+/// A write that failed at its last step has put a file in place that may not last. One that cannot be read may be that.
 void takeBackWhatWasWritten(const OSTMetadata& record) {
     const auto onDisk = OSTMetadata::readAndValidateMetadataAtUrl(record.url, record.uid, OSTCheckClassPath::no);
-    if (onDisk && !holdsInfo(*onDisk, record.info))
+    if (!onDisk || !holdsInfo(*onDisk, record.info))
         static_cast<void>(record.writeMetadataToDisk());
 }
 
@@ -165,10 +165,11 @@ OSTClientConnection::recreateDefaultStructureForUser(const OSTContainerReference
         const OSTIdentifierLock lock({container.uuid->string()}, OSTLockKind::writing);
         const auto record = OST_TRY(_container(container));
         OST_TRY(_createSubDirectories(record->url, container.name.userId, record->containerClass));
-        OST_TRY(makeSubDirectoriesDurable(*record));
-        if (isSystemClass(record->containerClass))
-            OST_TRY(OSTFileManager::defaultManager().standardizeACLsForSystemContainerAtURL(record->url));
-        return {};
+        if (!isSystemClass(record->containerClass))
+            return makeSubDirectoriesDurable(*record);
+        const auto& files = OSTFileManager::defaultManager();
+        OST_TRY(files.standardizeACLsForSystemContainerAtURL(record->url));
+        return files.makeFileSystemDurable(record->url); // any item may have changed
     }));
 }
 

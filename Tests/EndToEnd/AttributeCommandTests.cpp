@@ -6,6 +6,7 @@
 
 #include <gtest/gtest.h>
 
+#include <cerrno>
 #include <limits>
 
 namespace ost::test::wire {
@@ -87,6 +88,11 @@ TEST_F(AttributeCommandTest, InfoValuesOfEveryTypeGoThereAndBack) {
     EXPECT_EQ(third.call(about(7, {{"InfoDictRequested", truth(true)}})).keys(),
               "ReplyError ReplyInfoDictionary ReplyPath ReplyTransient");
     EXPECT_EQ(third.call(about(5, {{"Key", text("k")}})).error(), 1U);
+    const auto deepest = std::string(63, '\x81') + number(1);
+    EXPECT_EQ(third.call(about(5, {{"Key", text("d")}, {"Value", deepest}})).error(), 1U);
+    EXPECT_EQ(third.call(about(6, {{"Key", text("d")}})).error(), 1U);
+    EXPECT_EQ(third.call(about(7, {{"InfoDictRequested", truth(true)}})).error(), std::uint64_t{EMSGSIZE});
+    EXPECT_EQ(third.call(about(5, {{"Key", text("d")}})).error(), 1U);
     EXPECT_EQ(third.call(about(7, {{"InfoDictRequested", truth(true)}})).keys(), "ReplyError ReplyPath ReplyTransient");
 }
 

@@ -84,10 +84,14 @@ struct CBOREntry {
     CBORItem value;
 };
 
+/// How deep arrays and maps may lie in each other, the payload's own map being the first: deeper than any message,
+/// shallow enough for recursive readers.
+inline constexpr std::size_t CBORMaximumDepth = 64;
+
 /// Checks that `payload` is exactly one well-formed map of the wire's subset and gives the view of it: definite
-/// lengths, arrays and maps at most 64 deep, unique text keys, valid UTF-8 without NUL, tag 37 around 16 bytes, tag 1
-/// around a number, nothing after the item. Costs time in proportion to the payload (times its logarithm for keys),
-/// little memory, and nothing for lengths that are merely claimed.
+/// lengths, arrays and maps at most `CBORMaximumDepth` deep, unique text keys, valid UTF-8 without NUL, tag 37 around
+/// 16 bytes, tag 1 around a number, nothing after the item. Costs time in proportion to the payload (times its
+/// logarithm for keys), little memory, and nothing for lengths that are merely claimed.
 [[nodiscard]] std::expected<CBORItem, CBORError> validateCBOR(std::string_view payload);
 
 /// The elements of an array, in order. A forward range.

@@ -32,9 +32,8 @@ public:
     }
 
 private:
-    static constexpr std::size_t maximumDepth = 64; ///< deeper than any message, shallow enough for recursive readers
-    static constexpr std::size_t keysOnStack = 64;  ///< no ordinary request has more, so checking it allocates nothing
-    static constexpr std::size_t fewKeys = 16;      ///< up to here, comparing each with each is the fastest
+    static constexpr std::size_t keysOnStack = 64; ///< no ordinary request has more, so checking it allocates nothing
+    static constexpr std::size_t fewKeys = 16;     ///< up to here, comparing each with each is the fastest
 
     struct Level {
         std::uint64_t itemsLeft; ///< keys and values counted each
@@ -139,7 +138,7 @@ private:
         // Every item takes a byte at least, so a claim beyond that is refused before anything is done for it.
         if (head.argument > _left() / (isMap ? 2 : 1))
             return _fail(start, "ends early");
-        if (_depth == maximumDepth)
+        if (_depth == CBORMaximumDepth)
             return _fail(start, "nested too deeply");
         _levels[_depth++] = {head.argument * (isMap ? 2 : 1), _keys.size(), isMap};
         return true;
@@ -200,7 +199,7 @@ private:
     const char* const _end;
     CBORError _error{};
     std::size_t _depth = 0;
-    std::array<Level, maximumDepth> _levels; // the first _depth are in use
+    std::array<Level, CBORMaximumDepth> _levels; // the first _depth are in use
     std::array<std::byte, keysOnStack * sizeof(Key)> _storage;
     std::pmr::monotonic_buffer_resource _memory{_storage.data(), _storage.size()};
     std::pmr::vector<Key> _keys; ///< of all open maps, those of an inner one behind those of the outer

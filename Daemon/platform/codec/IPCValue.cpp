@@ -65,6 +65,17 @@ private:
     std::size_t _objects = 0;
 };
 
+/// `depth` is that of an array or dictionary in the place of the value.
+bool fits(const OSTValue& value, std::size_t depth) {
+    const auto below = [&](const OSTValue& element) { return fits(element, depth + 1); };
+    if (const auto* const array = value.asArray())
+        return depth <= CBORMaximumDepth && std::ranges::all_of(*array, below);
+    if (const auto* const dictionary = value.asDictionary())
+        return depth <= CBORMaximumDepth &&
+               std::ranges::all_of(*dictionary, [&](const auto& entry) { return below(entry.second); });
+    return true;
+}
+
 struct Encode {
     CBOREncoder& encoder;
 
@@ -92,6 +103,8 @@ std::optional<OSTValue> propertyListValue(const CBORItem& item) {
     auto value = converter.convert(item);
     return converter.isWithinLimit() ? value : std::nullopt;
 }
+
+bool fitsIntoMessage(const OSTValue& value) { return fits(value, 2); }
 
 void encodePropertyListValue(CBOREncoder& encoder, const OSTValue& value) {
     std::visit(Encode{encoder}, value.variant());

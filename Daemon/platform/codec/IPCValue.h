@@ -18,6 +18,9 @@ namespace ost::platform {
 /// otherwise cost hundreds of megabytes; a list of a million identifiers still fits.
 inline constexpr std::size_t maximumConvertedObjects = 4'000'000;
 
+/// Whether a message can hold the value under one of its keys: nothing in it lies deeper than a message may be.
+[[nodiscard]] bool fitsIntoMessage(const OSTValue& value);
+
 /// Writes a property-list value as one item.
 void encodePropertyListValue(CBOREncoder& encoder, const OSTValue& value);
 void encodePropertyListValue(CBOREncoder& encoder, const OSTDictionary& dictionary);
