@@ -27,14 +27,21 @@ std::string_view suffix(bool transient) { return transient ? "(transient)" : "";
 
 /// A scan of a large class directory holds the mutex for long; a listener's worker that waits for it lets others be
 /// served.
-std::unique_lock<std::mutex> lockCache(std::mutex& mutex) {
-    std::unique_lock lock(mutex, std::try_to_lock);
-    if (!lock) {
+class OST_SCOPED_CAPABILITY CacheLock {
+public:
+    explicit CacheLock(platform::Mutex& mutex) OST_ACQUIRE(mutex) : _mutex(mutex) {
+        if (_mutex.try_lock())
+            return;
         const platform::BlockingSection blocking;
-        lock.lock();
+        _mutex.lock();
     }
-    return lock;
-}
+    CacheLock(const CacheLock&) = delete;
+    CacheLock& operator=(const CacheLock&) = delete;
+    ~CacheLock() OST_RELEASE() { _mutex.unlock(); }
+
+private:
+    platform::Mutex& _mutex;
+};
 
 OSTError invalidContentClass(OSTContainerClass contentClass, std::source_location where) {
     return OSTCreateErrorAt(where, OSTErrorCode::invalidCacheInput, nullptr, "Invalid Content Class: %ld",
@@ -129,7 +136,7 @@ OSTResult<OSTCacheEntry> OSTContainerCache::entryForUser(const OSTContainerName&
         const auto className = pathComponentForContainerClass(name.containerClass);
         OSTCacheEntry entry;
         {
-            const auto lock = lockCache(_cacheLock);
+            const CacheLock lock(_cacheLock);
             const ClassTable* const table = OST_TRY(_tableForUserId(name, here));
             if (const auto found = table->find(*name.identifier); found != table->end())
                 entry = found->second;
@@ -175,7 +182,7 @@ OSTContainerCache::allEntriesForUser(std::uint32_t userId, OSTContainerClass con
             return std::unexpected(invalidContentClass(contentClass, here));
         std::vector<OSTCacheEntry> entries;
         {
-            const auto lock = lockCache(_cacheLock);
+            const CacheLock lock(_cacheLock);
             const ClassTable* const table = OST_TRY(
                 _tableForUserId({.userId = userId, .containerClass = contentClass, .transient = transient}, here));
             for (const auto& entry : *table | std::views::values)
@@ -199,7 +206,7 @@ OSTResult<std::vector<std::string>> OSTContainerCache::allContainerIdentifiersFo
     return OSTGuarded([&]() -> OSTResult<std::vector<std::string>> {
         if (!isValidContainerClass(contentClass))
             return std::unexpected(invalidContentClass(contentClass, here));
-        const auto lock = lockCache(_cacheLock);
+        const CacheLock lock(_cacheLock);
         const ClassTable* const table =
             OST_TRY(_tableForUserId({.userId = userId, .containerClass = contentClass, .transient = transient}, here));
         std::vector<std::string> identifiers;
@@ -222,7 +229,7 @@ OSTResult<OSTMetadataRecord> OSTContainerCache::addContainerMetadata(OSTMetadata
                 OSTCreateError(OSTErrorCode::invalidCacheInput, "Invalid input: URL: %@", metadata.url));
         auto record = std::make_shared<const OSTMetadata>(std::move(metadata));
         {
-            const auto lock = lockCache(_cacheLock);
+            const CacheLock lock(_cacheLock);
             ClassTable* const table = OST_TRY(_tableForUserId(record->name(), here));
             _put(*table, {record, placement});
         }
@@ -233,7 +240,7 @@ OSTResult<OSTMetadataRecord> OSTContainerCache::addContainerMetadata(OSTMetadata
 }
 
 void OSTContainerCache::placementReachedDisk(const OSTMetadata& metadata) {
-    const auto lock = lockCache(_cacheLock);
+    const CacheLock lock(_cacheLock);
     const auto table = _getCacheForUserId(metadata.name());
     if (!table)
         return;
@@ -247,7 +254,7 @@ OSTResult<void> OSTContainerCache::removeContainerForUser(const OSTContainerName
     return OSTGuarded([&]() -> OSTResult<void> {
         OST_TRY(checkName(name, here));
         {
-            const auto lock = lockCache(_cacheLock);
+            const CacheLock lock(_cacheLock);
             ClassTable* const table = OST_TRY(_tableForUserId(name, here));
             table->erase(*name.identifier);
         }

@@ -2,12 +2,12 @@
 
 #include "model/OSTContainerName.h"
 #include "model/OSTMetadata.h"
+#include "platform/base/Mutex.h"
 #include "platform/base/OSTError.h"
 
 #include <cstdint>
 #include <functional>
 #include <map>
-#include <mutex>
 #include <optional>
 #include <source_location>
 #include <string>
@@ -30,9 +30,10 @@ struct OSTCacheEntry {
 /// The metadata records of all containers, by user, class and identifier, so that a look-up does not scan a class
 /// directory.
 ///
-/// The table of a user and class is read from disk at its first use and then lives as long as the daemon; whoever
-/// makes, moves or deletes a container tells the cache. One record for each identifier: a later one takes the place of
-/// an earlier one. Records are shared and never change; a change is a new record, added in place of the old one.
+/// The table of a user and class is read from disk at its first use and then lives as long as the daemon. Code
+/// that makes, moves or deletes a container tells the cache. One record for each identifier: a later one takes the
+/// place of an earlier one. Records are shared and never change; a change is a new record, added in place of the old
+/// one.
 ///
 /// Threads: any. A mutex guards the tables, the scan of a class directory included; checks on disk of what was found
 /// run outside it. An exception inside an operation becomes `exceptionCaught`.
@@ -77,18 +78,18 @@ private:
     using ClassKey = std::pair<std::uint32_t, OSTContainerClass>;
     using ClassTables = std::map<ClassKey, ClassTable>;
 
-    /// The table that a name belongs to, read from disk when there is none. Call with the mutex held.
-    [[nodiscard]] OSTResult<ClassTable*> _getCacheForUserId(const OSTContainerName& name);
+    /// The table that a name belongs to, read from disk when there is none.
+    [[nodiscard]] OSTResult<ClassTable*> _getCacheForUserId(const OSTContainerName& name) OST_REQUIRES(_cacheLock);
     /// The same for the public operations, which report any failure as `cacheRebuildFailed`.
-    [[nodiscard]] OSTResult<ClassTable*> _tableForUserId(const OSTContainerName& name, std::source_location where);
+    [[nodiscard]] OSTResult<ClassTable*> _tableForUserId(const OSTContainerName& name, std::source_location where)
+        OST_REQUIRES(_cacheLock);
     [[nodiscard]] static OSTResult<ClassTable> _readClassDirectory(const std::string& directory, std::uint32_t userId,
                                                                    bool transient);
     static void _put(ClassTable& table, OSTCacheEntry entry);
 
-    std::mutex _cacheLock;
-    // Guarded by _cacheLock.
-    ClassTables _liveContainerCache;
-    ClassTables _transientContainerCache;
+    platform::Mutex _cacheLock;
+    ClassTables _liveContainerCache OST_GUARDED_BY(_cacheLock);
+    ClassTables _transientContainerCache OST_GUARDED_BY(_cacheLock);
 };
 
 } // namespace ost
