@@ -124,7 +124,7 @@ Result<ServiceLauncher> ServiceLauncher::prepare(const BootOptions& options) {
     ServiceLauncher launcher(OST_TRY(DeviceImage::openOrMake(options.image)));
     launcher._command = options.command;
     OST_TRY(launcher._image.reserve());
-    // Before the sockets appear: whoever sees them may also end us.
+    // Before the sockets appear: a client that sees them may end us already.
     OST_TRY(launcher._receiveSignals());
     OST_TRY(launcher._rememberHost());
     OST_TRY(launcher._openDaemon(options.daemon));

@@ -124,7 +124,7 @@ OSTResult<std::string> OSTFileManager::createTemporaryDirectoryInDirectoryURL(st
                                                                               std::uint32_t owner) const {
     const auto make = [&]() -> std::expected<std::string, platform::Errno> {
         const FileDescriptor parent = OST_TRY(OSTOpenItem(AT_FDCWD, path, O_PATH | O_DIRECTORY));
-        std::string name = OST_TRY(OSTMakeUnique(
+        std::string name = OST_TRY(OSTMakeUnderUniqueName(
             "temp.", [&](const char* candidate) { return ::mkdirat(parent.get(), candidate, S_IRWXU) == 0; }));
         if (owner != 0)
             if (const auto made = OSTOpenItem(parent.get(), name, O_PATH | O_DIRECTORY))

@@ -75,7 +75,7 @@ std::expected<void, platform::Errno> finish(int file, std::string_view bytes, co
 std::expected<void, platform::Errno> writeAtomically(const OSTItemPlace& place, int workshop, std::string_view bytes,
                                                      const OSTFileAttributes& attributes) {
     FileDescriptor file;
-    UnfinishedFile unfinished(workshop, OST_TRY(OSTMakeUnique(OSTUnfinishedPrefix, [&](const char* candidate) {
+    UnfinishedFile unfinished(workshop, OST_TRY(OSTMakeUnderUniqueName(OSTUnfinishedPrefix, [&](const char* candidate) {
                                   file = createExclusively(workshop, candidate, attributes.mode);
                                   return static_cast<bool>(file);
                               })));

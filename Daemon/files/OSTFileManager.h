@@ -164,7 +164,7 @@ public:
     [[nodiscard]] std::expected<void, platform::Errno> readFile(int directory, std::string_view relativePath,
                                                                 std::size_t maximumSize, std::string& buffer) const;
 
-    /// Writes a file in one step: whoever opens `path`, now or after a power cut, finds the old content or all of the
+    /// Writes a file in one step: who opens `path`, now or after a power cut, finds the old content or all of the
     /// new. The new file is on disk when this returns. A crash may leave an unfinished file in the workshop.
     [[nodiscard]] OSTResult<void> writeFileAtomicallyAtURL(std::string_view path, std::string_view bytes,
                                                            const OSTFileAttributes& attributes = {},

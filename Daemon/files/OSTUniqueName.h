@@ -22,7 +22,7 @@ inline constexpr int OSTUniqueNameAttempts = 100;
 /// Calls `make` with names of the prefix and six random letters or digits until it answers true, and returns the name
 /// that it took. Fails with errno as soon as that is not EEXIST.
 template<typename Make>
-[[nodiscard]] std::expected<std::string, platform::Errno> OSTMakeUnique(std::string_view prefix, Make make) {
+[[nodiscard]] std::expected<std::string, platform::Errno> OSTMakeUnderUniqueName(std::string_view prefix, Make make) {
     static constexpr std::string_view characters = "abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ0123456789";
     for (int attempt = 0; attempt < OSTUniqueNameAttempts; ++attempt) {
         std::array<std::uint8_t, 6> random{};

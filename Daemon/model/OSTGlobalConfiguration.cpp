@@ -1,6 +1,6 @@
 #include "model/OSTGlobalConfiguration.h"
 
-#include "model/OSTMadeDirectory.h"
+#include "model/OSTLayoutDirectory.h"
 #include "platform/base/Immortal.h"
 #include "platform/base/Log.h"
 #include "platform/base/Path.h"
@@ -56,63 +56,63 @@ OSTGlobalConfiguration::OSTGlobalConfiguration()
 
 std::string OSTGlobalConfiguration::sharedContainersDirectory() {
     const platform::BasicMutexLock lock(_mutex);
-    return OSTMadeDirectory(_sharedContainersDirectory, withIntermediates,
-                            "Failed to create shared container dir at \"%@\": %@");
+    return OSTMakeLayoutDirectory(_sharedContainersDirectory, withIntermediates,
+                                  "Failed to create shared container dir at \"%@\": %@");
 }
 
 std::string OSTGlobalConfiguration::logDirectory() {
-    return OSTMadeDirectory(pathByAppending(_homeDirectory, "Library/Logs/Ostrand"), unprotected,
-                            "Failed to create log directory at \"%@\": %@");
+    return OSTMakeLayoutDirectory(pathByAppending(_homeDirectory, "Library/Logs/Ostrand"), unprotected,
+                                  "Failed to create log directory at \"%@\": %@");
 }
 
 std::string OSTGlobalConfiguration::cachesDirectory() {
     const platform::BasicMutexLock lock(_mutex);
-    return OSTMadeDirectory(pathByAppending(_homeDirectory, cachesName), unprotected,
-                            "Failed to create cache dir at \"%@\": %@");
+    return OSTMakeLayoutDirectory(pathByAppending(_homeDirectory, cachesName), unprotected,
+                                  "Failed to create cache dir at \"%@\": %@");
 }
 
 std::string OSTGlobalConfiguration::libraryDirectory() {
     const platform::BasicMutexLock lock(_mutex);
-    return OSTMadeDirectory(pathByAppending(_homeDirectory, "Library/Ostrand"), unprotected,
-                            "Failed to create library dir at \"%@\": %@");
+    return OSTMakeLayoutDirectory(pathByAppending(_homeDirectory, "Library/Ostrand"), unprotected,
+                                  "Failed to create library dir at \"%@\": %@");
 }
 
 std::string OSTGlobalConfiguration::transientDirectory() {
     const platform::BasicMutexLock lock(_mutex);
-    return OSTMadeDirectory(pathByAppending(cachesDirectory(), transientName), withIntermediates,
-                            "Failed to create transient dir at \"%@\": %@");
+    return OSTMakeLayoutDirectory(pathByAppending(cachesDirectory(), transientName), withIntermediates,
+                                  "Failed to create transient dir at \"%@\": %@");
 }
 
 std::string OSTGlobalConfiguration::stagingDirectory() {
     const platform::BasicMutexLock lock(_mutex);
-    return OSTMadeDirectory(pathByAppending(cachesDirectory(), "Staging"), withIntermediates,
-                            "Failed to create staging dir at \"%@\": %@");
+    return OSTMakeLayoutDirectory(pathByAppending(cachesDirectory(), "Staging"), withIntermediates,
+                                  "Failed to create staging dir at \"%@\": %@");
 }
 
 std::string OSTGlobalConfiguration::deathrowDirectory() {
     const platform::BasicMutexLock lock(_mutex);
-    return OSTMadeDirectory(pathByAppending(cachesDirectory(), "Dead"), withIntermediates,
-                            "Failed to create deathrow dir at \"%@\": %@");
+    return OSTMakeLayoutDirectory(pathByAppending(cachesDirectory(), "Dead"), withIntermediates,
+                                  "Failed to create deathrow dir at \"%@\": %@");
 }
 
 std::string OSTGlobalConfiguration::replaceDirectory() {
     const platform::BasicMutexLock lock(_mutex);
-    return OSTMadeDirectory(pathByAppending(libraryDirectory(), "Replace"), withIntermediates,
-                            "Failed to create replace dir at \"%@\": %@");
+    return OSTMakeLayoutDirectory(pathByAppending(libraryDirectory(), "Replace"), withIntermediates,
+                                  "Failed to create replace dir at \"%@\": %@");
 }
 
 std::string OSTGlobalConfiguration::bundleDirectory() {
     const platform::BasicMutexLock lock(_mutex);
-    return OSTMadeDirectory(pathByAppending(sharedContainersDirectory(), "Bundle"), withIntermediates,
-                            "Failed to create bundle dir at \"%@\": %@");
+    return OSTMakeLayoutDirectory(pathByAppending(sharedContainersDirectory(), "Bundle"), withIntermediates,
+                                  "Failed to create bundle dir at \"%@\": %@");
 }
 
 std::string OSTGlobalConfiguration::transientBundleDirectory() {
     const platform::BasicMutexLock lock(_mutex);
     std::string path = _tessalydHomeDirectory;
     for (const auto component : {"Library", "Caches", "com.tamarok.ostrandd"})
-        path = OSTMadeDirectory(pathByAppending(path, component), {.mode = 0755, .owner = OSTInstallerUserId},
-                                "Failed to create transient bundle dir at \"%@\": %@");
+        path = OSTMakeLayoutDirectory(pathByAppending(path, component), {.mode = 0755, .owner = OSTInstallerUserId},
+                                      "Failed to create transient bundle dir at \"%@\": %@");
     return path;
 }
 
@@ -144,9 +144,9 @@ std::optional<std::string> OSTGlobalConfiguration::containerDirectoryURLForUser(
         return configuration ? configuration->containerDirectoryURLForContentClass(contentClass, transient)
                              : std::nullopt;
     }
-    return OSTMadeDirectory(pathByAppending(base, pathComponentForContainerClass(contentClass)),
-                            {.withIntermediateDirectories = true, .mode = 0755, .owner = owner},
-                            "Failed to create container dir at \"%@\": %@");
+    return OSTMakeLayoutDirectory(pathByAppending(base, pathComponentForContainerClass(contentClass)),
+                                  {.withIntermediateDirectories = true, .mode = 0755, .owner = owner},
+                                  "Failed to create container dir at \"%@\": %@");
 }
 
 std::expected<bool, platform::Errno> OSTGlobalConfiguration::isContainerURL(std::string_view url) const {

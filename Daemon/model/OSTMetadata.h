@@ -18,7 +18,7 @@ enum class OSTCheckClassPath : bool { no, yes };
 
 /// What is known of one container.
 ///
-/// A value type. Records that are shared (`OSTMetadataRecord`) never change; whoever has to change one makes a copy.
+/// A value type. Records that are shared (`OSTMetadataRecord`) never change; a change is made in a copy.
 ///
 /// On disk: a binary property list with "OSTMetadataIdentifier", "OSTMetadataUUID" (canonical text),
 /// "OSTMetadataContentClass", "OSTMetadataPersona" (the user id) and, when there is info, "OSTMetadataInfo". Old files

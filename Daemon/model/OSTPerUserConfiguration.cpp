@@ -1,6 +1,6 @@
 #include "model/OSTPerUserConfiguration.h"
 
-#include "model/OSTMadeDirectory.h"
+#include "model/OSTLayoutDirectory.h"
 #include "platform/base/Log.h"
 #include "platform/base/Path.h"
 #include "platform/device/Accounts.h"
@@ -58,7 +58,7 @@ std::optional<std::string> OSTPerUserConfiguration::userBaseDirectory() {
     if (!path)
         return std::nullopt;
     const platform::MutexLock lock(_mutex);
-    return OSTMadeDirectory(*std::move(path), _ownedByUser(), "Failed to create user base dir at \"%@\": %@");
+    return OSTMakeLayoutDirectory(*std::move(path), _ownedByUser(), "Failed to create user base dir at \"%@\": %@");
 }
 
 std::optional<std::string> OSTPerUserConfiguration::transientDirectory() {
@@ -66,7 +66,7 @@ std::optional<std::string> OSTPerUserConfiguration::transientDirectory() {
     if (!path)
         return std::nullopt;
     const platform::MutexLock lock(_mutex);
-    return OSTMadeDirectory(*std::move(path), _ownedByUser(), "Failed to create transient dir at \"%@\": %@");
+    return OSTMakeLayoutDirectory(*std::move(path), _ownedByUser(), "Failed to create transient dir at \"%@\": %@");
 }
 
 std::optional<std::string> OSTPerUserConfiguration::oldLibraryDirectoryPath() const {
@@ -85,8 +85,8 @@ std::optional<std::string> OSTPerUserConfiguration::containerDirectoryURLForCont
     if (!base)
         return std::nullopt;
     const platform::MutexLock lock(_mutex);
-    return OSTMadeDirectory(pathByAppending(*base, pathComponentForContainerClass(contentClass)), _ownedByUser(),
-                            "Failed to create container dir at \"%@\": %@");
+    return OSTMakeLayoutDirectory(pathByAppending(*base, pathComponentForContainerClass(contentClass)), _ownedByUser(),
+                                  "Failed to create container dir at \"%@\": %@");
 }
 
 } // namespace ost

@@ -16,9 +16,9 @@ namespace {
 /// The container that a request names, its user resolved for the client.
 std::expected<OSTContainerReference, OSTErrorCode> containerOf(const platform::IPCRequest& request,
                                                                const OSTClientConnection& client) {
-    const auto place = OST_TRY(OSTRequestedPlace(request, client));
-    return OSTContainerReference{.name = {.userId = place.userId,
-                                          .containerClass = place.containerClass,
+    const auto requested = OST_TRY(OSTReadClassAndUser(request, client));
+    return OSTContainerReference{.name = {.userId = requested.userId,
+                                          .containerClass = requested.containerClass,
                                           .identifier = request.stringValue(requestKey::identifier)},
                                  .uuid = request.uuidValue(requestKey::container.uuid)};
 }

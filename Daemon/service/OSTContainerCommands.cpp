@@ -6,10 +6,10 @@ namespace ost {
 
 OSTCommandResult OSTCreateOrLookupCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
                                           OSTClientConnection& client) {
-    const auto place = OST_TRY(OSTRequestedPlace(request, client));
+    const auto requested = OST_TRY(OSTReadClassAndUser(request, client));
     const auto record = OST_TRY(client.createOrLookupContainerForUser(
-        {.name = {.userId = place.userId,
-                  .containerClass = place.containerClass,
+        {.name = {.userId = requested.userId,
+                  .containerClass = requested.containerClass,
                   .identifier = OSTRequestedIdentifier(request, client),
                   .transient = request.booleanValue(requestKey::transient)},
          .createIfNecessary = request.booleanValue(requestKey::createIfNecessary)}));
@@ -22,9 +22,9 @@ OSTCommandResult OSTCreateOrLookupCommand(const platform::IPCRequest& request, p
 
 OSTCommandResult OSTListCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
                                 OSTClientConnection& client) {
-    const auto place = OST_TRY(OSTRequestedPlace(request, client));
-    const auto records = OST_TRY(
-        client.containersForUser(place.userId, place.containerClass, request.booleanValue(requestKey::transient)));
+    const auto requested = OST_TRY(OSTReadClassAndUser(request, client));
+    const auto records = OST_TRY(client.containersForUser(requested.userId, requested.containerClass,
+                                                          request.booleanValue(requestKey::transient)));
     auto identifiers = reply.encoder(replyKey::identifiers);
     identifiers.beginArray(records.size());
     for (const auto& record : records)

@@ -35,14 +35,14 @@ OSTCommandResult OSTReplaceCommand(const platform::IPCRequest& request, platform
     OSTReplacement replacement;
     auto& oldContainer = replacement.oldContainer;
     if ((oldContainer.uuid = request.uuidValue(requestKey::oldContainer.uuid))) {
-        const auto place = OST_TRY(OSTRequestedPlace(request, client, requestKey::oldContainer));
-        oldContainer.name = {.userId = place.userId,
-                             .containerClass = place.containerClass,
+        const auto requested = OST_TRY(OSTReadClassAndUser(request, client, requestKey::oldContainer));
+        oldContainer.name = {.userId = requested.userId,
+                             .containerClass = requested.containerClass,
                              .identifier = request.stringValue(requestKey::oldContainer.identifier)};
     }
-    const auto place = OST_TRY(OSTRequestedPlace(request, client, requestKey::newContainer));
-    replacement.newContainer = {.name = {.userId = place.userId,
-                                         .containerClass = place.containerClass,
+    const auto requested = OST_TRY(OSTReadClassAndUser(request, client, requestKey::newContainer));
+    replacement.newContainer = {.name = {.userId = requested.userId,
+                                         .containerClass = requested.containerClass,
                                          .identifier = request.stringValue(requestKey::newContainer.identifier)},
                                 .uuid = request.uuidValue(requestKey::newContainer.uuid)};
     return client.replaceContainer(replacement);
@@ -88,9 +88,9 @@ OSTCommandResult OSTDestroyDeathRowCommand(const platform::IPCRequest& /*request
 
 OSTCommandResult OSTDeleteCommand(const platform::IPCRequest& request, platform::IPCReply& /*reply*/,
                                   OSTClientConnection& client) {
-    const auto place = OST_TRY(OSTRequestedPlace(request, client));
-    return client.deleteContainerForUser({.userId = place.userId,
-                                          .containerClass = place.containerClass,
+    const auto requested = OST_TRY(OSTReadClassAndUser(request, client));
+    return client.deleteContainerForUser({.userId = requested.userId,
+                                          .containerClass = requested.containerClass,
                                           .identifier = request.stringValue(requestKey::identifier),
                                           .transient = request.booleanValue(requestKey::transient)});
 }

@@ -4,9 +4,9 @@
 
 namespace ost {
 
-std::expected<OSTRequestedClassAndUser, OSTErrorCode> OSTRequestedPlace(const platform::IPCRequest& request,
-                                                                        const OSTClientConnection& client,
-                                                                        const requestKey::Container& keys) {
+std::expected<OSTRequestedClassAndUser, OSTErrorCode> OSTReadClassAndUser(const platform::IPCRequest& request,
+                                                                          const OSTClientConnection& client,
+                                                                          const requestKey::Container& keys) {
     const auto containerClass = static_cast<OSTContainerClass>(request.unsignedValue(keys.containerClass));
     // Only the low half of the number is a user id.
     const auto userId = static_cast<std::uint32_t>(request.unsignedValue(keys.userId));

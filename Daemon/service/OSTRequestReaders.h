@@ -21,8 +21,8 @@ struct OSTRequestedClassAndUser {
 
 /// Reads the class and the user of a request and validates the user for the client. Fails with `invalidParameter`.
 [[nodiscard]] std::expected<OSTRequestedClassAndUser, OSTErrorCode>
-OSTRequestedPlace(const platform::IPCRequest& request, const OSTClientConnection& client,
-                  const requestKey::Container& keys = requestKey::container);
+OSTReadClassAndUser(const platform::IPCRequest& request, const OSTClientConnection& client,
+                    const requestKey::Container& keys = requestKey::container);
 
 /// The identifier that a request names, or else the client's own.
 [[nodiscard]] std::optional<std::string_view> OSTRequestedIdentifier(const platform::IPCRequest& request,

@@ -11,17 +11,20 @@ namespace ost {
 
 /// Reader/writer locks on identifiers, and one daemon-wide reader/writer lock on all of them.
 ///
-/// A writer of all identifiers excludes every other holder; a reader of all identifiers excludes identifier writers.
-/// Locks of different identifiers do not meet. Not re-entrant in any combination: a thread that holds the
-/// all-identifiers lock takes neither it again nor an identifier lock of a conflicting kind. Identifiers of one call
-/// are taken in ascending order and given back in descending order, which rules out deadlock between two callers.
+/// | held by another thread         | keeps out                                         |
+/// |--------------------------------|---------------------------------------------------|
+/// | all identifiers, for writing   | everybody                                         |
+/// | all identifiers, for reading   | writers of all identifiers and of any identifier  |
+/// | one identifier, for writing    | readers and writers of it and of all identifiers  |
+/// | one identifier, for reading    | writers of it and of all identifiers              |
 ///
-/// Whoever enters something that is entered with these locks held, as the code-signing mapping's queue is, forbids
-/// itself to take one there: the order is always the lock first.
+/// No lock is re-entrant. A holder of the all-identifiers lock may take an identifier lock only to read both.
 ///
-/// Threads: any. Misuse (unlocking what is not locked, taking the all-identifiers lock twice, taking a lock where that
-/// is forbidden) stops the process. Code takes the locks through the guards at the end; the functions are what the
-/// guards are made of.
+/// Order: identifiers of one call are taken in ascending order, so that two callers cannot wait for each other. The
+/// code-signing mapping's queue comes after the locks: its work runs under `OSTNoFurtherLocks`.
+///
+/// Threads: any. Misuse stops the process: unlocking what is not locked, taking the all-identifiers lock twice, taking
+/// a lock where that is forbidden. Code takes the locks through the guards below, which are made of the functions.
 enum class OSTLockKind : bool { reading, writing };
 
 void take_one_lock(std::string_view identifier, OSTLockKind kind);

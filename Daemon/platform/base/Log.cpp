@@ -41,7 +41,7 @@ std::string linePrefix(LogLevel level) {
     return {buffer, date + static_cast<std::size_t>(rest)};
 }
 
-/// Copies a line to standard error unless that would wait: whoever reads it may have stopped reading.
+/// Copies a line to standard error unless that would wait: its reader may have stopped reading.
 void copyToStandardError(std::string_view line) {
     pollfd out{.fd = STDERR_FILENO, .events = POLLOUT, .revents = 0};
     if (::poll(&out, 1, 0) != 1 || (out.revents & POLLOUT) == 0)

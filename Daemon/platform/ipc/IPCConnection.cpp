@@ -42,7 +42,7 @@ IPCConnection::IPCConnection(FileDescriptor socket, PeerIdentity peer, const Sur
 
 void IPCConnection::resume() {
     {
-        // Requests may be handled before `add` returns; whoever closes the socket needs the watch.
+        // A request may be handled before `add` returns. What closes the socket waits here and finds the watch.
         const MutexLock lock(_mutex);
         OST_ASSERT(_watch == WorkerPool::Watch::none && _messageHandler);
         const auto watch = _surroundings.pool.add(shared_from_this(), _socket.get(), receptionEvents);
@@ -328,7 +328,7 @@ void IPCConnection::_close() {
     }
     if (!_hungUp)
         discardReceived(socket.get());
-    // All descriptors first: whoever waits for some is told by the registry.
+    // The registry tells the listener that descriptors are free, so they are freed first.
     socket.reset();
     _peer.unpin();
     _surroundings.registry.remove(*this, _peer.effectiveUserId());

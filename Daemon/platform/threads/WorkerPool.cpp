@@ -172,7 +172,7 @@ bool WorkerPool::_park(MutexLock& lock) {
     if (!woken)
         return false;
     if (_calls > 0) {
-        // Whoever called has counted this thread as running.
+        // The caller has counted this thread as running.
         --_calls;
         if (!_stopping)
             return true;
