@@ -57,7 +57,7 @@ std::string field(const std::string& output, const std::string& name) {
     return begin == std::string::npos ? "" : output.substr(begin, output.find('\n', begin) - begin);
 }
 
-TEST_F(CommandLine, createsFindsAndListsContainers) {
+TEST_F(CommandLine, CreatesFindsAndListsContainers) {
     const auto created = ostrandctl({"create", "--class", "data/application", "com.example.a"});
     ASSERT_EQ(created.status, 0) << created.errors;
     const auto uuid = field(created.output, "uuid"), path = field(created.output, "path");
@@ -74,7 +74,7 @@ TEST_F(CommandLine, createsFindsAndListsContainers) {
         << "without an identifier the program asks for its own container";
 }
 
-TEST_F(CommandLine, deletesStagesDestroysAndReplacesContainers) {
+TEST_F(CommandLine, DeletesStagesDestroysAndReplacesContainers) {
     const auto make = [&](const std::string& identifier, bool transient = false) {
         auto words = std::vector<std::string>{"create", "--class", "2", identifier};
         if (transient)
@@ -120,7 +120,7 @@ TEST_F(CommandLine, deletesStagesDestroysAndReplacesContainers) {
     EXPECT_TRUE(ostrandctl({"purge", "--json"}).output.starts_with("{\"seconds\": "));
 }
 
-TEST_F(CommandLine, showsAndChangesWhatAContainerCarries) {
+TEST_F(CommandLine, ShowsAndChangesWhatAContainerCarries) {
     const auto made = ostrandctl({"create", "--class", "2", "com.example.a"});
     const auto with = [](std::vector<std::string> words, const std::vector<std::string>& more = {}) {
         words.insert(words.end(), {"--class", "2", "com.example.a"});
@@ -166,7 +166,7 @@ TEST_F(CommandLine, showsAndChangesWhatAContainerCarries) {
     EXPECT_EQ(renamed.substr(renamed.find('\n') + 1), field(ostrandctl(with({"show"})).output, "path") + "\n");
 }
 
-TEST_F(CommandLine, saysHowARequestFailedAndLeavesTheDeviceAlone) {
+TEST_F(CommandLine, SaysHowARequestFailedAndLeavesTheDeviceAlone) {
     const struct {
         std::string program;
         std::vector<std::string> words;

@@ -14,7 +14,7 @@ using Lines = std::vector<std::string>;
 
 namespace {
 
-/// A frame that whoever sends it loses its connection for.
+/// A frame that costs its sender the connection.
 struct HostileFrame {
     const char* what;
     std::string bytes;
@@ -27,11 +27,6 @@ std::string repeated(std::string_view text, std::size_t times) {
     return bytes;
 }
 
-/// A frame of request number 9 whose map has one entry, "X".
-HostileFrame value(const char* what, std::string_view encoded) {
-    return {what, frame(9, map({{"X", std::string(encoded)}}))};
-}
-
 std::vector<HostileFrame> hostileFrames() {
     using namespace std::string_view_literals;
     return {
@@ -39,40 +34,13 @@ std::vector<HostileFrame> hostileFrames() {
         {"a claim of 4 GB", header(0xffffffff, 9) + "\xa0"},
         {"a byte more than there may be", header((16 << 20) + 1, 9)},
         {"text for a header", "GET / HTTP/1.0\r\n\r\n"},
-        {"a number", frame(9, number(1))},
-        {"an array", frame(9, "\x80"sv)},
-        {"a null", frame(9, null())},
+        {"no map", frame(9, number(1))},
         {"a map cut short", frame(9, "\xa1\x61"sv)},
         {"a byte behind the map", frame(9, map({}) + null())},
-        {"two maps", frame(9, map({}) + map({}))},
         {"a map of 2^64 entries", frame(9, "\xbb\xff\xff\xff\xff\xff\xff\xff\xff"sv)},
-        {"a key that is a number", frame(9, "\xa1\x01\x01"sv)},
         {"a repeated key", request(9, {{"Command", number(0)}, {"Command", number(1)}})},
-        {"a repeated key, further down", frame(9, map({{"X", map({{"a", null()}, {"b", null()}, {"a", null()}})}}))},
-        {"a map of indefinite length", frame(9, "\xbf\xff"sv)},
-        {"a byte of NUL in a key", frame(9, "\xa1\x62X\0\x01"sv)},
-        value("an array of indefinite length", "\x9f\xff"sv),
-        value("a text of indefinite length", "\x7f\x61"
-                                             "a\xff"sv),
-        value("10,000 nested arrays", repeated("\x81", 9999) + "\x80"),
-        value("64 nested arrays", repeated("\x81", 63) + "\x80"),
-        value("a text that is no UTF-8", "\x62\xc3\x28"sv),
-        value("an overlong text", "\x62\xc0\xaf"sv),
-        value("a surrogate", "\x63\xed\xa0\x80"sv),
-        value("a text with NUL", "\x63"
-                                 "a\0b"sv),
-        value("a text of 2^63 bytes", "\x7b\x7f\xff\xff\xff\xff\xff\xff\xff"sv),
-        value("an unknown tag", "\xc2\x41\x01"sv),
-        value("a tag around nothing", "\xd8\x25"sv),
-        value("a UUID of 15 bytes", "\xd8\x25\x4f"
-                                    "0123456789abcde"sv),
-        value("a UUID in words", "\xd8\x25\x61"
-                                 "a"sv),
-        value("a date in words", "\xc1\x61"
-                                 "a"sv),
-        value("undefined", "\xf7"sv),
-        value("a break", "\xff"sv),
-        value("a reserved form of length", "\x1c"sv),
+        {"10,000 nested arrays", frame(9, map({{"X", repeated("\x81", 9999) + "\x80"}}))},
+        {"a text that is no UTF-8", frame(9, map({{"X", "\x62\xc3\x28"}}))},
     };
 }
 
@@ -147,16 +115,6 @@ TEST_F(HostileFrameTest, TheLongestAndTheDeepestThatIsAllowedIsServed) {
     EXPECT_EQ(longest.error(), 21U);
 }
 
-TEST_F(HostileFrameTest, AFrameMayComeByteByByte) {
-    auto connection = connect();
-    for (const char byte : creation(3, "com.example.slow"))
-        connection.send({&byte, 1});
-    const auto reply = connection.receive();
-    ASSERT_TRUE(reply);
-    EXPECT_EQ(reply->requestNumber(), 3U);
-    EXPECT_EQ(reply->error(), 1U);
-}
-
 TEST_F(HostileFrameTest, AClientThatLeavesCostsNothing) {
     DeviceLog log(device());
     for (const auto& [what, bytes] : unfinishedFrames()) {
@@ -194,23 +152,6 @@ TEST_F(HostileFrameTest, AThousandOfThemDoNotKeepTheNextOneOut) {
     expectService("after they have left");
     EXPECT_TRUE(comesTrue([&] { return openDescriptors(device().daemonId()) <= before; }))
         << before << " descriptors before, " << openDescriptors(device().daemonId()) << " after";
-}
-
-TEST_F(HostileFrameTest, WhoLeavesTooManyRepliesUnreadLosesItsConnection) {
-    // A long identifier makes a short request for a long list.
-    ASSERT_EQ(connect().call(creation(1, std::string(900'000, 'i'))).error(), 1U);
-    DeviceLog log(device());
-    auto connection = connect();
-    connection.send(
-        repeated(request(1, {{"Command", number(1)}, {"ContainerClass", number(2)}, {"UserID", number(501)}}), 80));
-    Lines errors;
-    EXPECT_TRUE(comesTrue([&] {
-        errors = log.takeErrors();
-        return !errors.empty();
-    }));
-    ASSERT_EQ(errors.size(), 1U);
-    EXPECT_NE(errors[0].find("connection of pid " + pid() + " closed: "), std::string::npos) << errors[0];
-    expectService("while it still does not read");
 }
 
 TEST_F(HostileFrameTest, AUserCannotTakeAllConnections) {

@@ -45,7 +45,7 @@ std::string outcomeOf(const std::string& line) {
     return text;
 }
 
-TEST(Arguments, comeFromTheTableAlone) {
+TEST(Arguments, ComeFromTheTableAlone) {
     const std::string usage = " | usage: tool [--where DIR] [--loud] COMMAND ...";
     const std::string usageOfMake = "usage: tool [--where DIR] [--loud] make --colour C [--part P]... NAME [SIZE]";
     const struct {
@@ -81,7 +81,7 @@ TEST(Arguments, comeFromTheTableAlone) {
         EXPECT_EQ(outcomeOf(line), outcome) << line;
 }
 
-TEST(Arguments, helpNamesEverythingThatTheTableAccepts) {
+TEST(Arguments, HelpNamesEverythingThatTheTableAccepts) {
     const std::string_view words[] = {"make", "--help"};
     EXPECT_EQ(std::get<Help>(parseCommandLine(table, words)).text,
               "usage: tool [--where DIR] [--loud] make --colour C [--part P]... NAME [SIZE]\n\n"
@@ -91,7 +91,7 @@ TEST(Arguments, helpNamesEverythingThatTheTableAccepts) {
               "  --loud       say more\n  --help       shows this\n");
 }
 
-TEST(CommandTable, hasEveryCommandOnceAndNoneHidesAnother) {
+TEST(CommandTable, HasEveryCommandOnceAndNoneHidesAnother) {
     const auto& commands = commandTable().commands;
     for (const auto& one : commands)
         for (const auto& other : commands)

@@ -31,7 +31,7 @@ std::string signatureOf(const std::string& file) {
     return identity.identifier.value_or("") + (identity.entitlements ? identity.entitlements->description() : "");
 }
 
-TEST(SignCommand, signsWhatCountsAndGivesNoPrivateRightsToOthers) {
+TEST(SignCommand, SignsWhatCountsAndGivesNoPrivateRightsToOthers) {
     if (geteuid() != 0)
         GTEST_SKIP() << "only root may sign";
     const auto directory = ost::test::makeScratchDirectory();
@@ -85,7 +85,7 @@ TEST(SignCommand, signsWhatCountsAndGivesNoPrivateRightsToOthers) {
     EXPECT_TRUE(link.error().message.ends_with("is no regular file")) << link.error().message;
 }
 
-TEST(DeviceCommands, setAndShowTheLockStateOfTheDeviceThatIsNamed) {
+TEST(DeviceCommands, SetAndShowTheLockStateOfTheDeviceThatIsNamed) {
     const std::string device = ost::test::makeScratchDirectory();
     const auto state = [&](std::string_view word) {
         const auto result = run({"device", word, "--device", device});

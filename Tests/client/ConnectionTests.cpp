@@ -81,7 +81,7 @@ private:
     FileDescriptor _client, _socket;
 };
 
-TEST(Connection, tellsHowARequestEnded) {
+TEST(Connection, TellsHowARequestEnded) {
     const auto good = reply(1, 1);
     const struct {
         const char* what;
@@ -109,7 +109,7 @@ TEST(Connection, tellsHowARequestEnded) {
     }
 }
 
-TEST(Connection, stillDeliversTheRepliesBeforeARefusal) {
+TEST(Connection, StillDeliversTheRepliesBeforeARefusal) {
     Daemon daemon;
     auto connection = daemon.client();
     const auto first = connection.send(Request(ost::OSTCommand{0})),
@@ -128,7 +128,7 @@ TEST(Connection, stillDeliversTheRepliesBeforeARefusal) {
     }
 }
 
-TEST(Connection, waitsNoLongerThanItsTimeoutAndCanWaitAgain) {
+TEST(Connection, WaitsNoLongerThanItsTimeoutAndCanWaitAgain) {
     Daemon daemon;
     auto connection = daemon.client(1ms);
     const auto number = connection.send(Request(ost::OSTCommand{0}));
@@ -149,7 +149,7 @@ TEST(Connection, waitsNoLongerThanItsTimeoutAndCanWaitAgain) {
     EXPECT_EQ(stuck.error(), Error::transport(ETIMEDOUT));
 }
 
-TEST(Connection, sendsAnyNumberOfRequestsBeforeItReceivesAnyReply) {
+TEST(Connection, SendsAnyNumberOfRequestsBeforeItReceivesAnyReply) {
     Daemon daemon;
     // Neither side's requests or replies fit into the socket: a client that only sent would wait for ever.
     constexpr std::uint64_t count = 3000;
@@ -187,7 +187,7 @@ TEST(Connection, sendsAnyNumberOfRequestsBeforeItReceivesAnyReply) {
     }
 }
 
-TEST(Connection, reachesADeviceWhosePathIsTooLongForASocketAddress) {
+TEST(Connection, ReachesADeviceWhosePathIsTooLongForASocketAddress) {
     const auto device = ost::test::makeScratchDirectory() / std::string(120, 'd');
     const auto run = device / "private/var/run";
     std::filesystem::create_directories(run);

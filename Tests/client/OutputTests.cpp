@@ -10,7 +10,7 @@ using namespace ostrand::ctl;
 
 namespace {
 
-TEST(Output, writesJSONThatHoldsWhateverTheValuesHold) {
+TEST(Output, WritesJSONThatHoldsWhateverTheValuesHold) {
     ost::OSTDictionary dictionary;
     dictionary.set("b", ost::OSTArray{true, std::uint64_t{1}, ost::OSTArray{}});
     dictionary.set("a\"", ost::OSTDictionary());
@@ -34,7 +34,7 @@ TEST(Output, writesJSONThatHoldsWhateverTheValuesHold) {
         EXPECT_EQ(jsonText(value), json);
 }
 
-TEST(Output, writesATreeThatIsPlainToReadWhateverTheValuesHold) {
+TEST(Output, WritesATreeThatIsPlainToReadWhateverTheValuesHold) {
     const ost::OSTDictionary inner({{"k\n", std::string("\x1b[\"")}});
     const ost::OSTDictionary dictionary(
         {{"array", ost::OSTArray{std::int64_t{-1}, ost::OSTArray{true, inner}, ost::OSTArray{}}},
@@ -60,7 +60,7 @@ real 0.5
     EXPECT_EQ(treeText({}), "");
 }
 
-TEST(Output, saysOfAFailureWhatProgramsAndPeopleNeed) {
+TEST(Output, SaysOfAFailureWhatProgramsAndPeopleNeed) {
     const struct {
         Failure failure;
         int status;
@@ -80,7 +80,7 @@ TEST(Output, saysOfAFailureWhatProgramsAndPeopleNeed) {
     }
 }
 
-TEST(ErrorCodes, areTheSystemsOwnBeforeTheyAreErrnos) {
+TEST(ErrorCodes, AreTheSystemsOwnBeforeTheyAreErrnos) {
     const struct {
         std::uint64_t code;
         std::string meaning;
@@ -97,7 +97,7 @@ TEST(ErrorCodes, areTheSystemsOwnBeforeTheyAreErrnos) {
         EXPECT_EQ(Error::failed(code).description(), "error " + std::to_string(code) + ": " + meaning);
 }
 
-TEST(ContainerClass, isNamedInAnyCaseAndHasAUsualUserThatFits) {
+TEST(ContainerClass, IsNamedInAnyCaseAndHasAUsualUserThatFits) {
     for (std::uint64_t number = 1; number <= 13; ++number) {
         const auto containerClass = static_cast<ContainerClass>(number);
         const auto name = std::string(ost::pathComponentForContainerClass(containerClass));

@@ -24,7 +24,7 @@ std::string outcome(const std::expected<T, Failure>& value) {
         return std::to_string(static_cast<std::uint64_t>(*value));
 }
 
-TEST(Values, meanWhatTheyName) {
+TEST(Values, MeanWhatTheyName) {
     const std::string device = ost::test::makeScratchDirectory();
     EXPECT_NE(outcome(userNamed("mobile", device)).find("cannot read"), std::string::npos);
     ost::test::writeFile(device + "/etc/passwd", "mobile:x:501:501::/private/var/mobile:\n7:x:8:8::/:\n");
@@ -44,7 +44,7 @@ TEST(Values, meanWhatTheyName) {
         EXPECT_EQ(result, expected);
 }
 
-TEST(Values, dictionariesAreReadInBothEncodingsAndFromStandardInput) {
+TEST(Values, DictionariesAreReadInBothEncodingsAndFromStandardInput) {
     const auto directory = ost::test::makeScratchDirectory();
     const std::string file = directory / "file";
     ost::OSTValue deep = std::string("x");

@@ -88,7 +88,7 @@ protected:
     }
 };
 
-TEST_F(AccessControlListTest, opensASystemContainerToSystemUsersAlone) {
+TEST_F(AccessControlListTest, OpensASystemContainerToSystemUsersAlone) {
     ASSERT_TRUE(makeACL(topLevel).apply(open(top).get()));
     standardize(top + "/Library", directory);
     standardize(top + "/Library/data", file);
@@ -114,7 +114,7 @@ TEST_F(AccessControlListTest, opensASystemContainerToSystemUsersAlone) {
     EXPECT_EQ(modeOf(top), 0775U) << "owner and others keep their bits, the group bits show the mask";
 }
 
-TEST_F(AccessControlListTest, handsEntriesDownToDirectoriesOfTheDaemon) {
+TEST_F(AccessControlListTest, HandsEntriesDownToDirectoriesOfTheDaemon) {
     ASSERT_TRUE(makeACL(topLevel).apply(open(top).get()));
     const auto made = top + "/tmp";
     ASSERT_EQ(::mkdir(made.c_str(), 0), 0);
@@ -127,7 +127,7 @@ TEST_F(AccessControlListTest, handsEntriesDownToDirectoriesOfTheDaemon) {
     EXPECT_EQ(applyInheritedEntries(open("/").get(), open(made).get()), false);
 }
 
-TEST_F(AccessControlListTest, keepsTheMaskAndTheEntriesWhenTheModeChanges) {
+TEST_F(AccessControlListTest, KeepsTheMaskAndTheEntriesWhenTheModeChanges) {
     const auto path = top + "/Library/data";
     standardize(path, file);
     const auto item = open(path);
@@ -148,7 +148,7 @@ TEST_F(AccessControlListTest, keepsTheMaskAndTheEntriesWhenTheModeChanges) {
     EXPECT_EQ(modeOf(path), 0604U);
 }
 
-TEST_F(AccessControlListTest, replacesWhatADirectoryHandsDown) {
+TEST_F(AccessControlListTest, ReplacesWhatADirectoryHandsDown) {
     const FileDescriptor item(::open(top.c_str(), O_RDONLY | O_DIRECTORY));
     ASSERT_TRUE(makeACL(directory).apply(item.get()));
     ASSERT_GT(::fgetxattr(item.get(), "system.posix_acl_default", nullptr, 0), 0);
@@ -157,7 +157,7 @@ TEST_F(AccessControlListTest, replacesWhatADirectoryHandsDown) {
     EXPECT_TRUE(makeACL(file).apply(item.get()));
 }
 
-TEST_F(AccessControlListTest, leavesWhatASymbolicLinkPointsAtAlone) {
+TEST_F(AccessControlListTest, LeavesWhatASymbolicLinkPointsAtAlone) {
     const auto link = top + "/link";
     ASSERT_EQ(::symlink("Library", link.c_str()), 0);
     const auto item = open(link);
@@ -166,7 +166,7 @@ TEST_F(AccessControlListTest, leavesWhatASymbolicLinkPointsAtAlone) {
     EXPECT_EQ(modeOf(top + "/Library"), 0755U);
 }
 
-TEST_F(AccessControlListTest, refusesWhatTheModelDoesNotHave) {
+TEST_F(AccessControlListTest, RefusesWhatTheModelDoesNotHave) {
     auto acl = AccessControlList::create(1).value();
     auto* entry = acl.createEntry().value();
     EXPECT_EQ(entry->addPermissions(0x1).error(), EINVAL);
@@ -180,7 +180,7 @@ TEST_F(AccessControlListTest, refusesWhatTheModelDoesNotHave) {
     EXPECT_EQ(acl.apply(-1).error(), EBADF);
 }
 
-TEST_F(AccessControlListTest, namesGroupsByStableUUIDs) {
+TEST_F(AccessControlListTest, NamesGroupsByStableUUIDs) {
     const auto uuid = groupUUIDForName("systemusers").value();
     EXPECT_EQ(uuid, groupUUIDForName("systemusers").value());
     EXPECT_EQ(groupNameForUUID(uuid).value(), "systemusers");

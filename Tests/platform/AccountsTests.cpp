@@ -7,7 +7,7 @@ namespace {
 
 class AccountsTest : public test::DeviceTest {};
 
-TEST_F(AccountsTest, findsUsersAndGroupsByNameAndNumber) {
+TEST_F(AccountsTest, FindsUsersAndGroupsByNameAndNumber) {
     test::writeFile("/etc/passwd", "# comment\n"
                                    "root:x:0:0:Root,,:/private/var/root:/bin/sh\n"
                                    "short:x:1\n"
@@ -38,7 +38,7 @@ TEST_F(AccountsTest, findsUsersAndGroupsByNameAndNumber) {
     EXPECT_EQ(groupsOf({"c", 700, 9, ""}, "/other"), std::vector<gid_t>{9});
 }
 
-TEST_F(AccountsTest, failWhenTheDatabaseCannotBeRead) {
+TEST_F(AccountsTest, FailWhenTheDatabaseCannotBeRead) {
     std::filesystem::remove("/etc/passwd");
     EXPECT_EQ(accountForUserId(0).error(), ENOENT);
     std::filesystem::create_directory("/etc/passwd");

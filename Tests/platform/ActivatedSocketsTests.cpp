@@ -41,7 +41,7 @@ protected:
     }
 };
 
-TEST_F(ActivatedSocketsTest, takesOverWhatTheLauncherListensOn) {
+TEST_F(ActivatedSocketsTest, TakesOverWhatTheLauncherListensOn) {
     auto listener = ActivatedSockets().takeListener(service, SOCK_STREAM).value();
     const FileDescriptor notListening(::socket(AF_UNIX, SOCK_STREAM, 0));
     handOver({listener.get(), notListening.get(), listener.get()}, "com.tamarok.tests:quiet:packets");
@@ -58,7 +58,7 @@ TEST_F(ActivatedSocketsTest, takesOverWhatTheLauncherListensOn) {
     EXPECT_EQ(sockets.takeListener("packets", SOCK_SEQPACKET).error(), EPROTOTYPE);
 }
 
-TEST_F(ActivatedSocketsTest, leavesWhatWasHandedToSomebodyElse) {
+TEST_F(ActivatedSocketsTest, LeavesWhatWasHandedToSomebodyElse) {
     const auto listener = ActivatedSockets().takeListener("other", SOCK_STREAM).value();
     handOver({listener.get()}, service, ::getppid());
     auto sockets = ActivatedSockets::fromEnvironment();
@@ -66,7 +66,7 @@ TEST_F(ActivatedSocketsTest, leavesWhatWasHandedToSomebodyElse) {
     EXPECT_GE(::fcntl(3, F_GETFD), 0);
 }
 
-TEST_F(ActivatedSocketsTest, bindsWhatWasNotHandedOver) {
+TEST_F(ActivatedSocketsTest, BindsWhatWasNotHandedOver) {
     ::umask(077);
     for (const int type : {SOCK_STREAM, SOCK_SEQPACKET}) {
         const auto listener =

@@ -12,7 +12,7 @@ namespace {
 
 class CrashReportTest : public test::DeviceTest {};
 
-TEST_F(CrashReportTest, isTheLastThingAProcessWrites) {
+TEST_F(CrashReportTest, IsTheLastThingAProcessWrites) {
     const std::string message = "** INTERNAL ERROR **\n" + std::string(10000, 'x');
     EXPECT_DEATH(crashWithMessage(message), "\\*\\* INTERNAL ERROR \\*\\*\nx{10000}\n");
     const auto reports = test::tree(crashReportDirectory);
@@ -23,7 +23,7 @@ TEST_F(CrashReportTest, isTheLastThingAProcessWrites) {
               message + "\n");
 }
 
-TEST_F(CrashReportTest, endsTheProcessWhateverStandsInTheWay) {
+TEST_F(CrashReportTest, EndsTheProcessWhateverStandsInTheWay) {
     std::filesystem::remove_all("/private/var/root");
     test::writeFile("/private/var/root", "no directory");
     EXPECT_EXIT(crashWithMessage("last words"), testing::KilledBySignal(SIGABRT), "last words");

@@ -7,7 +7,7 @@ namespace {
 
 class DeviceCapabilitiesTest : public test::DeviceTest {};
 
-TEST_F(DeviceCapabilitiesTest, areThoseTheDeviceStates) {
+TEST_F(DeviceCapabilitiesTest, AreThoseTheDeviceStates) {
     EXPECT_FALSE(deviceCapability("InternalBuild"));
     test::writeFile("/etc/device-capabilities",
                     "#InternalBuild=false\nInternalBuild=true\nOff=false\nOdd=yes\nLast=true");
@@ -17,7 +17,7 @@ TEST_F(DeviceCapabilitiesTest, areThoseTheDeviceStates) {
         EXPECT_FALSE(deviceCapability(name)) << name;
 }
 
-TEST_F(DeviceCapabilitiesTest, includeTheBuildVersion) {
+TEST_F(DeviceCapabilitiesTest, IncludeTheBuildVersion) {
     const std::pair<const char*, std::optional<std::string>> cases[] = {
         {"NAME=x\nBUILD_ID=24A335\n", "24A335"},
         {"BUILD_ID=\"24 \\\"A\\\"\"", "24 \"A\""},

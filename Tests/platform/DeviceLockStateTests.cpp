@@ -9,7 +9,7 @@ namespace {
 
 class DeviceLockStateTest : public test::DeviceTest {};
 
-TEST_F(DeviceLockStateTest, isTheNumberInItsFile) {
+TEST_F(DeviceLockStateTest, IsTheNumberInItsFile) {
     EXPECT_EQ(deviceLockState(), deviceUnlocked) << "nobody has written one";
     const struct {
         const char* content;
@@ -44,7 +44,7 @@ TEST_F(DeviceLockStateTest, isTheNumberInItsFile) {
     }
 }
 
-TEST_F(DeviceLockStateTest, isWrittenIntoAnImage) {
+TEST_F(DeviceLockStateTest, IsWrittenIntoAnImage) {
     std::filesystem::create_directories("/image/private/var/run");
     ASSERT_TRUE(writeDeviceLockState(deviceLocked, "/image"));
     EXPECT_EQ(test::readFile("/image/private/var/run/device-lock-state"), "1\n");
@@ -52,7 +52,7 @@ TEST_F(DeviceLockStateTest, isWrittenIntoAnImage) {
     EXPECT_EQ(writeDeviceLockState(deviceLocked, "/no-image").error(), ENOENT);
 }
 
-TEST_F(DeviceLockStateTest, notifiesOnceAboutChangesThatComeTogether) {
+TEST_F(DeviceLockStateTest, NotifiesOnceAboutChangesThatComeTogether) {
     auto loop = RunLoop::create().value();
     int calls = 0;
     const auto registration = DeviceLockStateNotification::registerHandler(*loop, [&] { ++calls; }).value();

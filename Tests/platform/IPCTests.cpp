@@ -399,7 +399,7 @@ TEST(IPC, AReplyThatTheSocketCannotHoldComesWhole) {
     }
 }
 
-TEST(IPC, WhoeverPassesALimitLosesTheConnection) {
+TEST(IPC, AClientThatPassesALimitLosesItsConnection) {
     constexpr std::size_t large = 4 * 1024 * 1024;
     const struct {
         const char* what;

@@ -9,7 +9,7 @@ namespace {
 
 class NamedSemaphoreTest : public test::DeviceTest {};
 
-TEST_F(NamedSemaphoreTest, existsOnceItIsCreated) {
+TEST_F(NamedSemaphoreTest, ExistsOnceItIsCreated) {
     EXPECT_FALSE(namedSemaphoreExists("ostrandd.fb_check"));
     ASSERT_TRUE(createNamedSemaphore("ostrandd.fb_check", 0400, 0));
     EXPECT_TRUE(namedSemaphoreExists("ostrandd.fb_check"));

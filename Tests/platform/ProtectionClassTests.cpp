@@ -28,7 +28,7 @@ protected:
     FileDescriptor _file;
 };
 
-TEST_F(ProtectionClassTest, isTheRecordedOneElseTheParentsElseTheDefault) {
+TEST_F(ProtectionClassTest, IsTheRecordedOneElseTheParentsElseTheDefault) {
     EXPECT_EQ(protectionClass(_directory.get(), -1), 0);
     EXPECT_EQ(_classOfFile(), 3);
     const struct {
@@ -50,7 +50,7 @@ TEST_F(ProtectionClassTest, isTheRecordedOneElseTheParentsElseTheDefault) {
     }
 }
 
-TEST_F(ProtectionClassTest, needsAnUnlockedDeviceForClassesWithKeys) {
+TEST_F(ProtectionClassTest, NeedsAnUnlockedDeviceForClassesWithKeys) {
     const struct {
         std::int32_t recorded; ///< -1: none
         std::int32_t wanted;
@@ -74,7 +74,7 @@ TEST_F(ProtectionClassTest, needsAnUnlockedDeviceForClassesWithKeys) {
     }
 }
 
-TEST_F(ProtectionClassTest, failsWhereItemsCannotCarryOne) {
+TEST_F(ProtectionClassTest, FailsWhereItemsCannotCarryOne) {
     const FileDescriptor foreign(::open("/proc/version", O_RDONLY | O_CLOEXEC));
     EXPECT_EQ(protectionClass(foreign.get(), -1).error(), EBADF);
     for (const std::int32_t wanted : {0, 1, 4})

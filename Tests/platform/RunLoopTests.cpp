@@ -29,7 +29,7 @@ struct Pipe {
     FileDescriptor writing;
 };
 
-TEST(RunLoop, runsWorkOfAllThreadsInOrder) {
+TEST(RunLoop, RunsWorkOfAllThreadsInOrder) {
     auto loop = RunLoop::create().value();
     const auto loopThread = std::this_thread::get_id();
     std::string order;
@@ -49,7 +49,7 @@ TEST(RunLoop, runsWorkOfAllThreadsInOrder) {
     EXPECT_EQ(order, "abcd");
 }
 
-TEST(RunLoop, servesADescriptorUntilItsSourceGoes) {
+TEST(RunLoop, ServesADescriptorUntilItsSourceGoes) {
     auto loop = RunLoop::create().value();
     const Pipe pipe;
     int calls = 0;
@@ -70,7 +70,7 @@ TEST(RunLoop, servesADescriptorUntilItsSourceGoes) {
     EXPECT_EQ(loop->addSource(-1, EPOLLIN, [](std::uint32_t) {}).error(), EBADF);
 }
 
-TEST(RunLoop, forgetsEventsOfASourceRemovedInTheSameRound) {
+TEST(RunLoop, ForgetsEventsOfASourceRemovedInTheSameRound) {
     auto loop = RunLoop::create().value();
     const Pipe pipes[2];
     int calls = 0;
@@ -90,7 +90,7 @@ TEST(RunLoop, forgetsEventsOfASourceRemovedInTheSameRound) {
     EXPECT_EQ(calls, 1);
 }
 
-TEST(RunLoop, pausesASourceWithoutEvents) {
+TEST(RunLoop, PausesASourceWithoutEvents) {
     auto loop = RunLoop::create().value();
     const Pipe pipe;
     int calls = 0;
@@ -111,7 +111,7 @@ TEST(RunLoop, pausesASourceWithoutEvents) {
     EXPECT_EQ(calls, 1);
 }
 
-TEST(RunLoop, stopsBeforeTheNextPieceOfWork) {
+TEST(RunLoop, StopsBeforeTheNextPieceOfWork) {
     auto loop = RunLoop::create().value();
     int ran = 0;
     loop->stop();

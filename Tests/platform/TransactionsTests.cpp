@@ -10,7 +10,7 @@ namespace {
 
 using namespace std::chrono_literals;
 
-TEST(Transactions, areNamedUntilTheyEnd) {
+TEST(Transactions, AreNamedUntilTheyEnd) {
     auto& transactions = Transactions::shared();
     Transaction first("start-up");
     Transaction second("request");
@@ -26,7 +26,7 @@ TEST(Transactions, areNamedUntilTheyEnd) {
     EXPECT_TRUE(transactions.waitUntilNone(std::chrono::steady_clock::now()));
 }
 
-TEST(Transactions, stayOpenUntilQueuedWorkHasRun) {
+TEST(Transactions, StayOpenUntilQueuedWorkHasRun) {
     WorkQueue queue("com.tamarok.tests.transactions");
     queue.suspend();
     bool ran = false;
@@ -40,7 +40,7 @@ TEST(Transactions, stayOpenUntilQueuedWorkHasRun) {
     EXPECT_TRUE(ran);
 }
 
-TEST(Transactions, endWhenTheQueueDropsTheWork) {
+TEST(Transactions, EndWhenTheQueueDropsTheWork) {
     WorkQueue queue("com.tamarok.tests.transactions");
     queue.suspend();
     async_with_transaction(queue, [] { FAIL() << "dropped work ran"; });

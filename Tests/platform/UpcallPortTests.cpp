@@ -124,7 +124,7 @@ protected:
     std::unique_ptr<UpcallPort> _port;
 };
 
-TEST_F(UpcallPortTest, handsOnMessagesWithRegionAndTrailer) {
+TEST_F(UpcallPortTest, HandsOnMessagesWithRegionAndTrailer) {
     const auto client = connect();
     const auto region = memoryFile("content and more");
     send(client, request(7), {region.get()}); // before it is accepted
@@ -139,7 +139,7 @@ TEST_F(UpcallPortTest, handsOnMessagesWithRegionAndTrailer) {
     EXPECT_FALSE(isClosed(client));
 }
 
-TEST_F(UpcallPortTest, tellsTheKernelFromOthersByThePacketsSender) {
+TEST_F(UpcallPortTest, TellsTheKernelFromOthersByThePacketsSender) {
     const auto client = connect(); // by root
     const auto region = memoryFile("secret");
     const pid_t child = ::fork();
@@ -157,7 +157,7 @@ TEST_F(UpcallPortTest, tellsTheKernelFromOthersByThePacketsSender) {
     EXPECT_EQ(text(messages[0].region), "") << "a region there is, but nobody looks into it";
 }
 
-TEST_F(UpcallPortTest, copiesNoRegionThatIsNotOneOfItsSize) {
+TEST_F(UpcallPortTest, CopiesNoRegionThatIsNotOneOfItsSize) {
     const auto client = connect();
     int ends[2];
     ASSERT_EQ(::pipe2(ends, O_CLOEXEC), 0);
@@ -182,7 +182,7 @@ TEST_F(UpcallPortTest, copiesNoRegionThatIsNotOneOfItsSize) {
     EXPECT_EQ(messages.back().region.value().size(), 1U << 20);
 }
 
-TEST_F(UpcallPortTest, handsOnPacketsOfEveryLengthWithTheTrueOne) {
+TEST_F(UpcallPortTest, HandsOnPacketsOfEveryLengthWithTheTrueOne) {
     const auto client = connect();
     for (const std::uint32_t size : {23U, 24U, 51U, 53U, 65536U}) {
         send(client, Words(16384, 0x13392fd4), {}, size);
@@ -200,7 +200,7 @@ TEST_F(UpcallPortTest, handsOnPacketsOfEveryLengthWithTheTrueOne) {
     EXPECT_FALSE(isClosed(client));
 }
 
-TEST_F(UpcallPortTest, countsDescriptorsAndKeepsNone) {
+TEST_F(UpcallPortTest, CountsDescriptorsAndKeepsNone) {
     const auto open = [] {
         return std::distance(std::filesystem::directory_iterator("/proc/self/fd"),
                              std::filesystem::directory_iterator());
@@ -219,7 +219,7 @@ TEST_F(UpcallPortTest, countsDescriptorsAndKeepsNone) {
     EXPECT_FALSE(isClosed(client));
 }
 
-TEST_F(UpcallPortTest, keepsServingWhileADescriptorOfAnotherUserDoesNotClose) {
+TEST_F(UpcallPortTest, KeepsServingWhileADescriptorOfAnotherUserDoesNotClose) {
     // A network connection with bytes that nobody takes: the last process to close it is to wait for that.
     const FileDescriptor silent(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
     sockaddr_in address{.sin_family = AF_INET, .sin_port = 0, .sin_addr = {::htonl(INADDR_LOOPBACK)}, .sin_zero = {}};
@@ -256,7 +256,7 @@ TEST_F(UpcallPortTest, keepsServingWhileADescriptorOfAnotherUserDoesNotClose) {
     }
 }
 
-TEST_F(UpcallPortTest, repliesWithASealedRegion) {
+TEST_F(UpcallPortTest, RepliesWithASealedRegion) {
     const auto client = connect();
     _reply = [] {
         const std::vector region(5000, std::byte{8});
@@ -285,7 +285,7 @@ TEST_F(UpcallPortTest, repliesWithASealedRegion) {
     EXPECT_EQ(::ftruncate(region.get(), 0), -1);
 }
 
-TEST_F(UpcallPortTest, waitsWithAPeerThatDoesNotTakeItsRepliesAndServesTheOthers) {
+TEST_F(UpcallPortTest, WaitsWithAPeerThatDoesNotTakeItsRepliesAndServesTheOthers) {
     const auto deaf = connect();
     const auto client = connect();
     _reply = [] { return UpcallReply{.bytes = std::vector(36, std::byte{1})}; };
@@ -307,7 +307,7 @@ TEST_F(UpcallPortTest, waitsWithAPeerThatDoesNotTakeItsRepliesAndServesTheOthers
     EXPECT_EQ(taken, sent);
 }
 
-TEST_F(UpcallPortTest, takesNoMoreConnectionsThanItsLimitAndPausesWithoutDescriptors) {
+TEST_F(UpcallPortTest, TakesNoMoreConnectionsThanItsLimitAndPausesWithoutDescriptors) {
     std::vector<FileDescriptor> clients;
     for (int client = 0; client < 65; ++client)
         clients.push_back(connect());

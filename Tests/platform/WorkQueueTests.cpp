@@ -17,7 +17,7 @@
 namespace ost::platform {
 namespace {
 
-TEST(WorkQueue, runsWorkInOrderSynchronousWorkInItsTurn) {
+TEST(WorkQueue, RunsWorkInOrderSynchronousWorkInItsTurn) {
     WorkQueue queue("com.tamarok.tests.order");
     std::vector<int> order;
     std::latch mayGoOn(1);
@@ -38,7 +38,7 @@ TEST(WorkQueue, runsWorkInOrderSynchronousWorkInItsTurn) {
     EXPECT_FALSE(queue.isCurrent());
 }
 
-TEST(WorkQueue, excludesManyThreads) {
+TEST(WorkQueue, ExcludesManyThreads) {
     WorkQueue queue("com.tamarok.tests.exclusion");
     constexpr int rounds = 2000;
     int counter = 0; // without protection of its own
@@ -54,7 +54,7 @@ TEST(WorkQueue, excludesManyThreads) {
     EXPECT_EQ(queue.sync([&] { return counter; }), 4 * 2 * rounds);
 }
 
-TEST(WorkQueue, parksWorkWhileSuspended) {
+TEST(WorkQueue, ParksWorkWhileSuspended) {
     WorkQueue queue("com.tamarok.tests.suspension");
     std::atomic<bool> ran = false;
     queue.suspend();
@@ -67,7 +67,7 @@ TEST(WorkQueue, parksWorkWhileSuspended) {
     EXPECT_TRUE(ran);
 }
 
-TEST(WorkQueue, stopAbandonsWhatHasNotBegunAndKeepsExcluding) {
+TEST(WorkQueue, StopAbandonsWhatHasNotBegunAndKeepsExcluding) {
     WorkQueue queue("com.tamarok.tests.stop");
     auto parked = std::make_shared<int>();
     auto refused = std::make_shared<int>();
@@ -91,7 +91,7 @@ TEST(WorkQueue, stopAbandonsWhatHasNotBegunAndKeepsExcluding) {
     EXPECT_EQ(queue.sync([] { return 7; }), 7);
 }
 
-TEST(WorkQueue, namesItsThreadAndLowersOnlyThatOne) {
+TEST(WorkQueue, NamesItsThreadAndLowersOnlyThatOne) {
     WorkQueue queue("com.tamarok.tests.background");
     queue.setTargetBackgroundPriority();
     const auto nice = [] { return ::getpriority(PRIO_PROCESS, static_cast<id_t>(::gettid())); };
@@ -103,7 +103,7 @@ TEST(WorkQueue, namesItsThreadAndLowersOnlyThatOne) {
     EXPECT_EQ(currentThreadName(), "");
 }
 
-TEST(WorkQueue, passesExceptionsOnAndDiesOfMisuse) {
+TEST(WorkQueue, PassesExceptionsOnAndDiesOfMisuse) {
     WorkQueue queue("com.tamarok.tests.exceptions");
     EXPECT_THROW(queue.sync([] { throw std::runtime_error("refused"); }), std::runtime_error);
     EXPECT_TRUE(queue.sync([] { return true; }));

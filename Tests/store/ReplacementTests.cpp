@@ -10,8 +10,6 @@
 
 #include <sys/mount.h>
 #include <sys/stat.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
 #include <csignal>
 #include <filesystem>
@@ -332,24 +330,7 @@ TEST_F(Replacement, CodeSigningOfAReplacedBundleBecomesInvalidUnlessTheReplaceme
     EXPECT_TRUE(mapping.codeSigningInfoExistForIdentifier("app"));
 }
 
-// What cannot be put back, and what a crash interrupts
-
-TEST_F(Replacement, InterruptedByACrashIsUndoneAtTheNextStart) {
-    const auto old = make(bundleApplication, "old");
-    const auto fresh = make(bundleApplication, "new", true);
-    const auto before = places();
-    for (const bool preserveOldUUID : {false, true}) {
-        midway.act = []() -> OSTResult<void> { ::_exit(0); };
-        if (const pid_t child = ::fork(); child == 0)
-            std::exit(replace(old, fresh, preserveOldUUID));
-        else
-            ASSERT_EQ(child, ::waitpid(child, nullptr, 0));
-        EXPECT_NE(before, places());
-        store().containerManagerSetup();
-        EXPECT_EQ(before, places());
-        expectNothingUnderWay();
-    }
-}
+// What cannot be put back
 
 TEST_F(Replacement, OldContainerThatCannotBePutBackWaitsForTheNextStart) {
     const auto fresh = make(bundleApplication, "new", true);

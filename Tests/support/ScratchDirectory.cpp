@@ -43,7 +43,7 @@ std::string scratchPlace() {
     const int nowhere = ::open("/dev/null", O_RDWR | O_CLOEXEC);
     for (const int standard : {STDIN_FILENO, STDOUT_FILENO, STDERR_FILENO})
         ::dup2(nowhere, standard);
-    // Whoever waits for the end of another pipe of the test would wait for this process.
+    // A reader that waits for the end of another pipe of the test would wait for this process.
     constexpr int first = STDERR_FILENO + 1;
     lifeline = ::dup2(lifeline, first);
     ::close_range(first + 1, ~0U, 0);

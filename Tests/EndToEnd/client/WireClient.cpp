@@ -1,5 +1,5 @@
 // A client that only makes connections: each byte on standard input, which is a socket, is answered with a new
-// connection to the daemon, passed as a descriptor. Whoever uses it speaks with the identity of this process: its user,
+// connection to the daemon, passed as a descriptor. Its user speaks with the identity of this process: its user,
 // its program's signature. Usage: wire-client SOCKET
 
 #include <sys/socket.h>
