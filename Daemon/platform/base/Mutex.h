@@ -58,7 +58,7 @@ public:
         : _lock(mutex._mutex, held) {}
     BasicMutexLock(const BasicMutexLock&) = delete;
     BasicMutexLock& operator=(const BasicMutexLock&) = delete;
-    ~BasicMutexLock() OST_RELEASE() {}
+    ~BasicMutexLock() OST_RELEASE() = default;
 
     void lock() OST_ACQUIRE() { _lock.lock(); }
     void unlock() OST_RELEASE() { _lock.unlock(); }
