@@ -78,7 +78,7 @@ TEST_F(CodeSigningMigration, CachedInfoWinsOverTheLegacyFileWhichWinsOverGroupsA
     OSTDictionary legacy;
     for (const auto* const identifier : {"valid", "cached", "legacy", "caller's"}) {
         makeWithInfo(dataApplication, identifier, groupIdsKey, strings({"group"}));
-        legacy.set(identifier, OSTDictionary({{"from", "legacy"}}));
+        legacy.set(identifier, OSTDictionary({{"from", std::string("legacy")}}));
     }
     legacy.set("odd", OSTValue("no dictionary"));
     legacy.set("com.tamarok.Ostrand.ChildPluginBundleIDs",

@@ -95,7 +95,9 @@ TEST(Locks, AWaitingWriterIsNotKeptWaitingByFurtherReaders) {
     auto further = allReading.hold();
     while (further->taken()) // the writer does not wait yet
         further = allReading.hold();
+    // Either may be next once the lock is free.
     reader->release();
+    further->release();
     writer->release();
     writer->waitUntilTaken();
     further->waitUntilTaken();
