@@ -44,6 +44,7 @@ struct OSTClientConnection::ReplaceOperation {
     std::string stagingURL;     ///< where the old container is parked
     bool oldIsParked = false;
     bool oldIsForgotten = false; ///< by the cache
+    bool newHasOldUUID = false;  ///< in its metadata file
     OSTStoreDelegate::Restoration restoreCodeSigning;
     bool newIsInPlace = false;
 };
@@ -54,6 +55,9 @@ std::expected<void, OSTErrorCode> OSTClientConnection::replaceContainer(const OS
         const OSTAllIdentifiersLock lock(OSTLockKind::writing);
         ReplaceOperation operation;
         const auto replaced = OSTGuarded([&] { return _replace(replacement, operation); });
+        if (operation.newHasOldUUID && !operation.newIsInPlace)
+            // What fails is in the log; the container is found by the UUID that the cache holds, until the next start.
+            static_cast<void>(operation.newContainer->writeMetadataToDisk());
         if (operation.oldIsParked && !operation.newIsInPlace) {
             const auto restored = _restoreOldContainer(operation);
             if (!restored && replaced.error().is(OSTErrorCode::exceptionCaught))
@@ -204,6 +208,13 @@ OSTResult<void> OSTClientConnection::_putNewContainerInPlace(const OSTReplacemen
         return OSTCreateError(OSTErrorCode::replacingMoveFailed, cause, "Failed to replace: %@ with: %@ at: %@", old,
                               operation.newContainer->url, destination);
     };
+    OSTMetadata metadata = *operation.newContainer;
+    if (replacement.preserveOldUUID) {
+        // A container that has taken its place has its UUID for good, whatever happens then.
+        metadata.uuid = *replacement.oldContainer.uuid;
+        operation.newHasOldUUID = true;
+        OST_TRY(metadata.writeMetadataToDisk());
+    }
     if (const auto moved = files.moveItemAtURL(operation.newContainer->url, destination); !moved)
         return std::unexpected(failedMove(moved.error()));
     // Before the replace file goes, which would otherwise be gone after a power cut while the move had not happened. A
@@ -219,11 +230,8 @@ OSTResult<void> OSTClientConnection::_putNewContainerInPlace(const OSTReplacemen
     if (!_setSandboxContainerMappingForUser(name, destination))
         platform::logError("Failed to set container mapping in replace operation of %@, %llu", *name.identifier,
                            name.containerClass);
-    OSTMetadata metadata = *operation.newContainer;
     metadata.url = destination;
     metadata.transient = operation.transient;
-    if (replacement.preserveOldUUID)
-        metadata.uuid = *replacement.oldContainer.uuid;
     const auto added = OSTContainerCache::sharedInstance().addContainerMetadata(metadata);
     if (!added)
         return std::unexpected(OSTCreateError(OSTErrorCode::cacheAddFailed, added.error(),

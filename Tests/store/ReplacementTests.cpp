@@ -94,6 +94,8 @@ TEST_F(Replacement, PutsTheNewContainerInThePlaceOfTheOldOne) {
             EXPECT_EQ(place, record->url);
             EXPECT_EQ(transient, record->transient);
             EXPECT_EQ(preserveOldUUID ? old->uuid : fresh->uuid, record->uuid);
+            const auto onDisk = OSTMetadata::readAndValidateMetadataAtUrl(place.native(), 501, OSTCheckClassPath::no);
+            EXPECT_EQ(record->uuid, onDisk.value().uuid);
             EXPECT_FALSE(cached(dataApplication, fresh->identifier, !transient));
             EXPECT_FALSE(cached(dataApplication, old->identifier, transient));
             expectNothingUnderWay();
