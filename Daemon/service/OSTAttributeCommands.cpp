@@ -13,16 +13,6 @@ namespace ost {
 
 namespace {
 
-/// The container that a request names, its user resolved for the client.
-std::expected<OSTContainerReference, OSTErrorCode> containerOf(const platform::IPCRequest& request,
-                                                               const OSTClientConnection& client) {
-    const auto requested = OST_TRY(OSTReadClassAndUser(request, client));
-    return OSTContainerReference{.name = {.userId = requested.userId,
-                                          .containerClass = requested.containerClass,
-                                          .identifier = request.stringValue(requestKey::identifier)},
-                                 .uuid = request.uuidValue(requestKey::container.uuid)};
-}
-
 /// The info value of a request; none when it has none.
 std::expected<std::optional<OSTValue>, OSTErrorCode> infoValueOf(const platform::IPCRequest& request) {
     const auto item = request.item(requestKey::infoValue);
@@ -53,21 +43,21 @@ OSTCommandResult put(platform::IPCReply& reply, std::string_view key, const OSTV
 
 OSTCommandResult OSTSetInfoValueCommand(const platform::IPCRequest& request, platform::IPCReply& /*reply*/,
                                         OSTClientConnection& client) {
-    const auto container = OST_TRY(containerOf(request, client));
+    const auto container = OST_TRY(OSTReadContainer(request, client));
     const auto value = OST_TRY(infoValueOf(request));
     return client.setInfoValue(value, request.stringValue(requestKey::infoKey), container);
 }
 
 OSTCommandResult OSTInfoValueCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
                                      OSTClientConnection& client) {
-    const auto container = OST_TRY(containerOf(request, client));
+    const auto container = OST_TRY(OSTReadContainer(request, client));
     const auto value = OST_TRY(client.infoValueForKey(request.stringValue(requestKey::infoKey), container));
     return put(reply, replyKey::infoValue, value);
 }
 
 OSTCommandResult OSTMetadataCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
                                     OSTClientConnection& client) {
-    const auto container = OST_TRY(containerOf(request, client));
+    const auto container = OST_TRY(OSTReadContainer(request, client));
     const auto record = OST_TRY(client.metadataForUser(container));
     reply.set(replyKey::path, record->url);
     reply.set(replyKey::transient, record->transient);
@@ -78,12 +68,12 @@ OSTCommandResult OSTMetadataCommand(const platform::IPCRequest& request, platfor
 
 OSTCommandResult OSTRecreateDefaultStructureCommand(const platform::IPCRequest& request, platform::IPCReply& /*reply*/,
                                                     OSTClientConnection& client) {
-    return client.recreateDefaultStructureForUser(OST_TRY(containerOf(request, client)));
+    return client.recreateDefaultStructureForUser(OST_TRY(OSTReadContainer(request, client)));
 }
 
 OSTCommandResult OSTRegenerateDirectoryUUIDCommand(const platform::IPCRequest& request, platform::IPCReply& /*reply*/,
                                                    OSTClientConnection& client) {
-    return client.regenerateDirectoryUUIDForUser(OST_TRY(containerOf(request, client)));
+    return client.regenerateDirectoryUUIDForUser(OST_TRY(OSTReadContainer(request, client)));
 }
 
 OSTCommandResult OSTSetDataProtectionCommand(const platform::IPCRequest& request, platform::IPCReply& reply,
@@ -92,7 +82,7 @@ OSTCommandResult OSTSetDataProtectionCommand(const platform::IPCRequest& request
         reply.set(replyKey::error, static_cast<std::uint64_t>(code));
         reply.send();
     };
-    const auto container = containerOf(request, client);
+    const auto container = OSTReadContainer(request, client);
     if (!container) {
         answer(container.error());
         return {};

@@ -4,6 +4,7 @@
 #include "service/OSTAttributeCommands.h"
 #include "service/OSTCodeSigningCommands.h"
 #include "service/OSTContainerCommands.h"
+#include "service/OSTMaintenanceCommands.h"
 #include "service/OSTRemovalCommands.h"
 
 namespace ost {
@@ -32,8 +33,8 @@ const std::array<OSTCommandEntry, OSTCommandCount> OSTCommandTable = {{
     {recreateDefaultStructure, OSTRecreateDefaultStructureCommand, allowed, dispatcher},
     {regenerateDirectoryUUID, OSTRegenerateDirectoryUUIDCommand, allowed, dispatcher},
     {deleteContainer, OSTDeleteCommand, allowed, dispatcher},
-    {wipePlugInData, nullptr, wipeContainer, dispatcher},
-    {wipeData, nullptr, allowed, dispatcher},
+    {wipePlugInData, OSTWipePluginContainerCommand, wipeContainer, dispatcher},
+    {wipeData, OSTWipeContainerCommand, allowed, dispatcher},
     {groupContainerPaths, OSTGroupContainerPathsCommand, none, dispatcher},
     {groupIdentifiers, OSTGroupIdentifiersCommand, allowed, dispatcher},
     {systemContainerPath, OSTSystemContainerPathCommand, none, dispatcher},
@@ -44,9 +45,9 @@ const std::array<OSTCommandEntry, OSTCommandCount> OSTCommandTable = {{
     {invalidateCodeSigning, OSTInvalidateCodeSigningCommand, allowed, dispatcher},
     {setDataProtection, OSTSetDataProtectionCommand, allowed, handler},
     {recreateDefaultStructureAgain, OSTRecreateDefaultStructureCommand, allowed, dispatcher},
-    {diskUsage, nullptr, allowed, dispatcher},
-    {performDataMigration, nullptr, dataMigration, dispatcher},
-    {retryTest, nullptr, allowed, dispatcher},
+    {diskUsage, OSTDiskUsageCommand, allowed, dispatcher},
+    {performDataMigration, OSTPerformDataMigrationCommand, dataMigration, dispatcher},
+    {retryTest, OSTRetryTestCommand, allowed, dispatcher},
 }};
 
 } // namespace ost

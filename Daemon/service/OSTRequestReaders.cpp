@@ -14,6 +14,15 @@ std::expected<OSTRequestedClassAndUser, OSTErrorCode> OSTReadClassAndUser(const 
     return OSTRequestedClassAndUser{containerClass, resolved};
 }
 
+std::expected<OSTContainerReference, OSTErrorCode> OSTReadContainer(const platform::IPCRequest& request,
+                                                                    const OSTClientConnection& client) {
+    const auto requested = OST_TRY(OSTReadClassAndUser(request, client));
+    return OSTContainerReference{.name = {.userId = requested.userId,
+                                          .containerClass = requested.containerClass,
+                                          .identifier = request.stringValue(requestKey::identifier)},
+                                 .uuid = request.uuidValue(requestKey::container.uuid)};
+}
+
 std::optional<std::string_view> OSTRequestedIdentifier(const platform::IPCRequest& request,
                                                        const OSTClientConnection& client) {
     if (const auto identifier = request.stringValue(requestKey::identifier))

@@ -24,6 +24,11 @@ struct OSTRequestedClassAndUser {
 OSTReadClassAndUser(const platform::IPCRequest& request, const OSTClientConnection& client,
                     const requestKey::Container& keys = requestKey::container);
 
+/// Reads a container by class, user, identifier and UUID; what the request lacks is absent. Fails with
+/// `invalidParameter`.
+[[nodiscard]] std::expected<OSTContainerReference, OSTErrorCode> OSTReadContainer(const platform::IPCRequest& request,
+                                                                                  const OSTClientConnection& client);
+
 /// The identifier that a request names, or else the client's own.
 [[nodiscard]] std::optional<std::string_view> OSTRequestedIdentifier(const platform::IPCRequest& request,
                                                                      const OSTClientConnection& client);

@@ -75,6 +75,9 @@ public:
     void setAllowOtherIdLookup() { _identity.allowOtherIdLookup = true; }
     void setAllowGroupIdLookup() { _identity.allowGroupIdLookup = true; }
 
+    /// The opposite: the client's entitlements alone count.
+    void clearAllowOtherIdLookup() { _identity.allowOtherIdLookup = false; }
+
     // Creation and look-up
 
     /// Gives the container that the look-up names, making it when it is missing and may be made; `existed` tells which.
@@ -157,6 +160,25 @@ public:
     /// those of the cache.
     [[nodiscard]] std::expected<void, OSTErrorCode> replaceContainer(const OSTReplacement& replacement) const;
 
+    // Maintenance
+
+    /// Puts a fresh container in the place of a data container, under the same internal UUID; its old content goes to
+    /// death row. A client without `allowOtherIdLookup` may do so to the plug-ins alone that it is entitled to wipe.
+    /// Codes: `noIdentifier`, `invalidObject` (no data container), `notEntitled`, those of look-up, creation and
+    /// replacement.
+    [[nodiscard]] std::expected<void, OSTErrorCode>
+    deleteDataContainerContentForUser(const OSTContainerName& name) const;
+
+    /// The bytes that a container takes on disk; those of a bundle are measured once and kept in its info values.
+    /// Codes: `invalidObject` (no UUID, or no class), `notFound`.
+    [[nodiscard]] std::expected<std::uint64_t, OSTErrorCode>
+    diskUsageForUserId(const OSTContainerReference& container) const;
+
+    /// Ends the daemon as often as `crashes` says, once for each call, so that clients can test what they do then. The
+    /// count is kept in a container's info values; the call that finds none left returns. Codes: those of creation, of
+    /// `setInfoValue` and of deletion.
+    [[nodiscard]] std::expected<void, OSTErrorCode> retryTestForUser(std::uint32_t userId, std::uint64_t crashes) const;
+
     // Start-up
 
     /// The start-up migration, which lies above the store. A failure may come without an error.
@@ -231,6 +253,15 @@ private:
     [[nodiscard]] OSTResult<void> _discardReplaceFile(const std::string& url, StartPass startDeletionThread) const;
     [[nodiscard]] OSTResult<void> _recoverFromReplaceOperations() const;
     [[nodiscard]] OSTResult<void> _recoverFromReplaceFile(const std::string& url) const;
+
+    // +Maintenance
+    struct PlaceAndUsage {
+        std::string url;
+        std::optional<std::uint64_t> usage = std::nullopt;
+    };
+    [[nodiscard]] std::expected<void, OSTErrorCode> _checkWipe(const OSTContainerName& name) const;
+    [[nodiscard]] std::expected<PlaceAndUsage, OSTErrorCode>
+    _placeAndKnownUsage(const OSTContainerReference& container) const;
 
     // +Reboot
     void _cleanUpMobileUser() const;

@@ -99,8 +99,9 @@ std::expected<Account, Errno> accountForUserId(uid_t uid, const std::string& ima
     return find(image + passwdFile, parseAccount, [&](const Account& account) { return account.uid == uid; });
 }
 
-std::expected<Account, Errno> accountMatching(const std::function<bool(const Account&)>& matches) {
-    return find(passwdFile, parseAccount, matches);
+std::expected<Account, Errno> accountMatching(const std::function<bool(const Account&)>& matches,
+                                              const std::string& image) {
+    return find((image + passwdFile).c_str(), parseAccount, matches);
 }
 
 std::expected<gid_t, Errno> groupForName(std::string_view name) {

@@ -30,7 +30,8 @@ struct Account {
 [[nodiscard]] std::expected<Account, Errno> accountForName(std::string_view name, const std::string& image = "");
 [[nodiscard]] std::expected<Account, Errno> accountForUserId(uid_t uid, const std::string& image = "");
 /// The first account for which `matches` gives true.
-[[nodiscard]] std::expected<Account, Errno> accountMatching(const std::function<bool(const Account&)>& matches);
+[[nodiscard]] std::expected<Account, Errno> accountMatching(const std::function<bool(const Account&)>& matches,
+                                                            const std::string& image = "");
 [[nodiscard]] std::expected<gid_t, Errno> groupForName(std::string_view name);
 [[nodiscard]] std::expected<std::string, Errno> groupForId(gid_t gid);
 
