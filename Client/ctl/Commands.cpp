@@ -14,8 +14,8 @@ const CommandTable& commandTable() {
                         {"json", "", "print one JSON object instead of text for people"}},
             .commands = {},
         };
-        for (const auto part : {containerCommands, attributeCommands, protectionCommands, codeSigningCommands,
-                                signingCommands, deviceCommands, runCommands})
+        for (const auto part : {containerCommands, attributeCommands, protectionCommands, maintenanceCommands,
+                                codeSigningCommands, signingCommands, deviceCommands, runCommands})
             std::ranges::move(part(), std::back_inserter(all.commands));
         return all;
     }();

@@ -13,6 +13,7 @@ namespace ostrand::ctl {
 [[nodiscard]] std::vector<Command> containerCommands();
 [[nodiscard]] std::vector<Command> attributeCommands();
 [[nodiscard]] std::vector<Command> protectionCommands();
+[[nodiscard]] std::vector<Command> maintenanceCommands();
 [[nodiscard]] std::vector<Command> codeSigningCommands();
 [[nodiscard]] std::vector<Command> signingCommands();
 [[nodiscard]] std::vector<Command> deviceCommands();

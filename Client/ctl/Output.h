@@ -4,7 +4,6 @@
 #include "platform/base/OSTValue.h"
 
 #include <expected>
-#include <optional>
 #include <string>
 #include <string_view>
 
@@ -12,10 +11,9 @@ namespace ostrand::ctl {
 
 /// What a command has to say when it succeeded, for people and for programs.
 struct Report {
-    std::string text; ///< whole lines, already escaped
-    ost::OSTDictionary json;
-    /// The exit status of a program that the command ran. Standard output is then the program's; nothing is added.
-    std::optional<int> exitStatus = std::nullopt;
+    std::string text;        ///< whole lines, already escaped
+    ost::OSTDictionary json; ///< empty where standard output is that of a program that the command ran
+    int exitStatus = 0;      ///< the program's, or what the command found
 };
 
 /// Why a command did not do what it was asked.

@@ -23,10 +23,11 @@ void complain(const std::string& message, const std::string& usage = {}) {
 
 int printOutcome(const Invocation& invocation, const Outcome& outcome) {
     const bool asJSON = invocation.arguments.has("json");
-    if (outcome && outcome->exitStatus)
-        return *outcome->exitStatus;
-    if (outcome)
-        return print(asJSON ? jsonText(outcome->json) + "\n" : outcome->text);
+    if (outcome) {
+        const auto inJSON = [&] { return outcome->json.empty() ? std::string() : jsonText(outcome->json) + "\n"; };
+        const int failed = print(asJSON ? inJSON() : outcome->text);
+        return failed != 0 ? failed : outcome->exitStatus;
+    }
     const auto& failure = outcome.error();
     if (failure.exitStatus == Failure::usageStatus) {
         complain(failure.message, usageLine(commandTable(), *invocation.command));
