@@ -109,7 +109,7 @@ std::uint64_t dataClassOf(OSTContainerClass bundleClass) {
 } // namespace
 
 void OSTCodeSigningMapping::performAllCodeSigningMigrationAndReconciliation() {
-    if (!_available) {
+    if (!isAvailable()) {
         logError("Nothing is migrated, because the mapping file could not be read");
         return;
     }

@@ -42,7 +42,7 @@ std::expected<void, OSTErrorCode>
 OSTCodeSigningMapping::processCodeSigningInfo(const std::shared_ptr<const OSTDictionary>& info,
                                               std::optional<std::string_view> identifier,
                                               const OSTRegistrationOptions& options) {
-    if (!_available)
+    if (!isAvailable())
         return std::unexpected(OSTErrorCode::noProcessingResult);
     if (!identifier)
         return std::unexpected(OSTErrorCode::noIdentifier);

@@ -6,6 +6,7 @@
 #include "platform/base/Assert.h"
 #include "platform/base/Immortal.h"
 #include "platform/base/Log.h"
+#include "platform/base/PassingReason.h"
 #include "platform/base/Path.h"
 #include "store/OSTContainerCache.h"
 #include "store/OSTLocks.h"
@@ -35,10 +36,20 @@ OSTCodeSigningMapping& OSTCodeSigningMapping::sharedInstance() {
     return *mapping;
 }
 
-OSTCodeSigningMapping::OSTCodeSigningMapping() {
-    _available = _readCodeSigningMappingFromDisk().has_value();
-    if (!_available)
+void OSTCodeSigningMapping::_readWhenPossible() {
+    const auto read = _readCodeSigningMappingFromDisk();
+    if (read)
+        _reading = Reading::done;
+    else if (!platform::isReasonThatPasses(read.error()))
+        _reading = Reading::failed;
+    if (!read)
         platform::logError("Unable to read mapping file from disk.  This is bad");
+}
+
+bool OSTCodeSigningMapping::isAvailable() {
+    if (_reading == Reading::pending && !_codeSignQueue.isCurrent())
+        _sync([] {});
+    return _reading == Reading::done;
 }
 
 // The public operations
@@ -93,7 +104,7 @@ OSTCodeSigningMapping::getCodeSigningInfoForIdentifier(std::string_view identifi
 }
 
 void OSTCodeSigningMapping::removeCodeSigningDictionariesForIdentifierAndItsChildren(std::string_view identifier) {
-    if (!_available)
+    if (!isAvailable())
         return;
     _sync([&] {
         for (const auto& each : _childrenAndIdentifier(identifier))
@@ -107,7 +118,7 @@ void OSTCodeSigningMapping::removeCodeSigningDictionariesForIdentifierAndItsChil
 OSTResult<void>
 OSTCodeSigningMapping::invalidateCodeSigningInfoForIdentifierAndItsChildren(std::string_view identifier) {
     return _sync([&]() -> OSTResult<void> {
-        if (!_available)
+        if (!isAvailable())
             return {};
         const auto invalidate = [&](const std::string& each) {
             const auto stored = _entry(each);
@@ -131,7 +142,7 @@ OSTCodeSigningMapping::invalidateCodeSigningInfoForIdentifierAndItsChildren(std:
 }
 
 std::expected<void, OSTErrorCode> OSTCodeSigningMapping::invalidateCodeSigningInfoForAppsWithoutBundleContainer() {
-    if (!_available)
+    if (!isAvailable())
         return std::unexpected(OSTErrorCode::noProcessingResult);
     const OSTAllIdentifiersLock lock(OSTLockKind::writing);
     return _sync([&]() -> OSTResult<void> {
@@ -169,7 +180,7 @@ OSTCodeSigningMapping::entriesOfIdentifierAndItsChildren(std::string_view identi
 }
 
 void OSTCodeSigningMapping::restoreEntries(const std::vector<std::pair<std::string, EntryRecord>>& entries) {
-    if (!_available)
+    if (!isAvailable())
         return;
     _sync([&] {
         // As they were, those without information too, which staging would drop.
@@ -201,7 +212,7 @@ OSTCodeSigningMapping::EntryRecord OSTCodeSigningMapping::_entry(std::string_vie
 
 OSTCodeSigningMapping::EntryRecord
 OSTCodeSigningMapping::_onQueue_codeSigningInfoForIdentifier(std::string_view identifier, Request request) {
-    if (!_available)
+    if (!isAvailable())
         return nullptr;
     auto entry = _entry(identifier);
     if (entry && request == Request::external && (entry->placeholder || entry->invalid))

@@ -7,6 +7,7 @@
 #include "platform/threads/WorkQueue.h"
 #include "store/OSTLocks.h"
 
+#include <atomic>
 #include <concepts>
 #include <cstdint>
 #include <functional>
@@ -42,7 +43,7 @@ struct OSTGroupKeys {
 /// The shared instance reads the mapping file when it is first used; from then on memory is the authority and the file
 /// is only written: whole, atomically, and durable before the change is answered. A file that cannot be read is never
 /// overwritten: the mapping is then unavailable, every query answers as for an unknown identifier, and nothing is
-/// processed.
+/// processed. When the reason is one that passes, the next use reads again.
 ///
 /// Threads: any. All work runs on one serial queue. Operations that may change entries take the all-identifiers write
 /// lock first; the order is always the lock, then the queue, where taking a lock stops the process. On disk:
@@ -52,7 +53,7 @@ public:
     static OSTCodeSigningMapping& sharedInstance();
 
     /// Whether the mapping file could be read.
-    [[nodiscard]] bool isAvailable() const { return _available; }
+    [[nodiscard]] bool isAvailable();
 
     /// Whether the identifier has code-signing information, an invalid or placeholder one included.
     [[nodiscard]] bool codeSigningInfoExistForIdentifier(std::string_view identifier);
@@ -120,16 +121,21 @@ private:
     using Entries = std::map<std::string, EntryRecord, std::less<>>;
     enum class Request : bool { internal, external };
 
-    OSTCodeSigningMapping();
+    OSTCodeSigningMapping() {
+        _sync([] {});
+    }
 
-    /// Runs work on the queue.
+    /// Runs work on the queue, when the file has been read or cannot be.
     template<std::invocable Work>
     std::invoke_result_t<Work> _sync(Work&& work) {
         return _codeSignQueue.sync([&] {
             const OSTNoFurtherLocks noFurtherLocks;
+            if (_reading == Reading::pending)
+                _readWhenPossible();
             return std::invoke(std::forward<Work>(work));
         });
     }
+    void _readWhenPossible();
 
     [[nodiscard]] static std::string _mappingFileURL();
     [[nodiscard]] OSTResult<void> _readCodeSigningMappingFromDisk();
@@ -184,7 +190,8 @@ private:
     [[nodiscard]] bool _hasValidEntry(std::string_view identifier) const;
 
     platform::WorkQueue _codeSignQueue{"com.tamarok.Ostrand.EntitlementQueue"};
-    bool _available = false; ///< constant after construction
+    enum class Reading : std::uint8_t { pending, done, failed };
+    std::atomic<Reading> _reading = Reading::pending; ///< changes on the queue only, and from `pending` only
     // On the queue only.
     Entries _codeSigningMappingDict;
     /// The last write failed: the next registration writes even if it changes nothing, because it is answered.

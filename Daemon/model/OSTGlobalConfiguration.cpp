@@ -128,9 +128,9 @@ OSTPerUserConfiguration* OSTGlobalConfiguration::getPerUserConfigurationForUserI
     return found->second.get();
 }
 
-std::optional<std::string> OSTGlobalConfiguration::containerDirectoryURLForUser(std::uint32_t userId,
-                                                                                OSTContainerClass contentClass,
-                                                                                bool transient) {
+std::expected<std::string, platform::Errno>
+OSTGlobalConfiguration::containerDirectoryURLForUser(std::uint32_t userId, OSTContainerClass contentClass,
+                                                     bool transient) {
     const platform::BasicMutexLock lock(_mutex);
     std::string base;
     std::uint32_t owner = OSTRootUserId;
@@ -142,7 +142,7 @@ std::optional<std::string> OSTGlobalConfiguration::containerDirectoryURLForUser(
     } else {
         auto* const configuration = getPerUserConfigurationForUserId(userId);
         return configuration ? configuration->containerDirectoryURLForContentClass(contentClass, transient)
-                             : std::nullopt;
+                             : std::unexpected(EINVAL);
     }
     return OSTMakeLayoutDirectory(pathByAppending(base, pathComponentForContainerClass(contentClass)),
                                   {.withIntermediateDirectories = true, .mode = 0755, .owner = owner},

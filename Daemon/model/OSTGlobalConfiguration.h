@@ -44,8 +44,9 @@ public:
     /// The directories of one real user; null for a user id of 500 or less.
     [[nodiscard]] OSTPerUserConfiguration* getPerUserConfigurationForUserId(std::uint32_t userId);
 
-    /// The directory that holds all containers of the class for the user; none when there is no such directory.
-    [[nodiscard]] std::optional<std::string>
+    /// The directory that holds all containers of the class for the user. Fails with ENOENT or ENOTDIR while the user
+    /// has no home, with EINVAL when the class has no directory for the user, with another errno while nobody can tell.
+    [[nodiscard]] std::expected<std::string, platform::Errno>
     containerDirectoryURLForUser(std::uint32_t userId, OSTContainerClass contentClass, bool transient);
 
     /// Whether `url` could be the path of a container: a name directly inside the class directory of a class and user.

@@ -3,6 +3,7 @@
 #include "model/OSTLayoutDirectory.h"
 #include "platform/base/Log.h"
 #include "platform/base/Path.h"
+#include "platform/base/Try.h"
 #include "platform/device/Accounts.h"
 
 #include <cerrno>
@@ -15,9 +16,25 @@ using platform::pathByAppending;
 
 namespace {
 
-std::optional<std::string> realPath(const std::string& path) {
+std::expected<std::string, platform::Errno> realPath(const std::string& path) {
     char buffer[PATH_MAX];
-    return ::realpath(path.c_str(), buffer) ? std::optional<std::string>(buffer) : std::nullopt;
+    if (!::realpath(path.c_str(), buffer))
+        return std::unexpected(errno);
+    return buffer;
+}
+
+std::expected<std::string, platform::Errno> homeInDatabase(std::uint32_t userId) {
+    auto account = platform::accountForUserId(userId);
+    if (!account) {
+        platform::logError("Failed to getpwuid for uid: %u", userId);
+        return std::unexpected(account.error());
+    }
+    return account->home;
+}
+
+template<typename T>
+std::optional<T> optionalOf(std::expected<T, platform::Errno> value) {
+    return value ? std::optional<T>(*std::move(value)) : std::nullopt;
 }
 
 } // namespace
@@ -27,65 +44,62 @@ std::unique_ptr<OSTPerUserConfiguration> OSTPerUserConfiguration::withUserId(std
         platform::logError("userId: %u must be in range", userId);
         return nullptr;
     }
-    std::optional<std::string> home;
-    if (const auto account = platform::accountForUserId(userId)) {
-        home = realPath(account->home);
-    } else {
-        platform::logError("Failed to getpwuid for uid: %u", userId);
-        // Accounts that cannot be read now, for want of a descriptor, say nothing for good.
-        if (account.error() != ENOENT)
-            return nullptr;
-    }
-    return std::unique_ptr<OSTPerUserConfiguration>(new OSTPerUserConfiguration(userId, std::move(home)));
+    return std::unique_ptr<OSTPerUserConfiguration>(new OSTPerUserConfiguration(userId));
 }
+
+std::expected<std::string, platform::Errno> OSTPerUserConfiguration::_home() const {
+    const platform::MutexLock lock(_mutex);
+    if (!_userHomeDirectory) {
+        const auto named = OST_TRY(homeInDatabase(_userId));
+        _userHomeDirectory = OST_TRY(realPath(named));
+    }
+    return *_userHomeDirectory;
+}
+
+std::optional<std::string> OSTPerUserConfiguration::userHomeDirectory() const { return optionalOf(_home()); }
 
 bool OSTPerUserConfiguration::existsUserBaseDirectory() const {
-    return _userHomeDirectory && OSTFileManager::defaultManager().itemExistsAtURL(*_userHomeDirectory);
+    const auto home = _home();
+    return home && OSTFileManager::defaultManager().itemExistsAtURL(*home);
 }
 
-std::optional<std::string> OSTPerUserConfiguration::_inHome(std::string_view component) const {
-    if (!_userHomeDirectory)
-        return std::nullopt;
-    return pathByAppending(*_userHomeDirectory, component);
+std::expected<std::string, platform::Errno> OSTPerUserConfiguration::_inHome(std::string_view component) const {
+    return pathByAppending(OST_TRY(_home()), component);
 }
 
 OSTDirectoryAttributes OSTPerUserConfiguration::_ownedByUser() const {
     return {.withIntermediateDirectories = true, .mode = 0755, .owner = _userId};
 }
 
-std::optional<std::string> OSTPerUserConfiguration::userBaseDirectory() {
-    auto path = _inHome(OSTUserBaseDirectoryName);
-    if (!path)
-        return std::nullopt;
+std::expected<std::string, platform::Errno> OSTPerUserConfiguration::userBaseDirectory() {
+    auto path = OST_TRY(_inHome(OSTUserBaseDirectoryName));
     const platform::MutexLock lock(_mutex);
-    return OSTMakeLayoutDirectory(*std::move(path), _ownedByUser(), "Failed to create user base dir at \"%@\": %@");
+    return OSTMakeLayoutDirectory(std::move(path), _ownedByUser(), "Failed to create user base dir at \"%@\": %@");
 }
 
-std::optional<std::string> OSTPerUserConfiguration::transientDirectory() {
-    auto path = _inHome(OSTUserTransientDirectoryName);
-    if (!path)
-        return std::nullopt;
+std::expected<std::string, platform::Errno> OSTPerUserConfiguration::transientDirectory() {
+    auto path = OST_TRY(_inHome(OSTUserTransientDirectoryName));
     const platform::MutexLock lock(_mutex);
-    return OSTMakeLayoutDirectory(*std::move(path), _ownedByUser(), "Failed to create transient dir at \"%@\": %@");
+    return OSTMakeLayoutDirectory(std::move(path), _ownedByUser(), "Failed to create transient dir at \"%@\": %@");
 }
 
 std::optional<std::string> OSTPerUserConfiguration::oldLibraryDirectoryPath() const {
-    return _inHome("Library/Ostrand");
+    return optionalOf(_inHome("Library/Ostrand"));
 }
 
-std::optional<std::string> OSTPerUserConfiguration::oldLoggingPath() const { return _inHome("Library/Logs/Ostrand"); }
+std::optional<std::string> OSTPerUserConfiguration::oldLoggingPath() const {
+    return optionalOf(_inHome("Library/Logs/Ostrand"));
+}
 
-std::optional<std::string> OSTPerUserConfiguration::containerDirectoryURLForContentClass(OSTContainerClass contentClass,
-                                                                                         bool transient) {
+std::expected<std::string, platform::Errno>
+OSTPerUserConfiguration::containerDirectoryURLForContentClass(OSTContainerClass contentClass, bool transient) {
     if (!isPerUserClass(contentClass)) {
         platform::logError("Invalid class for a per user container directory: %llu", contentClass);
-        return std::nullopt;
+        return std::unexpected(EINVAL);
     }
-    const auto base = transient ? transientDirectory() : userBaseDirectory();
-    if (!base)
-        return std::nullopt;
+    const auto base = OST_TRY(transient ? transientDirectory() : userBaseDirectory());
     const platform::MutexLock lock(_mutex);
-    return OSTMakeLayoutDirectory(pathByAppending(*base, pathComponentForContainerClass(contentClass)), _ownedByUser(),
+    return OSTMakeLayoutDirectory(pathByAppending(base, pathComponentForContainerClass(contentClass)), _ownedByUser(),
                                   "Failed to create container dir at \"%@\": %@");
 }
 

@@ -87,15 +87,15 @@ std::expected<T, OSTErrorCode> valueOrCode(OSTResult<T> result) {
 
 OSTResult<OSTMetadataRecord> OSTClientConnection::_container(const OSTContainerReference& container) {
     const auto& [name, uuid] = container;
-    auto entry = OSTContainerCache::sharedInstance().entryForUser(name, *uuid);
-    if (!entry)
+    auto entry = OST_TRY(OSTContainerCache::sharedInstance().entryForUser(name, *uuid));
+    if (!entry.record)
         return std::unexpected(OSTCreateError(OSTErrorCode::notFound,
                                               "No Container with userId: %u UUID: %@, identifier: %@, Class: %ld",
                                               name.userId, uuid->string(), name.identifier, name.containerClass));
     // What is answered, or done inside, must not get lost with the container.
-    if (entry->placement == OSTPlacement::pending)
-        OST_TRY(_makePlaceDurable(*entry->record));
-    return entry->record;
+    if (entry.placement == OSTPlacement::pending)
+        OST_TRY(_makePlaceDurable(*entry.record));
+    return entry.record;
 }
 
 std::expected<void, OSTErrorCode> OSTClientConnection::setInfoValue(const std::optional<OSTValue>& value,

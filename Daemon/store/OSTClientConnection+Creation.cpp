@@ -155,7 +155,10 @@ OSTResult<OSTCacheEntry> OSTClientConnection::_putInPlace(OSTMetadata metadata, 
                               .wellknownContainerForId(metadata.identifier, metadata.containerClass)
                               .value_or(std::string(lastPathComponent(staging)));
     const auto liveURL = pathByAppending(liveParent.value_or(std::string()), liveName);
-    if (const auto moved = OSTFileManager::defaultManager().moveItemAtURL(staging, liveURL); !moved)
+    const auto moved = liveParent ? OSTFileManager::defaultManager().moveItemAtURL(staging, liveURL)
+                                  : OSTResult<void>(std::unexpected(OSTCreatePOSIXError(
+                                        liveParent.error(), "User %u has no container directories", metadata.uid)));
+    if (!moved)
         return std::unexpected(OSTCreateError(OSTErrorCode::moveToLiveFailed, moved.error(),
                                               "Failed to move staging dir: %@ to live dir: %@", staging, liveURL));
     staging.clear();

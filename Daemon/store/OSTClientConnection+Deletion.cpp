@@ -2,6 +2,7 @@
 #include "model/OSTFailureReport.h"
 #include "model/OSTGlobalConfiguration.h"
 #include "platform/base/Immortal.h"
+#include "platform/base/PassingReason.h"
 #include "platform/base/Path.h"
 #include "platform/threads/Transactions.h"
 #include "store/OSTClientConnection.h"
@@ -9,6 +10,8 @@
 #include "store/OSTLocks.h"
 #include "store/OSTStoreDelegate.h"
 
+#include <algorithm>
+#include <array>
 #include <cerrno>
 
 namespace ost {
@@ -24,6 +27,13 @@ constexpr std::string_view parkingDirectory = "/tmp";
 /// How often a move to death row is tried again when a pass removed the unique directory that was made for it. A pass
 /// removes what it has listed, once, so more than a few losses in a row have another cause.
 constexpr int movesToDeathRow = 16;
+
+/// Whether nothing but a change of the item or of its place will let a failed removal succeed.
+bool isForGood(const OSTError& removal) {
+    constexpr std::array reasons{EPERM, EBUSY, EROFS, ENOTEMPTY, EXDEV};
+    return !platform::isReasonThatPasses(removal) ||
+           std::ranges::any_of(reasons, [&](int reason) { return removal.isPOSIX(reason); });
+}
 
 /// How often a removal is tried in all when something came into the item behind the removal's back: a unique directory
 /// gets its item, and an application may still be at work in its container.
@@ -69,7 +79,7 @@ OSTResult<void> OSTClientConnection::_stageForDeletion(const OSTContainerReferen
                                          name.userId, uuid, name.identifier, name.containerClass));
         return {};
     }
-    const auto record = OSTContainerCache::sharedInstance().containerForUser(name, *uuid);
+    const auto record = OST_TRY(OSTContainerCache::sharedInstance().containerForUser(name, *uuid));
     return record ? _stageContainer(*record) : OSTResult<void>();
 }
 
@@ -174,6 +184,8 @@ OSTResult<std::optional<OSTError>> OSTClientConnection::_removeItemOrMoveToTempA
         removed = files.removeItemAtURL(url);
     if (removed || removed.error().isPOSIX(ENOENT))
         return std::nullopt;
+    if (!isForGood(removed.error())) // the next pass may
+        return removed.error();
     platform::logDebug("Couldn't remove, so moving item to /tmp: %@ : %@", url, removed.error());
     const auto parked = files.moveItemAtURL(url, pathByAppending(parkingDirectory, lastPathComponent(url)));
     if (!parked)

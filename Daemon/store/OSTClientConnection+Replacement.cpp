@@ -3,6 +3,7 @@
 #include "model/OSTFailureReport.h"
 #include "model/OSTGlobalConfiguration.h"
 #include "platform/base/Log.h"
+#include "platform/base/PassingReason.h"
 #include "platform/base/Path.h"
 #include "platform/base/UUID.h"
 #include "platform/device/CrashReport.h"
@@ -12,8 +13,6 @@
 #include "store/OSTReplaceFile.h"
 #include "store/OSTStoreDelegate.h"
 
-#include <algorithm>
-#include <array>
 #include <cerrno>
 
 namespace ost {
@@ -21,17 +20,6 @@ namespace ost {
 using platform::lastPathComponent;
 using platform::pathByAppending;
 using platform::pathByDeletingLastComponent;
-
-namespace {
-
-/// Whether a file could not be read for a reason that says nothing about the file.
-bool mayBeReadLater(const OSTError& error) {
-    constexpr std::array passing{EIO, EACCES, ENOMEM, EMFILE, ENFILE};
-    const auto& cause = error.underlyingError();
-    return cause && std::ranges::any_of(passing, [&](int errnoValue) { return cause->isPOSIX(errnoValue); });
-}
-
-} // namespace
 
 /// How far one replacement has come, and so what has to be undone or cleaned up when it stops.
 struct OSTClientConnection::ReplaceOperation {
@@ -111,7 +99,8 @@ OSTResult<void> OSTClientConnection::_replace(const OSTReplacement& replacement,
 
 OSTResult<OSTMetadataRecord> OSTClientConnection::_containerOfSide(const OSTContainerReference& side) {
     const auto& [name, uuid] = side;
-    auto record = name.identifier ? OSTContainerCache::sharedInstance().containerForUser(name, *uuid) : nullptr;
+    auto record =
+        name.identifier ? OST_TRY(OSTContainerCache::sharedInstance().containerForUser(name, *uuid)) : nullptr;
     if (!record)
         return std::unexpected(OSTCreateError(OSTErrorCode::notFound,
                                               "No Container with userId: %u UUID: %@, identifier: %@, Class: %ld",
@@ -138,11 +127,18 @@ OSTResult<void> OSTClientConnection::_findSides(const OSTReplacement& replacemen
     }
     const auto directory = OSTGlobalConfiguration::sharedInstance().containerDirectoryURLForUser(
         operation.newContainer->uid, operation.newContainer->containerClass, operation.transient);
-    operation.destination = pathByAppending(directory.value_or(std::string()), lastPathComponent(newURL));
-    if (OSTFileManager::defaultManager().itemExistsAtURL(operation.destination))
-        return std::unexpected(
-            OSTCreateError(OSTErrorCode::alreadyExists, "Container already exists at %@", operation.destination));
-    return {};
+    if (!directory)
+        return std::unexpected(OSTCreateError(OSTErrorCode::replacingMoveFailed,
+                                              "Failed to find the directory for %@: %@", newURL, directory.error()));
+    operation.destination = pathByAppending(*directory, lastPathComponent(newURL));
+    const auto& files = OSTFileManager::defaultManager();
+    if (files.itemDoesNotExistAtURL(operation.destination))
+        return {};
+    if (!files.itemExistsAtURL(operation.destination))
+        return std::unexpected(OSTCreateError(OSTErrorCode::replacingMoveFailed,
+                                              "Failed to find out whether anything is at %@", operation.destination));
+    return std::unexpected(
+        OSTCreateError(OSTErrorCode::alreadyExists, "Container already exists at %@", operation.destination));
 }
 
 OSTResult<void> OSTClientConnection::_checkNothingLives(const ReplaceOperation& operation) {
@@ -312,7 +308,7 @@ OSTResult<void> OSTClientConnection::_recoverFromReplaceFile(const std::string& 
     const auto& files = OSTFileManager::defaultManager();
     const auto file = OSTReplaceFile::_readAndValidateReplaceFileAtUrl(url);
     // What is parked in staging waits with its file until that can be read again.
-    if (!file && mayBeReadLater(file.error()))
+    if (!file && platform::isReasonThatPasses(file.error()))
         return {};
     // A file that is not valid is in the log, and is only discarded.
     if (file) {

@@ -281,8 +281,8 @@ private:
     /// Moves one item to death row with one rename; an item that is already gone is success.
     /// Fails with `moveToDeathRowFailed`.
     [[nodiscard]] OSTResult<void> _moveItemAtURLToDeathRow(const std::string& url, StartPass startDeletionThread) const;
-    /// Removes an item, or parks it under /tmp when it cannot be removed; the value is then the removal's error.
-    /// Fails with `moveAsideFailed`.
+    /// Removes an item, or parks it under /tmp when it cannot be removed; the value is then the removal's error. An
+    /// item that cannot be removed at the moment stays, with the same value. Fails with `moveAsideFailed`.
     [[nodiscard]] static OSTResult<std::optional<OSTError>> _removeItemOrMoveToTempAtURL(const std::string& url);
     [[nodiscard]] static std::optional<OSTError> _emptyDeathRow();
 

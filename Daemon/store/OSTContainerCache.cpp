@@ -6,12 +6,12 @@
 #include "model/OSTGlobalConfiguration.h"
 #include "platform/base/Immortal.h"
 #include "platform/base/Log.h"
+#include "platform/base/PassingReason.h"
 #include "platform/base/Path.h"
 #include "platform/base/Unicode.h"
 #include "platform/threads/BlockingSection.h"
 
 #include <cerrno>
-#include <cstring>
 #include <future>
 #include <ranges>
 #include <system_error>
@@ -57,24 +57,18 @@ OSTResult<void> checkName(const OSTContainerName& name, std::source_location whe
     return {};
 }
 
-/// Checks a record that the cache holds against the disk.
-OSTResult<void> checkOnDisk(const OSTMetadata& record, std::source_location where) {
-    const auto className = pathComponentForContainerClass(record.containerClass);
-    if (record.url.empty())
-        return std::unexpected(OSTCreateErrorAt(where, OSTErrorCode::invalidCacheInput, nullptr,
-                                                "Cache: %@%@: Invalid URL path string: %@", className,
-                                                suffix(record.transient), record.url));
-    const auto metadataFile = record.metadataFileURL();
-    if (!OSTFileManager::defaultManager().itemExistsAtURL(metadataFile))
-        return std::unexpected(OSTCreateErrorAt(where, OSTErrorCode::cacheInconsistent, nullptr,
-                                                "Cache: %@%@: INCONSISTENT-No Metadata at: %@", className,
-                                                suffix(record.transient), metadataFile));
-    return {};
+/// Whether a look-up failed because there is no such container, and not because nobody could tell.
+bool saysThereIsNone(const OSTError& error) {
+    const auto& cause = error.underlyingError();
+    return error.is(OSTErrorCode::notFound) || error.is(OSTErrorCode::cacheInconsistent) ||
+           error.is(OSTErrorCode::invalidCacheInput) || (cause && cause->is(OSTErrorCode::invalidCacheInput)) ||
+           platform::isAbsence(error);
 }
 
 /// The record of an item of a class directory; null, with the reason in the log, when the item is no valid container.
-OSTMetadataRecord readItem(int open, const std::string& directory, const std::string& name, std::uint32_t userId,
-                           bool transient, std::string& buffer) {
+/// Fails when that cannot be found out.
+OSTResult<OSTMetadataRecord> readItem(int open, const std::string& directory, const std::string& name,
+                                      std::uint32_t userId, bool transient, std::string& buffer) {
     if (!platform::isValidText(name)) { // no answer could hold its path
         platform::logError("Skipping %@ in %@, whose name is not UTF-8", name, directory);
         return nullptr;
@@ -86,6 +80,8 @@ OSTMetadataRecord readItem(int open, const std::string& directory, const std::st
         read ? OSTResult<std::string_view>(buffer)
              : std::unexpected(OSTCreatePOSIXError(read.error(), "read of %@ failed: %s", url, read.error())),
         url, userId, OSTCheckClassPath::yes);
+    if (!metadata && platform::isReasonThatPasses(metadata.error()))
+        return std::unexpected(metadata.error());
     if (!metadata)
         return nullptr;
     metadata->transient = transient;
@@ -134,36 +130,72 @@ OSTResult<OSTCacheEntry> OSTContainerCache::entryForUser(const OSTContainerName&
     return OSTGuarded([&]() -> OSTResult<OSTCacheEntry> {
         OST_TRY(checkName(name, here));
         const auto className = pathComponentForContainerClass(name.containerClass);
-        OSTCacheEntry entry;
-        {
-            const CacheLock lock(_cacheLock);
-            const ClassTable* const table = OST_TRY(_tableForUserId(name, here));
-            if (const auto found = table->find(*name.identifier); found != table->end())
-                entry = found->second;
-        }
-        if (!entry.record)
+        auto held = OST_TRY(_heldForUser(name, here));
+        if (!held.entry.record)
             return std::unexpected(OSTCreateError(OSTErrorCode::notFound, OSTLogging::silent, nullptr,
                                                   "Cache: %@%@: Container Not Found with ID: %@", className,
                                                   suffix(name.transient), name.identifier));
-        OST_TRY(checkOnDisk(*entry.record, here));
+        OST_TRY(_checkOnDisk(held, here));
         platform::logDebug("Cache: %@%@: Found Identifier: %@", className, suffix(name.transient), name.identifier);
-        return entry;
+        return std::move(held.entry);
     });
 }
 
-OSTMetadataRecord OSTContainerCache::containerForUser(OSTContainerName name, const platform::UUID& uuid) {
-    auto entry = entryForUser(name, uuid);
-    return entry ? std::move(entry->record) : nullptr;
+OSTResult<OSTContainerCache::Held> OSTContainerCache::_heldForUser(const OSTContainerName& name,
+                                                                   std::source_location where) {
+    const CacheLock lock(_cacheLock);
+    const ClassTable* const table = OST_TRY(_tableForUserId(name, where));
+    const auto found = table->find(*name.identifier);
+    return found == table->end() ? Held() : found->second;
 }
 
-std::optional<OSTCacheEntry> OSTContainerCache::entryForUser(OSTContainerName name, const platform::UUID& uuid) {
-    for (name.transient = false;; name.transient = true) {
-        auto found = entryForUser(name);
-        if (found && found->record->uuid == uuid)
-            return *std::move(found);
-        if (name.transient)
-            return std::nullopt;
+OSTResult<void> OSTContainerCache::_checkOnDisk(const Held& held, std::source_location where) {
+    const auto& record = *held.entry.record;
+    const auto className = pathComponentForContainerClass(record.containerClass);
+    if (record.url.empty())
+        return std::unexpected(OSTCreateErrorAt(where, OSTErrorCode::invalidCacheInput, nullptr,
+                                                "Cache: %@%@: Invalid URL path string: %@", className,
+                                                suffix(record.transient), record.url));
+    auto metadataFile = held.metadataFile;
+    const auto exists = metadataFile.look(record.url, OSTMetadataFileName.data());
+    if (!exists) {
+        const auto cause = OSTCreatePOSIXError(exists.error(), "look at %@ failed: %s", record.url, exists.error());
+        return std::unexpected(OSTCreateErrorAt(where, OSTErrorCode::cacheRebuildFailed, &cause,
+                                                "Cache: %@%@: Failed to look for metadata at: %@", className,
+                                                suffix(record.transient), record.metadataFileURL()));
     }
+    if (!*exists)
+        return std::unexpected(OSTCreateErrorAt(where, OSTErrorCode::cacheInconsistent, nullptr,
+                                                "Cache: %@%@: INCONSISTENT-No Metadata at: %@", className,
+                                                suffix(record.transient), record.metadataFileURL()));
+    if (metadataFile != held.metadataFile)
+        _remember(held.entry.record, metadataFile);
+    return {};
+}
+
+void OSTContainerCache::_remember(const OSTMetadataRecord& record, const OSTKnownFile& metadataFile) {
+    const CacheLock lock(_cacheLock);
+    const auto table = _getCacheForUserId(record->name());
+    if (!table)
+        return;
+    const auto found = (*table)->find(record->identifier);
+    if (found != (*table)->end() && found->second.entry.record == record)
+        found->second.metadataFile = metadataFile;
+}
+
+OSTResult<OSTMetadataRecord> OSTContainerCache::containerForUser(const OSTContainerName& name,
+                                                                 const platform::UUID& uuid) {
+    return OST_TRY(entryForUser(name, uuid)).record;
+}
+
+OSTResult<OSTCacheEntry> OSTContainerCache::entryForUser(OSTContainerName name, const platform::UUID& uuid) {
+    for (const bool transient : {false, true}) {
+        name.transient = transient;
+        auto found = entryForUser(name);
+        if (found ? found->record->uuid == uuid : !saysThereIsNone(found.error()))
+            return found;
+    }
+    return OSTCacheEntry();
 }
 
 OSTResult<std::vector<OSTMetadataRecord>>
@@ -180,21 +212,26 @@ OSTContainerCache::allEntriesForUser(std::uint32_t userId, OSTContainerClass con
     return OSTGuarded([&]() -> OSTResult<std::vector<OSTCacheEntry>> {
         if (!isValidContainerClass(contentClass))
             return std::unexpected(invalidContentClass(contentClass, here));
-        std::vector<OSTCacheEntry> entries;
+        std::vector<Held> all;
         {
             const CacheLock lock(_cacheLock);
             const ClassTable* const table = OST_TRY(
                 _tableForUserId({.userId = userId, .containerClass = contentClass, .transient = transient}, here));
-            for (const auto& entry : *table | std::views::values)
-                entries.push_back(entry);
+            const auto values = *table | std::views::values;
+            all.assign(values.begin(), values.end());
         }
-        std::erase_if(entries, [&](const OSTCacheEntry& entry) {
-            if (!checkOnDisk(*entry.record, here))
-                return true;
+        std::vector<OSTCacheEntry> entries;
+        entries.reserve(all.size());
+        for (auto& held : all) {
+            const auto checked = _checkOnDisk(held, here);
+            if (!checked && !saysThereIsNone(checked.error()))
+                return std::unexpected(checked.error());
+            if (!checked)
+                continue;
             platform::logDebug("Cache: %@%@: ALL Found Identifier: %@", pathComponentForContainerClass(contentClass),
-                               suffix(transient), entry.record->identifier);
-            return false;
-        });
+                               suffix(transient), held.entry.record->identifier);
+            entries.push_back(std::move(held.entry));
+        }
         return entries;
     });
 }
@@ -245,8 +282,8 @@ void OSTContainerCache::placementReachedDisk(const OSTMetadata& metadata) {
     if (!table)
         return;
     const auto found = (*table)->find(metadata.identifier);
-    if (found != (*table)->end() && found->second.record->url == metadata.url)
-        found->second.placement = OSTPlacement::durable;
+    if (found != (*table)->end() && found->second.entry.record->url == metadata.url)
+        found->second.entry.placement = OSTPlacement::durable;
 }
 
 OSTResult<void> OSTContainerCache::removeContainerForUser(const OSTContainerName& name) {
@@ -289,17 +326,16 @@ OSTResult<OSTContainerCache::ClassTable*> OSTContainerCache::_getCacheForUserId(
     const auto directory =
         OSTGlobalConfiguration::sharedInstance().containerDirectoryURLForUser(userId, contentClass, transient);
     if (!directory)
-        return std::unexpected(OSTCreatePOSIXError(ENOENT, "User %u has no container directories", userId));
+        return std::unexpected(OSTCreatePOSIXError(directory.error(), "User %u has no container directories", userId));
     return &tables.emplace(key, OST_TRY(_readClassDirectory(*directory, userId, transient))).first->second;
 }
 
 OSTResult<OSTContainerCache::ClassTable> OSTContainerCache::_readClassDirectory(const std::string& directory,
                                                                                 std::uint32_t userId, bool transient) {
     const auto& files = OSTFileManager::defaultManager();
-    // Everybody who writes here has asked for this table first.
-    const auto items = OST_TRY(files.urlsForItemsInDirectoryRemovingUnfinished(directory));
+    const auto items = OST_TRY(files.urlsForItemsInDirectoryAtURL(directory));
     const auto open = OST_TRY(files.openDirectoryAtURL(directory));
-    std::vector<OSTMetadataRecord> records(items.size());
+    std::vector<OSTResult<OSTMetadataRecord>> records(items.size());
     const auto read = [&](std::size_t first, std::size_t last) {
         std::string buffer;
         for (; first < last; ++first)
@@ -310,19 +346,20 @@ OSTResult<OSTContainerCache::ClassTable> OSTContainerCache::_readClassDirectory(
     ClassTable table;
     table.reserve(items.size());
     for (auto& record : records)
-        if (record)
-            _put(table, {std::move(record)});
+        if (auto valid = OST_TRY(std::move(record)))
+            _put(table, {std::move(valid)});
     return table;
 }
 
 void OSTContainerCache::_put(ClassTable& table, OSTCacheEntry entry) {
     const std::string_view identifier = entry.record->identifier;
     if (const auto old = table.find(identifier); old != table.end()) {
-        if (old->second.record->url == entry.record->url && old->second.placement == OSTPlacement::pending)
+        const auto& [record, placement] = old->second.entry;
+        if (record->url == entry.record->url && placement == OSTPlacement::pending)
             entry.placement = OSTPlacement::pending;
         table.erase(old); // with its key, which the old record owns
     }
-    table.emplace(identifier, std::move(entry));
+    table.emplace(identifier, Held{std::move(entry)});
 }
 
 } // namespace ost

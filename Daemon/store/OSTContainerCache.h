@@ -1,5 +1,6 @@
 #pragma once
 
+#include "files/OSTKnownFile.h"
 #include "model/OSTContainerName.h"
 #include "model/OSTMetadata.h"
 #include "platform/base/Mutex.h"
@@ -8,7 +9,6 @@
 #include <cstdint>
 #include <functional>
 #include <map>
-#include <optional>
 #include <source_location>
 #include <string>
 #include <string_view>
@@ -41,17 +41,20 @@ class OSTContainerCache {
 public:
     static OSTContainerCache& sharedInstance();
 
-    /// Finds a container by its identifier. Fails with `invalidCacheInput`, `cacheRebuildFailed`, `notFound` (not
-    /// logged), or `cacheInconsistent` when the container's metadata file has gone from the disk; the record then
-    /// stays.
+    /// Finds a container by its identifier. Fails with `invalidCacheInput`, `notFound` (not logged),
+    /// `cacheInconsistent` when the container's metadata file has gone from the disk, or `cacheRebuildFailed` when that
+    /// or the class directory cannot be looked at. The record stays in any case.
     [[nodiscard]] OSTResult<OSTMetadataRecord> containerForUser(const OSTContainerName& name);
     [[nodiscard]] OSTResult<OSTCacheEntry> entryForUser(const OSTContainerName& name);
 
-    /// Finds the container with that internal UUID, among the live ones first; null when neither table has it.
-    [[nodiscard]] OSTMetadataRecord containerForUser(OSTContainerName name, const platform::UUID& uuid);
-    [[nodiscard]] std::optional<OSTCacheEntry> entryForUser(OSTContainerName name, const platform::UUID& uuid);
+    /// Finds the container with that internal UUID, among the live ones first; without a record when there is none.
+    /// Fails when that cannot be found out.
+    [[nodiscard]] OSTResult<OSTMetadataRecord> containerForUser(const OSTContainerName& name,
+                                                                const platform::UUID& uuid);
+    [[nodiscard]] OSTResult<OSTCacheEntry> entryForUser(OSTContainerName name, const platform::UUID& uuid);
 
-    /// All containers whose metadata file is on disk; the errors of others are logged and not returned.
+    /// All containers whose metadata file is on disk; a file that has gone is logged. Fails with `invalidCacheInput` or
+    /// `cacheRebuildFailed`.
     [[nodiscard]] OSTResult<std::vector<OSTMetadataRecord>>
     allContainersForUser(std::uint32_t userId, OSTContainerClass contentClass, bool transient);
     [[nodiscard]] OSTResult<std::vector<OSTCacheEntry>>
@@ -73,8 +76,12 @@ public:
     [[nodiscard]] OSTResult<void> removeContainerForUser(const OSTContainerName& name);
 
 private:
-    /// Entries by the identifier that their own record owns.
-    using ClassTable = std::unordered_map<std::string_view, OSTCacheEntry>;
+    struct Held {
+        OSTCacheEntry entry;
+        OSTKnownFile metadataFile = {};
+    };
+    /// What is held, by the identifier that its own record owns.
+    using ClassTable = std::unordered_map<std::string_view, Held>;
     using ClassKey = std::pair<std::uint32_t, OSTContainerClass>;
     using ClassTables = std::map<ClassKey, ClassTable>;
 
@@ -86,6 +93,11 @@ private:
     [[nodiscard]] static OSTResult<ClassTable> _readClassDirectory(const std::string& directory, std::uint32_t userId,
                                                                    bool transient);
     static void _put(ClassTable& table, OSTCacheEntry entry);
+    /// What is held under a name; without a record when there is nothing.
+    [[nodiscard]] OSTResult<Held> _heldForUser(const OSTContainerName& name, std::source_location where);
+    /// Looks for the metadata file of what is held and remembers what was seen.
+    [[nodiscard]] OSTResult<void> _checkOnDisk(const Held& held, std::source_location where);
+    void _remember(const OSTMetadataRecord& record, const OSTKnownFile& metadataFile);
 
     platform::Mutex _cacheLock;
     ClassTables _liveContainerCache OST_GUARDED_BY(_cacheLock);

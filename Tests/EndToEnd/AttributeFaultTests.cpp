@@ -124,7 +124,7 @@ TEST_F(AttributeFaultTest, ASetThatFailsChangesNeitherFileNorMemory) {
         Fault::Kind::fail, [&](auto& connection) { return set(connection); },
         [&](auto& connection, const auto& answer) {
             EXPECT_TRUE(answer || answer.error() == ostrand::Error::refused() ||
-                        answer.error() == ostrand::Error::failed(34) || answer.error() == ostrand::Error::failed(21))
+                        answer.error() == ostrand::Error::failed(34) || answer.error() == ostrand::Error::failed(43))
                 << answer.error().description();
             const auto value = valueAnswered(connection, "k");
             EXPECT_EQ(value, answer ? set.current : set.before);

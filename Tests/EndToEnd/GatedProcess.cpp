@@ -48,6 +48,7 @@ constexpr std::array gatedCalls{
     Call{SYS_fchownat, "fchownat", false},
     Call{SYS_setxattr, "setxattr", false},
     Call{SYS_getxattr, "getxattr", false},
+    Call{SYS_readlinkat, "readlinkat", false},
     Call{SYS_fchmod, "fchmod", true},
     Call{SYS_fchown, "fchown", true},
     Call{SYS_fsetxattr, "fsetxattr", true},
@@ -65,6 +66,7 @@ constexpr std::array gatedCalls{
     Call{SYS_rename, "rename", false},
     Call{SYS_unlink, "unlink", false},
     Call{SYS_chmod, "chmod", false},
+    Call{SYS_readlink, "readlink", false},
 #endif
 };
 

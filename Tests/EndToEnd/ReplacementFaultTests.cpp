@@ -33,13 +33,10 @@ constexpr const char* identifier = "com.example.Installer.Sketches";
 constexpr const char* dataName = "data";
 
 /// What a replacement that did not succeed may answer when a file-system call fails.
-constexpr std::array expectedCodes{OSTErrorCode::notFound,
-                                   OSTErrorCode::alreadyExists,
-                                   OSTErrorCode::dictionaryWriteFailed,
-                                   OSTErrorCode::moveOldToStagingFailed,
-                                   OSTErrorCode::replacingMoveFailed,
-                                   OSTErrorCode::replaceCleanupFailed,
-                                   OSTErrorCode::mappingWriteFailed};
+constexpr std::array expectedCodes{OSTErrorCode::cacheRebuildFailed,    OSTErrorCode::alreadyExists,
+                                   OSTErrorCode::dictionaryWriteFailed, OSTErrorCode::moveOldToStagingFailed,
+                                   OSTErrorCode::replacingMoveFailed,   OSTErrorCode::replaceFileInvalid,
+                                   OSTErrorCode::replaceCleanupFailed,  OSTErrorCode::mappingWriteFailed};
 
 /// Which of the two containers is in the old one's place.
 enum class Place { old, replaced };

@@ -277,16 +277,28 @@ TEST_F(ContainerStore, CacheReportsWhatGoneBehindItsBack) {
     EXPECT_TRUE(wrongUser.error().underlyingError()->is(OSTErrorCode::invalidCacheInput));
 }
 
+TEST_F(ContainerStore, UserIsServedAsSoonAsTheAccountAndTheHomeAreThere) {
+    const auto code = [] {
+        const auto made = create(502, dataApplication, "org.example.app");
+        return made ? OSTErrorCode::success : made.error();
+    };
+    EXPECT_EQ(OSTErrorCode::cacheRebuildFailed, code());
+    test::writeFile("/etc/passwd", test::readFile("/etc/passwd") + "second:x:502:502::/private/var/second:/bin/sh\n");
+    EXPECT_EQ(OSTErrorCode::cacheRebuildFailed, code());
+    fs::create_directories("/private/var/second");
+    EXPECT_EQ(OSTErrorCode::success, code());
+}
+
 TEST_F(ContainerStore, CacheTellsLiveAndTransientContainersApart) {
     auto& cache = OSTContainerCache::sharedInstance();
     const auto live = *lookUp("org.example.app", true);
     const auto transient = *lookUp("org.example.app", true, true);
     const OSTContainerName name = live->name();
-    EXPECT_EQ(live->url, cache.containerForUser(name, live->uuid)->url);
-    const auto found = cache.containerForUser(name, transient->uuid);
+    EXPECT_EQ(live->url, (*cache.containerForUser(name, live->uuid))->url);
+    const auto found = *cache.containerForUser(name, transient->uuid);
     EXPECT_EQ(transient->url, found->url);
     EXPECT_TRUE(found->transient);
-    EXPECT_FALSE(cache.containerForUser(name, platform::UUID::generate()));
+    EXPECT_FALSE(*cache.containerForUser(name, platform::UUID::generate()));
 
     ASSERT_TRUE(cache.removeContainerForUser(transient->name()));
     ASSERT_TRUE(cache.removeContainerForUser(transient->name())) << "absent is no error";
