@@ -115,7 +115,10 @@ OSTResult<OSTClientConnection::LookUpResult> OSTClientConnection::_lookUp(const 
         return LookUpResult{.entry = *found};
     if (found) {
         // A transient container is never reused.
-        if (const auto removed = _moveItemAtURLToDeathRow(found->record->url, StartPass::yes); !removed)
+        auto removed = _settleReplacementsOf(*found->record);
+        if (removed)
+            removed = _moveItemAtURLToDeathRow(found->record->url, StartPass::yes);
+        if (!removed)
             return std::unexpected(OSTCreateError(OSTErrorCode::transientRemovalFailed, removed.error(),
                                                   "Failed to remove transient container at %@", found->record->url));
     } else if (!found.error().is(OSTErrorCode::notFound)) {

@@ -71,7 +71,7 @@ std::expected<void, OSTErrorCode> OSTClientConnection::stageForDeleteContainer(c
     });
 }
 
-OSTResult<void> OSTClientConnection::_stageForDeletion(const OSTContainerReference& reference) {
+OSTResult<void> OSTClientConnection::_stageForDeletion(const OSTContainerReference& reference) const {
     const auto& [name, uuid] = reference;
     if (!uuid || !name.identifier || !isValidContainerClass(name.containerClass)) {
         static_cast<void>(OSTCreateError(OSTErrorCode::invalidObject,
@@ -83,7 +83,8 @@ OSTResult<void> OSTClientConnection::_stageForDeletion(const OSTContainerReferen
     return record ? _stageContainer(*record) : OSTResult<void>();
 }
 
-OSTResult<void> OSTClientConnection::_stageContainer(const OSTMetadata& metadata) {
+OSTResult<void> OSTClientConnection::_stageContainer(const OSTMetadata& metadata) const {
+    OST_TRY(_settleReplacementsOf(metadata));
     const auto& files = OSTFileManager::defaultManager();
     const auto destination =
         pathByAppending(OSTGlobalConfiguration::sharedInstance().deathrowDirectory(), lastPathComponent(metadata.url));

@@ -90,6 +90,9 @@ OSTResult<void> OSTClientConnection::_checkReplacement(const OSTReplacement& rep
 
 OSTResult<void> OSTClientConnection::_replace(const OSTReplacement& replacement, ReplaceOperation& operation) const {
     OST_TRY(_findSides(replacement, operation));
+    for (const auto& side : {operation.oldContainer, operation.newContainer})
+        if (side)
+            OST_TRY(_settleReplacementsOf(*side));
     if (operation.oldContainer)
         OST_TRY(_parkOldContainer(operation));
     else
@@ -287,6 +290,27 @@ OSTResult<void> OSTClientConnection::_discardReplaceFile(const std::string& url,
     if (!moved)
         static_cast<void>(OSTFileManager::defaultManager().removeItemAtURL(url));
     return moved;
+}
+
+OSTResult<void> OSTClientConnection::_settleReplacementsOf(const OSTMetadata& container) const {
+    const auto& files = OSTFileManager::defaultManager();
+    const auto directory = OSTGlobalConfiguration::sharedInstance().replaceDirectory();
+    const auto items = files.urlsForItemsInDirectoryAtURL(directory);
+    if (!items && !platform::isAbsence(items.error()))
+        return std::unexpected(OSTCreateError(OSTErrorCode::replaceFileInvalid, items.error(),
+                                              "Failed to get items at replace URL%@ : %@", directory, items.error()));
+    for (const auto& item : items.value_or(std::vector<OSTDirectoryItem>())) {
+        const auto url = pathByAppending(directory, item.name);
+        const auto file = OSTReplaceFile::_readAndValidateReplaceFileAtUrl(url);
+        if (!file && platform::isReasonThatPasses(file.error()))
+            return std::unexpected(file.error());
+        if (!file || (file->oldURL != container.url && file->destinationURL != container.url))
+            continue;
+        if (!_discardReplaceFile(url, StartPass::no) && !files.itemDoesNotExistAtURL(url))
+            return std::unexpected(
+                OSTCreateError(OSTErrorCode::replaceCleanupFailed, "Failed to remove replace file at %@", url));
+    }
+    return {};
 }
 
 OSTResult<void> OSTClientConnection::_recoverFromReplaceOperations() const {

@@ -251,6 +251,10 @@ private:
                                                       const ReplaceOperation& operation) const;
     /// Moves the file to death row, or removes it where it is; the latter is a failure all the same.
     [[nodiscard]] OSTResult<void> _discardReplaceFile(const std::string& url, StartPass startDeletionThread) const;
+    /// Discards the replace files that earlier replacements left and that speak of the place of a living container,
+    /// which is about to leave it: a later start would take it for one that a replacement lost. The caller holds the
+    /// all-identifiers lock for writing. Fails with `replaceFileInvalid` or `replaceCleanupFailed`.
+    [[nodiscard]] OSTResult<void> _settleReplacementsOf(const OSTMetadata& container) const;
     [[nodiscard]] OSTResult<void> _recoverFromReplaceOperations() const;
     [[nodiscard]] OSTResult<void> _recoverFromReplaceFile(const std::string& url) const;
 
@@ -276,8 +280,8 @@ private:
     static void _repairSandboxContainerMappings();
 
     // +Deletion
-    [[nodiscard]] static OSTResult<void> _stageForDeletion(const OSTContainerReference& reference);
-    [[nodiscard]] static OSTResult<void> _stageContainer(const OSTMetadata& metadata);
+    [[nodiscard]] OSTResult<void> _stageForDeletion(const OSTContainerReference& reference) const;
+    [[nodiscard]] OSTResult<void> _stageContainer(const OSTMetadata& metadata) const;
     /// Moves one item to death row with one rename; an item that is already gone is success.
     /// Fails with `moveToDeathRowFailed`.
     [[nodiscard]] OSTResult<void> _moveItemAtURLToDeathRow(const std::string& url, StartPass startDeletionThread) const;

@@ -116,6 +116,33 @@ TEST_F(Replacement, StartsAPassOnlyWhenAskedTo) {
     }
 }
 
+TEST_F(Replacement, FileThatIsStillPendingIsDiscardedBeforeItsContainerGoes) {
+    const auto pend = [](const OSTMetadataRecord& record) {
+        const auto token = UUID::generate().string();
+        const OSTReplaceFile file{.oldURL = record->url,
+                                  .newURL = record->url,
+                                  .stagingURL = fs::path(staging) / token,
+                                  .destinationURL = record->url};
+        EXPECT_TRUE(file._writeToDiskReplaceAt(OSTReplaceFile::urlOfToken(token)));
+    };
+    const auto other = make(dataApplication, "other");
+    pend(other);
+    const auto deleted = make(dataApplication, "deleted");
+    pend(deleted);
+    EXPECT_TRUE(store().stageForDeleteContainer(*deleted));
+    const auto old = make(dataApplication, "old");
+    const auto fresh = make(dataApplication, "fresh", true);
+    pend(old);
+    pend(fresh);
+    EXPECT_EQ(1, replace(old, fresh));
+    const auto transient = make(dataApplication, "transient", true);
+    pend(transient);
+    make(dataApplication, "transient", true);
+    EXPECT_EQ(1U, names(replaceDirectory).size()) << "that of the other one";
+    store().containerManagerSetup();
+    EXPECT_TRUE(names(replaceDirectory).empty());
+}
+
 TEST_F(Replacement, IsWrittenDownBeforeTheFirstMove) {
     const auto old = make(bundleApplication, "a");
     const auto fresh = make(bundleApplication, "a", true);
