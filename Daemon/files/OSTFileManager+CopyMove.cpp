@@ -29,8 +29,9 @@ enum class Existing : unsigned { stays = RENAME_NOREPLACE, isReplaced = 0 };
 class Workshop {
 public:
     static std::expected<Workshop, platform::Errno> make(std::string_view item, int parent) {
-        auto name = OST_TRY(OSTMakeUnderUniqueName(
-            OSTUnfinishedPrefix, [&](const char* candidate) { return ::mkdirat(parent, candidate, S_IRWXU) == 0; }));
+        auto name = OST_TRY(OSTMakeUnderUniqueName(OSTOwnUnfinishedPrefix(), [&](const char* candidate) {
+            return ::mkdirat(parent, candidate, S_IRWXU) == 0;
+        }));
         std::string path = platform::pathByAppending(platform::pathByDeletingLastComponent(item), name);
         auto directory = OSTOpenItem(parent, name, O_RDONLY | O_DIRECTORY);
         if (!directory) {

@@ -3,6 +3,7 @@
 #include "files/OSTDurability.h"
 #include "files/OSTPathResolution.h"
 #include "files/OSTUniqueName.h"
+#include "platform/base/Immortal.h"
 #include "platform/base/Path.h"
 #include "platform/base/SmallFile.h"
 #include "platform/device/AccessControlList.h"
@@ -75,7 +76,8 @@ std::expected<void, platform::Errno> finish(int file, std::string_view bytes, co
 std::expected<void, platform::Errno> writeAtomically(const OSTItemPlace& place, int workshop, std::string_view bytes,
                                                      const OSTFileAttributes& attributes) {
     FileDescriptor file;
-    UnfinishedFile unfinished(workshop, OST_TRY(OSTMakeUnderUniqueName(OSTUnfinishedPrefix, [&](const char* candidate) {
+    UnfinishedFile unfinished(workshop,
+                              OST_TRY(OSTMakeUnderUniqueName(OSTOwnUnfinishedPrefix(), [&](const char* candidate) {
                                   file = createExclusively(workshop, candidate, attributes.mode);
                                   return static_cast<bool>(file);
                               })));
@@ -109,15 +111,30 @@ OSTResult<void> OSTFileManager::writeFileAtomicallyAtURL(std::string_view path, 
     return {};
 }
 
-void OSTFileManager::removeUnfinishedItemsInDirectoryURL(std::string_view path) const {
+const std::string& OSTOwnUnfinishedPrefix() {
+    static platform::Immortal prefix([] {
+        const auto tag = OSTMakeUnderUniqueName(OSTUnfinishedPrefix, [](const char*) { return true; });
+        return tag.value_or(std::string(OSTUnfinishedPrefix)) + ".";
+    });
+    return *prefix;
+}
+
+std::vector<std::string> OSTFileManager::unfinishedItemsInDirectoryURL(std::string_view path) const {
+    std::vector<std::string> items;
     auto directory = OSTOpenItem(AT_FDCWD, path, O_RDONLY | O_DIRECTORY);
     const auto close = [](DIR* stream) { ::closedir(stream); };
     const std::unique_ptr<DIR, decltype(close)> stream(directory ? ::fdopendir(directory->release()) : nullptr);
-    if (!stream)
-        return;
-    while (const dirent* const entry = ::readdir(stream.get()))
-        if (std::string_view(entry->d_name).starts_with(OSTUnfinishedPrefix))
-            static_cast<void>(removeItemAtURL(platform::pathByAppending(path, entry->d_name)));
+    while (const dirent* const entry = stream ? ::readdir(stream.get()) : nullptr) {
+        const std::string_view name = entry->d_name;
+        if (name.starts_with(OSTUnfinishedPrefix) && !name.starts_with(OSTOwnUnfinishedPrefix()))
+            items.push_back(platform::pathByAppending(path, name));
+    }
+    return items;
+}
+
+void OSTFileManager::removeUnfinishedItemsInDirectoryURL(std::string_view path) const {
+    for (const auto& item : unfinishedItemsInDirectoryURL(path))
+        static_cast<void>(removeItemAtURL(item));
 }
 
 OSTResult<OSTNewFile> OSTFileManager::createFileAtURL(std::string_view path, std::string_view bytes,

@@ -169,7 +169,10 @@ public:
     [[nodiscard]] OSTResult<void> writeFileAtomicallyAtURL(std::string_view path, std::string_view bytes,
                                                            const OSTFileAttributes& attributes = {},
                                                            OSTWorkshop workshop = OSTWorkshop::ownDirectory) const;
-    /// Removes the unfinished files and copies that a crash left in a directory. Nobody may be writing there.
+    /// The paths of the unfinished files and copies that an earlier process left in a directory; none when it cannot be
+    /// listed.
+    [[nodiscard]] std::vector<std::string> unfinishedItemsInDirectoryURL(std::string_view path) const;
+    /// Removes them.
     void removeUnfinishedItemsInDirectoryURL(std::string_view path) const;
     /// Writes a file that must not exist yet (EEXIST), in a directory that nobody else looks into, and leaves the wait
     /// for the disk to the caller.

@@ -19,6 +19,11 @@ inline constexpr std::string_view OSTUnfinishedPrefix = ".temp.";
 /// Names tried before giving up; a second is needed about never.
 inline constexpr int OSTUniqueNameAttempts = 100;
 
+/// What the name of an unfinished item begins with, so that no listing shows it.
+inline constexpr std::string_view OSTUnfinishedPrefix = ".temp.";
+/// The same for what this process makes, and so is not a leftover.
+[[nodiscard]] const std::string& OSTOwnUnfinishedPrefix();
+
 /// Calls `make` with names of the prefix and six random letters or digits until it answers true, and returns the name
 /// that it took. Fails with errno as soon as that is not EEXIST.
 template<typename Make>

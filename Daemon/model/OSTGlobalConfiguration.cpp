@@ -43,6 +43,18 @@ std::expected<bool, platform::Errno> isBaseOfAUser(std::string_view base) {
     return user.has_value();
 }
 
+/// The directories that hold class directories of real users.
+std::vector<std::string> basesOfUsers() {
+    std::vector<std::string> bases;
+    (void)platform::accountMatching([&](const platform::Account& account) {
+        if (account.uid > OSTHighestSystemUserId)
+            for (const auto name : {OSTUserBaseDirectoryName, OSTUserTransientDirectoryName})
+                bases.push_back(pathByAppending(canonical(account.home.c_str()), name));
+        return false;
+    });
+    return bases;
+}
+
 } // namespace
 
 OSTGlobalConfiguration& OSTGlobalConfiguration::sharedInstance() {
@@ -147,6 +159,23 @@ OSTGlobalConfiguration::containerDirectoryURLForUser(std::uint32_t userId, OSTCo
     return OSTMakeLayoutDirectory(pathByAppending(base, pathComponentForContainerClass(contentClass)),
                                   {.withIntermediateDirectories = true, .mode = 0755, .owner = owner},
                                   "Failed to create container dir at \"%@\": %@");
+}
+
+std::vector<std::string> OSTGlobalConfiguration::classDirectories() const {
+    const std::vector<std::string> bundleBases{_sharedContainersDirectory,
+                                               pathByAppending(_tessalydHomeDirectory, cachesName)};
+    const std::vector<std::string> systemBases{
+        _sharedContainersDirectory, pathByAppending(pathByAppending(_homeDirectory, cachesName), transientName)};
+    const auto userBases = basesOfUsers();
+    std::vector<std::string> directories;
+    for (auto number = std::uint64_t{1}; number < static_cast<std::uint64_t>(OSTContainerClass::max); ++number) {
+        const auto containerClass = static_cast<OSTContainerClass>(number);
+        for (const auto& base : isBundleClass(containerClass)   ? bundleBases
+                                : isSystemClass(containerClass) ? systemBases
+                                                                : userBases)
+            directories.push_back(pathByAppending(base, pathComponentForContainerClass(containerClass)));
+    }
+    return directories;
 }
 
 std::expected<bool, platform::Errno> OSTGlobalConfiguration::isContainerURL(std::string_view url) const {

@@ -13,6 +13,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <vector>
 
 namespace ost {
 
@@ -48,6 +49,9 @@ public:
     /// has no home, with EINVAL when the class has no directory for the user, with another errno while nobody can tell.
     [[nodiscard]] std::expected<std::string, platform::Errno>
     containerDirectoryURLForUser(std::uint32_t userId, OSTContainerClass contentClass, bool transient);
+
+    /// The class directories of all users that have an account now, whether or not they exist. Makes none.
+    [[nodiscard]] std::vector<std::string> classDirectories() const;
 
     /// Whether `url` could be the path of a container: a name directly inside the class directory of a class and user.
     /// Makes no directory. Fails with the errno of reading the accounts.

@@ -1,4 +1,6 @@
-#include "EndToEnd/GatedProcess.h"
+#include "Client/Containers.h"
+#include "EndToEnd/GatedDevice.h"
+#include "EndToEnd/StoreView.h"
 #include "files/OSTFileManager.h"
 #include "support/DeviceTest.h"
 #include "support/ScratchDirectory.h"
@@ -8,8 +10,10 @@
 #include <sys/mount.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <csignal>
+#include <iterator>
 #include <set>
 #include <string>
 
@@ -85,6 +89,52 @@ TEST_F(MoveFaultTest, ACallThatFailsMovesAllOrNothing) {
     }
     EXPECT_EQ(status, 0);
     EXPECT_FALSE(fs::exists(source));
+}
+
+/// A device whose bundles lie on a file system of their own.
+class MoveLeftoversTest : public GatedDeviceTest {
+protected:
+    void SetUp() override {
+        GatedDeviceTest::SetUp();
+        if (IsSkipped())
+            return;
+        _other = device().onHost("/private/var/containers");
+        fs::create_directories(_other);
+        ASSERT_EQ(::mount("tmpfs", _other.c_str(), "tmpfs", 0, "mode=755"), 0);
+    }
+    void TearDown() override { ::umount2(_other.c_str(), MNT_DETACH); }
+
+    /// What lies where only containers belong, beside whole ones.
+    [[nodiscard]] std::vector<std::string> strays() {
+        auto names = namesIn(_other / "Bundle/Application");
+        std::erase_if(names, [](const std::string& name) { return !name.starts_with('.'); });
+        std::ranges::copy(leftovers(device().image()), std::back_inserter(names));
+        return names;
+    }
+
+private:
+    fs::path _other;
+};
+
+TEST_F(MoveLeftoversTest, TheNextStartRemovesWhatAKillLeft) {
+    const ostrand::ContainerRequest bundle{
+        .containerClass = ostrand::ContainerClass::bundleApplication, .user = 33, .identifier = "com.example.bundle"};
+    bool strayed = false;
+    for (unsigned call = 1;; ++call) {
+        auto connection = device().connect();
+        device().daemon().prepare({.kind = Fault::Kind::kill, .call = call});
+        if (ostrand::createOrLookup(connection, bundle, ostrand::WhenMissing::create))
+            (void)ostrand::deleteContainer(connection, bundle);
+        const auto course = device().daemon().conclude();
+        SCOPED_TRACE("killed at call " + std::to_string(call) + ", " + course.faultedCall);
+        strayed = strayed || !strays().empty();
+        if (course.faultedCall.empty())
+            break;
+        device().startDaemon();
+        ASSERT_TRUE(device().waitForFirstPass());
+        ASSERT_EQ(std::vector<std::string>(), strays());
+    }
+    EXPECT_TRUE(strayed);
 }
 
 } // namespace
