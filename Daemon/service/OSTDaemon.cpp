@@ -69,7 +69,14 @@ bool OSTDaemon::start() {
     static OSTCodeSigningStoreDelegate codeSigning;
     OSTStoreDelegate::join(codeSigning);
     const auto& store = OSTClientConnection::sharedClientConnection();
-    const bool firstBoot = !platform::namedSemaphoreExists(firstBootMarker);
+    const auto firstBootWorkDone = platform::namedSemaphoreExists(firstBootMarker);
+    if (!firstBootWorkDone) {
+        // First-boot work destroys transient containers, which are lost when they are of this boot.
+        logAs(LogLevel::error, "main", "Failed to look for semaphore %s: %s. Exiting.", firstBootMarker,
+              firstBootWorkDone.error());
+        return false;
+    }
+    const bool firstBoot = !*firstBootWorkDone;
     if (firstBoot)
         logAs(LogLevel::notice, "main", "ostrandd performing first boot initialization");
     if (firstBoot)

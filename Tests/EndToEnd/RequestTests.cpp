@@ -3,6 +3,7 @@
 #include "model/OSTMetadata.h"
 #include "service/OSTCommandTable.h"
 #include "support/BootedDevice.h"
+#include "support/DeviceTest.h"
 
 #include <gtest/gtest.h>
 
@@ -137,6 +138,9 @@ TEST_F(RequestTest, AProgramThatIsNotSignedOrNotTrustworthyMayDoNothing) {
         {"a program that all may write", writableByOthers, "(null)"},
         {"a program of a user", ofSomebody, "(null)"},
     };
+    // Only a daemon that answers has made all directories that a start makes.
+    EXPECT_EQ(client(allowed()).connect().call(creation(1, "com.example.a", false)).error(), 21U);
+    const auto untouched = tree(device().onHost("/private/var/mobile"));
     for (const auto& [who, identity, identifier] : rows) {
         const auto caller = client(identity);
         DeviceLog log(device());
@@ -148,7 +152,7 @@ TEST_F(RequestTest, AProgramThatIsNotSignedOrNotTrustworthyMayDoNothing) {
                                           ") missing required entitlement: " + entitlement("allowed")})
             << who;
     }
-    EXPECT_FALSE(std::filesystem::exists(device().onHost("/private/var/mobile/Containers")));
+    EXPECT_EQ(tree(device().onHost("/private/var/mobile")), untouched);
 }
 
 TEST_F(RequestTest, EveryRequestIsJudgedAnew) {

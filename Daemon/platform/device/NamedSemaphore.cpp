@@ -1,5 +1,7 @@
 #include "platform/device/NamedSemaphore.h"
 
+#include "platform/base/PassingReason.h"
+
 #include <fcntl.h>
 #include <semaphore.h>
 
@@ -7,10 +9,12 @@
 
 namespace ost::platform {
 
-bool namedSemaphoreExists(const std::string& name) {
+std::expected<bool, Errno> namedSemaphoreExists(const std::string& name) {
     auto* semaphore = ::sem_open(("/" + name).c_str(), 0);
-    if (semaphore == SEM_FAILED)
+    if (semaphore == SEM_FAILED && speaksOfTheItem(errno))
         return false;
+    if (semaphore == SEM_FAILED)
+        return std::unexpected(errno);
     ::sem_close(semaphore);
     return true;
 }
