@@ -2,7 +2,6 @@
 
 #include "files/OSTPathResolution.h"
 #include "files/OSTTreeCursor.h"
-#include "files/OSTUniqueName.h"
 #include "platform/base/Log.h"
 #include "platform/base/Path.h"
 
@@ -22,26 +21,16 @@ bool isDirectory(const OSTTreeCursor& item) {
     return ::fstatat(item.directory(), item.name(), &status, AT_SYMLINK_NOFOLLOW) == 0 && S_ISDIR(status.st_mode);
 }
 
-/// Calls `show` for each item that is listed and `hide` for each of the others.
-std::expected<void, platform::Errno> iterateDirectory(std::string_view path, const auto& show, const auto& hide) {
+std::expected<std::vector<OSTDirectoryItem>, platform::Errno> listing(std::string_view path) {
     auto directory = OSTOpenItem(AT_FDCWD, path, O_RDONLY | O_DIRECTORY);
     if (!directory && directory.error() != ENOENT)
         platform::logAs(platform::LogLevel::error, "_IterateDirectory", "opendir of %s failed: %s", path,
                         directory.error());
     OSTTreeCursor cursor(OST_TRY(std::move(directory)), std::string());
-    while (OST_TRY(cursor.next()))
-        cursor.name()[0] == '.' ? hide(cursor) : show(cursor);
-    return {};
-}
-
-OSTResult<std::vector<OSTDirectoryItem>> listing(std::string_view path, const auto& hide) {
     std::vector<OSTDirectoryItem> items;
-    const auto show = [&](const OSTTreeCursor& item) {
-        items.push_back({.name = item.name(), .isDirectory = isDirectory(item)});
-    };
-    if (const auto listed = iterateDirectory(path, show, hide); !listed)
-        return std::unexpected(
-            OSTCreatePOSIXError(listed.error(), "_IterateDirectory for %@ returned %s", path, listed.error()));
+    while (OST_TRY(cursor.next()))
+        if (cursor.name()[0] != '.')
+            items.push_back({.name = cursor.name(), .isDirectory = isDirectory(cursor)});
     return items;
 }
 
@@ -54,19 +43,11 @@ platform::Errno errorOfLooking(std::string_view path) {
 } // namespace
 
 OSTResult<std::vector<OSTDirectoryItem>> OSTFileManager::urlsForItemsInDirectoryAtURL(std::string_view path) const {
-    return listing(path, [](const OSTTreeCursor&) {});
-}
-
-OSTResult<std::vector<OSTDirectoryItem>>
-OSTFileManager::urlsForItemsInDirectoryRemovingUnfinished(std::string_view path) const {
-    std::vector<std::string> unfinished;
-    auto items = listing(path, [&](const OSTTreeCursor& item) {
-        if (std::string_view(item.name()).starts_with(OSTUnfinishedPrefix))
-            unfinished.emplace_back(item.name());
-    });
-    for (const auto& name : unfinished)
-        static_cast<void>(removeItemAtURL(platform::pathByAppending(path, name)));
-    return items;
+    auto items = listing(path);
+    if (!items)
+        return std::unexpected(
+            OSTCreatePOSIXError(items.error(), "_IterateDirectory for %@ returned %s", path, items.error()));
+    return *std::move(items);
 }
 
 OSTResult<OSTItemIdentity> OSTFileManager::identityOfItemAtURL(std::string_view path) const {

@@ -131,9 +131,6 @@ public:
 
     /// The items of a directory in the directory's own order, without those whose name begins with a dot.
     [[nodiscard]] OSTResult<std::vector<OSTDirectoryItem>> urlsForItemsInDirectoryAtURL(std::string_view path) const;
-    /// The same for a directory in which nobody is writing: removes what a crash left unfinished there.
-    [[nodiscard]] OSTResult<std::vector<OSTDirectoryItem>>
-    urlsForItemsInDirectoryRemovingUnfinished(std::string_view path) const;
 
     /// Whether anything is at `path`. What cannot be found out is logged and false in both questions.
     [[nodiscard]] bool itemExistsAtURL(std::string_view path) const;

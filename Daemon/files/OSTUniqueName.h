@@ -13,9 +13,6 @@
 
 namespace ost {
 
-/// What the name of an unfinished item begins with. Hidden, so that no listing shows it.
-inline constexpr std::string_view OSTUnfinishedPrefix = ".temp.";
-
 /// Names tried before giving up; a second is needed about never.
 inline constexpr int OSTUniqueNameAttempts = 100;
 

@@ -118,7 +118,7 @@ OSTResult<T> OSTMetadata::_written(OSTResult<T> result) const {
 }
 
 OSTResult<void> OSTMetadata::writeMetadataToDisk() const {
-    // Unfinished files are looked for where they are few: in the class directory, when it is read.
+    // A start looks for unfinished files where they are few: in the class directories.
     return _written(
         OST_writeToURL(dictionary(), metadataFileURL(), OSTSmallDictionaryFileSize, OSTWorkshop::directoryAbove));
 }

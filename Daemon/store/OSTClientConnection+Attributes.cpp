@@ -186,11 +186,12 @@ OSTClientConnection::regenerateDirectoryUUIDForUser(const OSTContainerReference&
 }
 
 OSTResult<OSTClientConnection::MovedContainer>
-OSTClientConnection::_moveToNewUUID(const OSTContainerReference& container) {
+OSTClientConnection::_moveToNewUUID(const OSTContainerReference& container) const {
     const OSTIdentifierLock lock({container.uuid->string()}, OSTLockKind::writing);
     auto record = OST_TRY(_container(container));
     OSTMetadata changed = *record;
     changed.url = pathByAppending(pathByDeletingLastComponent(record->url), platform::UUID::generate().string());
+    OST_TRY(_settleReplacementsAt(record->url));
     OST_TRY(moveDirectory(*record, changed.url));
     // The sandbox's item is that of the live container of the name.
     if (!record->transient && !_setSandboxContainerMappingForUser(record->name(), changed.url))

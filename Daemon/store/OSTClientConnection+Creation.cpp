@@ -115,7 +115,7 @@ OSTResult<OSTClientConnection::LookUpResult> OSTClientConnection::_lookUp(const 
         return LookUpResult{.entry = *found};
     if (found) {
         // A transient container is never reused.
-        auto removed = _settleReplacementsOf(*found->record);
+        auto removed = _settleReplacementsAt(found->record->url);
         if (removed)
             removed = _moveItemAtURLToDeathRow(found->record->url, StartPass::yes);
         if (!removed)

@@ -84,7 +84,7 @@ OSTResult<void> OSTClientConnection::_stageForDeletion(const OSTContainerReferen
 }
 
 OSTResult<void> OSTClientConnection::_stageContainer(const OSTMetadata& metadata) const {
-    OST_TRY(_settleReplacementsOf(metadata));
+    OST_TRY(_settleReplacementsAt(metadata.url));
     const auto& files = OSTFileManager::defaultManager();
     const auto destination =
         pathByAppending(OSTGlobalConfiguration::sharedInstance().deathrowDirectory(), lastPathComponent(metadata.url));

@@ -64,10 +64,10 @@ void OSTClientConnection::rebootContainerManagerSetup(const StartupMigration& mi
 void OSTClientConnection::rebootContainerManagerCleanup() const {
     auto& layout = OSTGlobalConfiguration::sharedInstance();
     const auto transient = layout.transientDirectory();
-    if (const auto moved = _moveItemAtURLToDeathRow(transient, StartPass::no); !moved)
+    if (const auto moved = _moveTransientDirectoryToDeathRow(transient); !moved)
         logError("Failed to delete shared transient URL %@ : %@", transient, moved.error());
     const auto transientBundles = layout.transientBundleDirectory();
-    if (const auto moved = _moveItemAtURLToDeathRow(transientBundles, StartPass::no); !moved)
+    if (const auto moved = _moveTransientDirectoryToDeathRow(transientBundles); !moved)
         logError("Failed to delete shared transient bundle URL %@ : %@", transientBundles, moved.error());
     _cleanUpMobileUser();
     forEachClass([&](OSTContainerClass containerClass) {
@@ -77,12 +77,17 @@ void OSTClientConnection::rebootContainerManagerCleanup() const {
     });
 }
 
+OSTResult<void> OSTClientConnection::_moveTransientDirectoryToDeathRow(const std::string& url) const {
+    OST_TRY(_settleReplacementsAt(url));
+    return _moveItemAtURLToDeathRow(url, StartPass::no);
+}
+
 void OSTClientConnection::_cleanUpMobileUser() const {
     auto* const user = OSTGlobalConfiguration::sharedInstance().getPerUserConfigurationForUserId(mobileUser);
     if (user == nullptr || !user->existsUserBaseDirectory())
         return;
     if (const auto url = user->transientDirectory())
-        if (const auto moved = _moveItemAtURLToDeathRow(*url, StartPass::no); !moved)
+        if (const auto moved = _moveTransientDirectoryToDeathRow(*url); !moved)
             logError("Failed to delete per-user transient URL %@ : %@", *url, moved.error());
     forEachClass([&](OSTContainerClass containerClass) {
         if (isPerUserClass(containerClass))

@@ -21,6 +21,14 @@ using platform::lastPathComponent;
 using platform::pathByAppending;
 using platform::pathByDeletingLastComponent;
 
+namespace {
+
+bool isAtOrBelow(std::string_view path, std::string_view place) {
+    return path.starts_with(place) && (path.size() == place.size() || path[place.size()] == '/');
+}
+
+} // namespace
+
 /// How far one replacement has come, and so what has to be undone or cleaned up when it stops.
 struct OSTClientConnection::ReplaceOperation {
     OSTMetadataRecord oldContainer; ///< null when there is none
@@ -92,7 +100,7 @@ OSTResult<void> OSTClientConnection::_replace(const OSTReplacement& replacement,
     OST_TRY(_findSides(replacement, operation));
     for (const auto& side : {operation.oldContainer, operation.newContainer})
         if (side)
-            OST_TRY(_settleReplacementsOf(*side));
+            OST_TRY(_settleReplacementsAt(side->url));
     if (operation.oldContainer)
         OST_TRY(_parkOldContainer(operation));
     else
@@ -292,7 +300,7 @@ OSTResult<void> OSTClientConnection::_discardReplaceFile(const std::string& url,
     return moved;
 }
 
-OSTResult<void> OSTClientConnection::_settleReplacementsOf(const OSTMetadata& container) const {
+OSTResult<void> OSTClientConnection::_settleReplacementsAt(std::string_view place) const {
     const auto& files = OSTFileManager::defaultManager();
     const auto directory = OSTGlobalConfiguration::sharedInstance().replaceDirectory();
     const auto items = files.urlsForItemsInDirectoryAtURL(directory);
@@ -304,7 +312,7 @@ OSTResult<void> OSTClientConnection::_settleReplacementsOf(const OSTMetadata& co
         const auto file = OSTReplaceFile::_readAndValidateReplaceFileAtUrl(url);
         if (!file && platform::isReasonThatPasses(file.error()))
             return std::unexpected(file.error());
-        if (!file || (file->oldURL != container.url && file->destinationURL != container.url))
+        if (!file || !(isAtOrBelow(file->oldURL, place) || isAtOrBelow(file->destinationURL, place)))
             continue;
         if (!_discardReplaceFile(url, StartPass::no) && !files.itemDoesNotExistAtURL(url))
             return std::unexpected(

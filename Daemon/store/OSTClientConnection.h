@@ -233,7 +233,7 @@ private:
     /// The container that is meant, in a place that is on disk.
     [[nodiscard]] static OSTResult<OSTMetadataRecord> _container(const OSTContainerReference& container);
     [[nodiscard]] static OSTResult<void> _changeInfo(const OSTMetadata& record, OSTDictionary info);
-    [[nodiscard]] static OSTResult<MovedContainer> _moveToNewUUID(const OSTContainerReference& container);
+    [[nodiscard]] OSTResult<MovedContainer> _moveToNewUUID(const OSTContainerReference& container) const;
 
     // +Replacement
     struct ReplaceOperation;
@@ -251,10 +251,11 @@ private:
                                                       const ReplaceOperation& operation) const;
     /// Moves the file to death row, or removes it where it is; the latter is a failure all the same.
     [[nodiscard]] OSTResult<void> _discardReplaceFile(const std::string& url, StartPass startDeletionThread) const;
-    /// Discards the replace files that earlier replacements left and that speak of the place of a living container,
-    /// which is about to leave it: a later start would take it for one that a replacement lost. The caller holds the
-    /// all-identifiers lock for writing. Fails with `replaceFileInvalid` or `replaceCleanupFailed`.
-    [[nodiscard]] OSTResult<void> _settleReplacementsOf(const OSTMetadata& container) const;
+    /// Discards the replace files that earlier replacements left and that speak of a container at or below `place`,
+    /// which is about to leave: a later start would take it for one that a replacement lost. The caller holds the
+    /// all-identifiers lock or the container's, so that none of these replacements is under way, or is starting up.
+    /// Fails with `replaceFileInvalid` or `replaceCleanupFailed`.
+    [[nodiscard]] OSTResult<void> _settleReplacementsAt(std::string_view place) const;
     [[nodiscard]] OSTResult<void> _recoverFromReplaceOperations() const;
     [[nodiscard]] OSTResult<void> _recoverFromReplaceFile(const std::string& url) const;
 
@@ -268,6 +269,7 @@ private:
     _placeAndKnownUsage(const OSTContainerReference& container) const;
 
     // +Reboot
+    [[nodiscard]] OSTResult<void> _moveTransientDirectoryToDeathRow(const std::string& url) const;
     void _cleanUpMobileUser() const;
     /// Moves to death row what lies in a class directory and is no container.
     void _cleanupOrphanedDataForUser(std::uint32_t userId, OSTContainerClass containerClass) const;

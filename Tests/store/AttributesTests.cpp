@@ -208,14 +208,5 @@ TEST_F(Attributes, AContainerThatCannotMoveStaysWhereItIs) {
     EXPECT_EQ(where(mounted), mounted->url);
 }
 
-TEST_F(Attributes, WhatAKilledWriterLeftIsRemovedWhenTheClassDirectoryIsRead) {
-    const fs::path directory = "/private/var/mobile/Containers/Data/Application";
-    test::writeFile(directory / ".temp.aaaaaa", "");
-    test::writeFile(directory / ".temp.bbbbbb/copy", "");
-    test::writeFile(directory / ".other", "");
-    EXPECT_FALSE(cached(dataApplication, "a"));
-    EXPECT_EQ(names(directory), std::vector<std::string>{".other"});
-}
-
 } // namespace
 } // namespace ost

@@ -138,6 +138,11 @@ TEST_F(Replacement, FileThatIsStillPendingIsDiscardedBeforeItsContainerGoes) {
     const auto transient = make(dataApplication, "transient", true);
     pend(transient);
     make(dataApplication, "transient", true);
+    const auto renamed = make(dataApplication, "renamed");
+    pend(renamed);
+    EXPECT_TRUE(store().regenerateDirectoryUUIDForUser({renamed->name(), renamed->uuid}));
+    pend(make(dataApplication, "swept", true));
+    store().rebootContainerManagerCleanup();
     EXPECT_EQ(1U, names(replaceDirectory).size()) << "that of the other one";
     store().containerManagerSetup();
     EXPECT_TRUE(names(replaceDirectory).empty());
