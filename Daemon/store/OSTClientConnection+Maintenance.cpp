@@ -128,7 +128,8 @@ std::expected<OSTClientConnection::PlaceAndUsage, OSTErrorCode>
 OSTClientConnection::_placeAndKnownUsage(const OSTContainerReference& container) const {
     const auto& [name, uuid] = container;
     const OSTIdentifierLock lock({uuid->string()}, OSTLockKind::writing);
-    const auto record = name.identifier ? OSTContainerCache::sharedInstance().containerForUser(name, *uuid) : nullptr;
+    const auto record =
+        name.identifier ? OST_TRY(OSTContainerCache::sharedInstance().containerForUser(name, *uuid)) : nullptr;
     if (!record) {
         logError("No Container with userId: %u UUID: %@, identifier: %@, Class: %ld", name.userId, uuid,
                  name.identifier, name.containerClass);
