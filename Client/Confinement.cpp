@@ -1,6 +1,5 @@
 #include "Client/Confinement.h"
 
-#include <fcntl.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 
@@ -107,15 +106,6 @@ std::expected<void, Errno> Confinement::allow(int file, FileAccess access) {
     if (::syscall(SYS_landlock_add_rule, _rules.get(), pathRule, &rule, 0) != 0)
         return std::unexpected(errno);
     return {};
-}
-
-std::expected<void, Errno> Confinement::allow(const std::string& path, FileAccess access) {
-    const FileDescriptor file(::open(path.c_str(), O_PATH | O_CLOEXEC));
-    if (file)
-        return allow(file.get(), access);
-    if (errno == ENOENT)
-        return {};
-    return std::unexpected(errno);
 }
 
 std::expected<void, Errno> Confinement::enter() const noexcept {

@@ -4,7 +4,6 @@
 
 #include <cstdint>
 #include <expected>
-#include <string>
 
 namespace ostrand {
 
@@ -31,8 +30,6 @@ public:
 
     /// Allows access below an open directory, or to an open file. Any kind of descriptor will do.
     [[nodiscard]] std::expected<void, ost::platform::Errno> allow(int file, FileAccess access);
-    /// The same by a path, whose links are followed. One that does not exist needs no rule.
-    [[nodiscard]] std::expected<void, ost::platform::Errno> allow(const std::string& path, FileAccess access);
 
     /// Puts the calling thread into the domain, for good. It must have given up gaining privileges. Needs no memory, so
     /// that it may follow a fork.

@@ -12,12 +12,15 @@
 
 #include <fcntl.h>
 #include <linux/openat2.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <array>
 #include <cerrno>
 #include <filesystem>
+#include <span>
+#include <utility>
 
 namespace ostrand::ctl {
 
@@ -90,6 +93,8 @@ std::expected<ProcessDescription, Failure> processOf(const Arguments& arguments,
     process.containerIdentifier = arguments.value(identifierOption.name);
     process.user = user;
     process.isPlugin = arguments.has(pluginOption.name);
+    if (process.systemContainer && process.containerIdentifier)
+        process.systemContainer = process.containerIdentifier;
     if (!process.containerIdentifier && !process.codeSigningIdentifier)
         return std::unexpected(
             Failure::local(escaped(program.path()) + " is not signed with an identifier; give one with --identifier"));
@@ -167,32 +172,62 @@ std::expected<T, Failure> confining(std::expected<T, Errno> done) {
         return *std::move(done);
 }
 
-/// A device below a directory that all programs may read would be open to them.
-std::expected<void, Failure> refuseInside(const char* directory, const Device& device) {
-    std::error_code missing;
-    const std::string readable = std::filesystem::canonical(directory, missing);
-    if (!missing && (device.path + "/").starts_with(readable + "/"))
-        return std::unexpected(
-            Failure::local(escaped(device.path) + " lies in " + readable + ", which every program may read"));
-    return {};
+/// A directory, by whatever name.
+using FileIdentity = std::pair<dev_t, ino_t>;
+
+/// The device's directory and those above it.
+std::expected<std::vector<FileIdentity>, Failure> directoriesAround(const Device& device) {
+    std::vector<FileIdentity> directories;
+    for (auto path = std::filesystem::path(device.path);; path = path.parent_path()) {
+        struct stat status{};
+        if (::stat(path.c_str(), &status) != 0)
+            return std::unexpected(Failure::system("cannot examine " + path.string(), errno));
+        directories.emplace_back(status.st_dev, status.st_ino);
+        if (path == path.root_path())
+            return directories;
+    }
 }
 
-template<std::size_t count>
-std::expected<void, Failure> allowAll(Confinement& confinement, const std::array<const char*, count>& paths,
-                                      FileAccess access, const Device& device) {
-    for (const char* const path : paths) {
-        OST_TRY(refuseInside(path, device));
-        OST_TRY(confining(confinement.allow(path, access)));
+/// Makes the rules for what is the same for all programs.
+class SystemRules {
+public:
+    SystemRules(Confinement& confinement, const Device& device, std::vector<FileIdentity> around)
+        : _confinement(confinement), _device(device), _around(std::move(around)) {}
+
+    std::expected<void, Failure> allow(std::span<const char* const> paths, FileAccess access) {
+        for (const char* const path : paths)
+            OST_TRY(_allow(path, access));
+        return {};
     }
-    return {};
-}
+
+private:
+    /// A path that does not exist needs no rule.
+    std::expected<void, Failure> _allow(const char* path, FileAccess access) {
+        const FileDescriptor file(::open(path, O_PATH | O_CLOEXEC));
+        if (!file && errno == ENOENT)
+            return {};
+        struct stat status{};
+        if (!file || ::fstat(file.get(), &status) != 0)
+            return std::unexpected(Failure::system(std::string("cannot open ") + path, errno));
+        // A device in there would be open to every program.
+        if (std::ranges::find(_around, FileIdentity(status.st_dev, status.st_ino)) != _around.end())
+            return std::unexpected(
+                Failure::local(escaped(_device.path) + " lies in " + path + ", which every program may read"));
+        return confining(_confinement.allow(file.get(), access));
+    }
+
+    Confinement& _confinement;
+    const Device& _device;
+    const std::vector<FileIdentity> _around;
+};
 
 /// What a program may do before it is known which containers it has.
 std::expected<Confinement, Failure> systemConfinement(const Program& program, const Device& device) {
     auto confinement = OST_TRY(confining(Confinement::create()));
-    OST_TRY(allowAll(confinement, programDirectories, FileAccess::readAndExecute, device));
-    OST_TRY(allowAll(confinement, readableFiles, FileAccess::read, device));
-    OST_TRY(allowAll(confinement, writableFiles, FileAccess::readAndWrite, device));
+    SystemRules rules(confinement, device, OST_TRY(directoriesAround(device)));
+    OST_TRY(rules.allow(programDirectories, FileAccess::readAndExecute));
+    OST_TRY(rules.allow(readableFiles, FileAccess::read));
+    OST_TRY(rules.allow(writableFiles, FileAccess::readAndWrite));
     OST_TRY(confining(confinement.allow(program.file(), FileAccess::readAndExecute)));
     return confinement;
 }

@@ -36,7 +36,7 @@ struct RunResult {
     std::string output, errors;
 };
 
-class Run : public testing::Test {
+class RunTest : public testing::Test {
 protected:
     void SetUp() override {
         if (::geteuid() != 0)
@@ -91,7 +91,7 @@ protected:
     std::optional<BootedDevice> device;
 };
 
-TEST_F(Run, aProgramHasItsContainersAndNothingOfTheCallers) {
+TEST_F(RunTest, AProgramHasItsContainersAndNothingOfTheCallers) {
     ASSERT_EQ(::setenv("SECRET", "x", 1), 0);
     ASSERT_EQ(::setenv("LC_TIME", "C", 1), 0);
     const auto result = shell("env | sort; id -u; id -G; pwd; touch file tmp/file; grep -E '^(Cap|NoNew|SigBlk)' "
@@ -111,7 +111,7 @@ TEST_F(Run, aProgramHasItsContainersAndNothingOfTheCallers) {
     EXPECT_EQ(tree(records()), "") << "it cleans up after itself";
 }
 
-TEST_F(Run, aProgramReachesNothingButItsOwn) {
+TEST_F(RunTest, AProgramReachesNothingButItsOwn) {
     const auto probe = scratch / "probe";
     fs::copy_file(builtProgram("run-probe"), probe);
     fs::permissions(probe, fs::perms::set_uid | fs::perms::set_gid | fs::perms(0755));
@@ -152,7 +152,7 @@ TEST_F(Run, aProgramReachesNothingButItsOwn) {
     EXPECT_EQ(readFile(secret), "secret\n");
 }
 
-TEST_F(Run, anApplicationSharesItsGroupsContainerWithItsPlugin) {
+TEST_F(RunTest, AnApplicationSharesItsGroupsContainerWithItsPlugin) {
     const auto application = signedCopy("/bin/dash", "com.example.Sketches");
     const auto plugin = signedCopy("/bin/dash", "com.example.Sketches.Brushes");
     const std::string toGroup = R"(cd "${OSTRAND_GROUP_CONTAINERS#*=}" && )";
@@ -171,7 +171,7 @@ TEST_F(Run, anApplicationSharesItsGroupsContainerWithItsPlugin) {
         << printed;
 }
 
-TEST_F(Run, whatCannotBeRunMakesNothing) {
+TEST_F(RunTest, WhatCannotBeRunMakesNothing) {
     const auto assertion = ost::platform::recordTerminationAssertion("com.example.Held", "critical", device->image());
     writeFile(scratch / "text", "text", 0755);
     writeFile(scratch / "data", "data", 0644);
@@ -201,7 +201,7 @@ TEST_F(Run, whatCannotBeRunMakesNothing) {
     EXPECT_EQ(tree(records()), "");
 }
 
-TEST_F(Run, whatStandsInTheWayOfTemporaryFilesIsLeftAlone) {
+TEST_F(RunTest, WhatStandsInTheWayOfTemporaryFilesIsLeftAlone) {
     ASSERT_EQ(shell("rmdir tmp && ln -s /etc tmp").status, 0);
     EXPECT_EQ(shell("echo $TMPDIR; ls -ld tmp; touch tmp/x 2>&1 || echo refused").output.substr(0, 1), "/");
     EXPECT_FALSE(fs::exists("/etc/x"));
@@ -209,7 +209,7 @@ TEST_F(Run, whatStandsInTheWayOfTemporaryFilesIsLeftAlone) {
     EXPECT_EQ(shell("test -p tmp").status, 0) << "nobody waits for the other end";
 }
 
-TEST_F(Run, signalsAreForTheProgramAndItsEndIsTold) {
+TEST_F(RunTest, SignalsAreForTheProgramAndItsEndIsTold) {
     EXPECT_EQ(shell("kill -KILL $$").status, 128 + SIGKILL);
     ChildProcess launcher(commandLine({"--identifier", app, "--", builtProgram("run-probe"), "await"}),
                           scratch / "errors");
@@ -221,7 +221,7 @@ TEST_F(Run, signalsAreForTheProgramAndItsEndIsTold) {
     EXPECT_EQ(launcher.wait(), 42);
 }
 
-TEST_F(Run, aRecordThatAKilledLauncherLeavesIsToldAndRemoved) {
+TEST_F(RunTest, ARecordThatAKilledLauncherLeavesIsToldAndRemoved) {
     pid_t program = 0;
     {
         ChildProcess launcher(commandLine({"--identifier", app, "--", builtProgram("run-probe"), "await"}),
@@ -243,7 +243,7 @@ TEST_F(Run, aRecordThatAKilledLauncherLeavesIsToldAndRemoved) {
     EXPECT_FALSE(fs::exists(record));
 }
 
-TEST_F(Run, aProgramOfAServiceHasTheGroupsOfTheDevice) {
+TEST_F(RunTest, AProgramOfAServiceHasTheGroupsOfTheDevice) {
     const auto result = run({"--identifier", app, "--user", "system", "--print", "--", "/bin/true"});
     EXPECT_EQ(result.status, 1) << "its user has no data containers";
     writeFile(device->onHost("/etc/group"), "mobile:x:501:\nsystemusers:x:500:system,mobile\nother:x:600:mobil\n");

@@ -70,6 +70,7 @@ TEST_F(Applications, AreRecordedWhileTheyRun) {
         ASSERT_TRUE(first && second);
         EXPECT_EQ(std::to_string(one.instance().startTime), test::readFile(entry(std::to_string(one.pid()))));
         EXPECT_EQ(2U, processes().size());
+        EXPECT_EQ(fs::perms::owner_all, fs::status(entry("")).permissions()) << "who can open it can lock it";
         EXPECT_EQ(Processes{}, applicationProcesses("com.example.Other").value());
         one.kill();
         EXPECT_EQ(Processes{two.instance()}, processes())

@@ -127,7 +127,8 @@ private:
     static constexpr int attempts = 100;
 
     static std::expected<FileDescriptor, Errno> _openOrMake(int parent, const std::string& path) {
-        if (::mkdirat(parent, path.c_str(), 0755) != 0 && errno != EEXIST)
+        // Others must not open it: who does can lock it for as long as they like.
+        if (::mkdirat(parent, path.c_str(), 0700) != 0 && errno != EEXIST)
             return std::unexpected(errno);
         return openWithoutLinks(parent, path.c_str(), directoryFlags);
     }
