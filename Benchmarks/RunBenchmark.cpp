@@ -38,6 +38,7 @@ void runTrue(benchmark::State& state) {
     const OneProcessor oneProcessor;
     const auto device = makeScratchDirectory() / "device";
     const BootedDevice booted(device);
+    booted.registerApplication(identifier);
     const std::vector<std::string> command{
         builtProgram("ostrandctl"), "run", "--device", device, "--identifier", identifier, program};
     Comparison{.unit = Unit::seconds,

@@ -1,7 +1,6 @@
 // Upcalls for containers that exist, beside an echo of the same packets with the same descriptors, and beside clients
 // that create.
 
-#include "Client/CodeSigning.h"
 #include "Client/Containers.h"
 #include "platform/codec/OSTPackBuffer.h"
 #include "platform/ipc/UpcallPacket.h"
@@ -141,22 +140,12 @@ int echoPackets(int listener) {
     }
 }
 
-/// As the installer does with an application: an upcall for an identifier that nobody knows leaves lines in the log.
-void registerApplication(const BootedDevice& device) {
-    auto connection = device.connect();
-    require(ostrand::registerCodeSigning(
-                connection, {.identifier = identifier,
-                             .info = OSTDictionary(),
-                             .options = ostrand::RegistrationOptions{.dataContainerClass = 2}.dictionary()}),
-            "register the application");
-}
-
 void oneSender(benchmark::State& state) {
     constexpr unsigned upcalls = 2000;
     const OneProcessor oneProcessor;
     const auto directory = makeScratchDirectory();
     const BootedDevice device(directory / "device");
-    registerApplication(device);
+    device.registerApplication(identifier);
     const auto echoPath = (directory / "echo").string();
     const auto listener = listenOn(echoPath, SOCK_SEQPACKET);
     const ChildProcess server([&] { return echoPackets(listener.get()); });
@@ -191,7 +180,7 @@ void besideCreations(benchmark::State& state) {
     constexpr unsigned clients = 8;
     const JournaledFileSystem disk;
     const BootedDevice device(disk.path() / "device");
-    registerApplication(device);
+    device.registerApplication(identifier);
     Upcalls daemon(device.socketPath() + ".upcall");
     daemon.once();
     double creation = 0;

@@ -1,5 +1,6 @@
 #include "support/BootedDevice.h"
 
+#include "Client/CodeSigning.h"
 #include "Client/Containers.h"
 #include "support/Require.h"
 
@@ -46,6 +47,15 @@ BootedDevice::BootedDevice(const std::filesystem::path& image)
 
 ostrand::Connection BootedDevice::connect() const {
     return require(ostrand::Connection::open(_image, patience), "connect to the daemon");
+}
+
+void BootedDevice::registerApplication(const std::string& identifier) const {
+    auto connection = connect();
+    require(ostrand::registerCodeSigning(
+                connection, {.identifier = identifier,
+                             .info = OSTDictionary(),
+                             .options = ostrand::RegistrationOptions{.dataContainerClass = 2}.dictionary()}),
+            "register the application");
 }
 
 std::string BootedDevice::socketPath() const { return _image / "private/var/run/com.tamarok.ostrandd"; }

@@ -22,6 +22,8 @@ public:
     explicit BootedDevice(const std::filesystem::path& image);
 
     [[nodiscard]] ostrand::Connection connect() const;
+    /// As the installer does: an upcall for an identifier that nobody knows leaves lines in the log.
+    void registerApplication(const std::string& identifier) const;
     [[nodiscard]] std::string socketPath() const;
     /// The path by which the host finds what a reply names.
     [[nodiscard]] std::filesystem::path hostPath(const std::string& devicePath) const;
