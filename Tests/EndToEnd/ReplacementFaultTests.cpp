@@ -140,7 +140,10 @@ protected:
     /// Makes the device as it was before, for the next round.
     void removeBoth() {
         auto connection = device().connect();
-        for (const auto& container : {_old.container, _new.container})
+        // The new one may have been given the old one's UUID without having taken its place.
+        auto newWithOldUUID = _new.container;
+        newWithOldUUID.uuid = _old.container.uuid;
+        for (const auto& container : {_old.container, _new.container, newWithOldUUID})
             ASSERT_TRUE(ostrand::stageForDeletion(connection, {referenceTo(container, GetParam().containerClass)}));
         ASSERT_TRUE(ostrand::destroyDeathRow(connection));
         for (const auto& path : {_old.container.path, _new.container.path})
