@@ -2,6 +2,7 @@
 
 #include "Protocol/OSTEntitlements.h"
 #include "files/OSTDictionaryFile.h"
+#include "files/OSTFileManager.h"
 #include "model/OSTGlobalConfiguration.h"
 #include "platform/base/Assert.h"
 #include "platform/base/Immortal.h"
@@ -348,6 +349,8 @@ OSTResult<void> OSTCodeSigningMapping::_readCodeSigningMappingFromDisk() {
         platform::logError("Failed to read code signing mapping file at %@ : %@", url, dictionary.error());
         return std::unexpected(dictionary.error());
     }
+    // An earlier process may have been killed before it had waited for the file. This one answers for it.
+    OST_TRY(OSTFileManager::defaultManager().makeDirectoryDurable(platform::pathByDeletingLastComponent(url)));
     for (const auto& [identifier, value] : *dictionary) {
         if (const auto* const serialized = value.asDictionary()) {
             _codeSigningMappingDict.emplace_hint(_codeSigningMappingDict.end(), identifier,

@@ -18,6 +18,7 @@ namespace ost {
 
 using platform::lastPathComponent;
 using platform::pathByAppending;
+using platform::pathByDeletingLastComponent;
 
 namespace {
 
@@ -39,6 +40,17 @@ bool isForGood(const OSTError& removal) {
 /// gets its item, and an application may still be at work in its container.
 constexpr int removals = 8;
 
+/// Waits until what was taken out of the directories is out of them on disk: what was answered as deleted must not be
+/// back after a power cut. All are tried; fails when one could not be waited for.
+OSTResult<void> makeDeletionsDurable(const std::set<std::string>& directories) {
+    OSTResult<void> result;
+    for (const auto& directory : directories)
+        if (const auto durable = OSTFileManager::defaultManager().makeDirectoryDurable(directory); !durable)
+            result = std::unexpected(OSTCreateError(OSTErrorCode::deletionFailed, durable.error(),
+                                                    "Failed to make sure of deletion in: %@", directory));
+    return result;
+}
+
 } // namespace
 
 platform::WorkQueue& OSTDeathRowQueue() {
@@ -54,24 +66,31 @@ OSTClientConnection::stageForDeleteContainersWithUsers(const OSTDeletion& deleti
                 OSTCreateError(OSTErrorCode::invalidObject,
                                "Can't act on an invalid input: UUIDString count: %ld, class count: %ld, ID count: %ld",
                                deletion.uuids.size(), deletion.classes.size(), deletion.identifiers.size()));
-        const OSTAllIdentifiersLock lock(OSTLockKind::writing);
+        std::set<std::string> directories;
+        OSTAllIdentifiersLock lock(OSTLockKind::writing);
         // A list of users that is too short is the caller's mistake, which the guard reports.
         for (std::size_t i = 0; i < deletion.uuids.size(); ++i)
             OST_TRY(_stageForDeletion(
-                {{deletion.userIds.at(i), deletion.classes[i], deletion.identifiers[i]}, deletion.uuids[i]}));
-        return {};
+                {{deletion.userIds.at(i), deletion.classes[i], deletion.identifiers[i]}, deletion.uuids[i]},
+                directories));
+        lock.unlock();
+        return makeDeletionsDurable(directories);
     });
 }
 
 std::expected<void, OSTErrorCode> OSTClientConnection::stageForDeleteContainer(const OSTMetadata& container,
                                                                                bool useLocking) const {
-    return OSTGuarded([&] {
-        const OSTAllIdentifiersLock lock(OSTLockKind::writing, useLocking);
-        return _stageForDeletion({container.name(), container.uuid});
+    return OSTGuarded([&]() -> OSTResult<void> {
+        std::set<std::string> directories;
+        OSTAllIdentifiersLock lock(OSTLockKind::writing, useLocking);
+        OST_TRY(_stageForDeletion({container.name(), container.uuid}, directories));
+        lock.unlock();
+        return makeDeletionsDurable(directories);
     });
 }
 
-OSTResult<void> OSTClientConnection::_stageForDeletion(const OSTContainerReference& reference) const {
+OSTResult<void> OSTClientConnection::_stageForDeletion(const OSTContainerReference& reference,
+                                                       std::set<std::string>& directories) const {
     const auto& [name, uuid] = reference;
     if (!uuid || !name.identifier || !isValidContainerClass(name.containerClass)) {
         static_cast<void>(OSTCreateError(OSTErrorCode::invalidObject,
@@ -80,10 +99,11 @@ OSTResult<void> OSTClientConnection::_stageForDeletion(const OSTContainerReferen
         return {};
     }
     const auto record = OST_TRY(OSTContainerCache::sharedInstance().containerForUser(name, *uuid));
-    return record ? _stageContainer(*record) : OSTResult<void>();
+    return record ? _stageContainer(*record, directories) : OSTResult<void>();
 }
 
-OSTResult<void> OSTClientConnection::_stageContainer(const OSTMetadata& metadata) const {
+OSTResult<void> OSTClientConnection::_stageContainer(const OSTMetadata& metadata,
+                                                     std::set<std::string>& directories) const {
     OST_TRY(_settleReplacementsAt(metadata.url));
     const auto& files = OSTFileManager::defaultManager();
     const auto destination =
@@ -98,6 +118,7 @@ OSTResult<void> OSTClientConnection::_stageContainer(const OSTMetadata& metadata
             return {};
         }
     }
+    directories.emplace(pathByDeletingLastComponent(metadata.url));
     if (!_setSandboxContainerMappingForUser(metadata.name(), std::nullopt))
         platform::logError("Failed to remove container mapping in delete operation of %@, %llu", metadata.identifier,
                            metadata.containerClass);

@@ -12,6 +12,7 @@
 #include <expected>
 #include <functional>
 #include <optional>
+#include <set>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -128,10 +129,10 @@ public:
 
     // Deletion
 
-    /// Takes containers out of their places, the cache and the sandbox's mapping, and leaves them on death row. An
-    /// entry that names no container is passed over; one whose container cannot be moved or removed is logged, and
-    /// keeps its place. Codes: `invalidObject` when UUIDs, identifiers and classes differ in number,
-    /// `cacheRemoveFailed`.
+    /// Takes containers out of their places, the cache and the sandbox's mapping, and leaves them on death row. That
+    /// has reached the disk when this returns. An entry that names no container is passed over; one whose container
+    /// cannot be moved or removed is logged, and keeps its place. Codes: `invalidObject` when UUIDs, identifiers and
+    /// classes differ in number, `cacheRemoveFailed`, `deletionFailed` when a power cut might bring a container back.
     [[nodiscard]] std::expected<void, OSTErrorCode>
     stageForDeleteContainersWithUsers(const OSTDeletion& deletion) const;
     /// The same for a container that was found; one that has gone since is passed over. `useLocking` is false when the
@@ -282,8 +283,11 @@ private:
     static void _repairSandboxContainerMappings();
 
     // +Deletion
-    [[nodiscard]] OSTResult<void> _stageForDeletion(const OSTContainerReference& reference) const;
-    [[nodiscard]] OSTResult<void> _stageContainer(const OSTMetadata& metadata) const;
+    /// Adds the directory out of which a container has gone to `directories`.
+    [[nodiscard]] OSTResult<void> _stageForDeletion(const OSTContainerReference& reference,
+                                                    std::set<std::string>& directories) const;
+    [[nodiscard]] OSTResult<void> _stageContainer(const OSTMetadata& metadata,
+                                                  std::set<std::string>& directories) const;
     /// Moves one item to death row with one rename; an item that is already gone is success.
     /// Fails with `moveToDeathRowFailed`.
     [[nodiscard]] OSTResult<void> _moveItemAtURLToDeathRow(const std::string& url, StartPass startDeletionThread) const;

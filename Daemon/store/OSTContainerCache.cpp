@@ -334,6 +334,8 @@ OSTResult<OSTContainerCache::ClassTable> OSTContainerCache::_readClassDirectory(
                                                                                 std::uint32_t userId, bool transient) {
     const auto& files = OSTFileManager::defaultManager();
     const auto items = OST_TRY(files.urlsForItemsInDirectoryAtURL(directory));
+    // An earlier process may have been killed before it had waited for what it moved. This one answers for it.
+    OST_TRY(files.makeDirectoryDurable(directory));
     const auto open = OST_TRY(files.openDirectoryAtURL(directory));
     std::vector<OSTResult<OSTMetadataRecord>> records(items.size());
     const auto read = [&](std::size_t first, std::size_t last) {
