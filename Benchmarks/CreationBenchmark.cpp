@@ -93,7 +93,12 @@ public:
             require(::mkdirat(directory.get(), subDirectory.c_str(), 0755) == 0 &&
                         ::fchownat(directory.get(), subDirectory.c_str(), _owner, _owner, AT_SYMLINK_NOFOLLOW) == 0,
                     subDirectory);
-        require(::fdatasync(file.get()) == 0 && ::fsync(directory.get()) == 0, name);
+        require(::fsync(file.get()) == 0 && ::fsync(directory.get()) == 0, name);
+        for (const auto& subDirectory : _subDirectories) {
+            const FileDescriptor open(
+                ::openat(directory.get(), subDirectory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+            require(::fsync(open.get()) == 0, subDirectory);
+        }
 
         require(::renameat(_staging.get(), name.c_str(), _live.get(), name.c_str()) == 0, name);
         require(::fsync(_live.get()) == 0, name);

@@ -82,7 +82,7 @@ std::expected<void, platform::Errno> writeAtomically(const OSTItemPlace& place, 
                                   return static_cast<bool>(file);
                               })));
     OST_TRY(finish(file.get(), bytes, attributes));
-    OST_TRY(OSTWaitForDisk(file.get(), ::fdatasync));
+    OST_TRY(OSTWaitForDisk(file.get(), ::fsync)); // the protection class is an attribute, which fdatasync may leave out
     if (::renameat(workshop, unfinished.name(), place.directory(), place.name()) != 0)
         return std::unexpected(errno);
     unfinished.keep();
@@ -156,7 +156,7 @@ OSTResult<OSTNewFile> OSTFileManager::createFileAtURL(std::string_view path, std
 }
 
 OSTResult<void> OSTNewFile::makeDurable() {
-    auto durable = OSTWaitForDisk(_file.get(), ::fdatasync);
+    auto durable = OSTWaitForDisk(_file.get(), ::fsync); // the class too
     if (durable)
         durable = OSTWaitForDisk(_directory.get(), ::fsync);
     if (!durable)

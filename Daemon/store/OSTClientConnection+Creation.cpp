@@ -35,6 +35,17 @@ std::span<const std::string_view> subDirectoriesOf(OSTContainerClass containerCl
     return dataSubDirectories;
 }
 
+/// Waits until the owners of the sub-directories, and what lies in these, are on disk.
+OSTResult<void> makeContentDurable(const std::string& url, OSTContainerClass containerClass) {
+    for (const auto name : subDirectoriesOf(containerClass)) {
+        const auto durable = OSTFileManager::defaultManager().makeDirectoryDurable(pathByAppending(url, name));
+        if (!durable)
+            return std::unexpected(OSTCreateError(OSTErrorCode::subDirectoryCreationFailed, durable.error(),
+                                                  "Failed to create sub-dir at %@%@", url, name));
+    }
+    return {};
+}
+
 /// The record of a container as the answer of the look-up that made it: later ones get the shared record.
 OSTMetadataRecord asMadeNow(const OSTMetadata& record) {
     auto copy = std::make_shared<OSTMetadata>(record);
@@ -115,12 +126,15 @@ OSTResult<OSTClientConnection::LookUpResult> OSTClientConnection::_lookUp(const 
         return LookUpResult{.entry = *found};
     if (found) {
         // A transient container is never reused.
-        auto removed = _settleReplacementsAt(found->record->url);
+        const auto& url = found->record->url;
+        auto removed = _settleReplacementsAt(url);
         if (removed)
-            removed = _moveItemAtURLToDeathRow(found->record->url, StartPass::yes);
+            removed = _moveItemAtURLToDeathRow(url, StartPass::yes);
+        if (removed && !lookup.createIfNecessary) // else the wait for the new one's place carries it
+            removed = OSTFileManager::defaultManager().makeDirectoryDurable(pathByDeletingLastComponent(url));
         if (!removed)
             return std::unexpected(OSTCreateError(OSTErrorCode::transientRemovalFailed, removed.error(),
-                                                  "Failed to remove transient container at %@", found->record->url));
+                                                  "Failed to remove transient container at %@", url));
     } else if (!found.error().is(OSTErrorCode::notFound)) {
         return std::unexpected(found.error());
     }
@@ -146,8 +160,9 @@ OSTResult<OSTMetadata> OSTClientConnection::_buildInStaging(const OSTContainerNa
     if (isSystemClass(name.containerClass))
         OST_TRY(OSTFileManager::defaultManager().setTopLevelSystemContainerACLAtURL(staging));
     OST_TRY(_createSubDirectories(staging, name.userId, name.containerClass));
-    // Last, so that one commit of the file system's journal carries the sub-directories as well.
+    // All of it at the end, so that the first of the file system's commits carries the rest.
     OST_TRY(metadata.makeMetadataDurable(std::move(pendingFile)));
+    OST_TRY(makeContentDurable(staging, name.containerClass));
     return metadata;
 }
 
