@@ -23,9 +23,10 @@ struct ClassedItem {
     const std::string& path;
 };
 
-OSTResult<ClassedItem> open(int directory, const char* name, const std::string& path) {
+OSTResult<ClassedItem> open(int directory, const char* name, const std::string& path,
+                            OSTMounts mounts = OSTMounts::cross) {
     ClassedItem item{.directory = directory, .descriptor = {}, .status = {}, .path = path};
-    auto opened = OSTOpenItem(directory, name, O_RDONLY);
+    auto opened = OSTOpenItem(directory, name, O_RDONLY, mounts);
     if (opened && ::fstat(opened->get(), &item.status) != 0)
         opened = std::unexpected(errno);
     if (!opened)
@@ -64,6 +65,14 @@ auto withItem(const std::string& path, Act act) -> std::invoke_result_t<Act, con
     return act(OST_TRY(open(place->directory(), place->name(), path)));
 }
 
+/// All 0 when it cannot be read.
+struct statx statusOf(const OSTTreeEntry& entry) {
+    struct statx status{};
+    if (::statx(entry.directory, entry.name, AT_SYMLINK_NOFOLLOW, STATX_TYPE | STATX_MODE, &status) != 0)
+        return {};
+    return status;
+}
+
 } // namespace
 
 OSTResult<std::int32_t> OSTFileManager::dataProtectionClassOfItemAtURL(std::string_view path) const {
@@ -78,18 +87,22 @@ OSTResult<void> OSTFileManager::setDataProtectionClassOfItemAtURL(std::string_vi
 OSTResult<void> OSTFileManager::setDataProtectionClassOfItem(const OSTTreeEntry& entry, OSTOwnFiles& ownFiles,
                                                              std::int32_t toClass,
                                                              const OSTClassPredicate& ifPredicate) const {
-    const auto item = OST_TRY(open(entry.directory, entry.name, entry.path));
-    const bool isSameKind = ((item.status.st_mode ^ entry.status.mode) & static_cast<mode_t>(S_IFMT)) == 0;
-    if (!isSameKind || !ownFiles.contains(item.status, entry.path))
+    const auto item = open(entry.directory, entry.name, entry.path, OSTMounts::stayOut);
+    if (!item && item.error().isPOSIX(EXDEV)) // another file system's
         return {};
-    return setClass(item, toClass, ifPredicate);
+    if (!item)
+        return std::unexpected(item.error());
+    const bool isSameKind = ((item->status.st_mode ^ entry.status.mode) & static_cast<mode_t>(S_IFMT)) == 0;
+    if (!isSameKind || !ownFiles.contains(item->status, entry.path))
+        return {};
+    return setClass(*item, toClass, ifPredicate);
 }
 
 bool OSTFileManager::itemIsFixed(const OSTTreeEntry& entry) const {
-    struct statx status{};
     constexpr std::uint64_t fixed = STATX_ATTR_IMMUTABLE | STATX_ATTR_APPEND;
-    return ::statx(entry.directory, entry.name, AT_SYMLINK_NOFOLLOW, STATX_TYPE, &status) == 0 &&
-           (status.stx_attributes & fixed) != 0;
+    return (statusOf(entry).stx_attributes & fixed) != 0;
 }
+
+mode_t OSTFileManager::modeOfItem(const OSTTreeEntry& entry) const { return statusOf(entry).stx_mode; }
 
 } // namespace ost

@@ -192,6 +192,8 @@ public:
                                                                const OSTClassPredicate& ifPredicate) const;
     /// Whether nobody may change the item to which a walk has come: it is immutable or append-only.
     [[nodiscard]] bool itemIsFixed(const OSTTreeEntry& entry) const;
+    /// The file mode of that item, 0 when it cannot be read.
+    [[nodiscard]] mode_t modeOfItem(const OSTTreeEntry& entry) const;
 
     // Access control lists and owners of whole containers (OSTFileManager+SystemContainerACLs.cpp).
     // Metadata files are left alone. An item that cannot be changed is logged and the next one follows; a file with a

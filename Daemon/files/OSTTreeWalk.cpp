@@ -39,8 +39,8 @@ std::expected<ItemStatus, platform::Errno> statusOf(int directory, const char* n
 
 class TreeWalk {
 public:
-    TreeWalk(OSTTreeCursor& cursor, const std::function<bool(const OSTTreeEntry&)>& visit)
-        : _cursor(cursor), _visit(visit) {}
+    TreeWalk(OSTTreeCursor& cursor, const std::function<bool(const OSTTreeEntry&)>& visit, OSTItemStatus itemStatus)
+        : _cursor(cursor), _visit(visit), _itemStatus(itemStatus) {}
 
     /// Visits everything below the top; false when the walk is to end.
     [[nodiscard]] bool run() {
@@ -63,6 +63,9 @@ public:
 
 private:
     [[nodiscard]] bool _visitItem() {
+        const auto type = _cursor.type();
+        if (_itemStatus == OSTItemStatus::kindAlone && type != DT_UNKNOWN && type != DT_DIR)
+            return _visitAs(Visit::item, {.mode = static_cast<mode_t>(DTTOIF(type))});
         const auto item = statusOf(_cursor.directory(), _cursor.name());
         if (!item)
             return _fail(_cursor.directory(), _cursor.name(), _cursor.path(), item.error());
@@ -108,12 +111,14 @@ private:
 
     OSTTreeCursor& _cursor;
     const std::function<bool(const OSTTreeEntry&)>& _visit;
+    const OSTItemStatus _itemStatus;
     std::vector<Status> _ancestors; // below the top
 };
 
 } // namespace
 
-bool OSTWalkTree(std::string_view path, const std::function<bool(const OSTTreeEntry&)>& visit) {
+bool OSTWalkTree(std::string_view path, const std::function<bool(const OSTTreeEntry&)>& visit,
+                 OSTItemStatus itemStatus) {
     const std::string top(path);
     const auto place = OSTItemPlace::find(path);
     const auto visitTop = [&](Visit as, const Status& status, int error = 0) {
@@ -135,7 +140,7 @@ bool OSTWalkTree(std::string_view path, const std::function<bool(const OSTTreeEn
     if (!opened)
         return visitTop(Visit::failure, {}, opened.error());
     OSTTreeCursor cursor(*std::move(opened), top);
-    return TreeWalk(cursor, visit).run() && visitTop(Visit::directoryAfter, item->status);
+    return TreeWalk(cursor, visit, itemStatus).run() && visitTop(Visit::directoryAfter, item->status);
 }
 
 } // namespace ost

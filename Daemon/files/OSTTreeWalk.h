@@ -20,13 +20,13 @@ struct OSTTreeEntry {
         failure,         ///< an item without readable status, or a directory that cannot be read; `error` says why
     };
     struct Status {
-        mode_t mode;
-        uid_t uid;
-        gid_t gid;
-        nlink_t links;
-        ino_t inode;
-        std::uint64_t size;   ///< bytes
-        std::uint64_t blocks; ///< allocated, 512 bytes each
+        mode_t mode = 0;
+        uid_t uid = 0;
+        gid_t gid = 0;
+        nlink_t links = 0;
+        ino_t inode = 0;
+        std::uint64_t size = 0;   ///< bytes
+        std::uint64_t blocks = 0; ///< allocated, 512 bytes each
     };
 
     Visit visit;
@@ -38,10 +38,16 @@ struct OSTTreeEntry {
     const Status& status; ///< all 0 where it could not be read
 };
 
+/// What is read of items that are no directories: all of the status, or no more than the directory tells, which is the
+/// kind of an item, in its mode.
+enum class OSTItemStatus : bool { whole, kindAlone };
+
 /// Visits the item at `path` and everything below it, to any depth, in the order of the directories. Neither symbolic
-/// links nor mount points are entered; a mount point is not visited either. Returns whether the walk reached its end:
+/// links nor mount points are entered; a mount point is not visited either, but for a file of which the kind alone is
+/// read. Returns whether the walk reached its end:
 /// not when `visit` answered false, nor when the tree was moved about so that there was no way on, which is visited as
 /// a failure.
-bool OSTWalkTree(std::string_view path, const std::function<bool(const OSTTreeEntry&)>& visit);
+bool OSTWalkTree(std::string_view path, const std::function<bool(const OSTTreeEntry&)>& visit,
+                 OSTItemStatus itemStatus = OSTItemStatus::whole);
 
 } // namespace ost

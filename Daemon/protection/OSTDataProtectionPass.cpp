@@ -78,12 +78,13 @@ OSTResult<void> OSTDataProtectionPass::_checkContainer() {
 OSTResult<void> OSTDataProtectionPass::_walk(const std::string& item) {
     OSTResult<void> result;
     platform::Errno failure = 0;
-    const bool reachedEnd = OSTWalkTree(item, [&](const OSTTreeEntry& entry) {
+    const auto visit = [&](const OSTTreeEntry& entry) {
         if (entry.visit == OSTTreeEntry::Visit::failure)
             failure = entry.error;
         result = _visit(entry);
         return result.has_value();
-    });
+    };
+    const bool reachedEnd = OSTWalkTree(item, visit, OSTItemStatus::kindAlone);
     if (reachedEnd || !result)
         return result;
     return std::unexpected(OSTCreatePOSIXError(failure, "FTS returned error for %s : %s", item, failure));
@@ -136,7 +137,7 @@ OSTResult<void> OSTDataProtectionPass::_setClass(const OSTTreeEntry& entry, std:
         return set;
     if (set.error().isPOSIX(EBADF)) {
         platform::logError("Ignoring failure to set protection class to %d on %@ (mode 0%o): %@", toClass, entry.path,
-                           entry.status.mode, set.error());
+                           OSTFileManager::defaultManager().modeOfItem(entry), set.error());
         return {};
     }
     _metFixedItem = OSTFileManager::defaultManager().itemIsFixed(entry);

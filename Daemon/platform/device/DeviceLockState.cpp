@@ -7,12 +7,15 @@
 #include <fcntl.h>
 #include <sys/epoll.h>
 #include <sys/inotify.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <charconv>
+#include <chrono>
 #include <cstdio>
 #include <cstring>
+#include <ctime>
 #include <string_view>
 
 namespace ost::platform {
@@ -20,6 +23,39 @@ namespace ost::platform {
 namespace {
 
 constexpr std::size_t stateTextLimit = 16; // a number of 32 bits and a newline
+
+/// By which one content of the state's file is told from another.
+struct FileStatus {
+    dev_t device = 0;
+    ino_t inode = 0;
+    std::chrono::nanoseconds changed{0};
+    friend bool operator==(const FileStatus&, const FileStatus&) = default;
+};
+
+/// What the state's file said when it had that status.
+struct KnownState {
+    FileStatus of;
+    int state = deviceLockStateUnknown;
+};
+
+std::chrono::nanoseconds durationOf(const timespec& time) {
+    return std::chrono::seconds(time.tv_sec) + std::chrono::nanoseconds(time.tv_nsec);
+}
+
+std::expected<FileStatus, Errno> statusOfStateFile() {
+    struct stat status{};
+    if (::lstat(deviceLockStateFile, &status) != 0)
+        return std::unexpected(errno);
+    return FileStatus{.device = status.st_dev, .inode = status.st_ino, .changed = durationOf(status.st_ctim)};
+}
+
+/// Whether nothing that changes now can bear that time any more.
+bool isLongAgo(std::chrono::nanoseconds time) {
+    constexpr std::chrono::milliseconds clockTick{10}; // the longest that kernels have
+    timespec now{};
+    ::clock_gettime(CLOCK_REALTIME, &now);
+    return durationOf(now) - time > 2 * clockTick;
+}
 
 /// Fetches every event that is due. True when one of them concerns the state's file.
 bool drainEvents(int watch) {
@@ -40,6 +76,20 @@ bool drainEvents(int watch) {
 }
 
 } // namespace
+
+int deviceLockState() {
+    thread_local KnownState known;
+    const auto status = statusOfStateFile();
+    if (!status && status.error() == ENOENT)
+        return deviceUnlocked;
+    if (status && known.of == *status)
+        return known.state;
+    const int state = deviceLockState(std::string());
+    // A later change in the same tick of the file system's clock would bear the same time.
+    if (status && isLongAgo(status->changed))
+        known = {.of = *status, .state = state};
+    return state;
+}
 
 int deviceLockState(const std::string& image) {
     const auto content = readSmallFile((image + deviceLockStateFile).c_str(), stateTextLimit, FinalLink::refuse);

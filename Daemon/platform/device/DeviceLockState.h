@@ -18,12 +18,14 @@ inline constexpr int deviceUnlocked = 0;
 inline constexpr int deviceLocked = 1;
 inline constexpr int deviceLockStateUnknown = -1;
 
-/// The current state of the device whose image is the directory `image` ("" for the device that one runs on): 0 when
-/// nobody has written one, `deviceLockStateUnknown` when the file is anything but a number.
-[[nodiscard]] int deviceLockState(const std::string& image = "");
+/// The current state of the device that one runs on: 0 when nobody has written one, `deviceLockStateUnknown` when the
+/// file is anything but a number. Reads the file when it has changed, so it may be asked for each of many items.
+[[nodiscard]] int deviceLockState();
+/// The same for the device whose image is the directory `image`.
+[[nodiscard]] int deviceLockState(const std::string& image);
 
-/// Replaces the state of a device, given like above. Fails with the errno of writing the file, and then leaves the old
-/// state.
+/// Replaces the state of a device, given by its image or "" for the device that one runs on. Fails with the errno of
+/// writing the file, and then leaves the old state.
 [[nodiscard]] std::expected<void, Errno> writeDeviceLockState(int state, const std::string& image = "");
 
 /// The notification of a changed lock state. Belongs to the thread of its run loop.
