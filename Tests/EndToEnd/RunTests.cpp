@@ -248,6 +248,15 @@ TEST_F(RunTest, AProgramOfAServiceHasTheGroupsOfTheDevice) {
     EXPECT_EQ(result.status, 1) << "its user has no data containers";
     writeFile(device->onHost("/etc/group"), "mobile:x:501:\nsystemusers:x:500:system,mobile\nother:x:600:mobil\n");
     EXPECT_EQ(shell("id -G").output, "501 500\n");
+
+    std::string more;
+    for (int number = 0; number <= 65536; ++number) // one more than the kernel takes
+        more += "more:x:" + std::to_string(1000 + number) + ":mobile\n";
+    writeFile(device->onHost("/etc/group"), more);
+    const auto refused = shell("echo started");
+    EXPECT_EQ(refused.output, "");
+    EXPECT_NE(refused.errors.find("cannot take the user's groups"), std::string::npos) << refused.errors;
+    EXPECT_EQ(tree(records()), "") << "what was not started is on no record";
 }
 
 } // namespace

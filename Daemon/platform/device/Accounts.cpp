@@ -4,12 +4,12 @@
 #include "platform/base/Text.h"
 #include "platform/base/Try.h"
 
-#include <algorithm>
 #include <array>
 #include <cerrno>
 #include <charconv>
 #include <cstdint>
 #include <optional>
+#include <set>
 
 namespace ost::platform {
 
@@ -113,11 +113,14 @@ std::expected<std::string, Errno> groupForId(gid_t gid) {
 }
 
 std::expected<std::vector<gid_t>, Errno> groupsOf(const Account& account, const std::string& image) {
-    std::vector<gid_t> groups{account.gid};
+    std::set<gid_t> others;
     OST_TRY(forEachRecord(image + groupFile, parseGroup, [&](const Group& group) {
-        if (hasMember(group.members, account.name) && std::ranges::find(groups, group.gid) == groups.end())
-            groups.push_back(group.gid);
+        if (hasMember(group.members, account.name))
+            others.insert(group.gid);
     }));
+    others.erase(account.gid);
+    std::vector<gid_t> groups{account.gid};
+    groups.insert(groups.end(), others.begin(), others.end());
     return groups;
 }
 

@@ -35,7 +35,7 @@ struct Account {
 [[nodiscard]] std::expected<gid_t, Errno> groupForName(std::string_view name);
 [[nodiscard]] std::expected<std::string, Errno> groupForId(gid_t gid);
 
-/// All groups of an account: its own and those that list its name among their members.
+/// All groups of an account, each once: its own first, then those that list its name among their members.
 [[nodiscard]] std::expected<std::vector<gid_t>, Errno> groupsOf(const Account& account, const std::string& image = "");
 
 } // namespace ost::platform
