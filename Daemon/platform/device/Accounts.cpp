@@ -101,7 +101,7 @@ std::expected<Account, Errno> accountForUserId(uid_t uid, const std::string& ima
 
 std::expected<Account, Errno> accountMatching(const std::function<bool(const Account&)>& matches,
                                               const std::string& image) {
-    return find((image + passwdFile).c_str(), parseAccount, matches);
+    return find(image + passwdFile, parseAccount, matches);
 }
 
 std::expected<gid_t, Errno> groupForName(std::string_view name) {
