@@ -19,8 +19,23 @@ using platform::FileDescriptor;
 
 namespace {
 
+/// Makes a directory unless something is there. Gives whether it did.
+std::expected<bool, platform::Errno> makeWhereMissing(int parent, const char* name,
+                                                      const OSTDirectoryAttributes& attributes) {
+    if (::mkdirat(parent, name, attributes.mode) != 0)
+        return errno == EEXIST ? std::expected<bool, platform::Errno>(false) : std::unexpected(errno);
+    if (!attributes.durable)
+        return true;
+    const auto names = OSTOpenItem(parent, ".", O_RDONLY | O_DIRECTORY);
+    const auto durable = names ? OSTWaitForDisk(names->get(), ::fsync) : std::unexpected(names.error());
+    if (durable)
+        return true;
+    ::unlinkat(parent, name, AT_REMOVEDIR);
+    return std::unexpected(durable.error());
+}
+
 /// Makes the directories on the way to the item at `path` that are missing.
-std::expected<void, platform::Errno> makeParents(std::string_view path, mode_t mode) {
+std::expected<void, platform::Errno> makeParents(std::string_view path, const OSTDirectoryAttributes& attributes) {
     FileDescriptor held = OST_TRY(OSTOpenItem(AT_FDCWD, "/", O_PATH | O_DIRECTORY));
     for (auto slash = path.find('/'); slash != std::string_view::npos; slash = path.find('/')) {
         const std::string_view name = path.substr(0, slash);
@@ -29,8 +44,7 @@ std::expected<void, platform::Errno> makeParents(std::string_view path, mode_t m
             continue;
         auto opened = OSTOpenItem(held.get(), name, O_PATH | O_DIRECTORY);
         if (!opened && opened.error() == ENOENT) {
-            if (::mkdirat(held.get(), std::string(name).c_str(), mode) != 0 && errno != EEXIST)
-                return std::unexpected(errno);
+            static_cast<void>(OST_TRY(makeWhereMissing(held.get(), std::string(name).c_str(), attributes)));
             opened = OSTOpenItem(held.get(), name, O_PATH | O_DIRECTORY);
         }
         held = OST_TRY(std::move(opened));
@@ -48,14 +62,12 @@ std::expected<MadeDirectory, platform::Errno> makeDirectory(std::string_view pat
                                                             const OSTDirectoryAttributes& attributes, int access) {
     auto place = OSTItemPlace::find(path);
     if (!place && place.error() == ENOENT && attributes.withIntermediateDirectories) {
-        OST_TRY(makeParents(path, attributes.mode));
+        OST_TRY(makeParents(path, attributes));
         place = OSTItemPlace::find(path);
     }
     if (!place)
         return std::unexpected(place.error());
-    const bool isNew = ::mkdirat(place->directory(), place->name(), attributes.mode) == 0;
-    if (!isNew && errno != EEXIST)
-        return std::unexpected(errno);
+    const bool isNew = OST_TRY(makeWhereMissing(place->directory(), place->name(), attributes));
     auto opened = OSTOpenItem(place->directory(), place->name(), access);
     if (isNew && opened && attributes.mode == 0) { // which masks all that the directory inherits
         const auto applied = platform::applyInheritedEntries(place->directory(), opened->get());

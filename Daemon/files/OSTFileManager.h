@@ -30,6 +30,7 @@ struct OSTDirectoryAttributes {
     mode_t mode = 0755;
     std::uint32_t owner = 0; ///< user and group; 0 leaves the owner unchanged
     std::int32_t protectionClass = OSTKeepProtectionClass;
+    bool durable = false; ///< each new directory is on disk in its parent, or is not made
 };
 
 struct OSTFileAttributes {

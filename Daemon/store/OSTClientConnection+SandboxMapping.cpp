@@ -46,6 +46,7 @@ std::optional<OSTContainerName> containerOf(const platform::SandboxUserStateItem
 } // namespace
 
 void OSTClientConnection::_repairSandboxContainerMappings() {
+    platform::removeUnfinishedSandboxUserStateItems();
     for (const auto& item : platform::danglingSandboxUserStateItems()) {
         const auto name = containerOf(item);
         if (!name)

@@ -3,8 +3,10 @@
 #include "platform/base/DirectoryNames.h"
 #include "platform/base/FileDescriptor.h"
 #include "platform/base/FileName.h"
+#include "platform/base/Path.h"
 #include "platform/base/Text.h"
 #include "platform/base/Try.h"
+#include "platform/threads/BlockingSection.h"
 
 #include <fcntl.h>
 #include <sys/stat.h>
@@ -34,6 +36,15 @@ std::expected<std::string, Errno> makeTemporaryLink(int directory, const std::st
     }
 }
 
+/// Waits until the names in the directory at `path` below `parent` are on disk.
+std::expected<void, Errno> makeNamesDurable(int parent, const char* path) {
+    const FileDescriptor directory(::openat(parent, path, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+    const BlockingSection blocking;
+    if (!directory || ::fsync(directory.get()) != 0)
+        return std::unexpected(errno);
+    return {};
+}
+
 std::expected<FileDescriptor, Errno> openOrMake(int parent, const std::string& name) {
     constexpr mode_t searchable = 0755;
     constexpr int flags = O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
@@ -41,6 +52,8 @@ std::expected<FileDescriptor, Errno> openOrMake(int parent, const std::string& n
     if (!directory && errno == ENOENT) {
         if (::mkdirat(parent, name.c_str(), searchable) != 0 && errno != EEXIST)
             return std::unexpected(errno);
+        const std::string holder(pathByDeletingLastComponent(name));
+        OST_TRY(makeNamesDurable(parent, holder.empty() ? "." : holder.c_str()));
         directory.reset(::openat(parent, name.c_str(), flags));
     }
     if (!directory)
@@ -95,7 +108,18 @@ std::expected<void, Errno> setSandboxUserStateItem(std::uint32_t userId, std::ui
         ::unlinkat(items.get(), temporary.c_str(), 0);
         return std::unexpected(error);
     }
-    return {};
+    return makeNamesDurable(items.get(), ".");
+}
+
+void removeUnfinishedSandboxUserStateItems() {
+    forEachItem(AT_FDCWD, sandboxStateDirectory, [](int top, const std::string& user) {
+        forEachItem(top, user, [](int ofUser, const std::string& type) {
+            const auto items = openWithoutLinks(ofUser, type.c_str(), O_RDONLY | O_DIRECTORY);
+            const auto names = items ? hiddenNames(*items) : std::unexpected(items.error());
+            for (const auto& name : names.value_or(std::vector<std::string>()))
+                ::unlinkat(items->get(), name.c_str(), 0);
+        });
+    });
 }
 
 std::vector<SandboxUserStateItem> danglingSandboxUserStateItems() {

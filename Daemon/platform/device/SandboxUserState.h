@@ -16,8 +16,8 @@ namespace ost::platform {
 inline constexpr const char* sandboxStateDirectory = "/private/var/db/sandbox-state";
 
 /// Sets the state item `key` of a user and type to `path`, in one rename, or removes it when there is none; removing an
-/// item that is absent succeeds. NAME is the key as `fileNameForKey` writes it. Fails with an errno: ENAMETOOLONG when
-/// the key is too long for a file name.
+/// item that is absent succeeds. An item that was set has reached the disk. NAME is the key as `fileNameForKey` writes
+/// it. Fails with an errno: ENAMETOOLONG when the key is too long for a file name.
 ///
 /// Threads: any, but not two at a time for one item.
 [[nodiscard]] std::expected<void, Errno> setSandboxUserStateItem(std::uint32_t userId, std::uint64_t type,
@@ -31,6 +31,9 @@ struct SandboxUserStateItem {
     std::string key;
     std::string path;
 };
+
+/// Removes what a crash left of items that were being set. Nobody may be setting one.
+void removeUnfinishedSandboxUserStateItems();
 
 /// The items at whose path nothing is. What cannot be looked at is passed over.
 [[nodiscard]] std::vector<SandboxUserStateItem> danglingSandboxUserStateItems();

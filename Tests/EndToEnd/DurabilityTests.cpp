@@ -1,0 +1,57 @@
+#include "EndToEnd/GatedProcess.h"
+#include "files/OSTFileManager.h"
+#include "platform/device/SandboxUserState.h"
+#include "support/DeviceTest.h"
+
+#include <gtest/gtest.h>
+
+#include <cerrno>
+#include <filesystem>
+#include <functional>
+
+using namespace ost::test;
+
+namespace {
+
+/// Operations that answer for what is on disk, each in a process whose calls fail one after the other.
+class DurabilityTest : public DeviceTest {
+protected:
+    /// How many waits for the disk there are without which the operation does not succeed.
+    static unsigned waitsOf(const std::function<bool()>& operation) {
+        unsigned waits = 0;
+        for (unsigned call = 1;; ++call) {
+            std::filesystem::remove_all("/made");
+            std::filesystem::remove_all(ost::platform::sandboxStateDirectory);
+            GatedProcess process([&] { return operation() ? 0 : 1; },
+                                 {.kind = Fault::Kind::fail, .call = call, .error = EIO});
+            const bool succeeded = process.wait() == 0;
+            const auto course = process.conclude();
+            if (course.faultedCall == "fsync") {
+                EXPECT_FALSE(succeeded) << "at call " << call;
+                ++waits;
+            }
+            if (course.faultedCall.empty()) {
+                EXPECT_TRUE(succeeded);
+                return waits;
+            }
+        }
+    }
+};
+
+TEST_F(DurabilityTest, ANewDirectoryOfTheLayoutIsOnDiskInItsParentOrIsNotMade) {
+    const auto make = [] {
+        const bool made =
+            ost::OSTFileManager::defaultManager()
+                .createDirectoryAtURL("/made/in/layout", {.withIntermediateDirectories = true, .durable = true})
+                .has_value();
+        return made && std::filesystem::exists("/made/in/layout");
+    };
+    EXPECT_EQ(3U, waitsOf(make));
+}
+
+TEST_F(DurabilityTest, AnItemOfTheSandboxIsOnDiskWhenItIsSet) {
+    const auto set = [] { return ost::platform::setSandboxUserStateItem(501, 1, "item", "/path").has_value(); };
+    EXPECT_EQ(4U, waitsOf(set));
+}
+
+} // namespace
