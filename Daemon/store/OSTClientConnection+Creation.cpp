@@ -108,9 +108,9 @@ OSTResult<OSTCacheEntry> OSTClientConnection::_lookUpOrCreate(const OSTContainer
         const auto found = OST_TRY(_lookUp(lookup));
         if (found.entry.record)
             return found.entry;
-        // Nobody can come between: the lock is the caller's, or kept because the cache still has the transient
-        // container that has just been thrown away.
-        if (found.threwTransientAway || !lookup.useLocking)
+        if (found.threwTransientAway)
+            return _putInPlaceOfThrownAway(lookup.name, staging);
+        if (!lookup.useLocking)
             return _putInPlace(OST_TRY(_buildInStaging(lookup.name, staging)), staging);
     }
     // Building waits for the disk. Without the lock, creations do so side by side and share the disk's commits.
@@ -118,6 +118,18 @@ OSTResult<OSTCacheEntry> OSTClientConnection::_lookUpOrCreate(const OSTContainer
     const OSTAllIdentifiersLock lock(OSTLockKind::writing);
     const auto made = OST_TRY(_lookUp(lookup)); // by another creation meanwhile
     return made.entry.record ? made.entry : _putInPlace(std::move(built), staging);
+}
+
+OSTResult<OSTCacheEntry> OSTClientConnection::_putInPlaceOfThrownAway(const OSTContainerName& name,
+                                                                      std::string& staging) {
+    // Under the lock of the look-up, because the cache still has the container that was thrown away.
+    auto made = OSTGuarded([&]() -> OSTResult<OSTCacheEntry> {
+        return _putInPlace(OST_TRY(_buildInStaging(name, staging)), staging);
+    });
+    if (!made)
+        // Or what has passed when the next creation comes would be its failure for good.
+        static_cast<void>(OSTContainerCache::sharedInstance().removeContainerForUser(name));
+    return made;
 }
 
 OSTResult<OSTClientConnection::LookUpResult> OSTClientConnection::_lookUp(const OSTContainerLookup& lookup) const {

@@ -216,6 +216,8 @@ private:
     [[nodiscard]] OSTResult<LookUpResult> _lookUp(const OSTContainerLookup& lookup) const;
     [[nodiscard]] static OSTResult<OSTMetadata> _buildInStaging(const OSTContainerName& name, std::string& staging);
     [[nodiscard]] static OSTResult<OSTCacheEntry> _putInPlace(OSTMetadata metadata, std::string& staging);
+    [[nodiscard]] static OSTResult<OSTCacheEntry> _putInPlaceOfThrownAway(const OSTContainerName& name,
+                                                                          std::string& staging);
     [[nodiscard]] static OSTResult<void>
     _createTopLevelContainerDirectory(const std::string& url, OSTContainerClass containerClass, std::uint32_t owner);
     [[nodiscard]] static OSTResult<void> _createSubDirectories(const std::string& url, std::uint32_t userId,
