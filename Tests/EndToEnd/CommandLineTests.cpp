@@ -26,7 +26,8 @@ protected:
         for (const auto& copy : {signedProgram, unsignedProgram})
             std::filesystem::copy_file(builtProgram("ostrandctl"), copy);
         const auto run = ostrandctl({"sign", signedProgram, "--identifier", "com.example.ctl", "--force",
-                                     "--entitlement", "com.tamarok.private.Ostrand.allowed"});
+                                     "--entitlement", "com.tamarok.private.Ostrand.allowed", "--entitlement",
+                                     "com.tamarok.private.Ostrand.dataMigration"});
         ASSERT_EQ(run.status, 0) << run.errors;
     }
 
@@ -164,6 +165,26 @@ TEST_F(CommandLine, ShowsAndChangesWhatAContainerCarries) {
     EXPECT_EQ(ostrandctl(with({"restore-structure"})).status, 0);
     const auto renamed = ostrandctl(with({"rename-directory"})).output;
     EXPECT_EQ(renamed.substr(renamed.find('\n') + 1), field(ostrandctl(with({"show"})).output, "path") + "\n");
+}
+
+TEST_F(CommandLine, MeasuresWipesMigratesAndChecks) {
+    const auto made = ostrandctl({"create", "--class", "2", "com.example.a"});
+    const auto container = device->onHost(field(made.output, "path"));
+    writeFile(container / "Documents/data", std::string(100'000, 'x'));
+    EXPECT_TRUE(ostrandctl({"usage", "--json"}).output.starts_with("{\"bytes\": 1")) << "four of 4 KiB are in it";
+    EXPECT_EQ(ostrandctl({"wipe", "--class", "2", "com.example.a"}).output, "wiped com.example.a\n");
+    EXPECT_FALSE(std::filesystem::exists(container / "Documents/data"));
+    EXPECT_EQ(field(ostrandctl({"lookup", "--class", "2", "com.example.a"}).output, "uuid"),
+              field(made.output, "uuid"));
+    EXPECT_EQ(ostrandctl({"migrate"}).status, 0);
+
+    EXPECT_EQ(ostrandctl({"check"}).output, "1 containers, 0 findings\n");
+    std::filesystem::create_directory(container.parent_path() / "planted");
+    std::filesystem::create_directory_symlink("/nowhere", container.parent_path() / "link");
+    const auto checked = ostrandctl({"check", "--json"});
+    EXPECT_EQ(checked.status, 1);
+    for (const auto* const name : {"planted", "link"})
+        EXPECT_NE(checked.output.find("/" + std::string(name) + "\""), std::string::npos) << checked.output;
 }
 
 TEST_F(CommandLine, SaysHowARequestFailedAndLeavesTheDeviceAlone) {
