@@ -2,6 +2,7 @@
 #include "codesigning/OSTGroupManager.h"
 #include "files/OSTDictionaryFile.h"
 #include "files/OSTFileManager.h"
+#include "model/OSTFailureReport.h"
 #include "model/OSTGlobalConfiguration.h"
 #include "model/OSTMigrationMarker.h"
 #include "platform/base/Log.h"
@@ -12,8 +13,11 @@
 #include "store/OSTLocks.h"
 
 #include <algorithm>
+#include <atomic>
 #include <cerrno>
+#include <exception>
 #include <functional>
+#include <thread>
 
 namespace ost {
 
@@ -28,6 +32,8 @@ constexpr std::string_view codeSigningMarker = "ost_code_signing_migration_compl
 constexpr std::string_view legacyFileName = "ost_entitlements.plist";
 
 constexpr const char* groupIdsKey = "com.tamarok.Tessaly.GroupContainerIDs";
+
+constexpr std::size_t writesSideBySide = 32;
 
 /// A container whose info values hold what is migrated, and that value.
 struct Holder {
@@ -50,6 +56,28 @@ OSTResult<void> clearInfoValue(const OSTMetadata& container, const char* key) {
     OST_TRY(cleared.writeMetadataToDisk());
     OST_TRY(OSTContainerCache::sharedInstance().addContainerMetadata(cleared));
     return {};
+}
+
+/// Removes a migrated info value from all its holders. Each write waits for the disk, and everybody waits for the lock
+/// meanwhile, so several are made side by side and share the disk's commits.
+void clearInfoValues(const std::vector<Holder>& holders, const char* key,
+                     const std::function<void(const OSTMetadata&, OSTErrorCode)>& failed) {
+    std::atomic<std::size_t> next = 0;
+    const auto clearRemaining = [&] {
+        for (auto index = next++; index < holders.size(); index = next++) {
+            const auto& container = *holders[index].container;
+            if (const auto cleared = OSTGuarded([&] { return clearInfoValue(container, key); }); !cleared)
+                failed(container, cleared.error().code());
+        }
+    };
+    std::vector<std::jthread> helpers;
+    try {
+        while (helpers.size() + 1 < std::min(writesSideBySide, holders.size()))
+            helpers.emplace_back(clearRemaining);
+    } catch (const std::exception&) {
+        // With as many as there are; this thread is enough.
+    }
+    clearRemaining();
 }
 
 std::shared_ptr<const OSTDictionary> infoWithEntitlements(const OSTValue& entitlements) {
@@ -161,10 +189,9 @@ bool OSTCodeSigningMapping::_migrateAppGroupIdsFromDataContainersToFile() {
         logError("Failed to write code signing mapping to disk following group id migration: %@", stored.error());
         return false;
     }
-    for (const auto& [container, value] : holders)
-        if (const auto cleared = clearInfoValue(*container, groupIdsKey); !cleared)
-            logError("Failed to clear group id metadata for %@ at %@ : %llu", container->identifier, container->url,
-                     cleared.error().code());
+    clearInfoValues(holders, groupIdsKey, [](const OSTMetadata& container, OSTErrorCode code) {
+        logError("Failed to clear group id metadata for %@ at %@ : %llu", container.identifier, container.url, code);
+    });
     writeMigrationFileToDiskWithName(groupMarker);
     logNotice("Group ID migration completed");
     return true;
@@ -248,10 +275,10 @@ bool OSTCodeSigningMapping::_migrateCachedCodeSigningInfoFromBundleContainersToM
         logError("Failed to write code signing mapping to disk following code signing migration: %@", stored.error());
         return false;
     }
-    for (const auto& [container, value] : holders)
-        if (const auto cleared = clearInfoValue(*container, OSTCachedCodeSigningInfoKey); !cleared)
-            logError("Error setting info value for identifier: %@, Class: %llu: %llu", container->identifier,
-                     container->containerClass, cleared.error().code());
+    clearInfoValues(holders, OSTCachedCodeSigningInfoKey, [](const OSTMetadata& container, OSTErrorCode code) {
+        logError("Error setting info value for identifier: %@, Class: %llu: %llu", container.identifier,
+                 container.containerClass, code);
+    });
     if (!allListed)
         return false;
     writeMigrationFileToDiskWithName(codeSigningMarker);
