@@ -87,9 +87,8 @@ TEST_F(ProcessContainersTest, AnswersWithEveryContainerInOrder) {
 TEST_F(ProcessContainersTest, TheCodeSignatureNamesTheContainerWhereNothingElseDoes) {
     const auto data = "1=" + makeContainer(dataApplication, "com.example.signed");
     EXPECT_EQ(ask(string(0, "com.example.signed") + number(3, 501))[1], data);
-    EXPECT_EQ(ask(string(0, "com.example.signed") + number(3, 501) + string(1, ""))[1],
-              "1=" + pathOf(dataApplication, ""))
-        << "an empty identifier is one";
+    const auto empty = ask(string(0, "com.example.signed") + number(3, 501) + string(1, ""));
+    EXPECT_EQ(empty[1], "1=" + pathOf(dataApplication, "")) << "an empty identifier is one";
     // The last one of an item that may not repeat counts.
     EXPECT_EQ(ask(string(0, "x") + number(3, 7) + string(0, "com.example.signed") + number(3, 501))[1], data);
 }
@@ -137,8 +136,8 @@ TEST_F(ProcessContainersTest, TheHomeIsThatOfTheUser) {
     EXPECT_EQ(ask(number(3, 501)), (Lines{"100=/private/var/mobile", "0=1"}));
     for (const auto user : {1U, 33U, 499U, 500U, 777U, 4294967295U})
         EXPECT_EQ(ask(number(3, user)), Lines{"0=1"}) << user;
-    EXPECT_EQ(ask(string(6, "com.example.service")),
-              (Lines{"100=/private/var/root", "101=" + pathOf(dataSystem, "com.example.service"), "0=1"}));
+    const auto ofService = ask(string(6, "com.example.service"));
+    EXPECT_EQ(ofService, (Lines{"100=/private/var/root", "101=" + pathOf(dataSystem, "com.example.service"), "0=1"}));
 }
 
 TEST_F(ProcessContainersTest, WhatCannotBeReadMakesNothing) {
