@@ -442,29 +442,31 @@ TEST(IPC, AClientWithoutDebtsMayStay) {
 }
 
 TEST(IPC, RefusesConnectionsOverALimitUntilOneHasGone) {
-    Service service({.connections = 3, .connectionsOfOneUser = 1});
+    Service service({.connections = 5, .connectionsKeptForRoot = 3, .connectionsOfOneUser = 1});
     const auto isServed = [](Client& client) {
         client.send(request(1, echo));
         return client.receiveNumber() == 1;
     };
-    // Credentials are the thread's; another one makes the connections of user 501.
-    std::vector<Client> ofUser(2);
-    std::thread([&] {
-        ASSERT_EQ(::syscall(SYS_setresuid, -1, 501, -1), 0);
-        for (auto& client : ofUser)
-            client.connect(service);
-    }).join();
-    EXPECT_TRUE(isServed(ofUser[0]));
-    EXPECT_FALSE(isServed(ofUser[1]));
-    Client second(service), third(service), fourth(service);
-    EXPECT_TRUE(isServed(second) && isServed(third));
-    EXPECT_FALSE(isServed(fourth));
+    std::vector<Client> clients(9);
+    const auto connectAs = [&](uid_t user, std::size_t client) {
+        // Credentials are the thread's.
+        std::thread([&] {
+            ASSERT_EQ(::syscall(SYS_setresuid, -1, user, -1), 0);
+            clients[client].connect(service);
+        }).join();
+        return isServed(clients[client]);
+    };
+    EXPECT_TRUE(connectAs(501, 0));
+    EXPECT_FALSE(connectAs(501, 1)) << "it has one";
+    EXPECT_TRUE(connectAs(502, 2));
+    EXPECT_FALSE(connectAs(503, 3)) << "the rest is root's";
+    EXPECT_TRUE(connectAs(0, 4) && connectAs(0, 5) && connectAs(0, 6));
+    EXPECT_FALSE(connectAs(0, 7));
 
     const int gone = service.invalidated;
-    third.close();
+    clients[2].close();
     Service::await(service.invalidated, gone + 1);
-    Client fifth(service);
-    EXPECT_TRUE(isServed(fifth));
+    EXPECT_TRUE(connectAs(503, 8));
 }
 
 TEST(IPC, AcceptingPausesWithoutDescriptorsAndGoesOnWhenTheyAreBack) {

@@ -1,18 +1,47 @@
 #include "platform/ipc/IPCConnectionRegistry.h"
 
+#include <algorithm>
+
 namespace ost::platform {
+
+namespace {
+
+/// Socket, process and program.
+constexpr std::size_t descriptorsOfAConnection = 3;
+/// For what the daemon keeps open, and for the requests that are handled at a time.
+constexpr std::size_t descriptorsForWork = 256;
+
+} // namespace
+
+IPCLimits IPCLimits::withDescriptors(std::size_t descriptors) const {
+    const auto work = std::min(descriptorsForWork, descriptors / 2);
+    const auto most = (descriptors - work) / descriptorsOfAConnection;
+    IPCLimits limits = *this;
+    if (most < connections) {
+        limits.connections = most;
+        limits.connectionsKeptForRoot = std::min(connectionsKeptForRoot, most / 4);
+        limits.connectionsOfOneUser = std::min(connectionsOfOneUser, most / 4);
+    }
+    return limits;
+}
 
 std::expected<void, const char*> IPCConnectionRegistry::add(const std::shared_ptr<IPCConnection>& connection,
                                                             uid_t user) {
     const MutexLock lock(_mutex);
     if (_connections.size() >= _limits.connections)
         return std::unexpected("too many connections");
-    auto& ofUser = _connectionsOfUser[user];
-    if (user > 0 && ofUser >= _limits.connectionsOfOneUser)
+    if (user > 0 && _connections.size() - _countOf(0) + _limits.connectionsKeptForRoot >= _limits.connections)
+        return std::unexpected("too many connections of users");
+    if (user > 0 && _countOf(user) >= _limits.connectionsOfOneUser)
         return std::unexpected("too many connections of its user");
     _connections.emplace(connection.get(), connection);
-    ++ofUser;
+    ++_connectionsOfUser[user];
     return {};
+}
+
+std::size_t IPCConnectionRegistry::_countOf(uid_t user) const {
+    const auto found = _connectionsOfUser.find(user);
+    return found == _connectionsOfUser.end() ? 0 : found->second;
 }
 
 void IPCConnectionRegistry::remove(IPCConnection& connection, uid_t user) {

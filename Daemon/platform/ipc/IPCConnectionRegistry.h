@@ -32,6 +32,8 @@ public:
     [[nodiscard]] std::vector<std::shared_ptr<IPCConnection>> all() const;
 
 private:
+    [[nodiscard]] std::size_t _countOf(uid_t user) const OST_REQUIRES(_mutex);
+
     const IPCLimits& _limits;
     std::function<void()> _removalHandler;
 

@@ -10,14 +10,19 @@ namespace ost::platform {
 
 /// What a client may cost before it loses its connection.
 struct IPCLimits {
-    std::size_t connections = 4096;         ///< in all: three descriptors each
-    std::size_t connectionsOfOneUser = 256; ///< of a user id above 0, so that no user can take them all
+    std::size_t connections = 4096;           ///< in all
+    std::size_t connectionsKeptForRoot = 256; ///< of these; so the others can never lock root out
+    std::size_t connectionsOfOneUser = 256;   ///< of a user id above 0, so that no user can take them all
     std::uint32_t payload = IPCFrameHeader::maximumPayload;
     std::size_t unreadReplies = 64 * 1024 * 1024;                   ///< bytes kept for a client that does not read
     std::chrono::milliseconds takeReply = std::chrono::seconds(30); ///< to take a reply that the socket cannot hold
     std::chrono::milliseconds completeFrame =
         std::chrono::seconds(30);                                    ///< to send a frame whose first byte has arrived
     std::chrono::milliseconds acceptAgain = std::chrono::seconds(1); ///< pause when the process is out of descriptors
+
+    /// The same, with fewer connections where that many open descriptors do not suffice for them and for the requests
+    /// they bring.
+    [[nodiscard]] IPCLimits withDescriptors(std::size_t descriptors) const;
 };
 
 } // namespace ost::platform

@@ -14,6 +14,7 @@
 #include <cerrno>
 #include <cstring>
 #include <exception>
+#include <limits>
 #include <optional>
 #include <span>
 #include <utility>
@@ -31,12 +32,13 @@ constexpr auto flushTime = std::chrono::seconds(1);
 /// What the pool watches beside the connections: the listening socket and the timer.
 constexpr std::size_t ownSources = 2;
 
-void raiseDescriptorLimit() {
+/// Raises the process's limit of open descriptors as far as it may, and gives it.
+std::size_t raiseDescriptorLimit() {
     rlimit limit{};
-    if (::getrlimit(RLIMIT_NOFILE, &limit) != 0 || limit.rlim_cur >= limit.rlim_max)
-        return;
-    limit.rlim_cur = limit.rlim_max;
-    ::setrlimit(RLIMIT_NOFILE, &limit);
+    if (::getrlimit(RLIMIT_NOFILE, &limit) != 0)
+        return std::numeric_limits<std::size_t>::max();
+    const rlimit raised{.rlim_cur = limit.rlim_max, .rlim_max = limit.rlim_max};
+    return ::setrlimit(RLIMIT_NOFILE, &raised) == 0 ? raised.rlim_cur : limit.rlim_cur;
 }
 
 } // namespace
@@ -142,8 +144,8 @@ private:
 
 std::expected<std::unique_ptr<IPCListener>, Errno> IPCListener::create(FileDescriptor listeningSocket,
                                                                        std::string label, EventHandler eventHandler,
-                                                                       const IPCLimits& limits) {
-    raiseDescriptorLimit();
+                                                                       const IPCLimits& wanted) {
+    const auto limits = wanted.withDescriptors(raiseDescriptorLimit());
     const int flags = ::fcntl(listeningSocket.get(), F_GETFL);
     if (flags < 0 || ::fcntl(listeningSocket.get(), F_SETFL, flags | O_NONBLOCK) != 0)
         return std::unexpected(errno);

@@ -25,10 +25,10 @@ public:
     /// Told of each new connection, on a thread of the pool: sets the connection's handlers and resumes it.
     using EventHandler = std::function<void(const std::shared_ptr<IPCConnection>&)>;
 
-    /// Takes a socket that listens already, and raises the process's limit of open descriptors as far as it may.
-    /// `label` names the threads. Fails with an errno.
+    /// Takes a socket that listens already, and raises the process's limit of open descriptors as far as it may; where
+    /// that is too low for the limits, fewer connections are accepted. `label` names the threads. Fails with an errno.
     [[nodiscard]] static std::expected<std::unique_ptr<IPCListener>, Errno>
-    create(FileDescriptor listeningSocket, std::string label, EventHandler eventHandler, const IPCLimits& limits = {});
+    create(FileDescriptor listeningSocket, std::string label, EventHandler eventHandler, const IPCLimits& wanted = {});
 
     /// Finishes without a bound for the requests under way, closes all connections, and calls their invalidation
     /// handlers.
