@@ -123,9 +123,8 @@ OSTResult<OSTCacheEntry> OSTClientConnection::_lookUpOrCreate(const OSTContainer
 OSTResult<OSTCacheEntry> OSTClientConnection::_putInPlaceOfThrownAway(const OSTContainerName& name,
                                                                       std::string& staging) {
     // Under the lock of the look-up, because the cache still has the container that was thrown away.
-    auto made = OSTGuarded([&]() -> OSTResult<OSTCacheEntry> {
-        return _putInPlace(OST_TRY(_buildInStaging(name, staging)), staging);
-    });
+    auto made = OSTGuarded(
+        [&]() -> OSTResult<OSTCacheEntry> { return _putInPlace(OST_TRY(_buildInStaging(name, staging)), staging); });
     if (!made)
         // Or what has passed when the next creation comes would be its failure for good.
         static_cast<void>(OSTContainerCache::sharedInstance().removeContainerForUser(name));
