@@ -2,14 +2,15 @@
 // class of a large container.
 
 #include "Client/Attributes.h"
-#include "support/BootedDevice.h"
+#include "Support/BootedDevice.h"
+#include "Support/ScratchDirectory.h"
 #include "support/Comparison.h"
+#include "support/DeviceClient.h"
 #include "support/JournaledFileSystem.h"
 #include "support/OneProcessor.h"
 #include "support/Require.h"
 #include "support/RoundTrips.h"
 #include "support/Stopwatch.h"
-#include "support/Workshop.h"
 
 #include <dirent.h>
 #include <fcntl.h>
@@ -28,6 +29,9 @@
 
 namespace ost::benchmarks {
 
+using test::BootedDevice;
+using test::makeScratchDirectory;
+
 namespace {
 
 using ostrand::ContainerClass;
@@ -39,7 +43,7 @@ constexpr const char* key = "com.example.Sketches.LastOpened";
 /// A connection and a container, which is made when it is not there.
 class Owner {
 public:
-    Owner(const BootedDevice& device, const std::string& identifier) : _connection(device.connect()) {
+    Owner(const BootedDevice& device, const std::string& identifier) : _connection(connectTo(device)) {
         const auto made =
             require(ostrand::createOrLookup(
                         _connection,
@@ -47,7 +51,7 @@ public:
                         ostrand::WhenMissing::create),
                     "create a container");
         container = {ContainerClass::dataApplication, user, identifier, made.uuid};
-        path = device.hostPath(made.path);
+        path = device.onHost(made.path);
     }
 
     void setInfoValues(unsigned count) {
@@ -146,11 +150,11 @@ std::string requestAbout(const ostrand::ContainerReference& container, std::uint
 void gettingOne(benchmark::State& state) {
     constexpr unsigned roundTrips = 2000;
     const OneProcessor oneProcessor;
-    const BootedDevice device(makeScratchDirectory() / "device");
+    const BootedDevice device(makeScratchDirectory(0711) / "device");
     Owner owner(device, "com.example.Sketches");
     owner.setInfoValues(1);
-    RoundTrips get(device.socketPath(), requestAbout(owner.container, 6));
-    RoundTrips lookUp(device.socketPath(), requestAbout(owner.container, 0));
+    RoundTrips get(device.socket(), requestAbout(owner.container, 6));
+    RoundTrips lookUp(device.socket(), requestAbout(owner.container, 0));
     Comparison{.unit = Unit::seconds,
                .target = {Target::Kind::ratioAtMost, 1.2},
                .daemon = [&] { return get.secondsEach(roundTrips); },
@@ -202,7 +206,7 @@ void changeTree(FileDescriptor top, const std::string& value) {
 
 /// A container with a large tree, whose class goes to and fro.
 struct LargeContainer {
-    std::filesystem::path scratch = makeScratchDirectory();
+    std::filesystem::path scratch = makeScratchDirectory(0711);
     BootedDevice device{scratch / "device"};
     Owner owner{device, "com.example.Sketches"};
     std::array<std::filesystem::path, 3> items{owner.path / "Documents", owner.path / "Library", owner.path / "tmp"};
@@ -233,7 +237,7 @@ void lookUpsMeanwhile(benchmark::State& state) {
     constexpr unsigned roundTrips = 1000;
     LargeContainer container;
     const Owner other(container.device, "com.example.Notes");
-    RoundTrips lookUp(container.device.socketPath(), requestAbout(other.container, 0));
+    RoundTrips lookUp(container.device.socket(), requestAbout(other.container, 0));
     const auto duringChange = [&] {
         container.changeBare("3");
         std::atomic<bool> isChanging = true;

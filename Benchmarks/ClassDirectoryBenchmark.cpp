@@ -2,13 +2,14 @@
 // reads the files; and what the containers cost in memory.
 
 #include "Client/Containers.h"
+#include "Support/BootedDevice.h"
+#include "Support/ScratchDirectory.h"
 #include "model/OSTMetadata.h"
 #include "platform/codec/PropertyList.h"
-#include "support/BootedDevice.h"
 #include "support/Comparison.h"
+#include "support/DeviceClient.h"
 #include "support/Require.h"
 #include "support/Stopwatch.h"
-#include "support/Workshop.h"
 
 #include <dirent.h>
 #include <fcntl.h>
@@ -25,6 +26,9 @@
 #include <vector>
 
 namespace ost::benchmarks {
+
+using test::BootedDevice;
+using test::makeScratchDirectory;
 
 namespace {
 
@@ -57,7 +61,7 @@ private:
     [[nodiscard]] std::filesystem::path _findClassDirectory() const;
     void _makeContainer(unsigned number) const;
 
-    std::filesystem::path _image = makeScratchDirectory() / "device";
+    std::filesystem::path _image = makeScratchDirectory(0711) / "device";
     std::filesystem::path _classDirectory;
 };
 
@@ -75,8 +79,8 @@ ostrand::Container lookUp(ostrand::Connection& connection, unsigned number) {
 /// Where the daemon puts the first one.
 std::filesystem::path CrowdedImage::_findClassDirectory() const {
     const BootedDevice device(_image);
-    auto connection = device.connect();
-    return device.hostPath(lookUp(connection, 0).path).parent_path();
+    auto connection = connectTo(device);
+    return device.onHost(lookUp(connection, 0).path).parent_path();
 }
 
 void CrowdedImage::_makeContainer(unsigned number) const {
@@ -102,7 +106,7 @@ const CrowdedImage& crowdedImage() {
 /// The daemon that has just been started, one look-up in another class behind it.
 struct FreshDaemon {
     BootedDevice device{crowdedImage().path()};
-    ostrand::Connection connection = device.connect();
+    ostrand::Connection connection = connectTo(device);
 
     FreshDaemon() { lookUp(connection, ostrand::ContainerClass::dataTempDir, 0); }
 };
@@ -147,9 +151,9 @@ void firstLookUp(benchmark::State& state) {
 
 double bytesOfCachedContainer() {
     FreshDaemon daemon;
-    const auto before = daemon.device.residentBytes();
+    const auto before = residentBytes(daemon.device);
     lookUp(daemon.connection, containers / 2);
-    const auto after = daemon.device.residentBytes();
+    const auto after = residentBytes(daemon.device);
     return static_cast<double>(after - before) / containers;
 }
 

@@ -3,21 +3,22 @@
 
 #include "Client/CodeSigning.h"
 #include "Client/Containers.h"
+#include "Support/BootedDevice.h"
+#include "Support/ChildProcess.h"
+#include "Support/ScratchDirectory.h"
 #include "codesigning/OSTCodeSigningMapping.h"
 #include "codesigning/OSTGroupManager.h"
 #include "files/OSTDictionaryFile.h"
 #include "platform/codec/IPCValue.h"
 #include "platform/codec/PropertyList.h"
 #include "platform/ipc/IPCFrame.h"
-#include "support/BootedDevice.h"
-#include "support/ChildProcess.h"
 #include "support/Comparison.h"
+#include "support/DeviceClient.h"
 #include "support/JournaledFileSystem.h"
 #include "support/OneProcessor.h"
 #include "support/Require.h"
 #include "support/RoundTrips.h"
 #include "support/Stopwatch.h"
-#include "support/Workshop.h"
 
 #include <fcntl.h>
 #include <unistd.h>
@@ -30,6 +31,10 @@
 #include <vector>
 
 namespace ost::benchmarks {
+
+using test::BootedDevice;
+using test::ChildProcess;
+using test::makeScratchDirectory;
 
 namespace {
 
@@ -120,9 +125,9 @@ void oneMore(benchmark::State& state) {
     const CrowdedDevice crowded(disk.path() / "device");
     const auto bare = disk.path() / "bare";
     std::filesystem::create_directory(bare);
-    auto connection = crowded.device().connect();
+    auto connection = connectTo(crowded.device());
     const auto file = require(
-        OST_dictionaryWithContentsOfURL(crowded.device().hostPath(mappingFile).native(), OSTLargeDictionaryFileSize),
+        OST_dictionaryWithContentsOfURL(crowded.device().onHost(mappingFile).native(), OSTLargeDictionaryFileSize),
         "read the mapping");
     unsigned number = identifiers;
     Comparison{.unit = Unit::seconds,
@@ -171,12 +176,12 @@ std::string lookUpOf(unsigned number) {
 void unchanged(benchmark::State& state) {
     const OneProcessor oneProcessor;
     constexpr unsigned roundTrips = 2000;
-    const CrowdedDevice crowded(makeScratchDirectory() / "device");
+    const CrowdedDevice crowded(makeScratchDirectory(0711) / "device");
     const auto& device = crowded.device();
-    RoundTrips registrations(device.socketPath(), registrationOf(identifiers / 2));
-    RoundTrips lookUps(device.socketPath(), lookUpOf(identifiers / 2));
+    RoundTrips registrations(device.socket(), registrationOf(identifiers / 2));
+    RoundTrips lookUps(device.socket(), lookUpOf(identifiers / 2));
     lookUps.once(); // Makes it.
-    const auto written = [&] { return std::filesystem::last_write_time(device.hostPath(mappingFile)); };
+    const auto written = [&] { return std::filesystem::last_write_time(device.onHost(mappingFile)); };
     const auto before = written();
     Comparison{.unit = Unit::seconds,
                .target = {Target::Kind::ratioAtMost, 1.2},
@@ -233,7 +238,7 @@ double secondsOfBareCounting(const std::vector<std::vector<std::string>>& lists)
 }
 
 void counting(benchmark::State& state) {
-    const auto image = makeScratchDirectory() / "device";
+    const auto image = makeScratchDirectory(0711) / "device";
     plantMapping(image);
     std::vector<std::vector<std::string>> lists;
     for (unsigned number = 0; number < identifiers; ++number)

@@ -1,9 +1,10 @@
 // Creation of containers that survive a power cut, beside a loop that makes the same directories and files.
 
 #include "Client/Containers.h"
+#include "Support/BootedDevice.h"
 #include "platform/base/UUID.h"
-#include "support/BootedDevice.h"
 #include "support/Comparison.h"
+#include "support/DeviceClient.h"
 #include "support/JournaledFileSystem.h"
 #include "support/Require.h"
 #include "support/Stopwatch.h"
@@ -22,6 +23,8 @@
 
 namespace ost::benchmarks {
 
+using test::BootedDevice;
+
 namespace {
 
 using platform::FileDescriptor;
@@ -34,7 +37,7 @@ constexpr unsigned turns = 31;
 /// Creates containers through the client library, each under a name of its own.
 class Creator {
 public:
-    explicit Creator(const BootedDevice& device) : _connection(device.connect()) {}
+    explicit Creator(const BootedDevice& device) : _connection(connectTo(device)) {}
 
     ostrand::Container create() {
         static std::atomic<unsigned> number{0};
@@ -138,7 +141,7 @@ void oneClient(benchmark::State& state) {
     const JournaledFileSystem disk;
     const BootedDevice device(disk.path() / "device");
     Creator daemon(device);
-    const BareCreator bare(device.hostPath(daemon.create().path), disk.path() / "bare");
+    const BareCreator bare(device.onHost(daemon.create().path), disk.path() / "bare");
     Comparison{.unit = Unit::seconds,
                .target = {Target::Kind::ratioAtMost, 1.4},
                .daemon = [&] { return secondsOf([&] { daemon.createMany(creationsInTurn); }) / creationsInTurn; },

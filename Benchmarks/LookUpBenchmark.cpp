@@ -1,20 +1,24 @@
 // Look-ups of an existing container, beside an echo of the same bytes from an event loop.
 
 #include "Client/Containers.h"
+#include "Support/BootedDevice.h"
+#include "Support/ScratchDirectory.h"
 #include "platform/codec/CBOR.h"
 #include "platform/ipc/IPCFrame.h"
-#include "support/BootedDevice.h"
 #include "support/Comparison.h"
+#include "support/DeviceClient.h"
 #include "support/EchoServer.h"
 #include "support/OneProcessor.h"
 #include "support/Require.h"
 #include "support/RoundTrips.h"
-#include "support/Workshop.h"
 
 #include <stdexcept>
 #include <string>
 
 namespace ost::benchmarks {
+
+using test::BootedDevice;
+using test::makeScratchDirectory;
 
 namespace {
 
@@ -42,7 +46,7 @@ std::string lookUpRequest() {
 
 /// A daemon with one container, and an echo that answers the look-up of that container with what the daemon answers.
 struct Servers {
-    std::filesystem::path directory = makeScratchDirectory();
+    std::filesystem::path directory = makeScratchDirectory(0711);
     std::string request = lookUpRequest();
     BootedDevice device{directory / "device"};
     std::string reply = _replyOfDaemon();
@@ -52,12 +56,12 @@ struct Servers {
 
 private:
     [[nodiscard]] std::string _replyOfDaemon() const {
-        auto connection = device.connect();
+        auto connection = connectTo(device);
         require(ostrand::createOrLookup(connection,
                                         {.containerClass = ContainerClass::dataApplication, .identifier = identifier},
                                         ostrand::WhenMissing::create),
                 "create a container");
-        const std::string bytes(RoundTrips(device.socketPath(), request).once());
+        const std::string bytes(RoundTrips(device.socket(), request).once());
         const auto answer = platform::validateCBOR(std::string_view(bytes).substr(IPCFrameHeader::size));
         const auto existed = answer ? answer->find("ReplyExisted") : std::nullopt;
         if (!existed || existed->asBoolean() != true)
@@ -70,7 +74,7 @@ void oneClient(benchmark::State& state) {
     constexpr unsigned roundTrips = 2000;
     const OneProcessor oneProcessor;
     const Servers servers;
-    RoundTrips daemon(servers.device.socketPath(), servers.request);
+    RoundTrips daemon(servers.device.socket(), servers.request);
     RoundTrips echo(servers.echoPath(), servers.request);
     Comparison{.unit = Unit::seconds,
                .target = {Target::Kind::ratioAtMost, 2.0},
@@ -83,7 +87,7 @@ void manyConnections(benchmark::State& state) {
     constexpr unsigned connections = 64;
     constexpr std::chrono::milliseconds duration{200};
     const Servers servers;
-    BusyConnections daemon(servers.device.socketPath(), servers.request, servers.reply.size(), connections);
+    BusyConnections daemon(servers.device.socket(), servers.request, servers.reply.size(), connections);
     BusyConnections echo(servers.echoPath(), servers.request, servers.reply.size(), connections);
     Comparison{.unit = Unit::perSecond,
                .target = {Target::Kind::ratioAtLeast, 0.5},

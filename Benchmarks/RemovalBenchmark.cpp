@@ -1,15 +1,16 @@
 // Staging for deletion, destruction and replacement, beside the same moves, writes and removals without a daemon.
 
 #include "Client/Containers.h"
+#include "Support/BootedDevice.h"
+#include "Support/ChildProcess.h"
+#include "Support/ScratchDirectory.h"
 #include "platform/base/UUID.h"
-#include "support/BootedDevice.h"
-#include "support/ChildProcess.h"
 #include "support/Comparison.h"
+#include "support/DeviceClient.h"
 #include "support/JournaledFileSystem.h"
 #include "support/OneProcessor.h"
 #include "support/Require.h"
 #include "support/Stopwatch.h"
-#include "support/Workshop.h"
 
 #include <fcntl.h>
 #include <sys/stat.h>
@@ -24,6 +25,10 @@
 #include <vector>
 
 namespace ost::benchmarks {
+
+using test::BootedDevice;
+using test::ChildProcess;
+using test::makeScratchDirectory;
 
 namespace {
 
@@ -121,7 +126,7 @@ void staging(benchmark::State& state) {
     const OneProcessor oneProcessor;
     const JournaledFileSystem disk;
     const BootedDevice device(disk.path() / "device");
-    auto connection = device.connect();
+    auto connection = connectTo(device);
     const BareStore bare(disk.path() / "bare");
     const auto daemon = [&] {
         std::vector<ostrand::ContainerReference> containers;
@@ -148,7 +153,7 @@ void staging(benchmark::State& state) {
 void replacement(benchmark::State& state) {
     const JournaledFileSystem disk;
     const BootedDevice device(disk.path() / "device");
-    auto connection = device.connect();
+    auto connection = connectTo(device);
     const BareStore bare(disk.path() / "bare");
     const auto daemon = [&] {
         double seconds = 0;
@@ -194,22 +199,22 @@ public:
 
     void makeWaste() {
         const auto container = create(_connection, newIdentifier());
-        makeLargeTree(_device.hostPath(container.path) / "Documents/tree");
+        makeLargeTree(_device.onHost(container.path) / "Documents/tree");
         require(ostrand::stageForDeletion(_connection, {referenceTo(container)}), "stage for deletion");
     }
     void destroyWaste() const {
-        auto connection = _device.connect();
+        auto connection = connectTo(_device);
         require(ostrand::destroyDeathRow(connection), "destroy what is on death row");
     }
 
 private:
-    BootedDevice _device{makeScratchDirectory() / "device"};
-    ostrand::Connection _connection = _device.connect();
+    BootedDevice _device{makeScratchDirectory(0711) / "device"};
+    ostrand::Connection _connection = connectTo(_device);
 };
 
 void destruction(benchmark::State& state) {
     DeviceWithWaste device;
-    const auto bare = makeScratchDirectory();
+    const auto bare = makeScratchDirectory(0711);
     const auto daemon = [&] {
         device.makeWaste();
         return secondsOf([&] { device.destroyWaste(); });

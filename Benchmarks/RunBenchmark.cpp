@@ -1,13 +1,14 @@
 // Running a program in its containers, beside starting the same program as the same user and one upcall.
 
 #include "Client/Upcall.h"
-#include "support/BootedDevice.h"
-#include "support/ChildProcess.h"
+#include "Support/BootedDevice.h"
+#include "Support/ChildProcess.h"
+#include "Support/ScratchDirectory.h"
 #include "support/Comparison.h"
+#include "support/DeviceClient.h"
 #include "support/OneProcessor.h"
 #include "support/Require.h"
 #include "support/Stopwatch.h"
-#include "support/Workshop.h"
 
 #include <grp.h>
 #include <unistd.h>
@@ -16,6 +17,11 @@
 #include <string>
 
 namespace ost::benchmarks {
+
+using test::BootedDevice;
+using test::builtProgram;
+using test::ChildProcess;
+using test::makeScratchDirectory;
 
 namespace {
 
@@ -36,9 +42,9 @@ void requireSuccess(ChildProcess&& process) {
 
 void runTrue(benchmark::State& state) {
     const OneProcessor oneProcessor;
-    const auto device = makeScratchDirectory() / "device";
+    const auto device = makeScratchDirectory(0711) / "device";
     const BootedDevice booted(device);
-    booted.registerApplication(identifier);
+    registerApplication(booted, identifier);
     const std::vector<std::string> command{
         builtProgram("ostrandctl"), "run", "--device", device, "--identifier", identifier, program};
     Comparison{.unit = Unit::seconds,

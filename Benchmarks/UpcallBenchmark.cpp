@@ -2,16 +2,18 @@
 // that create.
 
 #include "Client/Containers.h"
+#include "Support/BootedDevice.h"
+#include "Support/ChildProcess.h"
+#include "Support/ScratchDirectory.h"
 #include "platform/codec/OSTPackBuffer.h"
 #include "platform/ipc/UpcallPacket.h"
-#include "support/BootedDevice.h"
 #include "support/Comparison.h"
+#include "support/DeviceClient.h"
 #include "support/JournaledFileSystem.h"
 #include "support/OneProcessor.h"
 #include "support/Require.h"
 #include "support/Socket.h"
 #include "support/Stopwatch.h"
-#include "support/Workshop.h"
 
 #include <sys/epoll.h>
 #include <sys/socket.h>
@@ -26,6 +28,10 @@
 #include <vector>
 
 namespace ost::benchmarks {
+
+using test::BootedDevice;
+using test::ChildProcess;
+using test::makeScratchDirectory;
 
 namespace {
 
@@ -143,13 +149,13 @@ int echoPackets(int listener) {
 void oneSender(benchmark::State& state) {
     constexpr unsigned upcalls = 2000;
     const OneProcessor oneProcessor;
-    const auto directory = makeScratchDirectory();
+    const auto directory = makeScratchDirectory(0711);
     const BootedDevice device(directory / "device");
-    device.registerApplication(identifier);
+    registerApplication(device, identifier);
     const auto echoPath = (directory / "echo").string();
     const auto listener = listenOn(echoPath, SOCK_SEQPACKET);
     const ChildProcess server([&] { return echoPackets(listener.get()); });
-    Upcalls daemon(device.socketPath() + ".upcall");
+    Upcalls daemon(device.socket().string() + ".upcall");
     Upcalls echo(echoPath);
     Comparison{.unit = Unit::seconds,
                .target = {Target::Kind::ratioAtMost, 2.0},
@@ -161,7 +167,7 @@ void oneSender(benchmark::State& state) {
 /// Creates until it is told to end, and gives what the slowest creation took.
 double slowestCreation(const BootedDevice& device, const std::atomic<bool>& end) {
     static std::atomic<unsigned> number{0};
-    auto connection = device.connect();
+    auto connection = connectTo(device);
     double slowest = 0;
     while (!end)
         slowest = std::max(
@@ -180,8 +186,8 @@ void besideCreations(benchmark::State& state) {
     constexpr unsigned clients = 8;
     const JournaledFileSystem disk;
     const BootedDevice device(disk.path() / "device");
-    device.registerApplication(identifier);
-    Upcalls daemon(device.socketPath() + ".upcall");
+    registerApplication(device, identifier);
+    Upcalls daemon(device.socket().string() + ".upcall");
     daemon.once();
     double creation = 0;
     const auto slowestUpcall = [&] {

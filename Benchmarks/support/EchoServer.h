@@ -1,7 +1,7 @@
 #pragma once
 
+#include "Support/ChildProcess.h"
 #include "platform/base/FileDescriptor.h"
-#include "support/ChildProcess.h"
 
 #include <cstddef>
 #include <string>
@@ -16,7 +16,7 @@ public:
 
 private:
     platform::FileDescriptor _listener;
-    ChildProcess _process;
+    test::ChildProcess _process;
 };
 
 } // namespace ost::benchmarks

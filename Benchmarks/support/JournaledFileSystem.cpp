@@ -1,8 +1,8 @@
 #include "support/JournaledFileSystem.h"
 
-#include "support/ChildProcess.h"
+#include "Support/ChildProcess.h"
+#include "Support/ScratchDirectory.h"
 #include "support/Require.h"
-#include "support/Workshop.h"
 
 #include <fcntl.h>
 #include <linux/loop.h>
@@ -16,6 +16,8 @@
 namespace ost::benchmarks {
 
 using platform::FileDescriptor;
+using test::ChildProcess;
+using test::makeScratchDirectory;
 
 namespace {
 
@@ -51,7 +53,7 @@ LoopDevice attach(int file) {
 
 } // namespace
 
-JournaledFileSystem::JournaledFileSystem() : _path(makeScratchDirectory()) {
+JournaledFileSystem::JournaledFileSystem() : _path(makeScratchDirectory(0711)) {
     const FileDescriptor file(::open(disk, O_TMPFILE | O_RDWR | O_CLOEXEC, 0600));
     require(file && ::ftruncate(file.get(), size) == 0, std::string("make a file in ") + disk);
     const auto loop = attach(file.get());

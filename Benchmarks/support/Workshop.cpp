@@ -6,11 +6,10 @@
 
 #include <sched.h>
 #include <sys/mount.h>
-#include <sys/stat.h>
 #include <unistd.h>
 
 #include <array>
-#include <cstdlib>
+#include <filesystem>
 #include <string>
 
 namespace ost::benchmarks {
@@ -58,13 +57,6 @@ void enterWorkshop(char** arguments) {
     sign(copy);
     ::execv(copy.c_str(), arguments);
     require(false, copy);
-}
-
-std::filesystem::path makeScratchDirectory() {
-    std::string directory = std::string(scratch) + "/XXXXXX";
-    require(::mkdtemp(directory.data()) != nullptr, directory);
-    require(::chmod(directory.c_str(), 0711) == 0, directory);
-    return directory;
 }
 
 } // namespace ost::benchmarks

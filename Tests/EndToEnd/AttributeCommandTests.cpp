@@ -2,7 +2,7 @@
 #include "EndToEnd/DeviceLog.h"
 #include "EndToEnd/Wire.h"
 #include "platform/device/DeviceLockState.h"
-#include "support/BootedDevice.h"
+#include "support/BootedDeviceTest.h"
 
 #include <gtest/gtest.h>
 

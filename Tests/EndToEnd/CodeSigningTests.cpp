@@ -2,11 +2,11 @@
 
 #include "Client/Containers.h"
 #include "EndToEnd/Wire.h"
+#include "Support/ScratchDirectory.h"
 #include "files/OSTDictionaryFile.h"
 #include "platform/codec/PropertyList.h"
-#include "support/BootedDevice.h"
+#include "support/BootedDeviceTest.h"
 #include "support/DeviceTest.h"
-#include "support/ScratchDirectory.h"
 
 #include <gtest/gtest.h>
 

@@ -1,6 +1,6 @@
-#include "support/BootedDevice.h"
+#include "Support/ScratchDirectory.h"
+#include "support/BootedDeviceTest.h"
 #include "support/DeviceTest.h"
-#include "support/ScratchDirectory.h"
 
 #include <gtest/gtest.h>
 
@@ -48,7 +48,7 @@ protected:
 
     const std::filesystem::path scratch = makeScratchDirectory();
     const std::string signedProgram = scratch / "signed", unsignedProgram = scratch / "unsigned";
-    std::optional<BootedDevice> device;
+    std::optional<ScratchDevice> device;
 };
 
 /// What stands behind a word at the beginning of a line.

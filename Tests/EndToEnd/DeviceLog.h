@@ -1,6 +1,6 @@
 #pragma once
 
-#include "support/BootedDevice.h"
+#include "Support/BootedDevice.h"
 
 #include <sys/types.h>
 

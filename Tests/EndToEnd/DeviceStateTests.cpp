@@ -1,7 +1,7 @@
 #include "EndToEnd/DeviceLog.h"
 #include "EndToEnd/StoreView.h"
 #include "EndToEnd/Wire.h"
-#include "support/BootedDevice.h"
+#include "support/BootedDeviceTest.h"
 #include "support/DeviceTest.h"
 
 #include <gtest/gtest.h>

@@ -1,8 +1,8 @@
 #include "EndToEnd/GatedDevice.h"
 
-#include "support/BootedDevice.h"
+#include "Support/BootedDevice.h"
+#include "Support/ScratchDirectory.h"
 #include "support/DeviceTest.h"
-#include "support/ScratchDirectory.h"
 
 #include <gtest/gtest.h>
 

@@ -1,6 +1,6 @@
 #include "EndToEnd/DeviceLog.h"
 #include "EndToEnd/Wire.h"
-#include "support/BootedDevice.h"
+#include "support/BootedDeviceTest.h"
 
 #include <gtest/gtest.h>
 

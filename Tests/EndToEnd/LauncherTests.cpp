@@ -1,6 +1,6 @@
-#include "support/BootedDevice.h"
+#include "Support/ScratchDirectory.h"
+#include "support/BootedDeviceTest.h"
 #include "support/DeviceTest.h"
-#include "support/ScratchDirectory.h"
 
 #include <fcntl.h>
 #include <sched.h>

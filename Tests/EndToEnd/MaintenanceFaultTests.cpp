@@ -2,11 +2,11 @@
 #include "Client/Maintenance.h"
 #include "EndToEnd/GatedDevice.h"
 #include "EndToEnd/StoreView.h"
+#include "Support/ChildProcess.h"
+#include "Support/ScratchDirectory.h"
 #include "platform/codec/PropertyList.h"
-#include "support/ChildProcess.h"
 #include "support/DeviceTest.h"
 #include "support/Sanitized.h"
-#include "support/ScratchDirectory.h"
 
 #include <gtest/gtest.h>
 

@@ -1,10 +1,10 @@
 #include "Client/CodeSigning.h"
 
 #include "EndToEnd/GatedDevice.h"
+#include "Support/ChildProcess.h"
+#include "Support/ScratchDirectory.h"
 #include "files/OSTDictionaryFile.h"
-#include "support/ChildProcess.h"
 #include "support/DeviceTest.h"
-#include "support/ScratchDirectory.h"
 
 #include <gtest/gtest.h>
 

@@ -1,9 +1,9 @@
 #include "Client/Containers.h"
 #include "EndToEnd/GatedDevice.h"
 #include "EndToEnd/StoreView.h"
+#include "Support/ScratchDirectory.h"
 #include "files/OSTFileManager.h"
 #include "support/DeviceTest.h"
-#include "support/ScratchDirectory.h"
 
 #include <gtest/gtest.h>
 

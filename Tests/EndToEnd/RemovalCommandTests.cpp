@@ -1,5 +1,5 @@
 #include "EndToEnd/Wire.h"
-#include "support/BootedDevice.h"
+#include "support/BootedDeviceTest.h"
 
 #include <gtest/gtest.h>
 

@@ -2,7 +2,7 @@
 #include "EndToEnd/Wire.h"
 #include "model/OSTMetadata.h"
 #include "service/OSTCommandTable.h"
-#include "support/BootedDevice.h"
+#include "support/BootedDeviceTest.h"
 #include "support/DeviceTest.h"
 
 #include <gtest/gtest.h>

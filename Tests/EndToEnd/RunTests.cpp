@@ -1,8 +1,8 @@
 #include "Client/Confinement.h"
+#include "Support/ScratchDirectory.h"
 #include "platform/device/Applications.h"
-#include "support/BootedDevice.h"
+#include "support/BootedDeviceTest.h"
 #include "support/DeviceTest.h"
-#include "support/ScratchDirectory.h"
 
 #include <gtest/gtest.h>
 
@@ -88,7 +88,7 @@ protected:
     [[nodiscard]] fs::path records() const { return device->onHost(ost::platform::applicationsDirectory); }
 
     const fs::path scratch = makeScratchDirectory(0755);
-    std::optional<BootedDevice> device;
+    std::optional<ScratchDevice> device;
 };
 
 TEST_F(RunTest, AProgramHasItsContainersAndNothingOfTheCallers) {

@@ -1,4 +1,4 @@
-#include "support/BootedDevice.h"
+#include "support/BootedDeviceTest.h"
 #include "support/DeviceTest.h"
 
 #include <gtest/gtest.h>

@@ -1,10 +1,10 @@
 #include "EndToEnd/Wire.h"
 
+#include "Support/BootedDevice.h"
+#include "Support/ScratchDirectory.h"
 #include "platform/codec/IPCValue.h"
 #include "platform/device/CodeSignature.h"
 #include "platform/ipc/IPCFrame.h"
-#include "support/BootedDevice.h"
-#include "support/ScratchDirectory.h"
 
 #include <sys/socket.h>
 #include <sys/time.h>

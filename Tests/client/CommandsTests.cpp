@@ -1,7 +1,7 @@
 #include "Client/ctl/Commands.h"
 #include "platform/device/CodeSignature.h"
 
-#include "support/ScratchDirectory.h"
+#include "Support/ScratchDirectory.h"
 
 #include <gtest/gtest.h>
 

@@ -1,6 +1,6 @@
 #include "Client/Connection.h"
 
-#include "support/ScratchDirectory.h"
+#include "Support/ScratchDirectory.h"
 
 #include <gtest/gtest.h>
 

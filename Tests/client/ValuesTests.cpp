@@ -1,8 +1,8 @@
 #include "Client/ctl/Values.h"
 #include "platform/codec/PropertyList.h"
 
+#include "Support/ScratchDirectory.h"
 #include "support/DeviceTest.h"
-#include "support/ScratchDirectory.h"
 
 #include <gtest/gtest.h>
 

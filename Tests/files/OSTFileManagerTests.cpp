@@ -1,10 +1,10 @@
 #include "files/OSTFileManager.h"
 
+#include "Support/ScratchDirectory.h"
 #include "platform/base/Log.h"
 #include "platform/base/Path.h"
 #include "platform/device/ProtectionClass.h"
 #include "support/DeviceTest.h"
-#include "support/ScratchDirectory.h"
 
 #include <gtest/gtest.h>
 

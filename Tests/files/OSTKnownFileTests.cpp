@@ -1,7 +1,7 @@
 #include "files/OSTKnownFile.h"
 
+#include "Support/ScratchDirectory.h"
 #include "support/DeviceTest.h"
-#include "support/ScratchDirectory.h"
 
 #include <gtest/gtest.h>
 

@@ -2,7 +2,7 @@
 #include "platform/ipc/IPCListener.h"
 #include "platform/threads/BlockingSection.h"
 
-#include "support/ScratchDirectory.h"
+#include "Support/ScratchDirectory.h"
 
 #include <gtest/gtest.h>
 

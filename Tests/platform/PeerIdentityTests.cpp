@@ -1,6 +1,6 @@
 #include "platform/ipc/PeerIdentity.h"
 
-#include "support/ScratchDirectory.h"
+#include "Support/ScratchDirectory.h"
 
 #include <gtest/gtest.h>
 

@@ -1,8 +1,8 @@
 #include "support/DeviceTest.h"
 
 #include "Device/DeviceImage.h"
+#include "Support/ScratchDirectory.h"
 #include "support/Sanitized.h"
-#include "support/ScratchDirectory.h"
 
 #include <sys/stat.h>
 #include <unistd.h>

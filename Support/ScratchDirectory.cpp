@@ -1,4 +1,4 @@
-#include "support/ScratchDirectory.h"
+#include "Support/ScratchDirectory.h"
 
 #include <fcntl.h>
 #include <linux/magic.h>
@@ -23,7 +23,7 @@ void require(bool succeeded, const char* what) {
         throw std::system_error(errno, std::generic_category(), what);
 }
 
-/// Memory, unless it is too small for the tests or programs may not be executed there, as in some containers.
+/// Memory, unless it is too small or programs may not be executed there, as in some containers.
 std::string scratchPlace() {
     constexpr std::uint64_t wanted = 512ULL << 20;
     struct statvfs memory{};
@@ -43,21 +43,21 @@ std::string scratchPlace() {
     const int nowhere = ::open("/dev/null", O_RDWR | O_CLOEXEC);
     for (const int standard : {STDIN_FILENO, STDOUT_FILENO, STDERR_FILENO})
         ::dup2(nowhere, standard);
-    // A reader that waits for the end of another pipe of the test would wait for this process.
+    // A reader that waits for the end of another pipe of this program would wait for this process.
     constexpr int first = STDERR_FILENO + 1;
     lifeline = ::dup2(lifeline, first);
     ::close_range(first + 1, ~0U, 0);
     char nothing = 0;
     while (::read(lifeline, &nothing, 1) < 0 && errno == EINTR)
         continue;
-    ::execlp("rm", "rm", "-rf", "--", directory.c_str(), nullptr);
+    ::execlp("rm", "rm", "-rf", "--one-file-system", "--", directory.c_str(), nullptr);
     ::_exit(127);
 }
 
 } // namespace
 
 std::filesystem::path makeScratchDirectory(unsigned mode) {
-    std::string directory = scratchPlace() + "/ostrand-test-XXXXXX";
+    std::string directory = scratchPlace() + "/ostrand-XXXXXX";
     require(::mkdtemp(directory.data()) != nullptr, directory.c_str());
 
     int lifeline[2]; // The writing end stays open until this process ends.

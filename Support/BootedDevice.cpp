@@ -1,10 +1,7 @@
-#include "support/BootedDevice.h"
+#include "Support/BootedDevice.h"
 
+#include "platform/base/OSTValue.h"
 #include "platform/device/CodeSignature.h"
-#include "support/DeviceTest.h"
-#include "support/ScratchDirectory.h"
-
-#include <gtest/gtest.h>
 
 #include <poll.h>
 #include <sched.h>
@@ -13,8 +10,11 @@
 
 #include <charconv>
 #include <chrono>
+#include <cstdio>
 #include <fstream>
+#include <iterator>
 #include <stdexcept>
+#include <utility>
 
 namespace ost::test {
 
@@ -23,6 +23,9 @@ using platform::FileDescriptor;
 namespace {
 
 constexpr std::chrono::seconds patience{30};
+
+constexpr const char* complaintsSuffix = ".complaints";
+constexpr const char* clientSuffix = ".bin/ostrandctl";
 
 pid_t parentOf(pid_t process) {
     std::ifstream status("/proc/" + std::to_string(process) + "/status");
@@ -73,8 +76,8 @@ Daemon awaitDaemonOf(pid_t launcher) {
 
 std::string builtProgram(const char* name) { return std::string(OSTRAND_BIN_DIR "/") + name; }
 
-BootedDevice::BootedDevice()
-    : _scratch(makeScratchDirectory(0755)), _image(_scratch / "device"), _client(_makeSignedClient()) {
+BootedDevice::BootedDevice(std::filesystem::path image, FaultReport report)
+    : _image(std::move(image)), _report(std::move(report)) {
     _boot();
 }
 
@@ -86,21 +89,23 @@ std::filesystem::path BootedDevice::onHost(const std::filesystem::path& devicePa
     return _image / devicePath.relative_path();
 }
 
+std::filesystem::path BootedDevice::_beside(const char* suffix) const { return _image.string() + suffix; }
+
 void BootedDevice::_boot() {
     // The command says that the device serves, and keeps it up for as long as its standard input is open.
     _launcher.emplace(std::vector<std::string>{builtProgram("ostrand-device"), "boot", "--image", _image, "--", "sh",
                                                "-c", "echo serving; exec cat"},
-                      _scratch / "complaints");
+                      _beside(complaintsSuffix));
     if (_launcher->readLine() != "serving")
         throw std::runtime_error("The device does not boot: " + complaints());
 }
 
-std::filesystem::path BootedDevice::_makeSignedClient() const {
-    const auto place = _scratch / "bin"; // for root only: whoever may execute the program has its rights
+void BootedDevice::_makeSignedClient() const {
+    const auto client = _beside(clientSuffix);
+    const auto place = client.parent_path(); // for root only: who may execute the program has its rights
     std::filesystem::create_directory(place);
     std::filesystem::permissions(place, std::filesystem::perms::owner_all);
-    auto client = place / "ostrandctl";
-    std::filesystem::copy_file(builtProgram("ostrandctl"), client);
+    std::filesystem::copy_file(builtProgram("ostrandctl"), client, std::filesystem::copy_options::overwrite_existing);
     OSTDictionary entitlements;
     entitlements.set("com.tamarok.private.Ostrand.allowed", true);
     OSTDictionary signature;
@@ -109,13 +114,13 @@ std::filesystem::path BootedDevice::_makeSignedClient() const {
     const auto program = platform::openProgram(client);
     if (!program || !platform::writeCodeSignature(program->get(), signature))
         throw std::runtime_error("A copy of the client cannot be signed");
-    return client;
 }
 
 BootedDevice::Outcome BootedDevice::ostrandctl(std::vector<std::string> arguments) {
-    arguments.insert(arguments.begin(), _client);
+    std::call_once(_clientMade, [this] { _makeSignedClient(); });
+    arguments.insert(arguments.begin(), _beside(clientSuffix));
     arguments.insert(arguments.end(), {"--device", _image});
-    ChildProcess client(std::move(arguments), _scratch / "client-complaints");
+    ChildProcess client(std::move(arguments), _beside(".client-complaints"));
     std::string output = client.readAll();
     return {client.wait(), std::move(output)};
 }
@@ -138,19 +143,23 @@ void BootedDevice::shutDown() {
     if (!_launcher)
         return;
     _launcher->closeInput();
-    EXPECT_EQ(_launcher->wait(), 0);
+    const int status = _launcher->wait();
     _launcher.reset();
+    if (status != 0)
+        _report("The launcher ended with " + std::to_string(status));
     const std::string text = complaints();
     for (const char* fault : {"Assertion failed", "Sanitizer:", "runtime error:"})
-        EXPECT_EQ(text.find(fault), std::string::npos) << text;
+        if (text.contains(fault))
+            _report(text);
 }
 
-void BootedDeviceTest::SetUp() {
-    if (::geteuid() != 0)
-        GTEST_SKIP() << "A device can be booted by root only";
-    _device.emplace();
+std::string BootedDevice::complaints() const {
+    std::ifstream file;
+    file.exceptions(std::ios::failbit | std::ios::badbit);
+    file.open(_beside(complaintsSuffix));
+    return {std::istreambuf_iterator<char>(file), std::istreambuf_iterator<char>()};
 }
 
-std::string BootedDevice::complaints() const { return readFile(_scratch / "complaints"); }
+void BootedDevice::printFault(const std::string& fault) { std::fprintf(stderr, "%s\n", fault.c_str()); }
 
 } // namespace ost::test

@@ -1,21 +1,29 @@
 #pragma once
 
-#include "support/ChildProcess.h"
+#include "Support/ChildProcess.h"
 
-#include <gtest/gtest.h>
+#include <sys/types.h>
 
+#include <csignal>
 #include <filesystem>
+#include <functional>
+#include <mutex>
 #include <optional>
 #include <string>
+#include <vector>
 
 namespace ost::test {
 
-/// A scratch device that is up: the programs of this build, in processes of their own. The device is shut down in order
-/// when the object goes, or when the test process dies. Requires root.
+/// A device that is up: the programs of this build, in processes of their own. The device is shut down in order when
+/// the object goes, or when this process dies. Its image stays, and may be booted again. Requires root.
 class BootedDevice {
 public:
-    /// Returns when the daemon serves. Throws when it does not.
-    BootedDevice();
+    /// Is told what went wrong in the device, after it was shut down. Must not throw.
+    using FaultReport = std::function<void(const std::string& fault)>;
+
+    /// Boots the image at `image`, which is made when it is missing; what else the object needs goes into files beside
+    /// it. Returns when the daemon serves. Throws when it does not.
+    explicit BootedDevice(std::filesystem::path image, FaultReport report = printFault);
     BootedDevice(const BootedDevice&) = delete;
     BootedDevice& operator=(const BootedDevice&) = delete;
     /// Shuts down; see there.
@@ -46,35 +54,28 @@ public:
     /// Ends the daemon in order and boots the same image again.
     void reboot();
 
-    /// Ends the daemon in order. The test fails when the launcher does, or when a daemon of this device reported a
+    /// Ends the daemon in order. It is a fault when the launcher fails, or when a daemon of this device reported a
     /// broken invariant or a sanitizer's finding.
     void shutDown();
 
     /// What launcher and daemons wrote to standard error so far.
     [[nodiscard]] std::string complaints() const;
 
+    /// Prints a fault to standard error.
+    static void printFault(const std::string& fault);
+
 private:
     void _boot();
-    [[nodiscard]] std::filesystem::path _makeSignedClient() const;
+    void _makeSignedClient() const;
+    [[nodiscard]] std::filesystem::path _beside(const char* suffix) const;
 
-    std::filesystem::path _scratch;
     std::filesystem::path _image;
-    std::filesystem::path _client;
+    FaultReport _report;
+    std::once_flag _clientMade;
     std::optional<ChildProcess> _launcher;
 };
 
-/// A test with a device that is up. Skipped without root.
-class BootedDeviceTest : public testing::Test {
-protected:
-    void SetUp() override;
-
-    [[nodiscard]] BootedDevice& device() { return *_device; }
-
-private:
-    std::optional<BootedDevice> _device;
-};
-
 /// The program of this build with that name.
-std::string builtProgram(const char* name);
+[[nodiscard]] std::string builtProgram(const char* name);
 
 } // namespace ost::test
