@@ -74,8 +74,9 @@ void clearInfoValues(const std::vector<Holder>& holders, const char* key,
     try {
         while (helpers.size() + 1 < std::min(writesSideBySide, holders.size()))
             helpers.emplace_back(clearRemaining);
-    } catch (const std::exception&) {
+    } catch (const std::exception& exception) {
         // With as many as there are; this thread is enough.
+        logNotice("No further thread clears migrated info values: %s", exception.what());
     }
     clearRemaining();
 }
