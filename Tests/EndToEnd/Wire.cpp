@@ -232,13 +232,9 @@ Reply Connection::call(std::string_view request) {
 }
 
 Client::Client(std::filesystem::path socket, const Identity& identity)
-    : _program(makeScratchDirectory(0755) / "wire-client") {
-    std::filesystem::copy_file(builtProgram("wire-client"), _program);
-    require(::chown(_program.c_str(), identity.programOwner, identity.programOwner) == 0 &&
-                ::chmod(_program.c_str(), identity.programMode) == 0,
-            "prepare the program");
-    sign(identity);
-
+    : _program(identity.program.empty() ? makeScratchDirectory(0755) / "wire-client" : identity.program) {
+    if (identity.program.empty())
+        _makeProgram(identity);
     int ends[2];
     require(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends) == 0, "socketpair");
     _control.reset(ends[0]);
@@ -252,6 +248,14 @@ Client::Client(std::filesystem::path socket, const Identity& identity)
             ::execl(_program.c_str(), _program.c_str(), socket.c_str(), nullptr);
         ::_exit(127);
     }
+}
+
+void Client::_makeProgram(const Identity& identity) const {
+    std::filesystem::copy_file(builtProgram("wire-client"), _program);
+    require(::chown(_program.c_str(), identity.programOwner, identity.programOwner) == 0 &&
+                ::chmod(_program.c_str(), identity.programMode) == 0,
+            "prepare the program");
+    sign(identity);
 }
 
 Client::~Client() {

@@ -108,6 +108,8 @@ struct Identity {
     uid_t user = 0;
     mode_t programMode = 0755;
     uid_t programOwner = 0;
+    /// One that is there already and is used as it is, instead of a signed copy.
+    std::filesystem::path program = {};
 };
 
 /// A process of its own that runs a program of its own, signed as the identity says. Ends with the object.
@@ -127,6 +129,8 @@ public:
     [[nodiscard]] pid_t id() const { return _id; }
 
 private:
+    void _makeProgram(const Identity& identity) const;
+
     std::filesystem::path _program;
     platform::FileDescriptor _control;
     pid_t _id = 0;

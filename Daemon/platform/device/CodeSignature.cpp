@@ -2,6 +2,7 @@
 
 #include "Protocol/OSTKeys.h"
 #include "platform/codec/PropertyList.h"
+#include "platform/device/ExtendedAttributes.h"
 
 #include <fcntl.h>
 #include <linux/magic.h>
@@ -43,13 +44,14 @@ std::expected<RawCodeSignature, Errno> readCodeSignature(int fd, const struct st
     if (!isTrustworthy(status))
         return signature;
     const auto ordinary = std::min(ordinarySignature, buffer.size());
-    auto size = ::fgetxattr(fd, codeSignatureAttribute, buffer.data(), ordinary);
-    if (size < 0 && errno == ERANGE)
-        size = ::fgetxattr(fd, codeSignatureAttribute, buffer.data(), buffer.size());
-    if (size < 0 && errno != ENODATA && errno != ENOTSUP)
-        return std::unexpected(errno);
-    if (size > 0)
-        signature.bytes = {buffer.data(), static_cast<std::size_t>(size)};
+    const auto space = std::as_writable_bytes(buffer);
+    auto size = getAttribute(fd, codeSignatureAttribute, space.first(ordinary));
+    if (!size && size.error() == ERANGE)
+        size = getAttribute(fd, codeSignatureAttribute, space);
+    if (!size && size.error() != ENODATA && size.error() != ENOTSUP)
+        return std::unexpected(size.error());
+    if (size)
+        signature.bytes = {buffer.data(), *size};
     return signature;
 }
 

@@ -36,8 +36,8 @@ struct RawCodeSignature {
     dev_t device;           ///< the file system it was read from
 };
 
-/// Reads the signature of the open program `fd` into `buffer`. It does not count unless the file is a regular one of
-/// root that nobody else may write. Fails with the errno of reading it.
+/// Reads the signature of the program `fd`, which may be opened with O_PATH, into `buffer`. It does not count unless
+/// the file is a regular one of root that nobody else may write. Fails with the errno of reading it.
 [[nodiscard]] std::expected<RawCodeSignature, Errno> readCodeSignature(int fd, std::span<char> buffer);
 /// The same for a caller that has just asked for the file's status.
 [[nodiscard]] std::expected<RawCodeSignature, Errno> readCodeSignature(int fd, const struct stat& status,

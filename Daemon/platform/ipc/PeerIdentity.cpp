@@ -1,10 +1,13 @@
 #include "platform/ipc/PeerIdentity.h"
 
 #include "platform/base/Try.h"
+#include "platform/device/MountTable.h"
+#include "platform/threads/BlockingSection.h"
 
 #include <fcntl.h>
 #include <sys/socket.h>
 #include <sys/syscall.h>
+#include <sys/sysmacros.h>
 #include <unistd.h>
 
 #include <array>
@@ -55,6 +58,46 @@ std::expected<FileDescriptor, Errno> openProcess(int socket, pid_t processId) {
     return process;
 }
 
+/// What the kernel knows of a file without asking the server of its file system.
+struct Look {
+    struct stat status{};
+    std::uint64_t mount = 0;
+};
+
+std::expected<Look, Errno> lookWithoutAsking(int directory, const char* name, int flags) {
+    struct statx known{};
+    if (::statx(directory, name, flags | AT_STATX_DONT_SYNC | AT_NO_AUTOMOUNT, STATX_BASIC_STATS | STATX_MNT_ID,
+                &known) != 0)
+        return std::unexpected(errno);
+    Look look{.mount = known.stx_mnt_id};
+    look.status.st_dev = ::makedev(known.stx_dev_major, known.stx_dev_minor);
+    look.status.st_ino = known.stx_ino;
+    look.status.st_mode = known.stx_mode;
+    look.status.st_uid = known.stx_uid;
+    look.status.st_ctim = {.tv_sec = known.stx_ctime.tv_sec, .tv_nsec = known.stx_ctime.tv_nsec};
+    return look;
+}
+
+/// One that is mounted by a user is served by a process of that user, which need never answer; so it is told by the
+/// mount tables and not asked. The peer's own name what it sees, unless it has left its root or the mount is no longer
+/// in the tree; ours and the first process's may still know the device.
+std::expected<bool, Errno> isOnFileSystemOfUser(int process, const Look& look) {
+    // What has a disk of its own was mounted by an administrator.
+    if (major(look.status.st_dev) != 0)
+        return false;
+    auto mount = findMount(process, look.mount, look.status.st_dev);
+    for (const char* other : {"/proc/self", "/proc/1"}) {
+        if (mount || mount.error() != ENOENT)
+            break;
+        const FileDescriptor directory(::open(other, O_PATH | O_DIRECTORY | O_CLOEXEC));
+        if (directory)
+            mount = findMount(directory.get(), look.mount, look.status.st_dev);
+    }
+    if (!mount)
+        return std::unexpected(mount.error());
+    return mount->forbidsSetUserId && (mount->fileSystem == "fuse" || mount->fileSystem.starts_with("fuse."));
+}
+
 } // namespace
 
 std::expected<PeerIdentity, Errno> PeerIdentity::ofSocket(int socket) {
@@ -71,44 +114,67 @@ std::expected<PeerIdentity, Errno> PeerIdentity::ofSocket(int socket) {
 std::expected<const CodeSigningIdentity*, Errno> PeerIdentity::codeSigningIdentity() {
     timespec now{}; // of before the status is read; by the clock that dates changes
     ::clock_gettime(CLOCK_REALTIME_COARSE, &now);
-    const auto status = OST_TRY(_holdProgram());
+    auto status = OST_TRY(_holdProgram());
     if (_changeWouldShow && haveSameChangeTime(status, _programStatus))
         return &_identity;
     _changeWouldShow = false;
-    OST_TRY(_readSignature(status));
+    OST_TRY(_askForIdentity(status));
     _programStatus = status;
     _changeWouldShow = _fileSystem.showsChanges && status.st_ctim.tv_sec + secondsUntilAChangeShows < now.tv_sec;
     return &_identity;
+}
+
+/// A file system that is not known to be a local one may let us wait for its server, for as long as that likes.
+std::expected<void, Errno> PeerIdentity::_askForIdentity(struct stat& status) {
+    if (_fileSystem.showsChanges)
+        return _readSignature(status);
+    if (!_fileSystem.ofUser) {
+        const BlockingSection blocking;
+        if (::fstat(_program.get(), &status) != 0)
+            return std::unexpected(errno);
+        _fileSystem = signatureFileSystem(_program.get());
+        if (!_fileSystem.ofUser)
+            return _readSignature(status);
+    }
+    _identity = {};
+    _raw.clear();
+    return {};
 }
 
 std::expected<void, Errno> PeerIdentity::_readSignature(const struct stat& status) {
     std::array<char, maximumCodeSignature> buffer;
     const auto signature = OST_TRY(readCodeSignature(_program.get(), status, buffer));
     if (signature.bytes != _raw || signature.device != _device) {
-        _identity = _fileSystem.ofUser ? CodeSigningIdentity{} : parseCodeSignature(signature.bytes);
+        _identity = parseCodeSignature(signature.bytes);
         _raw = signature.bytes;
         _device = signature.device;
     }
     return {};
 }
 
-/// Holds the program that the process runs now, and gives its status. Opening it at every request would cost more than
-/// the rest of this file; a file that is held open keeps its number, so looking at that tells whether it is still the
-/// one.
+/// Holds the program that the process runs now, and gives what the kernel knows of its status. Holding another one
+/// costs more than the rest of this file; a file that is held keeps its number, so looking at that tells whether it is
+/// still the one. It is not opened for reading, because opening and closing may ask its server.
 std::expected<struct stat, Errno> PeerIdentity::_holdProgram() {
     if (!_process)
         return std::unexpected(ESRCH);
-    struct stat status{};
-    if (::fstatat(_process.get(), "exe", &status, 0) != 0)
-        return std::unexpected(errno);
-    if (_program && status.st_dev == _programStatus.st_dev && status.st_ino == _programStatus.st_ino)
-        return status;
+    auto look = OST_TRY(lookWithoutAsking(_process.get(), "exe", 0));
+    if (_program && look.status.st_dev == _programStatus.st_dev && look.status.st_ino == _programStatus.st_ino)
+        return look.status;
     _changeWouldShow = false;
-    _program.reset(::openat(_process.get(), "exe", O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY));
-    if (!_program || ::fstat(_program.get(), &_programStatus) != 0)
+    _program.reset(::openat(_process.get(), "exe", O_PATH | O_CLOEXEC));
+    if (!_program)
         return std::unexpected(errno);
-    _fileSystem = signatureFileSystem(_program.get());
-    return _programStatus;
+    // The process may run a third one by now; what is held counts.
+    auto held = lookWithoutAsking(_program.get(), "", AT_EMPTY_PATH);
+    const auto ofUser = held ? isOnFileSystemOfUser(_process.get(), *held) : std::unexpected(held.error());
+    if (!ofUser) {
+        _program.reset();
+        return std::unexpected(ofUser.error());
+    }
+    _fileSystem = {.ofUser = *ofUser, .showsChanges = false};
+    _programStatus = held->status;
+    return held->status;
 }
 
 } // namespace ost::platform

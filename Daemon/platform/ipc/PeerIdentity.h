@@ -32,8 +32,10 @@ public:
 
     /// What the program that the peer runs now is signed as. Asks at every call which program that is and whether it
     /// has changed, because a process may execute another one, and one may be signed anew. As long as the signature
-    /// stays the same, so do the objects in the identity. Valid until the next call. Fails with an errno when the
-    /// program cannot be determined: ESRCH when the process has ended.
+    /// stays the same, so do the objects in the identity. Valid until the next call. A program on a file system that a
+    /// user serves is unsigned, and that server is never asked; a server of an administrator's may keep this thread in
+    /// a `BlockingSection`. Fails with an errno when the program cannot be determined: ESRCH when the process has
+    /// ended.
     [[nodiscard]] std::expected<const CodeSigningIdentity*, Errno> codeSigningIdentity();
 
     /// Gives the descriptors back; no program can be determined any more.
@@ -47,12 +49,13 @@ private:
         : _processId(processId), _effectiveUserId(effectiveUserId), _process(std::move(process)) {}
 
     [[nodiscard]] std::expected<struct stat, Errno> _holdProgram();
+    [[nodiscard]] std::expected<void, Errno> _askForIdentity(struct stat& status);
     [[nodiscard]] std::expected<void, Errno> _readSignature(const struct stat& status);
 
     pid_t _processId;
     uid_t _effectiveUserId;
     FileDescriptor _process; ///< the process's directory in /proc; empty when it had ended
-    FileDescriptor _program; ///< the program that was last asked for, open
+    FileDescriptor _program; ///< the program that was last asked for, held with O_PATH
     SignatureFileSystem _fileSystem;
     struct stat _programStatus{};
     bool _changeWouldShow = false; ///< whether a signature other than the one last read comes with another status

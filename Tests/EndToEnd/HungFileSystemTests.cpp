@@ -1,0 +1,77 @@
+#include "EndToEnd/DeviceLog.h"
+#include "EndToEnd/Wire.h"
+#include "support/BootedDeviceTest.h"
+#include "support/ServedFileSystem.h"
+
+#include <gtest/gtest.h>
+
+#include <unistd.h>
+
+#include <optional>
+#include <vector>
+
+namespace ost::test::wire {
+
+namespace {
+
+/// More than the daemon has threads for at first.
+constexpr std::size_t connectionsOfTheHung = 16;
+
+class HungFileSystemTest : public BootedDeviceTest {
+protected:
+    void SetUp() override {
+        BootedDeviceTest::SetUp();
+        if (!IsSkipped() && ::access("/dev/fuse", R_OK | W_OK) != 0)
+            GTEST_SKIP() << "this host has no FUSE";
+    }
+
+    /// Connections of a client whose program lies there.
+    std::vector<Connection> connect(const ServedFileSystem& fileSystem) {
+        _client.emplace(device().socket(), Identity{.user = 501, .program = fileSystem.program()});
+        std::vector<Connection> connections;
+        for (std::size_t i = 0; i < connectionsOfTheHung; ++i)
+            connections.push_back(_client->connect());
+        return connections;
+    }
+
+    void expectServiceOfOthers() {
+        const Client other(device().socket(), allowed());
+        EXPECT_EQ(other.connect().call(creation(1, "com.example.other")).error(), 1U);
+    }
+
+private:
+    std::optional<Client> _client;
+};
+
+} // namespace
+
+TEST_F(HungFileSystemTest, TheServerOfAUsersFileSystemIsNotAsked) {
+    for (const bool inTheTree : {true, false}) {
+        ServedFileSystem fileSystem(builtProgram("wire-client"), true);
+        auto connections = connect(fileSystem);
+        fileSystem.stopAnswering();
+        if (!inTheTree)
+            fileSystem.detach();
+        for (auto& connection : connections)
+            connection.send(creation(1, "com.example.hung"));
+        expectServiceOfOthers();
+        for (auto& connection : connections)
+            EXPECT_TRUE(connection.isClosed()) << "in the tree: " << inTheTree;
+    }
+}
+
+TEST_F(HungFileSystemTest, AnAdministratorsThatHangsKeepsItsOwnClientsWaiting) {
+    std::vector<Connection> connections;
+    {
+        ServedFileSystem fileSystem(builtProgram("wire-client"), false);
+        connections = connect(fileSystem);
+        fileSystem.stopAnswering();
+        for (auto& connection : connections)
+            connection.send(creation(1, "com.example.hung"));
+        expectServiceOfOthers();
+    }
+    for (auto& connection : connections)
+        EXPECT_TRUE(connection.isClosed());
+}
+
+} // namespace ost::test::wire
