@@ -119,12 +119,17 @@ void OSTContainerMigrator::_cleanUpOldUserLocations() {
             logError("Failed to get items for deletion: %@ : %@", *logs, items.error());
         return;
     }
+    bool allMoved = true;
     for (const auto& item : *items) {
         const auto log = pathByAppending(*logs, item.name);
-        if (const auto moved = moveLog(log); !moved)
+        const auto moved = moveLog(log);
+        allMoved = allMoved && moved;
+        if (!moved)
             logError("Failed to move to new logging directory from %@ : %@", log, moved.error());
     }
     logNotice("Migrated log files on %@", OSTCurrentBuildVersion());
+    if (!allMoved)
+        return; // What stayed behind is moved at the next boot.
     if (const auto removed = files.removeItemAtURL(*logs); !removed)
         logError("Failed to remove old Log directory: %@", removed.error());
 }

@@ -30,7 +30,6 @@ protected:
         GatedDeviceTest::SetUp();
         if (IsSkipped())
             return;
-        ASSERT_TRUE(device().waitForFirstPass());
         auto connection = device().connect();
         const auto made = ostrand::createOrLookup(
             connection, {.containerClass = ostrand::ContainerClass::dataApplication, .user = 501, .identifier = "a"},

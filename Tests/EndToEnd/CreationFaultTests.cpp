@@ -28,13 +28,6 @@ void PrintTo(const Kind& kind, std::ostream* out) { *out << kind.name; }
 /// A daemon whose file-system calls fail or kill it while it makes a container.
 class CreationFaultTest : public GatedDeviceTest, public testing::WithParamInterface<Kind> {
 protected:
-    void SetUp() override {
-        GatedDeviceTest::SetUp();
-        if (IsSkipped())
-            return;
-        ASSERT_TRUE(device().waitForFirstPass());
-    }
-
     static ostrand::Result<ostrand::Container> create(Connection& connection, const std::string& identifier) {
         return ostrand::createOrLookup(connection,
                                        {.containerClass = GetParam().containerClass,

@@ -151,6 +151,7 @@ void GatedDeviceTest::SetUp() {
         GTEST_SKIP() << "A device can be run by root only";
     _device.emplace();
     _device->startDaemon();
+    ASSERT_TRUE(_device->waitForFirstPass());
 }
 
 } // namespace ost::test

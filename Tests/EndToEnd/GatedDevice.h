@@ -58,7 +58,7 @@ private:
     std::optional<GatedProcess> _daemon;
 };
 
-/// A test with such a device, whose daemon has been started.
+/// A test with such a device, whose daemon has done what a start has to do.
 class GatedDeviceTest : public testing::Test {
 protected:
     void SetUp() override;

@@ -40,7 +40,6 @@ class WipeFaultTest : public GatedDeviceTest {
 protected:
     /// Has the fault befall one call after the other of a wipe, until it comes to none.
     void wipeAtEveryCall(Fault::Kind kind) {
-        ASSERT_TRUE(device().waitForFirstPass());
         std::set<bool> wiped;
         for (unsigned call = 1; !HasFailure(); ++call) {
             auto connection = device().connect();
@@ -88,7 +87,6 @@ protected:
         GatedDeviceTest::SetUp();
         if (IsSkipped())
             return;
-        ASSERT_TRUE(device().waitForFirstPass());
         ASSERT_NO_FATAL_FAILURE(_makeContainers());
         device().killDaemon();
         fs::create_directories(_onHost("mobile/Containers"));
