@@ -103,6 +103,10 @@ Result<void> destroyDeathRow(Connection& connection) {
     return withoutAnswer(connection.call(Request(OSTCommand::destroyDeathRow)));
 }
 
+Result<std::uint32_t> beginDestroyingDeathRow(Connection& connection) {
+    return connection.send(Request(OSTCommand::destroyDeathRow));
+}
+
 Result<void> replace(Connection& connection, const std::optional<ContainerReference>& oldContainer,
                      const ContainerReference& newContainer) {
     Request request(OSTCommand::replace);

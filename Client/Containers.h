@@ -70,6 +70,8 @@ enum class WhenMissing : bool { fail, create };
 /// Destroys what is staged for deletion, and returns when that is done. Fails with 17 when something could not be
 /// destroyed, or with the errno of what had to be parked under /tmp.
 [[nodiscard]] Result<void> destroyDeathRow(Connection& connection);
+/// Only sends it; the reply to the number, which has nothing but its code, is to be received.
+[[nodiscard]] Result<std::uint32_t> beginDestroyingDeathRow(Connection& connection);
 
 /// Puts the new container in the place of the old one, which is staged for deletion; without an old one, makes a
 /// transient container a lasting one. The two must differ in being transient, since the new one keeps its directory's

@@ -46,6 +46,10 @@ Result<void> migrate(Connection& connection) {
     return carriedOut(connection, Request(OSTCommand::performDataMigration));
 }
 
+Result<std::uint32_t> beginMigration(Connection& connection) {
+    return connection.send(Request(OSTCommand::performDataMigration));
+}
+
 Result<void> retryTest(Connection& connection, std::uint64_t user, std::uint64_t crashes) {
     Request request(OSTCommand::retryTest);
     request.key(requestKey::container.userId).unsignedNumber(user);

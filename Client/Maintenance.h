@@ -16,6 +16,8 @@ namespace ostrand {
 
 /// Changes what older releases left behind, and returns when that is done. Takes an entitlement of its own.
 [[nodiscard]] Result<void> migrate(Connection& connection);
+/// Only sends it; the reply to the number, which has nothing but its code, is to be received.
+[[nodiscard]] Result<std::uint32_t> beginMigration(Connection& connection);
 
 /// Lets the daemon of an internal build end, so that a client can test what it does then; fails with a lost connection
 /// each time it does, `crashes` times in all. Other builds do nothing.

@@ -1,6 +1,9 @@
 #include "Client/ctl/Arguments.h"
 
+#include "Client/ctl/Suggestion.h"
+
 #include <algorithm>
+#include <array>
 
 namespace ostrand::ctl {
 
@@ -97,7 +100,10 @@ std::string helpOf(const CommandTable& table, const Command& command) {
     Columns operands;
     for (const auto& operand : command.operands)
         operands.add(std::string(operand.name), operand.help);
-    return text + operands.text("arguments") + optionsText(command.options, table.options);
+    text += operands.text("arguments") + optionsText(command.options, table.options);
+    if (!command.json.empty())
+        text.append("\nwith --json:\n  ").append(command.json).append("\n");
+    return text;
 }
 
 std::string usageOfGroup(const CommandTable& table, std::string_view group) {
@@ -111,7 +117,7 @@ std::string helpOfGroup(const CommandTable& table, std::string_view group) {
             commands.add(std::string(command.name), command.summary);
     return usageOfGroup(table, group) + "\n\n" + std::string(table.summary) + "\n" + commands.text("commands") +
            optionsText({}, table.options) + "\n\"" + std::string(table.program) +
-           " COMMAND --help\" says more about a command.\n";
+           " COMMAND --help\" says more about a command.\n" + std::string(table.exitStatus);
 }
 
 /// Goes through the words once; knows the command as soon as its last word was seen.
@@ -146,7 +152,8 @@ private:
         const auto equals = word.find('=');
         const auto* const option = word.starts_with("--") ? _optionNamed(word.substr(2, equals - 2)) : nullptr;
         if (!option)
-            return "unknown option " + escaped(word.substr(0, equals));
+            return "unknown option " + escaped(word.substr(0, equals)) +
+                   didYouMean(word.substr(0, equals), _optionSpellings());
         const auto name = "--" + std::string(option->name);
         if (option->count != Option::Count::repeated && _arguments.has(option->name))
             return name + " is given twice";
@@ -180,8 +187,33 @@ private:
         else if (std::ranges::any_of(_table.commands, [&](const auto& each) { return isBelow(each, name); }))
             _group = name;
         else
-            return "unknown command \"" + escaped(name) + "\"";
+            return "unknown command \"" + escaped(name) + "\"" + didYouMean(name, _commandSpellings());
         return {};
+    }
+
+    /// What may stand where a command's name is read, groups included.
+    std::vector<std::string> _commandSpellings() const {
+        std::vector<std::string> spellings;
+        for (const auto& command : _table.commands)
+            if (isBelow(command, _group)) {
+                const auto end = command.name.find(' ', _group.empty() ? 0 : _group.size() + 1);
+                spellings.emplace_back(command.name.substr(0, end));
+            }
+        std::ranges::sort(spellings);
+        spellings.erase(std::ranges::unique(spellings).begin(), spellings.end());
+        return spellings;
+    }
+
+    std::vector<std::string> _optionSpellings() const {
+        std::vector<std::string> spellings{"--help"};
+        for (const auto options : _optionsNow())
+            for (const auto& option : options)
+                spellings.push_back("--" + std::string(option.name));
+        return spellings;
+    }
+
+    std::array<std::span<const Option>, 2> _optionsNow() const {
+        return {_command ? std::span(_command->options) : std::span<const Option>{}, _table.options};
     }
 
     std::string _whatIsMissing() const {
@@ -197,8 +229,7 @@ private:
     }
 
     const Option* _optionNamed(std::string_view name) const {
-        for (const auto options :
-             {std::span(_table.options), _command ? std::span(_command->options) : std::span<const Option>{}})
+        for (const auto options : _optionsNow())
             if (const auto found = std::ranges::find(options, name, &Option::name); found != options.end())
                 return &*found;
         return nullptr;

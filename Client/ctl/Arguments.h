@@ -54,13 +54,17 @@ struct Command {
     std::vector<Option> options;
     std::string_view details; ///< further lines of its help
     Outcome (*run)(const Arguments& arguments);
+    /// The form of what it prints with --json: a JSON text with the names of types in the place of values, "?" behind
+    /// the keys that may be missing and "*" for any key.
+    std::string_view json = {};
 };
 
 /// The table as a whole.
 struct CommandTable {
     std::string_view program;
     std::string_view summary;
-    std::vector<Option> options; ///< options of every command, accepted before and after its name
+    std::vector<Option> options;      ///< options of every command, accepted before and after its name
+    std::string_view exitStatus = {}; ///< the paragraph of the help that explains it
     std::vector<Command> commands;
 };
 

@@ -14,7 +14,7 @@ constexpr Operand identifierOperand{"ID", "the code-signing identifier"};
 constexpr Option infoOption{"info", "PLIST", "a property list with the information; - is standard input",
                             Option::Count::required};
 constexpr Option optionsOption{"options", "PLIST", "a property list with all options, instead of those below"};
-constexpr Option classOption{"class", "N", "the class of its data container: a number or a name"};
+constexpr Option classOption{"class", "C", "the class of its data container: a number or a name"};
 constexpr Option parentOption{"parent", "ID", "the identifier whose plug-in it is"};
 constexpr Option placeholderOption{"placeholder", "", "the application is still being installed"};
 constexpr Option byCallerOption{"by-caller", "", "it comes from no signed bundle, and stays valid without one"};
@@ -82,7 +82,8 @@ Outcome show(const Arguments& arguments) {
 Outcome invalidate(const Arguments& arguments) {
     auto connection = OST_TRY(connectToDevice(arguments));
     OST_TRY(orFailure(invalidateCodeSigningWithoutBundle(connection)));
-    return Report{.text = "what has lost its bundle is invalid now\n", .json = {}};
+    return Report{.text = "what has lost its bundle is invalid now\n",
+                  .json = ost::OSTDictionary({{"invalidated", ost::OSTValue(true)}})};
 }
 
 std::expected<std::uint64_t, Failure> userOf(const Arguments& arguments) {
@@ -100,11 +101,13 @@ Outcome groupPaths(const Arguments& arguments) {
     const auto paths = OST_TRY(orFailure(system ? systemGroupContainerPaths(connection, identifier)
                                                 : groupContainerPaths(connection, user, identifier)));
     Report report;
+    Table table;
     ost::OSTDictionary json;
     for (const auto& [group, path] : paths) {
-        report.text += escaped(group) + "  " + escaped(path) + "\n";
+        table.add({escaped(group), escaped(path)});
         json.set(group, path);
     }
+    report.text = table.text();
     report.json.set("paths", std::move(json));
     return report;
 }
@@ -151,28 +154,50 @@ std::vector<Command> codeSigningCommands() {
          {identifierOperand},
          {infoOption, optionsOption, classOption, parentOption, placeholderOption, byCallerOption},
          aboutRegistering,
-         registerInfo},
-        {"codesign show", "shows what is registered and counts", {identifierOperand}, {}, aboutShowing, show},
-        {"codesign remove", "removes what is registered", {identifierOperand}, {}, "", remove},
-        {"codesign invalidate", "invalidates what has lost its bundle container", {}, {}, "", invalidate},
+         registerInfo,
+         R"({"registered": "string"})"},
+        {"codesign show",
+         "shows what is registered and counts",
+         {identifierOperand},
+         {},
+         aboutShowing,
+         show,
+         R"({"*": "any"})"},
+        {"codesign remove",
+         "removes what is registered",
+         {identifierOperand},
+         {},
+         "",
+         remove,
+         R"({"removed": "string"})"},
+        {"codesign invalidate",
+         "invalidates what has lost its bundle container",
+         {},
+         {},
+         "",
+         invalidate,
+         R"({"invalidated": "boolean"})"},
         {"groups paths",
          "finds or makes the group containers of an identifier",
          {},
          {userOption, ofIdentifierOption, systemOption},
          "",
-         groupPaths},
+         groupPaths,
+         R"({"paths": {"*": "string"}})"},
         {"groups ids",
          "lists the application groups of an identifier",
          {},
          {userOption, ofIdentifierOption},
          "",
-         groupIds},
+         groupIds,
+         R"({"groups": ["string"]})"},
         {"system path",
          "finds or makes the system container of an identifier",
          {},
          {ofIdentifierOption, groupOption},
          "",
-         systemPath},
+         systemPath,
+         R"({"path": "string"})"},
     };
 }
 

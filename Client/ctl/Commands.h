@@ -18,6 +18,7 @@ namespace ostrand::ctl {
 [[nodiscard]] std::vector<Command> signingCommands();
 [[nodiscard]] std::vector<Command> deviceCommands();
 [[nodiscard]] std::vector<Command> runCommands();
+[[nodiscard]] std::vector<Command> watchCommands();
 
 /// The whole table, and what is common to all commands.
 [[nodiscard]] const CommandTable& commandTable();
@@ -26,7 +27,8 @@ namespace ostrand::ctl {
 [[nodiscard]] std::string deviceDirectory(const Arguments& arguments);
 
 /// Connects to the device's daemon.
-[[nodiscard]] std::expected<Connection, Failure> connectToDevice(const Arguments& arguments);
+[[nodiscard]] std::expected<Connection, Failure> connectToDevice(const Arguments& arguments,
+                                                                 Connection::Timeout timeout = {});
 
 /// The result of a request as a command hands it on.
 template<typename T>

@@ -1,12 +1,27 @@
 #include "Client/ctl/ContainerArguments.h"
 
 #include "Client/ctl/Commands.h"
+#include "Client/ctl/Suggestion.h"
 #include "Client/ctl/Values.h"
+#include "Protocol/OSTErrorCode.h"
 #include "platform/base/Try.h"
 
 #include <algorithm>
 
 namespace ostrand::ctl {
+
+namespace {
+
+Failure noContainer(const std::string& identifier, const std::vector<ListedContainer>& listed) {
+    std::vector<std::string> names;
+    for (const auto& container : listed)
+        names.push_back(container.identifier);
+    auto failure = Failure::of(Error::failed(static_cast<std::uint64_t>(ost::OSTErrorCode::notFound)));
+    failure.message += ": " + escaped(identifier) + didYouMean(identifier, names);
+    return failure;
+}
+
+} // namespace
 
 std::expected<ContainerClass, Failure> classOf(const Arguments& arguments) {
     return classNamed(*arguments.value(classOption.name));
@@ -19,16 +34,12 @@ std::expected<std::uint64_t, Failure> userOf(const Arguments& arguments, Contain
 
 std::expected<std::vector<ContainerReference>, Failure>
 listedContainers(Connection& connection, const ContainerRequest& about, const std::vector<std::string>& identifiers) {
-    constexpr std::uint64_t noSuchContainer = 21;
     const auto listed = OST_TRY(orFailure(ostrand::list(connection, about)));
     std::vector<ContainerReference> containers;
     for (const auto& identifier : identifiers) {
         const auto found = std::ranges::find(listed, identifier, &ListedContainer::identifier);
-        if (found == listed.end()) {
-            auto failure = Failure::of(Error::failed(noSuchContainer));
-            failure.message += ": " + escaped(identifier);
-            return std::unexpected(std::move(failure));
-        }
+        if (found == listed.end())
+            return std::unexpected(noContainer(identifier, listed));
         containers.push_back({about.containerClass, about.user, identifier, found->uuid});
     }
     return containers;

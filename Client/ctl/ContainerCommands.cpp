@@ -1,12 +1,18 @@
+#include "Client/Attributes.h"
 #include "Client/Containers.h"
+#include "Client/Maintenance.h"
 #include "Client/ctl/Commands.h"
 #include "Client/ctl/ContainerArguments.h"
+#include "Client/ctl/DeathRow.h"
+#include "Client/ctl/Terminal.h"
 #include "Client/ctl/Values.h"
+#include "Client/ctl/Waiting.h"
 #include "platform/base/Try.h"
 
 #include <algorithm>
 #include <chrono>
 #include <cstdio>
+#include <cstdlib>
 
 namespace ostrand::ctl {
 
@@ -15,6 +21,7 @@ namespace {
 constexpr Option identifierOption{"identifier", "ID", "the container's identifier; without it, the program's own"};
 constexpr Operand identifierOperand{"ID", "another way to give the identifier", Operand::Count::optional};
 constexpr Operand identifierOperands{"ID", "the containers' identifiers", Operand::Count::several};
+constexpr Option dryRunOption{"dry-run", "", "say what would go, how much it is, and leave it as it is"};
 constexpr Option oldOption{"old", "ID", "the container that goes; without it, the new one is moved to a free place"};
 constexpr Option newOption{"new", "ID", "the container that takes its place", Option::Count::required};
 constexpr Option newTransientOption{"new-transient", "", "the new container is a transient one"};
@@ -72,11 +79,36 @@ Outcome list(const Arguments& arguments) {
     return report;
 }
 
+/// What a deletion would take, as it is now.
+Outcome wouldDelete(Connection& connection, const std::vector<ContainerReference>& containers) {
+    Report report;
+    Table table;
+    ost::OSTArray rows;
+    std::uint64_t total = 0;
+    for (const auto& container : containers) {
+        const auto bytes = OST_TRY(orFailure(diskUsage(connection, container)));
+        const auto path = OST_TRY(orFailure(metadata(connection, container))).path;
+        total += bytes;
+        table.add({sizeText(bytes), container.uuid.string(), escaped(container.identifier), escaped(path)});
+        auto row = jsonOf(container.identifier, container.uuid.string());
+        row.set("path", path);
+        row.set("bytes", bytes);
+        rows.emplace_back(std::move(row));
+    }
+    report.text =
+        table.text() + sizeText(total) + "  in " + countOf(containers.size(), "container") + " would be deleted\n";
+    report.json.set("wouldDelete", std::move(rows));
+    report.json.set("bytes", total);
+    return report;
+}
+
 Outcome deleteOne(const Arguments& arguments) {
     const auto request = OST_TRY(containerRequestOf(arguments));
     if (!request.identifier)
         return std::unexpected(Failure::usage("no identifier given"));
     auto connection = OST_TRY(connectToDevice(arguments));
+    if (arguments.has(dryRunOption.name))
+        return wouldDelete(connection, OST_TRY(listedContainers(connection, request, {*request.identifier})));
     if (request.transient) {
         const auto container = OST_TRY(listedContainers(connection, request, {*request.identifier}));
         OST_TRY(orFailure(stageForDeletion(connection, container)));
@@ -96,6 +128,8 @@ Outcome stage(const Arguments& arguments) {
     const auto containers =
         OST_TRY(listedContainers(connection, {containerClass, user, {}, arguments.has(transientOption.name)},
                                  arguments.values(identifierOperands.name)));
+    if (arguments.has(dryRunOption.name))
+        return wouldDelete(connection, containers);
     OST_TRY(orFailure(stageForDeletion(connection, containers)));
     Report report;
     ost::OSTArray staged;
@@ -108,18 +142,46 @@ Outcome stage(const Arguments& arguments) {
     return report;
 }
 
+Outcome wouldDestroy(const std::string& device) {
+    const auto items = deathRowOf(device);
+    if (!items)
+        return std::unexpected(Failure::system("cannot look at death row", items.error()));
+    Report report;
+    Table table;
+    ost::OSTArray rows;
+    std::uint64_t total = 0;
+    for (const auto& [name, identifier, files, bytes, measured] : *items) {
+        total += bytes;
+        table.add({sizeText(bytes), countOf(files, "file") + (measured ? "" : " at least"), escaped(name),
+                   escaped(identifier)});
+        rows.emplace_back(ost::OSTDictionary(
+            {{"name", name}, {"identifier", identifier}, {"files", files}, {"bytes", bytes}, {"measured", measured}}));
+    }
+    report.text = table.text() + sizeText(total) + "  in " + countOf(items->size(), "item") + " would be destroyed\n";
+    report.json.set("wouldDestroy", std::move(rows));
+    report.json.set("bytes", total);
+    return report;
+}
+
 Outcome purge(const Arguments& arguments) {
-    auto connection = OST_TRY(connectToDevice(arguments));
+    const auto device = deviceDirectory(arguments);
+    if (arguments.has(dryRunOption.name))
+        return wouldDestroy(device);
+    auto connection = OST_TRY(connectToDevice(arguments, betweenReports));
     if (!arguments.has("json"))
         std::fputs("waiting until everything on death row is destroyed\n", stderr);
     const auto begin = std::chrono::steady_clock::now();
-    OST_TRY(orFailure(destroyDeathRow(connection)));
-    const std::chrono::duration<double> passed = std::chrono::steady_clock::now() - begin;
-    char seconds[32];
-    std::snprintf(seconds, sizeof seconds, "%.3f", passed.count());
+    {
+        const ProgressLine progress(!arguments.has("json"));
+        OST_TRY(waitForReply(connection, beginDestroyingDeathRow(connection), [&] {
+            if (progress.isShown())
+                progress.show(countOf(deathRowLength(device), "item") + " left");
+        }));
+    }
+    const auto seconds = secondsSince(begin);
     Report report;
-    report.text = std::string("death row is empty after ") + seconds + " s\n";
-    report.json.set("seconds", passed.count());
+    report.text = "death row is empty after " + seconds + " s\n";
+    report.json.set("seconds", std::strtod(seconds.c_str(), nullptr));
     return report;
 }
 
@@ -172,28 +234,50 @@ std::vector<Command> containerCommands() {
          {identifierOperand},
          ofOneContainer,
          classesAndUsers,
-         create},
-        {"lookup", "finds a container", {identifierOperand}, ofOneContainer, classesAndUsers, lookup},
+         create,
+         R"({"identifier": "string", "uuid": "string", "path": "string", "existed": "boolean"})"},
+        {"lookup",
+         "finds a container",
+         {identifierOperand},
+         ofOneContainer,
+         classesAndUsers,
+         lookup,
+         R"({"identifier": "string", "uuid": "string", "path": "string", "existed": "boolean"})"},
         {"list",
          "lists the containers of a user and class",
          {},
          {classOption, userOption, transientOption},
          classesAndUsers,
-         list},
-        {"delete", "stages a container for deletion", {identifierOperand}, ofOneContainer, classesAndUsers, deleteOne},
+         list,
+         R"({"containers": [{"identifier": "string", "uuid": "string"}]})"},
+        {"delete",
+         "stages a container for deletion",
+         {identifierOperand},
+         {classOption, userOption, identifierOption, transientOption, dryRunOption},
+         classesAndUsers,
+         deleteOne,
+         R"({"deleted?": "string", "wouldDelete?": [{"identifier": "string", "uuid": "string", "path": "string", "bytes": "number"}], "bytes?": "number"})"},
         {"stage",
          "stages containers for deletion, all of them or none when one is not there",
          {identifierOperands},
-         {classOption, userOption, transientOption},
+         {classOption, userOption, transientOption, dryRunOption},
          classesAndUsers,
-         stage},
-        {"purge", "destroys everything that is staged for deletion, and waits for it", {}, {}, "", purge},
+         stage,
+         R"({"staged?": [{"identifier": "string", "uuid": "string"}], "wouldDelete?": [{"identifier": "string", "uuid": "string", "path": "string", "bytes": "number"}], "bytes?": "number"})"},
+        {"purge",
+         "destroys everything that is staged for deletion, and waits for it",
+         {},
+         {dryRunOption},
+         "",
+         purge,
+         R"({"seconds?": "number", "wouldDestroy?": [{"name": "string", "identifier": "string", "files": "number", "bytes": "number", "measured": "boolean"}], "bytes?": "number"})"},
         {"replace",
          "puts a container in the place of another one",
          {},
          {classOption, userOption, oldOption, newOption, newTransientOption, oldUUIDOption, newUUIDOption},
          classesAndUsers,
-         replace},
+         replace,
+         R"({"old?": {"identifier": "string", "uuid": "string"}, "new": {"identifier": "string", "uuid": "string"}})"},
     };
 }
 

@@ -33,9 +33,27 @@ Outcome state(const Arguments& arguments) {
 
 std::vector<Command> deviceCommands() {
     return {
-        {"device lock", "puts the device into the locked state", {}, {}, "", lock},
-        {"device unlock", "ends the locked state; the daemon then does what had to wait for it", {}, {}, "", unlock},
-        {"device state", "prints whether the device is locked", {}, {}, "", state},
+        {"device lock",
+         "puts the device into the locked state",
+         {},
+         {},
+         "",
+         lock,
+         R"({"state": "string", "number": "number"})"},
+        {"device unlock",
+         "ends the locked state; the daemon then does what had to wait for it",
+         {},
+         {},
+         "",
+         unlock,
+         R"({"state": "string", "number": "number"})"},
+        {"device state",
+         "prints whether the device is locked",
+         {},
+         {},
+         "",
+         state,
+         R"({"state": "string", "number": "number"})"},
     };
 }
 

@@ -2,15 +2,14 @@
 #include "Client/StoreCheck.h"
 #include "Client/ctl/Commands.h"
 #include "Client/ctl/ContainerArguments.h"
+#include "Client/ctl/Terminal.h"
 #include "Client/ctl/Values.h"
+#include "Client/ctl/Waiting.h"
 #include "platform/base/Try.h"
 
 #include <unistd.h>
 
 #include <algorithm>
-#include <array>
-#include <charconv>
-#include <cstdio>
 #include <tuple>
 
 namespace ostrand::ctl {
@@ -33,21 +32,6 @@ struct Usage {
     std::uint64_t bytes;
 };
 
-/// "17.2 MiB"; a size is right-aligned in a column of its own.
-std::string sizeText(std::uint64_t bytes, bool exact) {
-    constexpr std::array units{"B", "KiB", "MiB", "GiB", "TiB", "PiB", "EiB"};
-    auto size = static_cast<double>(bytes);
-    std::size_t unit = 0;
-    for (; !exact && size >= 1024 && unit + 1 < units.size(); ++unit)
-        size /= 1024;
-    char text[48];
-    if (unit == 0)
-        std::snprintf(text, sizeof text, exact ? "%14llu" : "%6llu B  ", static_cast<unsigned long long>(bytes));
-    else
-        std::snprintf(text, sizeof text, "%6.1f %s", size, units[unit]);
-    return text;
-}
-
 std::vector<ContainerClass> classesOf(std::uint64_t user) {
     std::vector<ContainerClass> classes;
     for (std::uint64_t number = 1; ost::isValidContainerClass(static_cast<ContainerClass>(number)); ++number) {
@@ -59,25 +43,6 @@ std::vector<ContainerClass> classesOf(std::uint64_t user) {
     }
     return classes;
 }
-
-/// Tells a person who looks on how far a measurement is.
-class Progress {
-public:
-    explicit Progress(bool wanted) : _shown(wanted && ::isatty(STDERR_FILENO) != 0) {}
-    Progress(const Progress&) = delete;
-    Progress& operator=(const Progress&) = delete;
-    ~Progress() {
-        if (_shown)
-            std::fputs("\r\033[K", stderr);
-    }
-    void report(std::size_t done, std::size_t all) const {
-        if (_shown)
-            std::fprintf(stderr, "\r%zu of %zu containers measured", done, all);
-    }
-
-private:
-    bool _shown;
-};
 
 std::expected<std::vector<ContainerReference>, Failure> containersToMeasure(const Arguments& arguments,
                                                                             Connection& connection) {
@@ -105,10 +70,11 @@ std::expected<std::vector<ContainerReference>, Failure> containersToMeasure(cons
 std::expected<std::vector<Usage>, Failure>
 measure(Connection& connection, const std::vector<ContainerReference>& containers, bool showProgress) {
     std::vector<Usage> usages;
-    const Progress progress(showProgress);
+    const ProgressLine progress(showProgress);
     for (const auto& container : containers) {
         usages.push_back({container, OST_TRY(orFailure(diskUsage(connection, container)))});
-        progress.report(usages.size(), containers.size());
+        progress.show(std::to_string(usages.size()) + " of " + std::to_string(containers.size()) +
+                      " containers measured");
     }
     std::ranges::sort(usages, [](const Usage& one, const Usage& other) {
         return std::tie(other.bytes, one.container.identifier) < std::tie(one.bytes, other.container.identifier);
@@ -122,18 +88,20 @@ Outcome usage(const Arguments& arguments) {
     const auto usages = OST_TRY(measure(connection, containers, !arguments.has("json")));
     const bool exact = arguments.has(bytesOption.name);
     Report report;
+    Table table;
     ost::OSTArray rows;
     std::uint64_t total = 0;
     for (const auto& [container, bytes] : usages) {
         total += bytes;
-        const std::string className(pathComponentForContainerClass(container.containerClass));
-        report.text += sizeText(bytes, exact) + "  " + className + "  " + escaped(container.identifier) + "\n";
+        table.add({sizeText(bytes, exact), std::string(pathComponentForContainerClass(container.containerClass)),
+                   escaped(container.identifier)});
         rows.emplace_back(ost::OSTDictionary({{"identifier", container.identifier},
                                               {"uuid", container.uuid.string()},
                                               {"class", static_cast<std::uint64_t>(container.containerClass)},
                                               {"bytes", bytes}}));
     }
-    report.text += sizeText(total, exact) + "  in all\n";
+    table.add({sizeText(total, exact), "in all"});
+    report.text = table.text();
     report.json.set("containers", std::move(rows));
     report.json.set("bytes", total);
     return report;
@@ -152,8 +120,12 @@ Outcome wipeOne(const Arguments& arguments) {
 }
 
 Outcome migrateAll(const Arguments& arguments) {
-    auto connection = OST_TRY(connectToDevice(arguments));
-    OST_TRY(orFailure(migrate(connection)));
+    auto connection = OST_TRY(connectToDevice(arguments, betweenReports));
+    const auto begin = std::chrono::steady_clock::now();
+    const ProgressLine progress(!arguments.has("json"));
+    OST_TRY(waitForReply(connection, beginMigration(connection), [&] {
+        progress.show("migrating for " + secondsSince(begin) + " s; ostrandctl watch shows what is done");
+    }));
     Report report;
     report.text = "migrated; the daemon's log says what was done\n";
     report.json.set("migrated", ost::OSTValue(true));
@@ -162,13 +134,12 @@ Outcome migrateAll(const Arguments& arguments) {
 
 Outcome runRetryTest(const Arguments& arguments) {
     const auto text = *arguments.value(crashesOperand.name);
-    std::uint64_t crashes = 0;
-    const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), crashes);
-    if (error != std::errc{} || end != text.data() + text.size())
+    const auto crashes = numberIn(text);
+    if (!crashes)
         return std::unexpected(Failure::usage("\"" + escaped(text) + "\" is no number"));
     const auto user = OST_TRY(userOf(arguments, ContainerClass::dataApplication));
     auto connection = OST_TRY(connectToDevice(arguments));
-    OST_TRY(orFailure(retryTest(connection, user, crashes)));
+    OST_TRY(orFailure(retryTest(connection, user, *crashes)));
     Report report;
     report.text = "the test is over\n";
     report.json.set("done", "retry-test");
@@ -185,8 +156,8 @@ Outcome check(const Arguments& arguments) {
     Report report;
     ost::OSTArray findings;
     for (const auto& [path, what, meaning, repair] : found.findings) {
-        report.text +=
-            escaped(path) + "\n" + lineOf("found", what) + lineOf("means", meaning) + lineOf("repair", repair);
+        report.text += styled(escaped(path), Style::strong, STDOUT_FILENO) + "\n" + lineOf("found", what) +
+                       lineOf("means", meaning) + lineOf("repair", repair);
         findings.emplace_back(
             ost::OSTDictionary({{"path", path}, {"found", what}, {"means", meaning}, {"repair", repair}}));
     }
@@ -213,26 +184,36 @@ std::vector<Command> maintenanceCommands() {
          {identifierOperand},
          {classOption, userOption},
          classesAndUsers,
-         wipeOne},
+         wipeOne,
+         R"({"wiped": "string"})"},
         {"usage",
          "shows what containers take on disk, the largest first",
          {identifierOperands},
          {anyClassOption, userOption, bytesOption},
          "The size of a bundle is measured once and kept. Without --user, it is the current user's containers.",
-         usage},
+         usage,
+         R"({"containers": [{"identifier": "string", "uuid": "string", "class": "number", "bytes": "number"}], "bytes": "number"})"},
         {"check",
          "looks at the store, which it leaves as it is, and says what does not agree",
          {},
          {},
          "Exit status: 0 nothing was found, 1 something was, 2 not everything could be looked at.",
-         check},
-        {"migrate", "changes what older releases left behind, and waits for it", {}, {}, "", migrateAll},
+         check,
+         R"({"containers": "number", "findings": [{"path": "string", "found": "string", "means": "string", "repair": "string"}], "unreadable": ["string"], "waiting": ["string"]})"},
+        {"migrate",
+         "changes what older releases left behind, and waits for it",
+         {},
+         {},
+         "",
+         migrateAll,
+         R"({"migrated": "boolean"})"},
         {"retry-test",
          "ends the daemon of an internal build COUNT times, once for each call, for tests of clients",
          {crashesOperand},
          {userOption},
          "",
-         runRetryTest},
+         runRetryTest,
+         R"({"done": "string"})"},
     };
 }
 

@@ -1,11 +1,15 @@
 #include "Client/ctl/Output.h"
 
+#include "Client/ctl/Hints.h"
 #include "platform/base/MessageFormat.h"
 #include "platform/base/Text.h"
 #include "platform/base/Unicode.h"
 
+#include <algorithm>
+#include <array>
 #include <charconv>
 #include <cmath>
+#include <cstdio>
 #include <cstdlib>
 #include <cstring>
 
@@ -129,15 +133,24 @@ std::string_view nameOf(Error::Kind kind) {
     return "transport";
 }
 
-Failure makeFailure(int exitStatus, std::string_view kind, std::uint64_t code, std::string message) {
+Failure makeFailure(int exitStatus, std::string_view kind, std::uint64_t code, std::string message,
+                    std::string hint = {}) {
     ost::OSTDictionary details;
     details.set("kind", std::string(kind));
     if (code != 0)
         details.set("code", code);
     details.set("message", message);
+    if (!hint.empty())
+        details.set("hint", hint);
     ost::OSTDictionary json;
     json.set("error", std::move(details));
-    return {exitStatus, std::move(message), std::move(json)};
+    return {exitStatus, std::move(message), std::move(json), std::move(hint)};
+}
+
+/// How many columns of a terminal a text takes, where each character takes one.
+std::size_t widthOf(std::string_view text) {
+    return static_cast<std::size_t>(
+        std::ranges::count_if(text, [](char byte) { return (static_cast<unsigned char>(byte) & 0xc0U) != 0x80; }));
 }
 
 } // namespace
@@ -145,7 +158,7 @@ Failure makeFailure(int exitStatus, std::string_view kind, std::uint64_t code, s
 Failure Failure::usage(std::string message) { return makeFailure(usageStatus, "usage", 0, std::move(message)); }
 
 Failure Failure::of(const Error& error) {
-    return makeFailure(EXIT_FAILURE, nameOf(error.kind), error.code, error.description());
+    return makeFailure(EXIT_FAILURE, nameOf(error.kind), error.code, error.description(), std::string(hintFor(error)));
 }
 
 Failure Failure::local(std::string message) { return makeFailure(EXIT_FAILURE, "local", 0, std::move(message)); }
@@ -159,6 +172,40 @@ std::string escaped(std::string_view text) {
     std::string out;
     ost::platform::appendEscaped(out, text);
     return out;
+}
+
+std::string Table::text() const {
+    std::vector<std::size_t> widths;
+    for (const auto& row : _rows) {
+        widths.resize(std::max(widths.size(), row.size()));
+        for (std::size_t i = 0; i < row.size(); ++i)
+            widths[i] = std::max(widths[i], widthOf(row[i]));
+    }
+    std::string out;
+    for (const auto& row : _rows) {
+        for (std::size_t i = 0; i < row.size(); ++i)
+            out.append(row[i]).append(i + 1 < row.size() ? widths[i] + 2 - widthOf(row[i]) : 0, ' ');
+        out += '\n';
+    }
+    return out;
+}
+
+std::string sizeText(std::uint64_t bytes, bool exact) {
+    constexpr std::array units{"B", "KiB", "MiB", "GiB", "TiB", "PiB", "EiB"};
+    auto size = static_cast<double>(bytes);
+    std::size_t unit = 0;
+    for (; !exact && size >= 1024 && unit + 1 < units.size(); ++unit)
+        size /= 1024;
+    char text[48];
+    if (unit == 0)
+        std::snprintf(text, sizeof text, exact ? "%14llu" : "%6llu B  ", static_cast<unsigned long long>(bytes));
+    else
+        std::snprintf(text, sizeof text, "%6.1f %s", size, units.at(unit));
+    return text;
+}
+
+std::string countOf(std::uint64_t count, std::string_view thing) {
+    return std::to_string(count).append(" ").append(thing).append(count == 1 ? "" : "s");
 }
 
 std::string jsonText(const ost::OSTValue& value) {

@@ -6,6 +6,7 @@
 #include <expected>
 #include <string>
 #include <string_view>
+#include <vector>
 
 namespace ostrand::ctl {
 
@@ -31,13 +32,31 @@ struct Failure {
 
     int exitStatus;
     std::string message;     ///< already escaped
-    ost::OSTDictionary json; ///< {"error": {"kind": ..., "code": ..., "message": ...}}
+    ost::OSTDictionary json; ///< {"error": {"kind": ..., "code": ..., "message": ..., "hint": ...}}
+    std::string hint = {};   ///< what can be done about it; may be empty
 };
 
 using Outcome = std::expected<Report, Failure>;
 
 /// Text for a terminal: control characters and bytes that are no UTF-8 are written as escapes.
 [[nodiscard]] std::string escaped(std::string_view text);
+
+/// Rows of cells in columns that align, two blanks apart, for people. The cells must be escaped already.
+class Table {
+public:
+    void add(std::vector<std::string> row) { _rows.push_back(std::move(row)); }
+    /// One line for each row, without blanks at its end.
+    [[nodiscard]] std::string text() const;
+
+private:
+    std::vector<std::vector<std::string>> _rows;
+};
+
+/// "17.2 MiB"; `exact`: the bytes as a plain number. Texts of either kind are of one width, so that their digits align.
+[[nodiscard]] std::string sizeText(std::uint64_t bytes, bool exact = false);
+
+/// "1 file", "2 files".
+[[nodiscard]] std::string countOf(std::uint64_t count, std::string_view thing);
 
 /// A value as JSON on one line. Strings come out as valid UTF-8 whatever they hold (a byte that is none becomes
 /// U+FFFD), data as a string of hexadecimal digits, dates as seconds since 1970, a real that JSON cannot express as

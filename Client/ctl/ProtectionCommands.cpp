@@ -1,18 +1,16 @@
 #include "Client/Attributes.h"
 #include "Client/ctl/Commands.h"
 #include "Client/ctl/ContainerArguments.h"
+#include "Client/ctl/Terminal.h"
 #include "Client/ctl/Values.h"
+#include "Client/ctl/Waiting.h"
 #include "platform/base/Try.h"
 #include "platform/device/DeviceLockState.h"
 #include "platform/device/ProtectionClass.h"
 
 #include <fcntl.h>
-#include <unistd.h>
 
-#include <array>
-#include <cerrno>
 #include <charconv>
-#include <chrono>
 #include <cstdio>
 #include <filesystem>
 
@@ -33,9 +31,6 @@ constexpr Option outsideOption{"outside-developer", "", "the application is not 
 constexpr std::string_view aboutProtection =
     "Classes of protection: 0 none, 1 to 3 only with the keys of an unlocked device, 4 always readable; 2 cannot be\n"
     "asked for. A container that was never given one counts as 3. Without --user, the container is the current user's.";
-
-/// How long it is waited for the reply before somebody who looks on is told how far things are.
-constexpr std::chrono::milliseconds betweenReports{500};
 
 std::expected<DataProtection, Failure> changeOf(const Arguments& arguments) {
     DataProtection change{.identifier = *arguments.value(identifierOperand.name),
@@ -64,22 +59,14 @@ public:
     /// `container` is the container's directory as this process sees it, empty when it cannot be told.
     Progress(std::string device, std::string container, std::int64_t protectionClass)
         : _device(std::move(device)), _container(std::move(container)), _class(protectionClass) {}
-    Progress(const Progress&) = delete;
-    Progress& operator=(const Progress&) = delete;
-    ~Progress() {
-        if (_lineIsOpen)
-            std::fputs("\n", stderr);
-    }
 
     void report() {
         if (!_toldOfLock && ost::platform::deviceLockState(_device) == ost::platform::deviceLocked) {
             std::fputs("the device is locked: waiting for an unlock\n", stderr);
             _toldOfLock = true;
         }
-        if (::isatty(STDERR_FILENO) == 0)
-            return;
-        std::fprintf(stderr, "\r%llu items have the class", static_cast<unsigned long long>(_itemsDone()));
-        _lineIsOpen = true;
+        if (_line.isShown())
+            _line.show(std::to_string(_itemsDone()) + " items have the class");
     }
 
 private:
@@ -106,7 +93,7 @@ private:
     std::string _device, _container;
     std::int64_t _class;
     bool _toldOfLock = false;
-    bool _lineIsOpen = false;
+    ProgressLine _line{true};
 };
 
 /// Whether the class was recorded, as it is whenever the change succeeded. An item that may not be changed is errno 1,
@@ -118,27 +105,17 @@ std::expected<bool, Failure> isRecorded(Connection& connection, const DataProtec
     return (value ? value->unsignedValue() : neverSet) == static_cast<std::uint64_t>(change.protectionClass);
 }
 
-std::expected<void, Failure> waitForEnd(Connection& connection, std::uint32_t number, Progress* progress) {
-    for (;;) {
-        const auto reply = connection.receive(number);
-        if (reply)
-            return {};
-        if (reply.error() != Error::transport(ETIMEDOUT))
-            return std::unexpected(Failure::of(reply.error()));
-        if (progress)
-            progress->report();
-    }
-}
-
 Outcome protect(const Arguments& arguments) {
     const auto change = OST_TRY(changeOf(arguments));
     const auto device = deviceDirectory(arguments);
     auto others = OST_TRY(connectToDevice(arguments));
     const auto container = createOrLookup(others, containerOf(change), WhenMissing::fail);
     Progress progress(device, container ? device + container->path : "", change.protectionClass);
-    auto connection = OST_TRY(orFailure(Connection::open(device, betweenReports)));
-    const auto number = OST_TRY(orFailure(beginSettingDataProtection(connection, change)));
-    OST_TRY(waitForEnd(connection, number, arguments.has("json") ? nullptr : &progress));
+    auto connection = OST_TRY(connectToDevice(arguments, betweenReports));
+    OST_TRY(waitForReply(connection, beginSettingDataProtection(connection, change), [&] {
+        if (!arguments.has("json"))
+            progress.report();
+    }));
     if (!OST_TRY(isRecorded(others, change)))
         return std::unexpected(Failure::local("the change ended at an item that may not be changed; the daemon's log "
                                               "names it"));
@@ -158,7 +135,8 @@ std::vector<Command> protectionCommands() {
          {identifierOperand},
          {protectionOption, containerClassOption, userOption, retryOption, outsideOption},
          aboutProtection,
-         protect},
+         protect,
+         R"({"identifier": "string", "protectionClass": "number"})"},
     };
 }
 

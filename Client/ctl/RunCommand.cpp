@@ -361,19 +361,21 @@ Outcome run(const Arguments& arguments) {
 } // namespace
 
 std::vector<Command> runCommands() {
-    return {{"run",
-             "runs a program in its containers, which are made when they are missing",
-             {programOperand, argumentOperand},
-             {identifierOption, userOption, pluginOption, printOption, unconfinedOption},
-             "The program's signature says who it is and which groups it has. It runs in its data container, with the\n"
-             "rights of its user but without reach into anything but its containers and what programs need of the\n"
-             "system. HOME and TMPDIR lie in its data container; OSTRAND_DATA_CONTAINER, OSTRAND_GROUP_CONTAINERS,\n"
-             "OSTRAND_SYSTEM_CONTAINER and OSTRAND_SYSTEM_GROUP_CONTAINERS say where everything is, groups as a line\n"
-             "ID=PATH each. Of the caller's environment, PATH, TERM, TZ, LANG and LC_* are kept.\n"
-             "\n"
-             "The exit status is the program's, 128 and the number of the signal that ended it, or 1 when it was not\n"
-             "run.",
-             run}};
+    return {
+        {"run",
+         "runs a program in its containers, which are made when they are missing",
+         {programOperand, argumentOperand},
+         {identifierOption, userOption, pluginOption, printOption, unconfinedOption},
+         "The program's signature says who it is and which groups it has. It runs in its data container, with the\n"
+         "rights of its user but without reach into anything but its containers and what programs need of the\n"
+         "system. HOME and TMPDIR lie in its data container; OSTRAND_DATA_CONTAINER, OSTRAND_GROUP_CONTAINERS,\n"
+         "OSTRAND_SYSTEM_CONTAINER and OSTRAND_SYSTEM_GROUP_CONTAINERS say where everything is, groups as a line\n"
+         "ID=PATH each. Of the caller's environment, PATH, TERM, TZ, LANG and LC_* are kept.\n"
+         "\n"
+         "The exit status is the program's, 128 and the number of the signal that ended it, or 1 when it was not\n"
+         "run.",
+         run,
+         R"({"home?": "string", "data?": "string", "temporary?": "string", "groups?": {"*": "string"}, "system?": "string", "systemGroups?": {"*": "string"}})"}};
 }
 
 } // namespace ostrand::ctl

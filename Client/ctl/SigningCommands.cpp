@@ -94,7 +94,8 @@ std::vector<Command> signingCommands() {
          "A signature counts as long as the file belongs to root and neither group nor others may write it.\n"
          "Whoever may execute a program has its entitlements: those that begin with \"com.tamarok.private.Ostrand.\"\n"
          "are refused to a program that others may execute.",
-         sign}};
+         sign,
+         R"({"file": "string", "signature": {"Identifier?": "string", "Entitlements?": {"*": "any"}}})"}};
 }
 
 } // namespace ostrand::ctl

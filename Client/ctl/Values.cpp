@@ -1,5 +1,6 @@
 #include "Client/ctl/Values.h"
 
+#include "Client/ctl/Suggestion.h"
 #include "platform/base/Try.h"
 #include "platform/codec/PropertyList.h"
 
@@ -7,7 +8,6 @@
 #include <charconv>
 #include <cstdio>
 #include <memory>
-#include <optional>
 #include <pwd.h>
 #include <strings.h>
 
@@ -19,12 +19,6 @@ using File = std::unique_ptr<FILE, int (*)(FILE*)>;
 
 /// How deep a property list may be to go into a request, which is a level of its own.
 constexpr std::size_t deepestValue = 63;
-
-std::optional<std::uint64_t> numberIn(std::string_view text) {
-    std::uint64_t number = 0;
-    const auto [end, problem] = std::from_chars(text.data(), text.data() + text.size(), number);
-    return problem == std::errc{} && end == text.data() + text.size() ? std::optional(number) : std::nullopt;
-}
 
 /// The class of that name, in any case.
 std::optional<ContainerClass> containerClassNamed(std::string_view name) {
@@ -65,12 +59,26 @@ std::expected<ost::OSTValue, Failure> propertyListIn(const std::string& path, st
 
 } // namespace
 
+std::optional<std::uint64_t> numberIn(std::string_view text) {
+    std::uint64_t number = 0;
+    const auto [end, problem] = std::from_chars(text.data(), text.data() + text.size(), number);
+    return problem == std::errc{} && end == text.data() + text.size() ? std::optional(number) : std::nullopt;
+}
+
+std::vector<std::string> classNames() {
+    std::vector<std::string> names;
+    for (std::uint64_t number = 1; isValidContainerClass(static_cast<ContainerClass>(number)); ++number)
+        names.emplace_back(ost::OSTContainerClassPathComponents[number]);
+    return names;
+}
+
 std::expected<ContainerClass, Failure> classNamed(const std::string& text) {
     if (const auto number = numberIn(text))
         return static_cast<ContainerClass>(*number);
     if (const auto named = containerClassNamed(text))
         return *named;
-    return std::unexpected(Failure::usage("no container class is called \"" + escaped(text) + "\""));
+    return std::unexpected(
+        Failure::usage("no container class is called \"" + escaped(text) + "\"" + didYouMean(text, classNames())));
 }
 
 std::expected<std::uint64_t, Failure> userNamed(const std::string& text, const std::string& device) {
@@ -80,10 +88,14 @@ std::expected<std::uint64_t, Failure> userNamed(const std::string& text, const s
     const File accounts(std::fopen(path.c_str(), "re"), &std::fclose);
     if (!accounts)
         return std::unexpected(Failure::system("cannot read " + path, errno));
-    while (const passwd* account = fgetpwent(accounts.get()))
+    std::vector<std::string> names;
+    while (const passwd* account = fgetpwent(accounts.get())) {
         if (text == account->pw_name)
             return account->pw_uid;
-    return std::unexpected(Failure::usage("the device has no account \"" + escaped(text) + "\""));
+        names.emplace_back(account->pw_name);
+    }
+    return std::unexpected(
+        Failure::usage("the device has no account \"" + escaped(text) + "\"" + didYouMean(text, names)));
 }
 
 std::expected<ost::OSTValue, Failure> propertyListIn(const std::string& path) {

@@ -1,5 +1,9 @@
 #include "Client/ctl/Commands.h"
+#include "Client/ctl/Terminal.h"
 
+#include <unistd.h>
+
+#include <algorithm>
 #include <cstdio>
 #include <cstdlib>
 
@@ -15,10 +19,20 @@ int print(const std::string& text) {
     return written ? EXIT_SUCCESS : EXIT_FAILURE;
 }
 
-void complain(const std::string& message, const std::string& usage = {}) {
-    std::fprintf(stderr, "ostrandctl: %s\n", message.c_str());
+void complain(const Failure& failure, const std::string& usage = {}) {
+    const auto name = styled("ostrandctl:", Style::error, STDERR_FILENO);
+    std::fprintf(stderr, "%s %s\n", name.c_str(), failure.message.c_str());
+    if (!failure.hint.empty())
+        std::fprintf(stderr, "%s %s\n", styled("hint:", Style::strong, STDERR_FILENO).c_str(), failure.hint.c_str());
     if (!usage.empty())
         std::fprintf(stderr, "%s\n", usage.c_str());
+}
+
+int printFailure(const Failure& failure, bool asJSON, const std::string& usage) {
+    complain(failure, usage);
+    if (asJSON)
+        print(jsonText(failure.json) + "\n");
+    return failure.exitStatus;
 }
 
 int printOutcome(const Invocation& invocation, const Outcome& outcome) {
@@ -28,15 +42,14 @@ int printOutcome(const Invocation& invocation, const Outcome& outcome) {
         const int failed = print(asJSON ? inJSON() : outcome->text);
         return failed != 0 ? failed : outcome->exitStatus;
     }
-    const auto& failure = outcome.error();
-    if (failure.exitStatus == Failure::usageStatus) {
-        complain(failure.message, usageLine(commandTable(), *invocation.command));
-        return failure.exitStatus;
-    }
-    complain(failure.message);
-    if (asJSON)
-        print(jsonText(failure.json) + "\n");
-    return failure.exitStatus;
+    const bool isUsage = outcome.error().exitStatus == Failure::usageStatus;
+    return printFailure(outcome.error(), asJSON, isUsage ? usageLine(commandTable(), *invocation.command) : "");
+}
+
+/// Whether JSON is asked for in a command line that makes no sense.
+bool asksForJSON(std::span<const std::string_view> words) {
+    const auto end = std::ranges::find(words, "--");
+    return std::find(words.begin(), end, "--json") != end;
 }
 
 } // namespace
@@ -46,10 +59,8 @@ int main(int argc, char** argv) {
     const auto parsed = parseCommandLine(commandTable(), words);
     if (const auto* const help = std::get_if<Help>(&parsed))
         return print(help->text);
-    if (const auto* const error = std::get_if<UsageError>(&parsed)) {
-        complain(error->message, error->usage);
-        return Failure::usageStatus;
-    }
+    if (const auto* const error = std::get_if<UsageError>(&parsed))
+        return printFailure(Failure::usage(error->message), asksForJSON(words), error->usage);
     const auto& invocation = std::get<Invocation>(parsed);
     return printOutcome(invocation, invocation.command->run(invocation.arguments));
 }

@@ -1,3 +1,4 @@
+#include "JSONForm.h"
 #include "Support/ScratchDirectory.h"
 #include "support/BootedDeviceTest.h"
 #include "support/DeviceTest.h"
@@ -5,6 +6,8 @@
 #include <gtest/gtest.h>
 
 #include <unistd.h>
+
+#include <algorithm>
 
 using namespace ost::test;
 
@@ -43,6 +46,10 @@ protected:
             result.output += line + "\n";
         result.status = child.wait();
         result.errors = readFile(errors);
+        if (result.status == 0 && std::ranges::find(words, "--json") != words.end()) {
+            words.erase(words.begin());
+            EXPECT_EQ(faultOfJSON(words, result.output), "") << result.output;
+        }
         return result;
     }
 
@@ -187,6 +194,31 @@ TEST_F(CommandLine, MeasuresWipesMigratesAndChecks) {
         EXPECT_NE(checked.output.find("/" + std::string(name) + "\""), std::string::npos) << checked.output;
 }
 
+TEST_F(CommandLine, DryRunsSayWhatWouldGoAndLeaveItAndTheLogIsShownByLevel) {
+    const auto made = ostrandctl({"create", "--class", "2", "com.example.a"});
+    const auto path = field(made.output, "path"), uuid = field(made.output, "uuid");
+    const std::string size = "   4.0 KiB  "; // the metadata file
+    const auto wouldDelete =
+        size + uuid + "  com.example.a  " + path + "\n" + size + "in 1 container would be deleted\n";
+    for (const auto* const verb : {"delete", "stage"}) {
+        EXPECT_EQ(ostrandctl({verb, "--class", "2", "com.example.a", "--dry-run"}).output, wouldDelete);
+        ostrandctl({verb, "--class", "2", "com.example.a", "--dry-run", "--json"});
+        EXPECT_TRUE(std::filesystem::exists(device->onHost(path)));
+    }
+    ostrandctl({"delete", "--class", "2", "com.example.a"});
+    for (int i = 0; i < 2; ++i) {
+        const auto wouldDestroy = ostrandctl({"purge", "--dry-run"}).output;
+        EXPECT_NE(wouldDestroy.find("  com.example.a\n" + size + "in 1 item would be destroyed\n"), std::string::npos)
+            << wouldDestroy;
+    }
+    ostrandctl({"purge", "--dry-run", "--json"});
+
+    EXPECT_NE(ostrandctl({"watch", "--once"}).output.find("<Notice>"), std::string::npos);
+    EXPECT_EQ(ostrandctl({"watch", "--once", "--level", "error"}).output.find("<Notice>"), std::string::npos);
+    const auto last = ostrandctl({"watch", "--once", "--json", "--lines", "1"}).output;
+    EXPECT_EQ(std::ranges::count(last, '\n'), 1) << last;
+}
+
 TEST_F(CommandLine, SaysHowARequestFailedAndLeavesTheDeviceAlone) {
     const struct {
         std::string program;
@@ -207,15 +239,18 @@ TEST_F(CommandLine, SaysHowARequestFailedAndLeavesTheDeviceAlone) {
         {signedProgram, {"protect", "--class", "2", "com.example.b"}, 1, "error 21: no such container"},
         {signedProgram, {"protect", "--class", "x", "com.example.b"}, 2, "\"x\" is no protection class"},
         {unsignedProgram, {"purge"}, 1, "the daemon refused the request"},
+        {signedProgram, {"stage", "--class", "2", "com.exmaple.ctl"}, 1, "; did you mean \"com.example.ctl\"?\nhint: "},
         {signedProgram, {"create", "com.example.b"}, 2, "missing --class C\nusage: ostrandctl "},
     };
+    ostrandctl({"create", "--class", "2"});
     for (const auto& [program, words, status, complaint] : rows) {
         const auto result = run(program, words);
         EXPECT_EQ(result.status, status) << complaint;
         EXPECT_EQ(result.output, "") << complaint;
         EXPECT_NE(result.errors.find(complaint), std::string::npos) << result.errors;
     }
-    EXPECT_EQ(ostrandctl({"list", "--class", "2"}).output, "");
+    const auto left = ostrandctl({"list", "--class", "2"}).output;
+    EXPECT_TRUE(left.ends_with("  com.example.ctl\n") && std::ranges::count(left, '\n') == 1) << left;
 }
 
 } // namespace

@@ -65,7 +65,7 @@ TEST(Arguments, ComeFromTheTableAlone) {
         {"make --help", "help: " + usageOfMake},
         {"", "no command given" + usage},
         {"break", "unknown command \"break\"" + usage},
-        {"la on", "unknown command \"la\"" + usage},
+        {"la on", "unknown command \"la\"; did you mean \"lamp\"?" + usage},
         {"lamp", "\"lamp\" needs a further word | usage: tool [--where DIR] [--loud] lamp COMMAND ..."},
         {"lamp on off", "unexpected argument \"off\" | usage: tool [--where DIR] [--loud] lamp on"},
         {"--colour c make x", "unknown option --colour" + usage},

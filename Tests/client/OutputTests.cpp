@@ -67,9 +67,8 @@ TEST(Output, SaysOfAFailureWhatProgramsAndPeopleNeed) {
         std::string json;
     } rows[] = {
         {Failure::of(Error::failed(21)), 1,
-         R"({"error": {"code": 21, "kind": "failed", "message": "error 21: no such container"}})"},
-        {Failure::of(Error::refused()), 1,
-         R"({"error": {"kind": "refused", "message": "the daemon refused the request and closed the connection"}})"},
+         R"({"error": {"code": 21, "hint": "ostrandctl list --class C --user U shows what there is; transient ones )"
+         R"(with --transient.", "kind": "failed", "message": "error 21: no such container"}})"},
         {Failure::system("cannot open a\nb", ENOENT), 1,
          R"({"error": {"code": 2, "kind": "local", "message": "cannot open a\\nb: No such file or directory"}})"},
         {Failure::usage("what?"), 2, R"({"error": {"kind": "usage", "message": "what?"}})"},
@@ -78,6 +77,18 @@ TEST(Output, SaysOfAFailureWhatProgramsAndPeopleNeed) {
         EXPECT_EQ(failure.exitStatus, status);
         EXPECT_EQ(jsonText(failure.json), json);
     }
+}
+
+TEST(Output, AlignsColumnsByCharacters) {
+    Table table;
+    table.add({"a", "b"});
+    table.add({"h\u00e9h\u00e9", "long one", "c"});
+    table.add({"x", "y", "z"});
+    EXPECT_EQ(table.text(), "a     b\nh\u00e9h\u00e9  long one  c\nx     y         z\n");
+    EXPECT_EQ(sizeText(1023), "  1023 B  ");
+    EXPECT_EQ(sizeText(18022400), "  17.2 MiB");
+    EXPECT_EQ(sizeText(~std::uint64_t{0}), "  16.0 EiB");
+    EXPECT_EQ(countOf(1, "file") + ", " + countOf(0, "file"), "1 file, 0 files");
 }
 
 TEST(ErrorCodes, AreTheSystemsOwnBeforeTheyAreErrnos) {

@@ -1,0 +1,28 @@
+#pragma once
+
+#include "platform/base/OSTValue.h"
+
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <string_view>
+
+namespace ostrand::ctl {
+
+/// What a line of the log weighs, the heaviest first.
+enum class LogLevel : std::uint8_t { error, notice, debug };
+
+/// "error", in any case.
+[[nodiscard]] std::optional<LogLevel> logLevelNamed(std::string_view name);
+
+/// One line of the daemon's log: "2026-11-22T19:46:01.123456Z <Error> [PID:TID] function: message".
+struct LogLine {
+    std::string text; ///< as it stands in the file, without its end
+    LogLevel level = LogLevel::error;
+    std::string time, thread, message; ///< a line of another form is all message, and of the level error
+
+    [[nodiscard]] static LogLine parse(std::string text);
+    [[nodiscard]] ost::OSTDictionary json() const;
+};
+
+} // namespace ostrand::ctl
