@@ -1,3 +1,4 @@
+#include "Device/Help.h"
 #include "Device/ServiceLauncher.h"
 #include "platform/base/FileDescriptor.h"
 
@@ -9,29 +10,26 @@
 #include <cstdio>
 #include <cstdlib>
 #include <optional>
+#include <string>
 #include <string_view>
 
 using ost::device::BootOptions;
+using ost::device::helpSummary;
+using ost::device::helpUsage;
 using ost::device::ServiceLauncher;
 
 namespace {
 
 constexpr int usageError = 2;
 
-constexpr const char* help = R"(Usage: ostrand-device boot --image DIR [--daemon PATH] [-- COMMAND...]
-
-Boots the device whose file system lies in DIR and keeps its container daemon running. A DIR that is no device image is made
-one. Requires root.
-
-  --image DIR    the device image; its sockets are in DIR/private/var/run
-  --daemon PATH  the daemon (default: ostrandd beside this program)
-  COMMAND        runs on the host once the daemon serves, with OSTRAND_DEVICE set to DIR; the device goes down when it ends
-  --help         prints this
-
-Without COMMAND the device runs until SIGTERM or SIGINT. If the launcher is killed, the daemon is killed with it.
-
-Exit status: that of COMMAND; else 0, 1 when the device cannot be booted, 2 when the arguments make no sense.
-)";
+void printHelp() {
+    std::printf("Usage: %s\n\n%s\n\n", helpUsage.data(), helpSummary.data());
+    for (const auto& [name, value, text] : ost::device::helpRows) {
+        const auto left = std::string(name).append(name.empty() || value.empty() ? "" : " ").append(value);
+        std::printf("  %-15s%s\n", left.c_str(), text.data());
+    }
+    std::printf("\n%s\n\nExit status: %s\n", ost::device::helpEnd.data(), ost::device::helpExitStatus.data());
+}
 
 std::filesystem::path defaultDaemon() {
     return std::filesystem::read_symlink("/proc/self/exe").replace_filename("ostrandd");
@@ -49,7 +47,7 @@ std::expected<BootOptions, int> parse(int count, char** arguments) {
         } else if (option == 'd') {
             boot.daemon = optarg;
         } else if (option == 'h') {
-            std::fputs(help, stdout);
+            printHelp();
             return std::unexpected(EXIT_SUCCESS);
         } else {
             return std::unexpected(usageError);
@@ -79,13 +77,13 @@ int main(int count, char** arguments) {
     ost::platform::openMissingStandardFiles();
     const std::string_view verb = count > 1 ? arguments[1] : "";
     if (verb == "--help") {
-        std::fputs(help, stdout);
+        printHelp();
         return EXIT_SUCCESS;
     }
     auto options = verb == "boot" ? parse(count - 1, arguments + 1) : std::unexpected(usageError);
     if (options)
         return boot(*std::move(options));
     if (options.error() == usageError)
-        std::fputs("Usage: ostrand-device boot --image DIR [--daemon PATH] [-- COMMAND...]\n", stderr);
+        std::fprintf(stderr, "Usage: %s\n", helpUsage.data());
     return options.error();
 }

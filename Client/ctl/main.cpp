@@ -1,4 +1,5 @@
 #include "Client/ctl/Commands.h"
+#include "Client/ctl/Completion.h"
 #include "Client/ctl/Terminal.h"
 
 #include <unistd.h>
@@ -52,10 +53,20 @@ bool asksForJSON(std::span<const std::string_view> words) {
     return std::find(words.begin(), end, "--json") != end;
 }
 
+/// For the shells: "ostrandctl __complete -- WORD..." prints what may stand in the place of the last word.
+int complete(std::span<const std::string_view> words) {
+    std::string lines;
+    for (const auto& candidate : completions(commandTable(), words))
+        lines += candidate + "\n";
+    return print(lines);
+}
+
 } // namespace
 
 int main(int argc, char** argv) {
     const std::vector<std::string_view> words(argv + (argc > 0), argv + argc);
+    if (words.size() >= 2 && words[0] == "__complete" && words[1] == "--")
+        return complete(std::span(words).subspan(2));
     const auto parsed = parseCommandLine(commandTable(), words);
     if (const auto* const help = std::get_if<Help>(&parsed))
         return print(help->text);

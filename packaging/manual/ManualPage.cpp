@@ -1,0 +1,188 @@
+// Prints a manual page: its template, with what the programs' own tables say in the place of lines such as
+// "@COMMANDS@".
+
+#include "Client/ctl/Commands.h"
+#include "Client/ctl/ContainerArguments.h"
+#include "Client/ctl/Hints.h"
+#include "Device/Help.h"
+#include "Protocol/OSTErrorCode.h"
+
+#include <cctype>
+#include <cstdio>
+#include <fstream>
+#include <iostream>
+#include <map>
+#include <sstream>
+
+using namespace ostrand::ctl;
+
+namespace {
+
+constexpr std::size_t longestLine = 78;
+
+/// A word as the formatter prints it.
+std::string quoted(std::string_view word) {
+    std::string out;
+    for (const char letter : word)
+        out += letter == '\\' ? std::string("\\e") : std::string(1, letter);
+    if (word == "--")
+        return "\\-\\-"; // not a dash
+    return (out.starts_with('.') || out.starts_with('\'') ? "\\&" : "") + out;
+}
+
+/// Running text: each sentence begins a line, and no line is long.
+std::string prose(std::string_view text) {
+    std::istringstream words{std::string(text)};
+    std::string out, line;
+    for (std::string word; words >> word;) {
+        if (line.size() + 1 + word.size() > longestLine) {
+            out += line + "\n";
+            line.clear();
+        }
+        line += (line.empty() ? quoted(word) : " " + quoted(word));
+        if (word.find_last_of(".!?") == word.size() - 1) {
+            out += line + "\n";
+            line.clear();
+        }
+    }
+    return line.empty() ? out : out + line + "\n";
+}
+
+/// A sentence of a table, which has neither a capital letter nor a full stop.
+std::string sentence(std::string_view text) {
+    std::string out(text);
+    out[0] = static_cast<char>(std::toupper(static_cast<unsigned char>(out[0])));
+    return prose(out.ends_with('.') ? out : out + ".");
+}
+
+std::string literal(std::string_view text) { return ".Bd -literal -compact\n" + quoted(text) + "\n.Ed\n"; }
+
+/// The argument of a macro that says what a value is.
+std::string argument(std::string_view name) { return name.empty() ? "" : " Ar " + std::string(name); }
+
+std::string flag(std::string_view name) { return "Fl -" + std::string(name); }
+
+std::string optionsList(const std::vector<Option>& options) {
+    if (options.empty())
+        return {};
+    std::string out = ".Bl -tag -width Ds -compact\n";
+    for (const auto& option : options)
+        out += ".It " + flag(option.name) + argument(option.value) + "\n" + sentence(option.help);
+    return out + ".El\n";
+}
+
+/// How an option stands in a synopsis.
+std::string inSynopsis(const Option& option) {
+    const auto spelled = flag(option.name) + argument(option.value);
+    return (option.count == Option::Count::required ? "." : ".Op ") + spelled +
+           (option.count == Option::Count::repeated ? " ...\n" : "\n");
+}
+
+std::string inSynopsis(const Operand& operand) {
+    switch (operand.count) {
+    case Operand::Count::optional:
+        return ".Op Ar " + std::string(operand.name) + "\n";
+    case Operand::Count::several:
+        return ".Ar " + std::string(operand.name) + " ...\n";
+    case Operand::Count::any:
+        return ".Op Ar " + std::string(operand.name) + " ...\n";
+    case Operand::Count::required:
+        break;
+    }
+    return ".Ar " + std::string(operand.name) + "\n";
+}
+
+/// Help of several lines: those that are indented stand as they are.
+std::string details(std::string_view text) {
+    if (text.empty() || text == classesAndUsers)
+        return {};
+    std::string out = ".Pp\n", running;
+    std::istringstream lines{std::string(text)};
+    for (std::string line; std::getline(lines, line);)
+        running += line + "\n";
+    return out + prose(running);
+}
+
+std::string commandSection(const Command& command) {
+    std::string out = ".Ss " + std::string(command.name) + "\n" + sentence(command.summary);
+    out += ".Bd -ragged -offset indent\n.Nm\n.Cm " + std::string(command.name) + "\n";
+    for (const auto& option : command.options)
+        out += inSynopsis(option);
+    for (const auto& operand : command.operands)
+        out += inSynopsis(operand);
+    out += ".Ed\n";
+    if (!command.operands.empty() || !command.options.empty())
+        out += ".Pp\n";
+    if (!command.operands.empty()) {
+        out += ".Bl -tag -width Ds -compact\n";
+        for (const auto& operand : command.operands)
+            out += ".It Ar " + std::string(operand.name) + "\n" + sentence(operand.help);
+        out += ".El\n";
+    }
+    return out + optionsList(command.options) + details(command.details) + ".Pp\nWith\n.Fl -json :\n" +
+           literal(command.json);
+}
+
+std::string commands() {
+    std::string out;
+    for (const auto& command : commandTable().commands)
+        out += commandSection(command);
+    return out;
+}
+
+std::string classes() {
+    std::string out = ".Bl -tag -width 10n -compact\n";
+    for (std::uint64_t number = 1; number < static_cast<std::uint64_t>(ost::OSTContainerClass::max); ++number) {
+        const auto containerClass = static_cast<ost::OSTContainerClass>(number);
+        const auto user = ost::usualUserOf(containerClass);
+        out += ".It " + std::to_string(number) + "\n" +
+               prose(std::string(ost::pathComponentForContainerClass(containerClass)) + ", " +
+                     (user == ost::OSTCurrentUserPlaceholder ? "of a user above 500."
+                                                             : "of user " + std::to_string(user) + "."));
+    }
+    return out + ".El\n";
+}
+
+std::string codes() {
+    std::string out = ".Bl -tag -width 6n -compact\n";
+    for (std::uint64_t number = 0; number <= static_cast<std::uint64_t>(ost::OSTErrorCode::corruptPropertyList);
+         ++number)
+        if (const auto meaning = ost::meaningOf(static_cast<ost::OSTErrorCode>(number)); !meaning.empty()) {
+            out += ".It " + std::to_string(number) + "\n" + sentence(meaning);
+            if (const auto hint = hintFor(ostrand::Error::failed(number)); !hint.empty())
+                out += prose(hint);
+        }
+    return out + ".El\n";
+}
+
+std::string deviceOptions() {
+    std::string out = ".Bl -tag -width Ds\n";
+    for (const auto& [name, value, text] : ost::device::helpRows)
+        out += ".It" + (name.empty() ? "" : " " + flag(name.substr(2))) + argument(value) + "\n" + sentence(text);
+    return out + ".El\n";
+}
+
+const std::map<std::string, std::string (*)()> parts{
+    {"@COMMANDS@", commands},
+    {"@OPTIONS@", [] { return optionsList(commandTable().options); }},
+    {"@CLASSES@", classes},
+    {"@CODES@", codes},
+    {"@DEVICE_SUMMARY@", [] { return prose(ost::device::helpSummary) + ".Pp\n" + prose(ost::device::helpEnd); }},
+    {"@DEVICE_OPTIONS@", deviceOptions},
+    {"@DEVICE_EXIT@", [] { return prose(ost::device::helpExitStatus); }},
+};
+
+} // namespace
+
+int main(int argc, char** argv) {
+    std::ifstream page(argc == 2 ? argv[1] : "");
+    if (!page) {
+        std::fputs("usage: manual-page TEMPLATE\n", stderr);
+        return 2;
+    }
+    for (std::string line; std::getline(page, line);) {
+        const auto part = parts.find(line);
+        std::cout << (part == parts.end() ? line + "\n" : part->second());
+    }
+    return std::cout.flush() ? 0 : 1;
+}
