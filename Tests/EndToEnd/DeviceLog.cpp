@@ -5,8 +5,10 @@
 #include <gtest/gtest.h>
 
 #include <sched.h>
+#include <unistd.h>
 
 #include <chrono>
+#include <fstream>
 #include <iterator>
 #include <regex>
 #include <sstream>
@@ -40,6 +42,12 @@ std::size_t linesInLogFile(const BootedDevice& device, const std::string& text) 
 std::size_t openDescriptors(pid_t process) {
     return static_cast<std::size_t>(
         std::distance(std::filesystem::directory_iterator("/proc/" + std::to_string(process) + "/fd"), {}));
+}
+
+std::size_t residentMemory(pid_t process) {
+    std::size_t total = 0, resident = 0;
+    std::ifstream("/proc/" + std::to_string(process) + "/statm") >> total >> resident;
+    return resident * static_cast<std::size_t>(::sysconf(_SC_PAGESIZE));
 }
 
 bool comesTrue(const std::function<bool()>& condition) {

@@ -31,6 +31,9 @@ private:
 /// The open descriptors of a process.
 [[nodiscard]] std::size_t openDescriptors(pid_t process);
 
+/// The bytes of memory that a process has.
+[[nodiscard]] std::size_t residentMemory(pid_t process);
+
 /// Waits until something is so; false when it does not come about.
 [[nodiscard]] bool comesTrue(const std::function<bool()>& condition);
 

@@ -1,6 +1,8 @@
 #include "EndToEnd/DeviceLog.h"
 #include "EndToEnd/Wire.h"
+#include "platform/ipc/IPCFrame.h"
 #include "support/BootedDeviceTest.h"
+#include "support/Sanitized.h"
 
 #include <gtest/gtest.h>
 
@@ -113,6 +115,43 @@ TEST_F(HostileFrameTest, TheLongestAndTheDeepestThatIsAllowedIsServed) {
     const auto longest = reply(text(std::string((16 << 20) - 128, 'x')));
     EXPECT_EQ(deepest.error(), 21U);
     EXPECT_EQ(longest.error(), 21U);
+}
+
+TEST_F(HostileFrameTest, AProgramWithoutEntitlementsMaySendShortFramesOnly) {
+    const Client stranger(device().socket(), {.user = 501});
+    DeviceLog log(device());
+    for (const auto size : {std::size_t{65536}, std::size_t{65537}}) {
+        const auto padded = [&](std::size_t padding) {
+            return request(1, {{"ContainerClass", number(2)}, {"X", text(std::string(padding, 'x'))}});
+        };
+        constexpr std::size_t nearly = 60'000;
+        const auto bytes = padded(nearly + size + platform::IPCFrameHeader::size - padded(nearly).size());
+        ASSERT_EQ(bytes.size(), size + platform::IPCFrameHeader::size);
+        EXPECT_TRUE(stranger.connect().isRefused(bytes)) << size;
+        EXPECT_EQ(log.takeErrors().size(), size > 65536 ? 1U : 0U) << size;
+    }
+}
+
+TEST_F(HostileFrameTest, WhatAUserTakesOfTheMemoryIsBoundedAndGivenBack) {
+    if (isSanitized)
+        GTEST_SKIP() << "sanitizers keep what is freed";
+    const Client user(device().socket(), allowed("com.example.user", 501));
+    expectService("before");
+    const auto before = residentMemory(device().daemonId());
+    const auto most = [&] {
+        std::vector<Connection> connections;
+        std::size_t seen = 0;
+        for (int i = 0; i < 60; ++i) {
+            connections.push_back(user.connect());
+            connections.back().send(header(16 << 20, 1) + std::string(4 << 20, 'x'));
+            seen = std::max(seen, residentMemory(device().daemonId()));
+        }
+        return seen;
+    }();
+    EXPECT_LT(most, before + (std::size_t{128} << 20));
+    expectService("meanwhile");
+    EXPECT_TRUE(comesTrue([&] { return residentMemory(device().daemonId()) < before + (std::size_t{16} << 20); }))
+        << before << " bytes before, " << residentMemory(device().daemonId()) << " after";
 }
 
 TEST_F(HostileFrameTest, AClientThatLeavesCostsNothing) {

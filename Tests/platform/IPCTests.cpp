@@ -63,7 +63,7 @@ public:
                 connection->setInvalidationHandler([this](const auto&) { _count(invalidated); });
                 connection->resume();
             },
-            limits);
+            _forUnsignedClients(limits));
         EXPECT_TRUE(made && (*made)->resume());
         listener = *std::move(made);
     }
@@ -85,6 +85,12 @@ public:
     std::unique_ptr<IPCListener> listener;
 
 private:
+    /// The clients are this process, which is not signed.
+    static IPCLimits _forUnsignedClients(IPCLimits limits) {
+        limits.payloadWithoutEntitlements = limits.payload;
+        return limits;
+    }
+
     static void _count(std::atomic<int>& counter) {
         ++counter;
         counter.notify_all();
@@ -169,6 +175,13 @@ public:
 
     void connect(const Service& service) {
         ASSERT_EQ(::connect(_socket.get(), service.address(), service.addressSize()), 0);
+    }
+    void connectAs(uid_t user, const Service& service) {
+        // Credentials are the thread's.
+        std::thread([&] {
+            ASSERT_EQ(::syscall(SYS_setresuid, -1, user, -1), 0);
+            connect(service);
+        }).join();
     }
 
     /// False when the service has closed the connection.
@@ -427,6 +440,41 @@ TEST(IPC, AClientThatPassesALimitLosesItsConnection) {
     }
 }
 
+TEST(IPC, TheLargestConsumerOfAUserThatTakesTooMuchMemoryGoes) {
+    constexpr std::size_t kilobyte = 1024;
+    Service service({.memoryOfOneUser = 1000 * kilobyte, .memoryOfUsers = 1500 * kilobyte});
+    // All but the last byte of a frame.
+    const auto begin = [&](Client& client, uid_t user, std::size_t kilobytes) {
+        client.connectAs(user, service);
+        const auto whole = request(1, echo, 0, kilobytes * kilobyte);
+        client.send(whole.substr(0, whole.size() - 1));
+    };
+    Client root, small, large, middle;
+    begin(root, 0, 4000);
+    begin(small, 501, 200);
+    begin(large, 501, 700);
+    begin(middle, 501, 300);
+    Service::await(service.invalidated, 1);
+    EXPECT_EQ(large.receiveNumber(), std::nullopt) << "its user takes more than one may";
+
+    Client otherUser, thirdUser;
+    begin(otherUser, 502, 900);
+    begin(thirdUser, 503, 300);
+    Service::await(service.invalidated, 2);
+    EXPECT_EQ(otherUser.receiveNumber(), std::nullopt) << "users take more than they may together";
+
+    Client reader;
+    reader.connectAs(501, service);
+    for (std::uint32_t number = 1; number <= 8; ++number)
+        reader.send(request(number, fill, 200 * kilobyte));
+    Service::await(service.invalidated, 3);
+
+    for (Client* const client : {&root, &small, &middle, &thirdUser}) {
+        client->send("p");
+        EXPECT_EQ(client->receiveNumber(), 1);
+    }
+}
+
 TEST(IPC, AClientWithoutDebtsMayStay) {
     Service service({.takeReply = 20ms, .completeFrame = 20ms});
     Client stays(service), late(service);
@@ -449,11 +497,7 @@ TEST(IPC, RefusesConnectionsOverALimitUntilOneHasGone) {
     };
     std::vector<Client> clients(9);
     const auto connectAs = [&](uid_t user, std::size_t client) {
-        // Credentials are the thread's.
-        std::thread([&] {
-            ASSERT_EQ(::syscall(SYS_setresuid, -1, user, -1), 0);
-            clients[client].connect(service);
-        }).join();
+        clients[client].connectAs(user, service);
         return isServed(clients[client]);
     };
     EXPECT_TRUE(connectAs(501, 0));

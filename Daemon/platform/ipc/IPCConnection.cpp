@@ -37,7 +37,7 @@ void discardReceived(int socket) {
 } // namespace
 
 IPCConnection::IPCConnection(FileDescriptor socket, PeerIdentity peer, const Surroundings& surroundings)
-    : _surroundings(surroundings), _peer(std::move(peer)), _reader(surroundings.limits.payload),
+    : _surroundings(surroundings), _peer(std::move(peer)), _reader(surroundings.limits.payloadWithoutEntitlements),
       _socket(std::move(socket)) {}
 
 void IPCConnection::resume() {
@@ -88,9 +88,15 @@ void IPCConnection::_serveEvents(std::uint32_t events, std::span<char> scratch) 
     }
     _readUntilEnd |= (events & (EPOLLRDHUP | hangUpEvents)) != 0;
     _hungUp |= (events & hangUpEvents) != 0;
+    if ((events & memoryEvent) != 0) {
+        logError("connection of pid %d closed: its user's requests and replies take too much memory",
+                 _peer.processId());
+        return _close();
+    }
     if (_end.load() == End::none)
         _receive(scratch);
     _reader.settle();
+    _countReceived(0);
     // After receiving, so that what came in time counts even if it is seen late.
     if ((events & deadlineEvent) != 0)
         _checkDeadlines();
@@ -105,9 +111,10 @@ void IPCConnection::_receive(std::span<char> scratch) {
             return;
         if (auto frame = _reader.next())
             _handle(*std::move(frame));
-        else if (frame.error() == IPCFrameReader::Result::malformed)
-            return _refuse("a frame of no valid length");
-        else if (drained)
+        else if (frame.error() == IPCFrameReader::Result::malformed) {
+            if (!_allowsLongFrame())
+                return;
+        } else if (drained)
             return _watchForFrame(true);
         else
             drained = _receiveSome(scratch);
@@ -124,6 +131,7 @@ bool IPCConnection::_receiveSome(std::span<char> scratch) {
     if (count > 0) {
         const auto size = static_cast<std::size_t>(count);
         _reader.received(size);
+        _countReceived(0);
         return size < space.size() && !_readUntilEnd;
     }
     if (count < 0 && (errno == EAGAIN || errno == EINTR))
@@ -133,7 +141,36 @@ bool IPCConnection::_receiveSome(std::span<char> scratch) {
     return true;
 }
 
+/// A frame that is longer than others may be is taken from a program that has entitlements; else it is refused. The
+/// program is asked for at each, because it may be another one by then.
+bool IPCConnection::_allowsLongFrame() {
+    const auto claimed = _reader.claimedPayload().value_or(0);
+    if (claimed == 0 || claimed > _surroundings.limits.payload) {
+        _refuse("a frame of no valid length");
+        return false;
+    }
+    const auto identity = _peer.codeSigningIdentity();
+    if (!identity || !(*identity)->entitlements) {
+        _refuse("a frame too long for a program without entitlements");
+        return false;
+    }
+    _reader.setMaximumPayload(_surroundings.limits.payload);
+    return true;
+}
+
+/// Small change is not counted, so that ordinary requests touch nothing that all connections share.
+void IPCConnection::_countReceived(std::size_t atHand) {
+    constexpr std::size_t smallChange = 4096;
+    auto bytes = _reader.memory() + atHand;
+    if (bytes < smallChange)
+        bytes = 0;
+    if (bytes != _receivedBytes)
+        _surroundings.memory.change(*this, _peer.effectiveUserId(), std::exchange(_receivedBytes, bytes), bytes);
+}
+
 void IPCConnection::_handle(IPCFrame frame) {
+    _reader.setMaximumPayload(_surroundings.limits.payloadWithoutEntitlements);
+    _countReceived(frame.memory());
     if (const auto root = validateCBOR(frame.payload()); !root)
         return _refuse(formatMessage("malformed message, %@", root.error()));
     const auto sequence = _sequence++;
@@ -234,8 +271,9 @@ void IPCConnection::_sendOrKeep(std::string frame) {
         _updateDeadline();
         _surroundings.pool.change(_watch, _socket.get(), receptionEvents | EPOLLOUT);
     }
-    _unsentBytes += frame.size();
+    const auto size = frame.size();
     _unsent.push_back(std::move(frame));
+    _countUnsent(_unsentBytes + size);
     if (_unsentBytes - _sentOfFirst > _surroundings.limits.unreadReplies) {
         logError("connection of pid %d closed: it leaves too many replies unread", _peer.processId());
         _endWith(End::broken);
@@ -256,15 +294,20 @@ void IPCConnection::_sendKept() {
         _replyDeadline = Clock::now() + _surroundings.limits.takeReply;
         if (!sent) {
             _unsent.clear();
-            _unsentBytes = 0;
+            _countUnsent(0);
         } else {
-            _unsentBytes -= _unsent.front().size();
+            const auto size = _unsent.front().size();
             _unsent.pop_front();
+            _countUnsent(_unsentBytes - size);
         }
     }
     _replyDeadline.reset();
     _updateDeadline();
     _surroundings.pool.change(_watch, _socket.get(), receptionEvents);
+}
+
+void IPCConnection::_countUnsent(std::size_t bytes) {
+    _surroundings.memory.change(*this, _peer.effectiveUserId(), std::exchange(_unsentBytes, bytes), bytes);
 }
 
 /// Sends what is kept, for a listener whose threads have ended.
@@ -323,9 +366,13 @@ void IPCConnection::_close() {
         _frameDeadline = _replyDeadline = std::nullopt;
         _updateDeadline();
         _unsent.clear();
+        _countUnsent(0);
         _end.store(End::broken);
         socket = std::move(_socket);
     }
+    _reader.discard();
+    _countReceived(0);
+    _surroundings.memory.forget(*this, _peer.effectiveUserId());
     if (!_hungUp)
         discardReceived(socket.get());
     // The registry tells the listener that descriptors are free, so they are freed first.

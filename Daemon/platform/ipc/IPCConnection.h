@@ -4,6 +4,7 @@
 #include "platform/base/Mutex.h"
 #include "platform/ipc/IPCConnectionRegistry.h"
 #include "platform/ipc/IPCFrame.h"
+#include "platform/ipc/IPCMemoryBudget.h"
 #include "platform/ipc/IPCMessage.h"
 #include "platform/ipc/PeerIdentity.h"
 #include "platform/threads/DeadlineTimer.h"
@@ -47,6 +48,7 @@ public:
         WorkerPool& pool;
         DeadlineTimer& timer;
         IPCConnectionRegistry& registry;
+        IPCMemoryBudget& memory;
         const IPCLimits& limits;
     };
 
@@ -87,7 +89,9 @@ private:
     void _serveEvents(std::uint32_t events, std::span<char> scratch);
     void _receive(std::span<char> scratch);
     [[nodiscard]] bool _receiveSome(std::span<char> scratch);
+    [[nodiscard]] bool _allowsLongFrame();
     void _handle(IPCFrame frame);
+    void _countReceived(std::size_t atHand);
     void _watchForFrame(bool drained);
     void _checkDeadlines();
     void _closeIfFinished();
@@ -105,6 +109,7 @@ private:
 
     void _sendOrKeep(std::string frame) OST_REQUIRES(_mutex);
     void _sendKept() OST_REQUIRES(_mutex);
+    void _countUnsent(std::size_t bytes) OST_REQUIRES(_mutex);
     [[nodiscard]] std::optional<std::size_t> _trySending(std::string_view bytes) OST_REQUIRES(_mutex);
     void _replyIsDone() OST_REQUIRES(_mutex);
     void _endWith(End end) OST_REQUIRES(_mutex);
@@ -118,6 +123,7 @@ private:
     // Of the thread that serves.
     IPCFrameReader _reader;
     std::uint64_t _sequence = 0;     ///< requests received
+    std::size_t _receivedBytes = 0;  ///< as the budget knows them
     bool _readUntilEnd = false;      ///< the client sends no more than what is here already
     bool _hungUp = false;            ///< nor does it take replies
     bool _waitsForFrame = false;     ///< whether _frameDeadline is set

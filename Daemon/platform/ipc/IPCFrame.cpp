@@ -20,7 +20,8 @@ std::span<char> IPCFrameReader::space(std::span<char> scratch) {
     const auto have = _input.size();
     const auto room = std::min(wanted - have, std::max(have, scratch.size()));
     _buffer.erase(0, static_cast<std::size_t>(_input.data() - _buffer.data()));
-    _buffer.resize_and_overwrite(have + room, [](char*, std::size_t size) { return size; });
+    // The operation may be told of more room than was asked for.
+    _buffer.resize_and_overwrite(have + room, [&](char*, std::size_t) { return have + room; });
     _input = std::string_view(_buffer).substr(0, have);
     return _space = std::span(_buffer).subspan(have);
 }
@@ -52,10 +53,21 @@ std::expected<IPCFrame, IPCFrameReader::Result> IPCFrameReader::next() {
     return frame;
 }
 
+std::optional<std::uint32_t> IPCFrameReader::claimedPayload() const {
+    if (_input.size() < IPCFrameHeader::size)
+        return std::nullopt;
+    return IPCFrameHeader::read(_input.data()).payloadLength;
+}
+
+void IPCFrameReader::discard() {
+    _input = {};
+    _buffer = {};
+    _inBuffer = false;
+}
+
 void IPCFrameReader::settle() {
     if (_input.empty()) {
-        _buffer = {};
-        _inBuffer = false;
+        discard();
     } else if (!_inBuffer) {
         _buffer.assign(_input);
         _input = _buffer;

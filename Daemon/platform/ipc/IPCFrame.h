@@ -52,6 +52,8 @@ public:
 
     [[nodiscard]] std::uint32_t requestNumber() const { return _requestNumber; }
     [[nodiscard]] std::string_view payload() const { return std::string_view(_bytes).substr(_payloadOffset); }
+    /// Bytes that it takes.
+    [[nodiscard]] std::size_t memory() const { return _bytes.size(); }
 
 private:
     std::string _bytes;
@@ -87,6 +89,16 @@ public:
 
     /// Moves what is left out of the scratch.
     void settle();
+    /// Gives up what is left.
+    void discard();
+
+    /// Limits the payloads from the next one on that `next` gives.
+    void setMaximumPayload(std::uint32_t bytes) { _maximumPayload = bytes; }
+    /// The length that the next frame claims, when all of its header is there.
+    [[nodiscard]] std::optional<std::uint32_t> claimedPayload() const;
+
+    /// Bytes that it keeps outside the scratch.
+    [[nodiscard]] std::size_t memory() const { return _buffer.size(); }
 
     /// Whether nothing is left: no byte of a further frame has arrived.
     [[nodiscard]] bool empty() const { return _input.empty(); }

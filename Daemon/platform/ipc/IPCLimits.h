@@ -14,7 +14,11 @@ struct IPCLimits {
     std::size_t connectionsKeptForRoot = 256; ///< of these; so the others can never lock root out
     std::size_t connectionsOfOneUser = 256;   ///< of a user id above 0, so that no user can take them all
     std::uint32_t payload = IPCFrameHeader::maximumPayload;
-    std::size_t unreadReplies = 64 * 1024 * 1024;                   ///< bytes kept for a client that does not read
+    std::uint32_t payloadWithoutEntitlements = 64 * 1024; ///< of a program that may run no command anyway
+    std::size_t unreadReplies = 64 * 1024 * 1024;         ///< bytes kept for a client that does not read
+    std::size_t memoryOfOneUser =
+        64 * 1024 * 1024; ///< of a user id above 0: unfinished frames, queued requests, replies
+    std::size_t memoryOfUsers = 512 * 1024 * 1024;                  ///< of all of them
     std::chrono::milliseconds takeReply = std::chrono::seconds(30); ///< to take a reply that the socket cannot hold
     std::chrono::milliseconds completeFrame =
         std::chrono::seconds(30);                                    ///< to send a frame whose first byte has arrived

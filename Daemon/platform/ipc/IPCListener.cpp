@@ -159,9 +159,11 @@ std::expected<std::unique_ptr<IPCListener>, Errno> IPCListener::create(FileDescr
 IPCListener::IPCListener(const IPCLimits& limits, std::unique_ptr<WorkerPool> pool, FileDescriptor socket,
                          EventHandler eventHandler)
     : _limits(limits), _pool(std::move(pool)), _timer(std::make_shared<DeadlineTimer>(*_pool)), _registry(_limits),
+      _memory(*_pool, _limits),
       _acceptor(std::make_shared<Acceptor>(
           std::move(socket), std::move(eventHandler),
-          IPCConnection::Surroundings{.pool = *_pool, .timer = *_timer, .registry = _registry, .limits = _limits})) {
+          IPCConnection::Surroundings{
+              .pool = *_pool, .timer = *_timer, .registry = _registry, .memory = _memory, .limits = _limits})) {
     _registry.setRemovalHandler([acceptor = std::weak_ptr(_acceptor)] {
         if (const auto present = acceptor.lock())
             present->connectionGone();

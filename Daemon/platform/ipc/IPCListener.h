@@ -4,6 +4,7 @@
 #include "platform/base/FileDescriptor.h"
 #include "platform/ipc/IPCConnection.h"
 #include "platform/ipc/IPCConnectionRegistry.h"
+#include "platform/ipc/IPCMemoryBudget.h"
 #include "platform/threads/DeadlineTimer.h"
 #include "platform/threads/WorkerPool.h"
 
@@ -58,6 +59,7 @@ private:
     const std::unique_ptr<WorkerPool> _pool;
     const std::shared_ptr<DeadlineTimer> _timer;
     IPCConnectionRegistry _registry;
+    IPCMemoryBudget _memory;
     const std::shared_ptr<Acceptor> _acceptor;
 };
 
