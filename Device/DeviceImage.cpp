@@ -1,7 +1,6 @@
 #include "Device/DeviceImage.h"
 
-#include "Protocol/OSTServices.h"
-#include "Protocol/OSTUserId.h"
+#include "Device/ImageLayout.h"
 #include "platform/base/Errno.h"
 #include "platform/base/SmallFile.h"
 #include "platform/base/Try.h"
@@ -15,7 +14,6 @@
 #include <sys/syscall.h>
 #include <unistd.h>
 
-#include <array>
 #include <cerrno>
 #include <cstring>
 
@@ -24,52 +22,6 @@ namespace ost::device {
 using platform::FileDescriptor;
 
 namespace {
-
-/// The user of the account "mobile".
-constexpr unsigned mobileUser = 501;
-
-/// Paths in an image begin at its root.
-constexpr const char* runDirectory = OSTServiceSocketDirectory + 1;
-
-struct Directory {
-    const char* name;
-    unsigned mode;
-    unsigned owner; ///< and group
-};
-
-// Parents first. The staging area and death row lie in root's home: users may not pass it. The other homes are open,
-// because the containers in them have modes of their own, and bundles are for everybody.
-constexpr std::array directories{
-    Directory{"dev", 0755, OSTRootUserId},
-    Directory{"dev/shm", 0755, OSTRootUserId},
-    Directory{"etc", 0755, OSTRootUserId},
-    Directory{"private", 0755, OSTRootUserId},
-    Directory{"private/var", 0755, OSTRootUserId},
-    Directory{"private/var/db", 0755, OSTRootUserId},
-    Directory{"private/var/mobile", 0755, mobileUser},
-    Directory{"private/var/root", 0700, OSTRootUserId},
-    Directory{runDirectory, 0755, OSTRootUserId},
-    Directory{"private/var/tessalyd", 0755, OSTInstallerUserId},
-    Directory{"proc", 0555, OSTRootUserId},
-    Directory{"tmp", 01777, OSTRootUserId},
-};
-
-struct File {
-    const char* name;
-    std::string_view content;
-};
-
-constexpr const char* accountFile = "etc/passwd";
-
-// The accounts come last: they are what makes a directory an image, so an interrupted making starts again.
-constexpr std::array files{
-    File{"etc/os-release", "NAME=\"Ostrand device\"\nID=ostrand\nVERSION_ID=1\nBUILD_ID=1A1\n"},
-    File{"etc/group", "root:x:0:\ntessalyd:x:33:\nsystem:x:499:\nsystemusers:x:500:system\nmobile:x:501:\n"},
-    File{accountFile, "root:x:0:0:Administrator:/private/var/root:/bin/sh\n"
-                      "tessalyd:x:33:33:Installer:/private/var/tessalyd:/bin/false\n"
-                      "system:x:499:499:System services:/private/var/empty:/bin/false\n"
-                      "mobile:x:501:501:Mobile user:/private/var/mobile:/bin/sh\n"},
-};
 
 std::string procPathOf(const FileDescriptor& file) { return "/proc/self/fd/" + std::to_string(file.get()); }
 
@@ -104,9 +56,9 @@ Result<void> DeviceImage::_openRoot() {
 }
 
 Result<void> DeviceImage::_makeMissingParts() const {
-    for (const Directory& directory : directories)
+    for (const ImageDirectory& directory : imageDirectories)
         OST_TRY(_makeDirectory(directory.name, directory.mode, directory.owner));
-    for (const File& file : files)
+    for (const ImageFile& file : imageFiles)
         OST_TRY(_makeFile(file.name, file.content));
     return {};
 }

@@ -5,6 +5,7 @@
 #include "Client/ctl/ContainerArguments.h"
 #include "Client/ctl/Hints.h"
 #include "Device/Help.h"
+#include "Device/ImageLayout.h"
 #include "Protocol/OSTErrorCode.h"
 
 #include <cctype>
@@ -162,7 +163,33 @@ std::string deviceOptions() {
     return out + ".El\n";
 }
 
+/// Text as the rules for files read it.
+std::string ruleText(std::string_view text) {
+    std::string out;
+    for (const char letter : text)
+        out += letter == '\n' ? "\\n" : letter == '%' ? "%%" : std::string(1, letter);
+    return out;
+}
+
+/// Rules that make a directory the image that the launcher would make of it.
+std::string imageRules() {
+    const std::string image = OSTRAND_IMAGE_DIR;
+    std::ostringstream out;
+    const auto rule = [&](const char* type, const std::string& name, unsigned mode, unsigned owner) -> std::ostream& {
+        return out << type << ' ' << image << name << ' ' << '0' << std::oct << mode << std::dec << ' ' << owner << ' '
+                   << owner << " -";
+    };
+    rule("d", "", 0755, 0) << '\n';
+    for (const auto& [name, mode, owner] : ost::device::imageDirectories)
+        rule(std::string_view(name) == ost::device::runDirectory ? "D!" : "d", "/" + std::string(name), mode, owner)
+            << '\n';
+    for (const auto& [name, content] : ost::device::imageFiles)
+        rule("f", "/" + std::string(name), 0644, 0) << ' ' << ruleText(content) << '\n';
+    return out.str();
+}
+
 const std::map<std::string, std::string (*)()> parts{
+    {"@IMAGE_RULES@", imageRules},
     {"@COMMANDS@", commands},
     {"@OPTIONS@", [] { return optionsList(commandTable().options); }},
     {"@CLASSES@", classes},
@@ -177,7 +204,7 @@ const std::map<std::string, std::string (*)()> parts{
 int main(int argc, char** argv) {
     std::ifstream page(argc == 2 ? argv[1] : "");
     if (!page) {
-        std::fputs("usage: manual-page TEMPLATE\n", stderr);
+        std::fputs("usage: fill-template TEMPLATE\n", stderr);
         return 2;
     }
     for (std::string line; std::getline(page, line);) {
