@@ -1,8 +1,10 @@
 #include "Client/StoreCheck.h"
 
 #include "Client/Containers.h"
+#include "Protocol/OSTSandboxItem.h"
 #include "platform/base/Errno.h"
 #include "platform/base/FileDescriptor.h"
+#include "platform/base/FileName.h"
 #include "platform/base/Path.h"
 #include "platform/base/Try.h"
 #include "platform/base/UUID.h"
@@ -185,6 +187,7 @@ private:
                       "one of " + std::to_string(containers.size()) + " containers of " + identifier,
                       "the daemon serves one of them; which one may change when it starts",
                       "look which one has the data, and delete the others as root while the daemon is down");
+        _checkItemsOf(directory, onDisk);
         if (directory.containerClass == ContainerClass::sharedAppGroup)
             for (const auto& [identifier, containers] : onDisk)
                 _groups.emplace(identifier, containers.front().path);
@@ -279,6 +282,24 @@ private:
             return;
         _find(item, "points at no container", "the sandbox takes a process to a place that is not there",
               "nothing: it is set again with the container's next move, or remove it");
+    }
+
+    /// Containers that the sandbox has been told of, as a note on each says, and knows nothing of.
+    void _checkItemsOf(const ClassDirectory& directory, const std::map<std::string, std::vector<Container>>& onDisk) {
+        const auto item = ost::OSTSandboxItemOf(directory.user, directory.containerClass);
+        if (!item)
+            return;
+        const auto top = std::string(ost::platform::sandboxStateDirectory) + "/" + std::to_string(item->userId) + "/" +
+                         std::to_string(static_cast<std::uint64_t>(item->type));
+        for (const auto& [identifier, containers] : onDisk) {
+            const auto& path = containers.front().path;
+            const auto container = _files.open(path, O_RDONLY | O_DIRECTORY);
+            if (container && ost::platform::hasNoteOfSandboxUserStateItem(container->get()) &&
+                !_files.linkTarget(pathByAppending(top, ost::platform::fileNameForKey(identifier))))
+                _find(path, "no item of the sandbox says where " + identifier + " is",
+                      "a process that runs in it may be kept out of it",
+                      "restart the daemon, which sets the item again when it first reads the directory");
+        }
     }
 
     void _checkMapping() {

@@ -161,6 +161,13 @@ OSTResult<void> OSTFileManager::makeDirectoryDurable(std::string_view path) cons
     return _waitForDirectory(path, ::fsync);
 }
 
+OSTResult<void> OSTFileManager::makeMoveDurable(std::string_view source, std::string_view destination) const {
+    const auto from = platform::pathByDeletingLastComponent(source),
+               to = platform::pathByDeletingLastComponent(destination);
+    OST_TRY(makeDirectoryDurable(to));
+    return from == to ? OSTResult<void>() : makeDirectoryDurable(from);
+}
+
 OSTResult<void> OSTFileManager::makeFileSystemDurable(std::string_view path) const {
     return _waitForDirectory(path, ::syncfs);
 }

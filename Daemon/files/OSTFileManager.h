@@ -106,6 +106,10 @@ public:
     /// Waits until the names in the directory at `path` are on disk, and so what was last moved there.
     [[nodiscard]] OSTResult<void> makeDirectoryDurable(std::string_view path) const;
 
+    /// Waits until an item is on disk where it was moved, and then until it has left the directory that it came from: a
+    /// power cut meanwhile may leave it in both places, but never in none.
+    [[nodiscard]] OSTResult<void> makeMoveDurable(std::string_view source, std::string_view destination) const;
+
     /// Waits until everything that was changed on the file system of the directory at `path` is on disk.
     [[nodiscard]] OSTResult<void> makeFileSystemDurable(std::string_view path) const;
 

@@ -5,6 +5,7 @@
 #include "store/OSTClientConnection.h"
 #include "store/OSTContainerCache.h"
 #include "store/OSTLocks.h"
+#include "store/OSTSandboxItems.h"
 #include "store/OSTStoreDelegate.h"
 
 #include <cerrno>
@@ -43,18 +44,6 @@ OSTResult<OSTMetadataRecord> putIntoCache(const OSTMetadata& metadata, OSTPlacem
                                               "Failed to add to cache: %@, url: %@, transient: %d", metadata,
                                               metadata.url, metadata.transient));
     return added;
-}
-
-OSTResult<void> makeSubDirectoriesDurable(const OSTMetadata& record) {
-    if (isBundleClass(record.containerClass)) // has none
-        return {};
-    for (const auto holder : {"", "Library"})
-        if (const auto durable =
-                OSTFileManager::defaultManager().makeDirectoryDurable(pathByAppending(record.url, holder));
-            !durable)
-            return std::unexpected(OSTCreateError(OSTErrorCode::subDirectoryCreationFailed, durable.error(),
-                                                  "Failed to create sub-dir at %@%@", record.url, holder));
-    return {};
 }
 
 OSTError failedMove(const std::string& from, const std::string& to, const OSTError& cause) {
@@ -165,9 +154,11 @@ OSTClientConnection::recreateDefaultStructureForUser(const OSTContainerReference
         const OSTIdentifierLock lock({container.uuid->string()}, OSTLockKind::writing);
         const auto record = OST_TRY(_container(container));
         OST_TRY(_createSubDirectories(record->url, container.name.userId, record->containerClass));
-        if (!isSystemClass(record->containerClass))
-            return makeSubDirectoriesDurable(*record);
         const auto& files = OSTFileManager::defaultManager();
+        if (!isSystemClass(record->containerClass)) {
+            OST_TRY(_makeSubDirectoriesDurable(record->url, record->containerClass));
+            return files.makeDirectoryDurable(record->url);
+        }
         OST_TRY(files.standardizeACLsForSystemContainerAtURL(record->url));
         return files.makeFileSystemDurable(record->url); // any item may have changed
     }));
@@ -192,8 +183,10 @@ OSTClientConnection::_moveToNewUUID(const OSTContainerReference& container) cons
     OSTMetadata changed = *record;
     changed.url = pathByAppending(pathByDeletingLastComponent(record->url), platform::UUID::generate().string());
     OST_TRY(_settleReplacementsAt(record->url));
-    OST_TRY(moveDirectory(*record, changed.url));
     // The sandbox's item is that of the live container of the name.
+    if (!record->transient)
+        OSTNoteSandboxItem(*record);
+    OST_TRY(moveDirectory(*record, changed.url));
     if (!record->transient && !_setSandboxContainerMappingForUser(record->name(), changed.url))
         platform::logError("Failed to set container mapping in regenerate operation of %@, %llu", record->identifier,
                            record->containerClass);

@@ -35,17 +35,6 @@ std::span<const std::string_view> subDirectoriesOf(OSTContainerClass containerCl
     return dataSubDirectories;
 }
 
-/// Waits until the owners of the sub-directories, and what lies in these, are on disk.
-OSTResult<void> makeContentDurable(const std::string& url, OSTContainerClass containerClass) {
-    for (const auto name : subDirectoriesOf(containerClass)) {
-        const auto durable = OSTFileManager::defaultManager().makeDirectoryDurable(pathByAppending(url, name));
-        if (!durable)
-            return std::unexpected(OSTCreateError(OSTErrorCode::subDirectoryCreationFailed, durable.error(),
-                                                  "Failed to create sub-dir at %@%@", url, name));
-    }
-    return {};
-}
-
 /// The record of a container as the answer of the look-up that made it: later ones get the shared record.
 OSTMetadataRecord asMadeNow(const OSTMetadata& record) {
     auto copy = std::make_shared<OSTMetadata>(record);
@@ -173,7 +162,7 @@ OSTResult<OSTMetadata> OSTClientConnection::_buildInStaging(const OSTContainerNa
     OST_TRY(_createSubDirectories(staging, name.userId, name.containerClass));
     // All of it at the end, so that the first of the file system's commits carries the rest.
     OST_TRY(metadata.makeMetadataDurable(std::move(pendingFile)));
-    OST_TRY(makeContentDurable(staging, name.containerClass));
+    OST_TRY(_makeSubDirectoriesDurable(staging, name.containerClass));
     return metadata;
 }
 
@@ -220,6 +209,17 @@ OSTResult<void> OSTClientConnection::_createSubDirectories(const std::string& ur
                                                   system ? systemContentOwner : userId);
         if (!made)
             return std::unexpected(OSTCreateError(OSTErrorCode::subDirectoryCreationFailed, made.error(),
+                                                  "Failed to create sub-dir at %@%@", url, name));
+    }
+    return {};
+}
+
+OSTResult<void> OSTClientConnection::_makeSubDirectoriesDurable(const std::string& url,
+                                                                OSTContainerClass containerClass) {
+    for (const auto name : subDirectoriesOf(containerClass)) {
+        const auto durable = OSTFileManager::defaultManager().makeDirectoryDurable(pathByAppending(url, name));
+        if (!durable)
+            return std::unexpected(OSTCreateError(OSTErrorCode::subDirectoryCreationFailed, durable.error(),
                                                   "Failed to create sub-dir at %@%@", url, name));
     }
     return {};

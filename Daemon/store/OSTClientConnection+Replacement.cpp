@@ -11,9 +11,11 @@
 #include "store/OSTContainerCache.h"
 #include "store/OSTLocks.h"
 #include "store/OSTReplaceFile.h"
+#include "store/OSTSandboxItems.h"
 #include "store/OSTStoreDelegate.h"
 
 #include <cerrno>
+#include <source_location>
 
 namespace ost {
 
@@ -25,6 +27,34 @@ namespace {
 
 bool isAtOrBelow(std::string_view path, std::string_view place) {
     return path.starts_with(place) && (path.size() == place.size() || path[place.size()] == '/');
+}
+
+OSTError failedRecovery(const OSTReplaceFile& file, const OSTError& cause) {
+    return OSTCreateError(OSTErrorCode::replaceFileInvalid, cause, "Failed to recover replace move: %@ to %@",
+                          file.stagingURL, file.oldURL);
+}
+
+OSTResult<void> moveBack(const OSTReplaceFile& file) {
+    const auto& files = OSTFileManager::defaultManager();
+    platform::logDebug("Recovering from failed replace by moving: %@ to %@", file.stagingURL, file.oldURL);
+    // Neither was seen, but one that could not be looked for may be there.
+    const auto moved =
+        files.itemDoesNotExistAtURL(file.oldURL) && files.itemDoesNotExistAtURL(file.destinationURL)
+            ? files.moveItemAtURL(file.stagingURL, file.oldURL)
+            : std::unexpected(OSTCreatePOSIXError(EAGAIN, "%@ or %@ may exist", file.oldURL, file.destinationURL));
+    return moved ? moved : std::unexpected(failedRecovery(file, moved.error()));
+}
+
+/// Puts the old container back when neither it nor the new one is in place, and waits until what is in place is there
+/// on disk. Without its file, what is in staging is thrown away.
+OSTResult<void> recover(const OSTReplaceFile& file) {
+    const auto& files = OSTFileManager::defaultManager();
+    const bool newIsInPlace = files.itemExistsAtURL(file.destinationURL);
+    if (!files.itemExistsAtURL(file.oldURL) && !newIsInPlace)
+        OST_TRY(moveBack(file));
+    const auto& place = newIsInPlace ? file.destinationURL : file.oldURL;
+    const auto durable = files.makeDirectoryDurable(pathByDeletingLastComponent(place));
+    return durable ? durable : std::unexpected(failedRecovery(file, durable.error()));
 }
 
 } // namespace
@@ -43,29 +73,64 @@ struct OSTClientConnection::ReplaceOperation {
     bool newHasOldUUID = false;  ///< in its metadata file
     OSTStoreDelegate::Restoration restoreCodeSigning;
     bool newIsInPlace = false;
+    bool sandboxIsTold = false; ///< of the destination
+
+    [[nodiscard]] OSTResult<void> makeParkingDurable() const;
+    [[nodiscard]] OSTError failedMove(const OSTError& cause,
+                                      std::source_location where = std::source_location::current()) const;
 };
+
+/// The old container must be in staging, and out of its place, before the new one comes there: a power cut would leave
+/// two of them, or none that a start could put back.
+OSTResult<void> OSTClientConnection::ReplaceOperation::makeParkingDurable() const {
+    if (!oldIsParked)
+        return {};
+    const auto durable = OSTFileManager::defaultManager().makeMoveDurable(oldContainer->url, stagingURL);
+    if (!durable)
+        return std::unexpected(OSTCreateError(OSTErrorCode::moveOldToStagingFailed, durable.error(),
+                                              "Failed to move old %@ to staging %@", oldContainer->url, stagingURL));
+    return {};
+}
+
+OSTError OSTClientConnection::ReplaceOperation::failedMove(const OSTError& cause, std::source_location where) const {
+    const auto old = oldContainer ? std::optional(oldContainer->url) : std::nullopt;
+    return OSTCreateErrorAt(where, OSTErrorCode::replacingMoveFailed, &cause, "Failed to replace: %@ with: %@ at: %@",
+                            old, newContainer->url, destination);
+}
 
 std::expected<void, OSTErrorCode> OSTClientConnection::replaceContainer(const OSTReplacement& replacement) const {
     return OSTGuarded([&]() -> OSTResult<void> {
         OST_TRY(_checkReplacement(replacement));
-        const OSTAllIdentifiersLock lock(OSTLockKind::writing);
+        OSTAllIdentifiersLock lock(OSTLockKind::writing);
         ReplaceOperation operation;
-        const auto replaced = OSTGuarded([&] { return _replace(replacement, operation); });
-        if (operation.newHasOldUUID && !operation.newIsInPlace)
-            // What fails is in the log; the container is found by the UUID that the cache holds, until the next start.
-            static_cast<void>(operation.newContainer->writeMetadataToDisk());
-        if (operation.oldIsParked && !operation.newIsInPlace) {
-            const auto restored = _restoreOldContainer(operation);
-            if (!restored && replaced.error().is(OSTErrorCode::exceptionCaught))
-                platform::crashWithMessage(restored.error().description());
-            // What could not be put back is left to the next start, for which the replace file stays.
-            if (!restored)
-                return replaced;
-        }
-        if (!operation.replaceFileURL.empty())
-            OST_TRY(_cleanUpReplacement(replacement, operation));
-        return replaced;
+        OST_TRY(_replaceOrRestore(replacement, operation));
+        lock.unlock();
+        // The new one must not be back where it was, as well. Its destination has been waited for.
+        const auto source = pathByDeletingLastComponent(operation.newContainer->url);
+        const auto durable = OSTFileManager::defaultManager().makeDirectoryDurable(source);
+        return durable ? durable : std::unexpected(operation.failedMove(durable.error()));
     });
+}
+
+OSTResult<void> OSTClientConnection::_replaceOrRestore(const OSTReplacement& replacement,
+                                                       ReplaceOperation& operation) const {
+    const auto replaced = OSTGuarded([&] { return _replace(replacement, operation); });
+    if (operation.newHasOldUUID && !operation.newIsInPlace)
+        // What fails is in the log; the container is found by the UUID that the cache holds, until the next start.
+        static_cast<void>(operation.newContainer->writeMetadataToDisk());
+    if (operation.oldIsParked && !operation.newIsInPlace) {
+        const auto restored = _restoreOldContainer(operation);
+        if (!restored && replaced.error().is(OSTErrorCode::exceptionCaught))
+            platform::crashWithMessage(restored.error().description());
+        // What could not be put back is left to the next start, for which the replace file stays.
+        if (!restored)
+            return replaced;
+    }
+    if (operation.sandboxIsTold && !operation.newIsInPlace)
+        _correctSandboxContainerMapping(operation.newContainer->name());
+    if (!operation.replaceFileURL.empty())
+        OST_TRY(_cleanUpReplacement(replacement, operation));
+    return replaced;
 }
 
 OSTResult<void> OSTClientConnection::_checkReplacement(const OSTReplacement& replacement) {
@@ -100,11 +165,13 @@ OSTResult<void> OSTClientConnection::_replace(const OSTReplacement& replacement,
     OST_TRY(_findSides(replacement, operation));
     for (const auto& side : {operation.oldContainer, operation.newContainer})
         if (side)
-            OST_TRY(_settleReplacementsAt(side->url));
-    if (operation.oldContainer)
+            OST_TRY(_discardReplaceFilesOf(side->url));
+    if (operation.oldContainer) {
         OST_TRY(_parkOldContainer(operation));
-    else
+    } else {
         OST_TRY(_checkNothingLives(operation));
+        OST_TRY(OSTReplaceFile::makeDiscardsDurable()); // which the next replace file does otherwise
+    }
     return _putNewContainerInPlace(replacement, operation);
 }
 
@@ -210,11 +277,6 @@ OSTResult<void> OSTClientConnection::_putNewContainerInPlace(const OSTReplacemen
     const auto name = operation.newContainer->name();
     const auto& destination = operation.destination;
     const auto& files = OSTFileManager::defaultManager();
-    const auto failedMove = [&](const OSTError& cause) {
-        const auto old = operation.oldContainer ? std::optional(operation.oldContainer->url) : std::nullopt;
-        return OSTCreateError(OSTErrorCode::replacingMoveFailed, cause, "Failed to replace: %@ with: %@ at: %@", old,
-                              operation.newContainer->url, destination);
-    };
     OSTMetadata metadata = *operation.newContainer;
     if (replacement.preserveOldUUID) {
         // A container that has taken its place has its UUID for good, whatever happens then.
@@ -222,21 +284,25 @@ OSTResult<void> OSTClientConnection::_putNewContainerInPlace(const OSTReplacemen
         operation.newHasOldUUID = true;
         OST_TRY(metadata.writeMetadataToDisk());
     }
+    OST_TRY(operation.makeParkingDurable());
+    if (!operation.transient)
+        OSTNoteSandboxItem(metadata);
     if (const auto moved = files.moveItemAtURL(operation.newContainer->url, destination); !moved)
-        return std::unexpected(failedMove(moved.error()));
-    // Before the replace file goes, which would otherwise be gone after a power cut while the move had not happened. A
-    // move that cannot be made sure of is taken back.
+        return std::unexpected(operation.failedMove(moved.error()));
     operation.newIsInPlace = true;
-    const auto durable = files.makeDirectoryDurable(pathByDeletingLastComponent(destination));
-    if (!durable && files.moveItemAtURL(destination, operation.newContainer->url)) {
-        operation.newIsInPlace = false;
-        return std::unexpected(failedMove(durable.error()));
-    }
-
-    OST_TRY(_forgetContainer(name));
+    operation.sandboxIsTold = true; // first, so that one commit of the file system makes both durable
     if (!_setSandboxContainerMappingForUser(name, destination))
         platform::logError("Failed to set container mapping in replace operation of %@, %llu", *name.identifier,
                            name.containerClass);
+    // Before the replace file goes, which would otherwise be gone after a power cut while the move had not happened. A
+    // move that cannot be made sure of is taken back.
+    const auto durable = files.makeDirectoryDurable(pathByDeletingLastComponent(destination));
+    if (!durable && files.moveItemAtURL(destination, operation.newContainer->url)) {
+        operation.newIsInPlace = false;
+        return std::unexpected(operation.failedMove(durable.error()));
+    }
+
+    OST_TRY(_forgetContainer(name));
     metadata.url = destination;
     metadata.transient = operation.transient;
     const auto added = OSTContainerCache::sharedInstance().addContainerMetadata(metadata);
@@ -246,7 +312,7 @@ OSTResult<void> OSTClientConnection::_putNewContainerInPlace(const OSTReplacemen
                                               destination, operation.transient));
     if (!durable) { // and could not be taken back: the next start decides by what has reached the disk
         operation.replaceFileURL.clear();
-        return std::unexpected(failedMove(durable.error()));
+        return std::unexpected(operation.failedMove(durable.error()));
     }
     return {};
 }
@@ -297,10 +363,16 @@ OSTResult<void> OSTClientConnection::_discardReplaceFile(const std::string& url,
     // One that stayed would speak for containers that live on, and mislead a later start when these have gone.
     if (!moved)
         static_cast<void>(OSTFileManager::defaultManager().removeItemAtURL(url));
+    OSTReplaceFile::wasDiscarded();
     return moved;
 }
 
 OSTResult<void> OSTClientConnection::_settleReplacementsAt(std::string_view place) const {
+    OST_TRY(_discardReplaceFilesOf(place));
+    return OSTReplaceFile::makeDiscardsDurable();
+}
+
+OSTResult<void> OSTClientConnection::_discardReplaceFilesOf(std::string_view place) const {
     const auto& files = OSTFileManager::defaultManager();
     const auto directory = OSTGlobalConfiguration::sharedInstance().replaceDirectory();
     const auto items = files.urlsForItemsInDirectoryAtURL(directory);
@@ -337,7 +409,6 @@ OSTResult<void> OSTClientConnection::_recoverFromReplaceOperations() const {
 }
 
 OSTResult<void> OSTClientConnection::_recoverFromReplaceFile(const std::string& url) const {
-    const auto& files = OSTFileManager::defaultManager();
     const auto file = OSTReplaceFile::_readAndValidateReplaceFileAtUrl(url);
     // What is parked in staging waits with its file until that can be read again.
     if (!file && platform::isReasonThatPasses(file.error()))
@@ -345,20 +416,7 @@ OSTResult<void> OSTClientConnection::_recoverFromReplaceFile(const std::string& 
     // A file that is not valid is in the log, and is only discarded.
     if (file) {
         platform::logDebug("Doing a replace of %@ with info: %@", url, *file);
-        if (!files.itemExistsAtURL(file->oldURL) && !files.itemExistsAtURL(file->destinationURL)) {
-            platform::logDebug("Recovering from failed replace by moving: %@ to %@", file->stagingURL, file->oldURL);
-            // Neither was seen, but one that could not be looked for may be there.
-            auto moved = files.itemDoesNotExistAtURL(file->oldURL) && files.itemDoesNotExistAtURL(file->destinationURL)
-                             ? files.moveItemAtURL(file->stagingURL, file->oldURL)
-                             : std::unexpected(OSTCreatePOSIXError(EAGAIN, "%@ or %@ may exist", file->oldURL,
-                                                                   file->destinationURL));
-            if (moved)
-                moved = files.makeDirectoryDurable(pathByDeletingLastComponent(file->oldURL));
-            if (!moved)
-                return std::unexpected(OSTCreateError(OSTErrorCode::replaceFileInvalid, moved.error(),
-                                                      "Failed to recover replace move: %@ to %@", file->stagingURL,
-                                                      file->oldURL));
-        }
+        OST_TRY(recover(*file));
     }
     if (const auto removed = _discardReplaceFile(url, StartPass::no); !removed)
         return std::unexpected(OSTCreateError(OSTErrorCode::replaceCleanupFailed, removed.error(),

@@ -1,3 +1,4 @@
+#include "Protocol/OSTSandboxItem.h"
 #include "model/OSTGlobalConfiguration.h"
 #include "platform/base/Log.h"
 #include "platform/base/Path.h"
@@ -9,31 +10,14 @@ namespace ost {
 
 namespace {
 
-enum class SandboxItemType : std::uint64_t { data = 1, appGroup = 2, system = 4, systemGroup = 8 };
-
-struct SandboxItem {
-    std::uint32_t userId;
-    SandboxItemType type;
-};
-
-/// The item of a class that has one; what belongs to the system is kept for user 0.
-SandboxItem itemOf(std::uint32_t userId, OSTContainerClass containerClass) {
-    if (containerClass == OSTContainerClass::dataSystem)
-        return {OSTRootUserId, SandboxItemType::system};
-    if (containerClass == OSTContainerClass::sharedSystemGroup)
-        return {OSTRootUserId, SandboxItemType::systemGroup};
-    return {userId,
-            containerClass == OSTContainerClass::sharedAppGroup ? SandboxItemType::appGroup : SandboxItemType::data};
-}
-
 /// The live container of which the item speaks: that of the class in whose directory its path lies.
 std::optional<OSTContainerName> containerOf(const platform::SandboxUserStateItem& item) {
     const auto holder = platform::pathByDeletingLastComponent(item.path);
     for (auto number = 1U; number < static_cast<unsigned>(OSTContainerClass::max); ++number) {
         const auto containerClass = static_cast<OSTContainerClass>(number);
         const auto userId = isSystemClass(containerClass) ? OSTSystemUserId : item.userId;
-        const auto [ofUser, type] = itemOf(userId, containerClass);
-        if (isBundleClass(containerClass) || ofUser != item.userId || static_cast<std::uint64_t>(type) != item.type)
+        const auto ofClass = OSTSandboxItemOf(userId, containerClass);
+        if (!ofClass || ofClass->userId != item.userId || static_cast<std::uint64_t>(ofClass->type) != item.type)
             continue;
         const auto directory =
             OSTGlobalConfiguration::sharedInstance().containerDirectoryURLForUser(userId, containerClass, false);
@@ -47,16 +31,18 @@ std::optional<OSTContainerName> containerOf(const platform::SandboxUserStateItem
 
 void OSTClientConnection::_repairSandboxContainerMappings() {
     platform::removeUnfinishedSandboxUserStateItems();
-    for (const auto& item : platform::danglingSandboxUserStateItems()) {
-        const auto name = containerOf(item);
-        if (!name)
-            continue;
-        const auto found = OSTContainerCache::sharedInstance().containerForUser(*name);
-        if (found)
-            _setSandboxContainerMappingForUser(*name, (*found)->url);
-        else if (found.error().is(OSTErrorCode::notFound))
-            _setSandboxContainerMappingForUser(*name, std::nullopt);
-    }
+    for (const auto& item : platform::danglingSandboxUserStateItems())
+        if (const auto name = containerOf(item))
+            _correctSandboxContainerMapping(*name);
+}
+
+void OSTClientConnection::_correctSandboxContainerMapping(OSTContainerName name) {
+    name.transient = false;
+    const auto found = OSTContainerCache::sharedInstance().containerForUser(name);
+    if (found)
+        _setSandboxContainerMappingForUser(name, (*found)->url);
+    else if (found.error().is(OSTErrorCode::notFound))
+        _setSandboxContainerMappingForUser(name, std::nullopt);
 }
 
 bool OSTClientConnection::_setSandboxContainerMappingForUser(const OSTContainerName& name,
@@ -68,7 +54,7 @@ bool OSTClientConnection::_setSandboxContainerMappingForUser(const OSTContainerN
         platform::logError("Unsupported class for setting sandbox container mapping: %llu", containerClass);
         return false;
     }
-    const auto item = itemOf(name.userId, containerClass);
+    const auto item = *OSTSandboxItemOf(name.userId, containerClass);
     const auto identifier = *name.identifier;
     const auto type = static_cast<std::uint64_t>(item.type);
     // In one step where that works: a crash between two would leave the sandbox without the item.

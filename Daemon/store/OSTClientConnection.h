@@ -19,6 +19,9 @@
 
 namespace ost {
 
+/// Where items go that cannot be removed.
+inline constexpr std::string_view OSTParkingDirectory = "/tmp";
+
 /// Who a client is and what it may look up.
 struct OSTClientIdentity {
     std::optional<std::string> clientBundleIdentifier = std::nullopt;
@@ -222,6 +225,9 @@ private:
     _createTopLevelContainerDirectory(const std::string& url, OSTContainerClass containerClass, std::uint32_t owner);
     [[nodiscard]] static OSTResult<void> _createSubDirectories(const std::string& url, std::uint32_t userId,
                                                                OSTContainerClass containerClass);
+    /// Waits until the owners of the sub-directories, and what lies in these, are on disk.
+    [[nodiscard]] static OSTResult<void> _makeSubDirectoriesDurable(const std::string& url,
+                                                                    OSTContainerClass containerClass);
     [[nodiscard]] static OSTResult<void> _createDefaultDirectory(const std::string& url, std::uint16_t mode,
                                                                  std::uint32_t owner);
 
@@ -241,6 +247,8 @@ private:
     // +Replacement
     struct ReplaceOperation;
     [[nodiscard]] static OSTResult<void> _checkReplacement(const OSTReplacement& replacement);
+    [[nodiscard]] OSTResult<void> _replaceOrRestore(const OSTReplacement& replacement,
+                                                    ReplaceOperation& operation) const;
     [[nodiscard]] OSTResult<void> _replace(const OSTReplacement& replacement, ReplaceOperation& operation) const;
     [[nodiscard]] static OSTResult<OSTMetadataRecord> _containerOfSide(const OSTContainerReference& side);
     [[nodiscard]] static OSTResult<void> _findSides(const OSTReplacement& replacement, ReplaceOperation& operation);
@@ -259,6 +267,8 @@ private:
     /// all-identifiers lock or the container's, so that none of these replacements is under way, or is starting up.
     /// Fails with `replaceFileInvalid` or `replaceCleanupFailed`.
     [[nodiscard]] OSTResult<void> _settleReplacementsAt(std::string_view place) const;
+    /// The same, but a power cut may bring them back.
+    [[nodiscard]] OSTResult<void> _discardReplaceFilesOf(std::string_view place) const;
     [[nodiscard]] OSTResult<void> _recoverFromReplaceOperations() const;
     [[nodiscard]] OSTResult<void> _recoverFromReplaceFile(const std::string& url) const;
 
@@ -281,6 +291,8 @@ private:
     /// Tells the sandbox where the container of an identifier lies, or with no URL that there is none. False, with the
     /// reason in the log, when that failed. Bundle classes are not the sandbox's business.
     static bool _setSandboxContainerMappingForUser(const OSTContainerName& name, std::optional<std::string_view> url);
+    /// Tells the sandbox where the live container of the name lies, or that there is none.
+    static void _correctSandboxContainerMapping(OSTContainerName name);
     /// Tells the sandbox of the containers that a crash had moved or removed when it was still to be told.
     static void _repairSandboxContainerMappings();
 

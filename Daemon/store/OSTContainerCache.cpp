@@ -10,6 +10,7 @@
 #include "platform/base/Path.h"
 #include "platform/base/Unicode.h"
 #include "platform/threads/BlockingSection.h"
+#include "store/OSTSandboxItems.h"
 
 #include <cerrno>
 #include <future>
@@ -327,7 +328,14 @@ OSTResult<OSTContainerCache::ClassTable*> OSTContainerCache::_getCacheForUserId(
         OSTGlobalConfiguration::sharedInstance().containerDirectoryURLForUser(userId, contentClass, transient);
     if (!directory)
         return std::unexpected(OSTCreatePOSIXError(directory.error(), "User %u has no container directories", userId));
-    return &tables.emplace(key, OST_TRY(_readClassDirectory(*directory, userId, transient))).first->second;
+    ClassTable table = OST_TRY(_readClassDirectory(*directory, userId, transient));
+    if (!transient) {
+        std::vector<OSTMetadataRecord> containers;
+        for (const auto& held : table | std::views::values)
+            containers.push_back(held.entry.record);
+        OSTRestoreSandboxItems(userId, contentClass, containers);
+    }
+    return &tables.emplace(key, std::move(table)).first->second;
 }
 
 OSTResult<OSTContainerCache::ClassTable> OSTContainerCache::_readClassDirectory(const std::string& directory,

@@ -4,6 +4,8 @@
 #include "files/OSTFileManager.h"
 #include "model/OSTGlobalConfiguration.h"
 #include "platform/base/Errno.h"
+#include "platform/base/Immortal.h"
+#include "platform/base/Mutex.h"
 #include "platform/base/Path.h"
 #include "platform/base/Try.h"
 
@@ -20,6 +22,17 @@ constexpr const char* oldKey = "OSTReplaceOperationOldURL";
 constexpr const char* newKey = "OSTReplaceOperationNewURL";
 constexpr const char* stagingKey = "OSTReplaceOperationStagingURL";
 constexpr const char* destinationKey = "OSTReplaceOperationDestURL";
+
+/// What has to be waited for in the replace directory.
+struct Discards {
+    platform::Mutex mutex;
+    bool pending OST_GUARDED_BY(mutex) = true; ///< an earlier process may have left some
+
+    static Discards& shared() {
+        static platform::Immortal discards([] { return Discards(); });
+        return *discards;
+    }
+};
 
 /// Whether a container may be parked there: directly in the staging directory. What is there must not be a link or a
 /// file. Fails with the errno of looking.
@@ -54,6 +67,22 @@ std::string OSTReplaceFile::urlOfToken(std::string_view token) {
                                      std::string(token) + ".plist");
 }
 
+void OSTReplaceFile::wasDiscarded() {
+    auto& discards = Discards::shared();
+    const platform::MutexLock lock(discards.mutex);
+    discards.pending = true;
+}
+
+OSTResult<void> OSTReplaceFile::makeDiscardsDurable() {
+    auto& discards = Discards::shared();
+    const platform::MutexLock lock(discards.mutex); // during the wait, for which others would have to wait as well
+    if (discards.pending)
+        OST_TRY(OSTFileManager::defaultManager().makeDirectoryDurable(
+            OSTGlobalConfiguration::sharedInstance().replaceDirectory()));
+    discards.pending = false;
+    return {};
+}
+
 OSTResult<void> OSTReplaceFile::_writeToDiskReplaceAt(const std::string& url) const {
     if (oldURL.empty() || newURL.empty() || stagingURL.empty() || destinationURL.empty())
         return std::unexpected(OSTCreateError(OSTErrorCode::replaceDescriptionIncomplete,
@@ -61,7 +90,12 @@ OSTResult<void> OSTReplaceFile::_writeToDiskReplaceAt(const std::string& url) co
                                               oldURL, newURL, stagingURL, destinationURL));
     const OSTDictionary dictionary(
         {{oldKey, oldURL}, {newKey, newURL}, {stagingKey, stagingURL}, {destinationKey, destinationURL}});
-    if (const auto written = OST_writeToURL(dictionary, url, OSTSmallDictionaryFileSize); !written)
+    auto& discards = Discards::shared();
+    const platform::MutexLock lock(discards.mutex);
+    const auto written = OST_writeToURL(dictionary, url, OSTSmallDictionaryFileSize);
+    if (written)
+        discards.pending = false; // the directory has been waited for
+    else
         return std::unexpected(OSTCreateError(OSTErrorCode::dictionaryWriteFailed, written.error(),
                                               "Failed to write replace dictionary to URL %@", url));
     return {};

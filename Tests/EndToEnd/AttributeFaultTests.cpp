@@ -165,6 +165,21 @@ TEST_F(AttributeFaultTest, ARegenerationThatFailsLeavesOneContainerThatEverybody
         });
 }
 
+TEST_F(AttributeFaultTest, AnItemOfTheSandboxThatWasLostIsSetAgainWhenTheClassIsRead) {
+    auto first = device().connect();
+    ASSERT_TRUE(ostrand::regenerateDirectoryUUID(first, container));
+    ASSERT_TRUE(ostrand::createOrLookup(first, {container.containerClass, 501, "never.moved", false},
+                                        ostrand::WhenMissing::create));
+    device().killDaemon();
+    fs::remove(device().onHost("/private/var/db/sandbox-state/501/1/a"));
+    device().startDaemon();
+    auto again = device().connect();
+    const auto found = ostrand::metadata(again, container);
+    ASSERT_TRUE(found);
+    EXPECT_EQ(sandboxPath(), found->path);
+    EXPECT_EQ(namesIn(device().onHost("/private/var/db/sandbox-state/501/1")), std::vector<std::string>{"a"});
+}
+
 TEST_F(AttributeFaultTest, AKillAtAnyMomentOfAClassChangeLeavesEveryItemAndTheRecordOldOrNew) {
     const auto url = device().onHost(classDirectory) / namesIn(device().onHost(classDirectory)).at(0);
     for (const auto* const name : {"Documents/a", "tmp/b"})

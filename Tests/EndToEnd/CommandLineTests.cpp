@@ -188,10 +188,11 @@ TEST_F(CommandLine, MeasuresWipesMigratesAndChecks) {
     EXPECT_EQ(ostrandctl({"check"}).output, "1 containers, 0 findings\n");
     std::filesystem::create_directory(container.parent_path() / "planted");
     std::filesystem::create_directory_symlink("/nowhere", container.parent_path() / "link");
+    std::filesystem::remove(device->onHost("/private/var/db/sandbox-state/501/1/com.example.a"));
     const auto checked = ostrandctl({"check", "--json"});
     EXPECT_EQ(checked.status, 1);
-    for (const auto* const name : {"planted", "link"})
-        EXPECT_NE(checked.output.find("/" + std::string(name) + "\""), std::string::npos) << checked.output;
+    for (const std::string name : {"planted", "link", container.filename().c_str()})
+        EXPECT_NE(checked.output.find("/" + name + "\""), std::string::npos) << checked.output;
 }
 
 TEST_F(CommandLine, DryRunsSayWhatWouldGoAndLeaveItAndTheLogIsShownByLevel) {

@@ -6,6 +6,7 @@
 #include "platform/base/Path.h"
 #include "platform/base/Text.h"
 #include "platform/base/Try.h"
+#include "platform/device/ExtendedAttributes.h"
 #include "platform/threads/BlockingSection.h"
 
 #include <fcntl.h>
@@ -22,6 +23,8 @@
 namespace ost::platform {
 
 namespace {
+
+constexpr const char* noteAttribute = "trusted.ostrand.sandbox-item";
 
 /// Makes a link under a name that nothing else has, and gives the name. A crash may have left such a link behind, made
 /// by a process that had our number.
@@ -80,12 +83,16 @@ std::optional<std::string> danglingPath(int directory, const std::string& link) 
     return dangles ? std::optional<std::string>(path.data()) : std::nullopt;
 }
 
+std::expected<FileDescriptor, Errno> openExistingItems(std::uint32_t userId, std::uint64_t type, int access) {
+    const auto path = std::string(sandboxStateDirectory) + "/" + std::to_string(userId) + "/" + std::to_string(type);
+    return openWithoutLinks(AT_FDCWD, path.c_str(), access | O_DIRECTORY);
+}
+
 /// The directory of a user's items of one type, which is there as a rule.
 std::expected<FileDescriptor, Errno> openItems(std::uint32_t userId, std::uint64_t type) {
-    const auto user = std::to_string(userId), items = std::to_string(type);
-    const auto path = std::string(sandboxStateDirectory) + "/" + user + "/" + items;
-    if (auto existing = openWithoutLinks(AT_FDCWD, path.c_str(), O_PATH | O_DIRECTORY))
+    if (auto existing = openExistingItems(userId, type, O_PATH))
         return existing;
+    const auto user = std::to_string(userId), items = std::to_string(type);
     const auto top = OST_TRY(openOrMake(AT_FDCWD, sandboxStateDirectory));
     const auto ofUser = OST_TRY(openOrMake(top.get(), user));
     return openOrMake(ofUser.get(), items);
@@ -109,6 +116,29 @@ std::expected<void, Errno> setSandboxUserStateItem(std::uint32_t userId, std::ui
         return std::unexpected(error);
     }
     return makeNamesDurable(items.get(), ".");
+}
+
+std::expected<void, Errno> noteSandboxUserStateItem(std::uint32_t userId, std::uint64_t type, int container) {
+    OST_TRY(openItems(userId, type)); // without which nobody looks for notes
+    constexpr std::array<std::byte, 1> note{std::byte{'1'}};
+    return setAttribute(container, noteAttribute, note);
+}
+
+bool hasNoteOfSandboxUserStateItem(int container) {
+    std::array<std::byte, 1> note;
+    return getAttribute(container, noteAttribute, note).has_value();
+}
+
+std::optional<std::set<std::string>> keysOfSandboxUserStateItems(std::uint32_t userId, std::uint64_t type) {
+    const auto items = openExistingItems(userId, type, O_RDONLY);
+    const auto names = items ? plainNames(*items) : std::unexpected(items.error());
+    if (!names)
+        return std::nullopt;
+    std::set<std::string> keys;
+    for (const auto& name : *names)
+        if (auto key = keyOfFileName(name))
+            keys.insert(*std::move(key));
+    return keys;
 }
 
 void removeUnfinishedSandboxUserStateItems() {

@@ -5,6 +5,7 @@
 #include <cstdint>
 #include <expected>
 #include <optional>
+#include <set>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -23,6 +24,17 @@ inline constexpr const char* sandboxStateDirectory = "/private/var/db/sandbox-st
 [[nodiscard]] std::expected<void, Errno> setSandboxUserStateItem(std::uint32_t userId, std::uint64_t type,
                                                                  std::string_view key,
                                                                  std::optional<std::string_view> path);
+
+/// Notes on a container, whose directory is open, that it has an item of the user and type from now on, or is about to
+/// get one. The note is an extended attribute that goes with the directory and that only root can write.
+[[nodiscard]] std::expected<void, Errno> noteSandboxUserStateItem(std::uint32_t userId, std::uint64_t type,
+                                                                  int container);
+[[nodiscard]] bool hasNoteOfSandboxUserStateItem(int container);
+
+/// The keys of a user's items of one type; none at all when no container was ever noted for them, or when they cannot
+/// be listed.
+[[nodiscard]] std::optional<std::set<std::string>> keysOfSandboxUserStateItems(std::uint32_t userId,
+                                                                               std::uint64_t type);
 
 /// An item as its link has it.
 struct SandboxUserStateItem {
