@@ -244,7 +244,11 @@ bool OSTCodeSigningMapping::_migrateDataFromLegacyEntitlementsFileToCodeSigningF
         logError("Failed to write code signing mapping to disk following legacy migration: %@", stored.error());
         return false;
     }
-    if (const auto removed = OSTFileManager::defaultManager().removeItemAtURL(url); !removed)
+    const auto& files = OSTFileManager::defaultManager();
+    auto removed = files.removeItemAtURL(url);
+    if (removed) // for good: what it says would undo later registrations
+        removed = files.makeDirectoryDurable(platform::pathByDeletingLastComponent(url));
+    if (!removed)
         logError("Failed to remove legacy file at %@: %@", url, removed.error());
     logNotice("Legacy entitlement migration completed");
     return true;

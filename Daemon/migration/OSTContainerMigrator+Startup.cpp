@@ -71,6 +71,8 @@ OSTResult<void> moveIntoPlace(const std::string& from, const std::string& to, bo
         return mergeDirectory(from, to, Holds::containers);
     if (!isDirectory || !isSameContainer(from, to))
         return std::unexpected(OSTCreatePOSIXError(EEXIST, "%@ exists already, so %@ stays", to, from));
+    // An interrupted copy may not have waited for what it put there.
+    OST_TRY(files.makeDirectoryDurable(platform::pathByDeletingLastComponent(to)));
     return files.removeItemAtURL(from);
 }
 
@@ -85,6 +87,8 @@ OSTResult<void> mergeDirectory(const std::string& from, const std::string& to, H
         if (!moved)
             result = std::move(moved);
     }
+    if (result)
+        result = files.makeDirectoryDurable(to);
     return result ? files.removeItemAtURL(from) : result;
 }
 
@@ -190,7 +194,8 @@ OSTResult<void> OSTContainerMigrator::_migrateWellknownContainer(const OSTMetada
     OSTMetadata metadata = container;
     if (moved)
         metadata.url = expected;
-    if (const auto added = cache.addContainerMetadata(metadata); !added) {
+    const auto added = cache.addContainerMetadata(metadata, moved ? OSTPlacement::pending : OSTPlacement::durable);
+    if (!added) {
         logError("%s: Failed to update cache for whitelisted container %@: (error= %@: %lld)", migrationName,
                  container.identifier, added.error().domainName(), added.error().code());
         return std::unexpected(added.error());

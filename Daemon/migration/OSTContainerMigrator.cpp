@@ -23,7 +23,9 @@ OSTResult<void> standardizeACLsOfClass(OSTContainerClass containerClass) {
         OSTGlobalConfiguration::sharedInstance().containerDirectoryURLForUser(OSTSystemUserId, containerClass, false);
     if (!directory)
         return {};
-    return OSTFileManager::defaultManager().standardizeAllSystemContainerACLsAtURL(*directory);
+    const auto& files = OSTFileManager::defaultManager();
+    OST_TRY(files.standardizeAllSystemContainerACLsAtURL(*directory));
+    return files.makeFileSystemDurable(*directory); // before the marker, which ends the migration for good
 }
 
 } // namespace
@@ -70,8 +72,10 @@ OSTResult<void> OSTContainerMigrator::_performBundleContainerOwnershipMigration(
         return {};
     logNotice("Changing ownership of bundle container content.");
     const auto directory = layout.bundleDirectory();
-    const auto changed =
-        OSTFileManager::defaultManager().standardizeOwnershipAtURL(directory, OSTInstallerUserId, OSTInstallerUserId);
+    const auto& files = OSTFileManager::defaultManager();
+    auto changed = files.standardizeOwnershipAtURL(directory, OSTInstallerUserId, OSTInstallerUserId);
+    if (changed) // before the marker, which ends the migration for good
+        changed = files.makeFileSystemDurable(directory);
     if (!changed)
         return std::unexpected(OSTCreateError(OSTErrorCode::ownerChangeFailed, changed.error(),
                                               "Failed to change owner of %@: %@", directory, changed.error()));
