@@ -101,6 +101,13 @@ std::expected<void, platform::Errno> writeAtomically(std::string_view path, std:
     return writeAtomically(place, place.directory(), bytes, attributes);
 }
 
+/// Users may have items of such names.
+bool isOurs(int directory, const char* name) {
+    struct stat status{};
+    return ::fstatat(directory, name, &status, AT_SYMLINK_NOFOLLOW | AT_NO_AUTOMOUNT) == 0 &&
+           status.st_uid == ::geteuid();
+}
+
 } // namespace
 
 OSTResult<void> OSTFileManager::writeFileAtomicallyAtURL(std::string_view path, std::string_view bytes,
@@ -126,7 +133,8 @@ std::vector<std::string> OSTFileManager::unfinishedItemsInDirectoryURL(std::stri
     const std::unique_ptr<DIR, decltype(close)> stream(directory ? ::fdopendir(directory->release()) : nullptr);
     while (const dirent* const entry = stream ? ::readdir(stream.get()) : nullptr) {
         const std::string_view name = entry->d_name;
-        if (name.starts_with(OSTUnfinishedPrefix) && !name.starts_with(OSTOwnUnfinishedPrefix()))
+        if (name.starts_with(OSTUnfinishedPrefix) && !name.starts_with(OSTOwnUnfinishedPrefix()) &&
+            isOurs(::dirfd(stream.get()), entry->d_name))
             items.push_back(platform::pathByAppending(path, name));
     }
     return items;

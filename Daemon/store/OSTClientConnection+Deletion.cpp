@@ -22,9 +22,6 @@ using platform::pathByDeletingLastComponent;
 
 namespace {
 
-/// Where items go that cannot be removed.
-constexpr std::string_view parkingDirectory = "/tmp";
-
 /// How often a move to death row is tried again when a pass removed the unique directory that was made for it. A pass
 /// removes what it has listed, once, so more than a few losses in a row have another cause.
 constexpr int movesToDeathRow = 16;
@@ -209,10 +206,10 @@ OSTResult<std::optional<OSTError>> OSTClientConnection::_removeItemOrMoveToTempA
     if (!isForGood(removed.error())) // the next pass may
         return removed.error();
     platform::logDebug("Couldn't remove, so moving item to /tmp: %@ : %@", url, removed.error());
-    const auto parked = files.moveItemAtURL(url, pathByAppending(parkingDirectory, lastPathComponent(url)));
+    const auto parked = files.moveItemAtURL(url, pathByAppending(OSTParkingDirectory, lastPathComponent(url)));
     if (!parked)
         return std::unexpected(OSTCreateError(OSTErrorCode::moveAsideFailed, parked.error(),
-                                              "Failed to move dir: %@ to: %@", url, parkingDirectory));
+                                              "Failed to move dir: %@ to: %@", url, OSTParkingDirectory));
     return removed.error();
 }
 

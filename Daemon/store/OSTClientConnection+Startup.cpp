@@ -1,21 +1,42 @@
 #include "files/OSTFileManager.h"
 #include "model/OSTGlobalConfiguration.h"
 #include "platform/base/Immortal.h"
+#include "platform/base/MountPoints.h"
 #include "platform/base/Path.h"
 #include "platform/threads/Transactions.h"
 #include "store/OSTClientConnection.h"
 #include "store/OSTReplaceFile.h"
 
 #include <cerrno>
+#include <set>
+#include <string>
 
 namespace ost {
 
+using platform::pathByDeletingLastComponent;
+
 namespace {
 
-/// Removes what interrupted moves between file systems left beside containers, which may be on another file system than
-/// death row.
-void removeUnfinishedCopies() {
-    for (const auto& directory : OSTGlobalConfiguration::sharedInstance().classDirectories())
+/// Where an interrupted process may have left something unfinished: beside what it wrote, or moved between file
+/// systems.
+std::set<std::string> workshops() {
+    auto& layout = OSTGlobalConfiguration::sharedInstance();
+    std::set<std::string> directories{layout.bundleDirectory(), layout.logDirectory(),
+                                      std::string(OSTParkingDirectory)};
+    for (const auto& directory : layout.classDirectories()) {
+        directories.insert(directory);
+        // Beside the base, because those of transient containers are moved whole.
+        const auto base = pathByDeletingLastComponent(pathByDeletingLastComponent(directory));
+        directories.emplace(pathByDeletingLastComponent(base));
+    }
+    for (auto& path : platform::mountPoints())
+        if (directories.contains(std::string(pathByDeletingLastComponent(path))))
+            directories.insert(std::move(path)); // a container that is a file system of its own
+    return directories;
+}
+
+void removeUnfinishedItems() {
+    for (const auto& directory : workshops())
         OSTFileManager::defaultManager().removeUnfinishedItemsInDirectoryURL(directory);
 }
 
@@ -55,7 +76,7 @@ void OSTClientConnection::containerManagerCleanup() const {
     } else if (!items.error().isPOSIX(ENOENT)) {
         platform::logError("Failed to get items at staging URL%@ : %@", staging, items.error());
     }
-    async_with_transaction(OSTDeathRowQueue(), removeUnfinishedCopies);
+    async_with_transaction(OSTDeathRowQueue(), removeUnfinishedItems);
     deleteContainersOnDeathRowWithCompletion();
 }
 

@@ -5,6 +5,7 @@
 #include <gtest/gtest.h>
 
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <filesystem>
 
@@ -35,6 +36,28 @@ TEST_F(Reboot, TransientContainersOfEverybodyGoAndOthersStay) {
     for (const auto& transient : transients)
         EXPECT_FALSE(fs::exists(transient->url)) << transient->url;
     EXPECT_EQ(3U, names(deathRow).size());
+}
+
+TEST_F(Reboot, WhatAnEarlierProcessLeftUnfinishedGoesWhereverItIs) {
+    const auto made = make(dataApplication, "a.file.system");
+    mountOver(made->url);
+    const fs::path places[] = {applications,
+                               made->url,
+                               "/private/var/containers/Bundle",
+                               "/private/var/mobile",
+                               "/private/var/root/Library/Logs/Ostrand",
+                               "/tmp"};
+    for (const auto& place : places) {
+        test::writeFile(place / ".temp.a1b2c3.d4e5f6", "unfinished");
+        test::writeFile(place / ".temp.user", "");
+        ASSERT_EQ(0, ::lchown((place / ".temp.user").c_str(), 501, 501));
+    }
+    store().containerManagerCleanup();
+    EXPECT_EQ(1, passCode());
+    for (const auto& place : places) {
+        EXPECT_FALSE(fs::exists(place / ".temp.a1b2c3.d4e5f6")) << place;
+        EXPECT_TRUE(fs::exists(place / ".temp.user")) << place;
+    }
 }
 
 TEST_F(Reboot, OrphansOfEveryKindGoToDeathRow) {
