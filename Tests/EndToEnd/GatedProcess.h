@@ -1,6 +1,7 @@
 #pragma once
 
 #include "platform/base/FileDescriptor.h"
+#include "support/Sanitized.h"
 
 #include <sys/types.h>
 
@@ -25,6 +26,10 @@ struct Fault {
     unsigned call = 0; ///< the first one is 1
     int error = 0;     ///< of a call that fails
 };
+
+/// From one call that a fault befalls to the next, in a test that goes through all of them. Each start of a daemon
+/// takes long under a sanitizer, which is there for the ways through the code and not for each of the calls.
+inline constexpr unsigned toNextCall = isSanitized ? 5 : 1;
 
 /// A child process that makes every file-system call through a gate, where the calls are counted and faults befall
 /// them.

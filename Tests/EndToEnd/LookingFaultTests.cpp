@@ -77,7 +77,7 @@ protected:
 };
 
 TEST_F(LookingFaultTest, NoCallThatFailsInAColdScanHidesAContainer) {
-    for (unsigned call = 1;; ++call) {
+    for (unsigned call = 1;; call += toNextCall) {
         device().killDaemon();
         device().startDaemon();
         ASSERT_TRUE(device().waitForFirstPass());
@@ -173,7 +173,7 @@ TEST_F(LookingFaultTest, AMappingFileThatCannotBeReadAtOnceIsReadLater) {
     ASSERT_TRUE(ostrand::registerCodeSigning(
         connection, {kept, ost::OSTDictionary({{"com.tamarok.Ostrand.Entitlements", ost::OSTDictionary()}}),
                      ostrand::RegistrationOptions{}.dictionary()}));
-    for (unsigned call = 1;; ++call) {
+    for (unsigned call = 1;; call += toNextCall) {
         device().killDaemon();
         device().startDaemon({.kind = Fault::Kind::fail, .call = call, .error = EMFILE});
         const bool up = device().waitForFirstPass();

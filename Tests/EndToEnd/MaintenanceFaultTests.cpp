@@ -6,7 +6,6 @@
 #include "Support/ScratchDirectory.h"
 #include "platform/codec/PropertyList.h"
 #include "support/DeviceTest.h"
-#include "support/Sanitized.h"
 
 #include <gtest/gtest.h>
 
@@ -41,7 +40,7 @@ protected:
     /// Has the fault befall one call after the other of a wipe, until it comes to none.
     void wipeAtEveryCall(Fault::Kind kind) {
         std::set<bool> wiped;
-        for (unsigned call = 1; !HasFailure(); ++call) {
+        for (unsigned call = 1; !HasFailure(); call += toNextCall) {
             auto connection = device().connect();
             const auto container = make(connection, ContainerClass::dataApplication, "a");
             ASSERT_TRUE(container);
@@ -142,7 +141,7 @@ protected:
         const auto expected = migrated();
         for (const auto* const entitled : {"cached", "legacy", "grouped"})
             EXPECT_NE(expected.find(entitled), std::string::npos) << expected;
-        const unsigned step = kind == Fault::Kind::fail || isSanitized ? 5 : 1;
+        const unsigned step = kind == Fault::Kind::fail ? 5 : toNextCall;
         for (unsigned call = 1; !HasFailure(); call += step) {
             restore();
             const auto course = disturbed(Fault{.kind = kind, .call = call, .error = EIO});

@@ -270,7 +270,7 @@ protected:
         for (auto [fault, step] : rows) {
             ASSERT_NO_FATAL_FAILURE(makeBoth());
             for (bool done = false; !done;) {
-                fault.call += step;
+                fault.call += step * toNextCall;
                 device().killDaemon();
                 ASSERT_NO_FATAL_FAILURE(cutOffAfterMoves(moves));
                 device().startDaemon(fault);
@@ -297,7 +297,7 @@ protected:
 
 TEST_P(ReplacementFaultTest, AKillAtAnyMomentLeavesOneOfTheTwo) {
     std::set<Place> seen;
-    for (unsigned call = 1;; ++call) {
+    for (unsigned call = 1;; call += toNextCall) {
         ASSERT_NO_FATAL_FAILURE(makeBoth());
         const Fault fault{.kind = Fault::Kind::kill, .call = call};
         const auto attempt = replace(fault);
@@ -319,7 +319,7 @@ TEST_P(ReplacementFaultTest, AKillAtAnyMomentLeavesOneOfTheTwo) {
 TEST_P(ReplacementFaultTest, ACallThatFailsIsAnsweredTruly) {
     const bool overWire = GetParam().through == Through::wire;
     for (const int error : overWire ? std::vector{EIO, ENOSPC, EACCES} : std::vector{EIO}) {
-        for (unsigned call = 1;; ++call) {
+        for (unsigned call = 1;; call += toNextCall) {
             ASSERT_NO_FATAL_FAILURE(makeBoth());
             const Fault fault{.kind = Fault::Kind::fail, .call = call, .error = error};
             const auto attempt = replace(fault);
@@ -348,7 +348,7 @@ TEST_P(ReplacementFaultTest, ACallThatFailsIsAnsweredTruly) {
 }
 
 TEST_P(ReplacementFaultTest, WhatAFailingDiskLeavesTheNextStartPutsRight) {
-    for (unsigned call = 1;; ++call) {
+    for (unsigned call = 1;; call += toNextCall) {
         ASSERT_NO_FATAL_FAILURE(makeBoth());
         const Fault fault{.kind = Fault::Kind::failForGood, .call = call, .error = EIO};
         const auto attempt = replace(fault);
