@@ -7,6 +7,7 @@
 #include "support/Comparison.h"
 #include "support/DeviceClient.h"
 #include "support/JournaledFileSystem.h"
+#include "support/LargeTree.h"
 #include "support/OneProcessor.h"
 #include "support/Require.h"
 #include "support/RoundTrips.h"
@@ -163,19 +164,6 @@ void gettingOne(benchmark::State& state) {
 }
 
 constexpr const char* classAttribute = "trusted.ostrand.protection-class";
-constexpr unsigned directories = 1000, filesInDirectory = 100;
-
-void makeLargeTree(const std::filesystem::path& top) {
-    for (unsigned directory = 0; directory < directories; ++directory) {
-        const auto path = top / std::to_string(directory);
-        std::filesystem::create_directory(path);
-        const FileDescriptor opened(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-        for (unsigned file = 0; file < filesInDirectory; ++file)
-            require(static_cast<bool>(FileDescriptor(
-                        ::openat(opened.get(), std::to_string(file).c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0644))),
-                    path);
-    }
-}
 
 /// Reads the attribute of an item and gives it another value.
 void changeAttribute(int item, const std::string& value) {

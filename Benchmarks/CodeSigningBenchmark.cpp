@@ -3,6 +3,7 @@
 
 #include "Client/CodeSigning.h"
 #include "Client/Containers.h"
+#include "Client/Maintenance.h"
 #include "Support/BootedDevice.h"
 #include "Support/ChildProcess.h"
 #include "Support/ScratchDirectory.h"
@@ -145,6 +146,43 @@ void oneMore(benchmark::State& state) {
         .run(state);
 }
 
+/// What a release before the mapping file left.
+std::string legacyFile() {
+    std::vector<OSTDictionary::Entry> entries;
+    for (unsigned number = 0; number < identifiers; ++number)
+        entries.emplace_back(identifierOf(number), *infoOf(number).find(OSTEntitlementsKey));
+    return platform::serializeBinaryPropertyList(OSTDictionary(std::move(entries)));
+}
+
+/// Boots an image without a mapping but with the legacy file, and migrates it.
+double secondsOfMigration(const std::filesystem::path& image, const std::string& legacy) {
+    const auto mapping = image / std::filesystem::path(mappingFile).relative_path();
+    std::filesystem::remove(mapping);
+    const auto path = mapping.parent_path() / "ost_entitlements.plist";
+    writeWhole(FileDescriptor(::open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644)), legacy);
+    const BootedDevice device(image);
+    auto connection = connectTo(device);
+    const auto seconds = secondsOf([&] { require(ostrand::migrate(connection), "migrate"); });
+    if (std::filesystem::exists(path) || !std::filesystem::exists(mapping))
+        throw std::runtime_error("The legacy file is not migrated");
+    return seconds;
+}
+
+void migration(benchmark::State& state) {
+    const JournaledFileSystem disk;
+    const auto image = disk.path() / "device", bare = disk.path() / "bare";
+    std::filesystem::create_directory(bare);
+    plantMapping(image);
+    const auto legacy = legacyFile();
+    secondsOfMigration(image, legacy); // What is done once for a device is done now.
+    const auto file = mappingOf(identifiers);
+    Comparison{.unit = Unit::seconds,
+               .target = {Target::Kind::ratioAtMost, 3.0},
+               .daemon = [&] { return secondsOfMigration(image, legacy); },
+               .baseline = [&] { return secondsOfRewriting(file, bare); }}
+        .run(state);
+}
+
 std::string registrationOf(unsigned number) {
     return requestWith(4, [&](CBOREncoder& encoder) {
         encoder.key("Command");
@@ -251,6 +289,7 @@ void counting(benchmark::State& state) {
 }
 
 [[maybe_unused]] const int more = registerComparison("registration of one more among 10,000", 31, oneMore);
+[[maybe_unused]] const int migrations = registerComparison("migration of 10,000 entitlements", 7, migration);
 [[maybe_unused]] const int same = registerComparison("registration that changes nothing", 51, unchanged);
 [[maybe_unused]] const int counts = registerComparison("reference counts of 10,000 identifiers", 11, counting);
 

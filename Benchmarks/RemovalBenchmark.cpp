@@ -8,6 +8,7 @@
 #include "support/Comparison.h"
 #include "support/DeviceClient.h"
 #include "support/JournaledFileSystem.h"
+#include "support/LargeTree.h"
 #include "support/OneProcessor.h"
 #include "support/Require.h"
 #include "support/Stopwatch.h"
@@ -38,8 +39,6 @@ using platform::UUID;
 
 /// Few enough that a turn is short against the drift of the disk.
 constexpr unsigned containersInTurn = 24;
-constexpr unsigned directoriesOfLargeTree = 1000;
-constexpr unsigned filesOfLargeTree = 100'000;
 
 ostrand::Container create(ostrand::Connection& connection, const std::string& identifier, bool transient = false) {
     return require(
@@ -179,17 +178,6 @@ void replacement(benchmark::State& state) {
     Comparison{
         .unit = Unit::seconds, .target = {Target::Kind::ratioAtMost, 1.5}, .daemon = daemon, .baseline = baseline}
         .run(state);
-}
-
-void makeLargeTree(const std::filesystem::path& path) {
-    const auto top = openDirectory(path);
-    for (unsigned number = 0; number < directoriesOfLargeTree; ++number) {
-        const auto name = std::to_string(number);
-        require(::mkdirat(top.get(), name.c_str(), 0755) == 0, name);
-        const FileDescriptor directory(::openat(top.get(), name.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
-        for (unsigned file = 0; file < filesOfLargeTree / directoriesOfLargeTree; ++file)
-            require(::mknodat(directory.get(), std::to_string(file).c_str(), S_IFREG | 0644, 0) == 0, name);
-    }
 }
 
 /// A device on which a container with a large tree waits on death row, each time anew.
