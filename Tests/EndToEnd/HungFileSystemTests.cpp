@@ -5,6 +5,7 @@
 
 #include <gtest/gtest.h>
 
+#include <sched.h>
 #include <unistd.h>
 
 #include <optional>
@@ -58,6 +59,17 @@ TEST_F(HungFileSystemTest, TheServerOfAUsersFileSystemIsNotAsked) {
         for (auto& connection : connections)
             EXPECT_TRUE(connection.isClosed()) << "in the tree: " << inTheTree;
     }
+}
+
+TEST_F(HungFileSystemTest, ItsMakerDoesNotHaveToForbidSetUserIdInAMountTableOfHisOwn) {
+    ASSERT_EQ(::unshare(CLONE_NEWNS), 0);
+    ServedFileSystem fileSystem(builtProgram("wire-client"), false);
+    auto connections = connect(fileSystem);
+    fileSystem.stopAnswering();
+    for (auto& connection : connections)
+        connection.send(creation(1, "com.example.hung"));
+    for (auto& connection : connections)
+        EXPECT_TRUE(connection.isClosed());
 }
 
 TEST_F(HungFileSystemTest, AnAdministratorsThatHangsKeepsItsOwnClientsWaiting) {

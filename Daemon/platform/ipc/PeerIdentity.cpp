@@ -78,24 +78,29 @@ std::expected<Look, Errno> lookWithoutAsking(int directory, const char* name, in
     return look;
 }
 
+bool isServedByProcess(const Mount& mount) {
+    return mount.fileSystem == "fuse" || mount.fileSystem.starts_with("fuse.");
+}
+
 /// One that is mounted by a user is served by a process of that user, which need never answer; so it is told by the
-/// mount tables and not asked. The peer's own name what it sees, unless it has left its root or the mount is no longer
-/// in the tree; ours and the first process's may still know the device.
+/// mount tables and not asked. What is in the table of the first process or in ours was mounted by an administrator, or
+/// for a user by a program that sees to it that it forbids set-user-id. The peer may have a table of its own, in which
+/// it mounts what it likes.
 std::expected<bool, Errno> isOnFileSystemOfUser(int process, const Look& look) {
     // What has a disk of its own was mounted by an administrator.
     if (major(look.status.st_dev) != 0)
         return false;
-    auto mount = findMount(process, look.mount, look.status.st_dev);
-    for (const char* other : {"/proc/self", "/proc/1"}) {
-        if (mount || mount.error() != ENOENT)
-            break;
-        const FileDescriptor directory(::open(other, O_PATH | O_DIRECTORY | O_CLOEXEC));
-        if (directory)
-            mount = findMount(directory.get(), look.mount, look.status.st_dev);
+    for (const char* trusted : {"/proc/self", "/proc/1"}) {
+        const FileDescriptor directory(::open(trusted, O_PATH | O_DIRECTORY | O_CLOEXEC));
+        if (!directory)
+            return std::unexpected(errno);
+        const auto mount = findMount(directory.get(), look.mount, look.status.st_dev);
+        if (mount)
+            return isServedByProcess(*mount) && mount->forbidsSetUserId;
+        if (mount.error() != ENOENT)
+            return std::unexpected(mount.error());
     }
-    if (!mount)
-        return std::unexpected(mount.error());
-    return mount->forbidsSetUserId && (mount->fileSystem == "fuse" || mount->fileSystem.starts_with("fuse."));
+    return isServedByProcess(OST_TRY(findMount(process, look.mount, look.status.st_dev)));
 }
 
 } // namespace
