@@ -22,7 +22,7 @@ namespace {
 constexpr std::size_t longestLine = 78;
 
 /// A word as the formatter prints it.
-std::string quoted(std::string_view word) {
+std::string escaped(std::string_view word) {
     std::string out;
     for (const char letter : word)
         out += letter == '\\' ? std::string("\\e") : std::string(1, letter);
@@ -40,7 +40,7 @@ std::string prose(std::string_view text) {
             out += line + "\n";
             line.clear();
         }
-        line += (line.empty() ? quoted(word) : " " + quoted(word));
+        line += (line.empty() ? escaped(word) : " " + escaped(word));
         if (word.find_last_of(".!?") == word.size() - 1) {
             out += line + "\n";
             line.clear();
@@ -56,7 +56,7 @@ std::string sentence(std::string_view text) {
     return prose(out.ends_with('.') ? out : out + ".");
 }
 
-std::string literal(std::string_view text) { return ".Bd -literal -compact\n" + quoted(text) + "\n.Ed\n"; }
+std::string literal(std::string_view text) { return ".Bd -literal -compact\n" + escaped(text) + "\n.Ed\n"; }
 
 /// The argument of a macro that says what a value is.
 std::string argument(std::string_view name) { return name.empty() ? "" : " Ar " + std::string(name); }
