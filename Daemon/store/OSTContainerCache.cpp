@@ -33,7 +33,7 @@ public:
     explicit CacheLock(platform::Mutex& mutex) OST_ACQUIRE(mutex) : _mutex(mutex) {
         if (_mutex.try_lock())
             return;
-        const platform::BlockingSection blocking;
+        const platform::BlockingSection blocking(platform::BlockingSection::Turn::keep);
         _mutex.lock();
     }
     CacheLock(const CacheLock&) = delete;

@@ -103,7 +103,7 @@ template<typename Predicate>
 void wait(platform::Condition& condition, platform::MutexLock& lock, Predicate predicate) OST_REQUIRES(tableMutex) {
     if (predicate() || comesSoon(predicate) || condition.waitFor(lock, shortWait, predicate))
         return;
-    const platform::BlockingSection blocking;
+    const platform::BlockingSection blocking(platform::BlockingSection::Turn::keep);
     condition.wait(lock, predicate);
 }
 

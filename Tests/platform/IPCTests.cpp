@@ -40,6 +40,7 @@ enum Command : std::uint64_t {
     refuse,   ///< cancels the connection
     silence,  ///< gives no reply
     wait,     ///< replies once the service's gate is open, waiting in a blocking section
+    stand,    ///< the same, keeping the user's turn
     openGate, ///< opens the gate
     fill,     ///< replies with as many bytes as "Value" says
     fail,     ///< throws
@@ -112,7 +113,10 @@ private:
         case silence:
             return;
         case wait:
-            _wait();
+            _wait(BlockingSection::Turn::giveAway);
+            break;
+        case stand:
+            _wait(BlockingSection::Turn::keep);
             break;
         case openGate:
             gate.count_down();
@@ -130,8 +134,8 @@ private:
         reply->send();
     }
 
-    void _wait() {
-        const BlockingSection section;
+    void _wait(BlockingSection::Turn turn) {
+        const BlockingSection section(turn);
         _count(waiting);
         gate.wait();
     }
@@ -361,7 +365,7 @@ TEST(IPC, RequestsThatWaitKeepNobodyFromBeingServed) {
     Service service;
     std::vector<Client> clients(waiters);
     for (auto& client : clients) {
-        client.connect(service);
+        client.connectAs(501, service);
         client.send(request(1, wait));
     }
     Service::await(service.waiting, waiters);
@@ -371,6 +375,28 @@ TEST(IPC, RequestsThatWaitKeepNobodyFromBeingServed) {
     EXPECT_EQ(other.receiveNumber(), 2);
     for (auto& client : clients)
         EXPECT_EQ(client.receiveNumber(), 1);
+}
+
+TEST(IPC, AUserStandsBeforeOthersWithFewRequestsAtATime) {
+    Service service({.turnsOfOneUser = 2});
+    std::vector<Client> clients(16);
+    for (auto& client : clients) {
+        client.connectAs(501, service);
+        client.send(request(1, stand) + request(2, echo));
+    }
+    Client other;
+    other.connectAs(502, service);
+    for (std::uint32_t number = 1; number <= 100; ++number) {
+        other.send(request(number, echo));
+        EXPECT_EQ(other.receiveNumber(), number);
+    }
+    Service::await(service.waiting, 2);
+    EXPECT_EQ(service.waiting, 2);
+    other.send(request(1, openGate));
+    for (auto& client : clients) {
+        EXPECT_EQ(client.receiveNumber(), 1);
+        EXPECT_EQ(client.receiveNumber(), 2);
+    }
 }
 
 TEST(IPC, ClientsWithoutEndLeaveOthersTheirTurn) {

@@ -21,6 +21,8 @@ using Clock = std::chrono::steady_clock;
 
 /// Requests handled, and receptions done, before a client that goes on and on lets others have their turn.
 constexpr unsigned stepsInARow = 16;
+/// How long a connection that shares its user's turns goes on with one of them.
+constexpr std::chrono::microseconds longEnough{100};
 
 constexpr std::uint32_t receptionEvents = EPOLLIN | EPOLLRDHUP;
 constexpr std::uint32_t hangUpEvents = EPOLLHUP | EPOLLERR;
@@ -106,12 +108,15 @@ void IPCConnection::_serveEvents(std::uint32_t events, std::span<char> scratch) 
 
 void IPCConnection::_receive(std::span<char> scratch) {
     bool drained = false;
+    const auto begin = takesTurns() ? Clock::now() : Time{};
     for (unsigned step = 0; step < stepsInARow; ++step) {
         if (_end.load() != End::none || _surroundings.pool.isStopping())
             return;
-        if (auto frame = _reader.next())
+        if (auto frame = _reader.next()) {
             _handle(*std::move(frame));
-        else if (frame.error() == IPCFrameReader::Result::malformed) {
+            if (takesTurns() && Clock::now() - begin > longEnough)
+                break;
+        } else if (frame.error() == IPCFrameReader::Result::malformed) {
             if (!_allowsLongFrame())
                 return;
         } else if (drained)

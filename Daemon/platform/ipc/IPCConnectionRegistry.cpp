@@ -25,8 +25,8 @@ IPCLimits IPCLimits::withDescriptors(std::size_t descriptors) const {
     return limits;
 }
 
-std::expected<void, const char*> IPCConnectionRegistry::add(const std::shared_ptr<IPCConnection>& connection,
-                                                            uid_t user) {
+std::expected<std::shared_ptr<TurnGroup>, const char*>
+IPCConnectionRegistry::add(const std::shared_ptr<IPCConnection>& connection, uid_t user) {
     const MutexLock lock(_mutex);
     if (_connections.size() >= _limits.connections)
         return std::unexpected("too many connections");
@@ -35,24 +35,31 @@ std::expected<void, const char*> IPCConnectionRegistry::add(const std::shared_pt
     if (user > 0 && _countOf(user) >= _limits.connectionsOfOneUser)
         return std::unexpected("too many connections of its user");
     _connections.emplace(connection.get(), connection);
-    ++_connectionsOfUser[user];
-    return {};
+    auto& ofUser = _users[user];
+    if (++ofUser.connections == 1 && user > 0)
+        ofUser.turns = std::make_shared<TurnGroup>(_limits.turnsOfOneUser);
+    return ofUser.turns;
 }
 
 std::size_t IPCConnectionRegistry::_countOf(uid_t user) const {
-    const auto found = _connectionsOfUser.find(user);
-    return found == _connectionsOfUser.end() ? 0 : found->second;
+    const auto found = _users.find(user);
+    return found == _users.end() ? 0 : found->second.connections;
 }
 
 void IPCConnectionRegistry::remove(IPCConnection& connection, uid_t user) {
+    std::shared_ptr<TurnGroup> unusedTurns;
     {
         const MutexLock lock(_mutex);
         if (_connections.erase(&connection) == 0)
             return;
-        const auto ofUser = _connectionsOfUser.find(user);
-        if (--ofUser->second == 0)
-            _connectionsOfUser.erase(ofUser);
+        const auto ofUser = _users.find(user);
+        if (--ofUser->second.connections == 0) {
+            unusedTurns = std::move(ofUser->second.turns);
+            _users.erase(ofUser);
+        }
     }
+    if (unusedTurns)
+        unusedTurns->clear();
     if (_removalHandler)
         _removalHandler();
 }

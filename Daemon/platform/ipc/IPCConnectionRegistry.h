@@ -2,6 +2,7 @@
 
 #include "platform/base/Mutex.h"
 #include "platform/ipc/IPCLimits.h"
+#include "platform/threads/TurnGroup.h"
 
 #include <sys/types.h>
 
@@ -24,14 +25,21 @@ public:
     /// Called after each removal. To be set before the first connection is added.
     void setRemovalHandler(std::function<void()> handler) { _removalHandler = std::move(handler); }
 
-    /// Takes a connection of `user` in, or says which limit refuses it.
-    [[nodiscard]] std::expected<void, const char*> add(const std::shared_ptr<IPCConnection>& connection, uid_t user);
+    /// Takes a connection of `user` in and gives the turns that it shares with the user's others, null for root's; or
+    /// says which limit refuses it.
+    [[nodiscard]] std::expected<std::shared_ptr<TurnGroup>, const char*>
+    add(const std::shared_ptr<IPCConnection>& connection, uid_t user);
     /// Lets a connection of `user` go; one that was not taken in changes nothing.
     void remove(IPCConnection& connection, uid_t user);
 
     [[nodiscard]] std::vector<std::shared_ptr<IPCConnection>> all() const;
 
 private:
+    struct User {
+        std::size_t connections = 0;
+        std::shared_ptr<TurnGroup> turns;
+    };
+
     [[nodiscard]] std::size_t _countOf(uid_t user) const OST_REQUIRES(_mutex);
 
     const IPCLimits& _limits;
@@ -39,7 +47,7 @@ private:
 
     mutable Mutex _mutex;
     std::unordered_map<IPCConnection*, std::shared_ptr<IPCConnection>> _connections OST_GUARDED_BY(_mutex);
-    std::unordered_map<uid_t, std::size_t> _connectionsOfUser OST_GUARDED_BY(_mutex);
+    std::unordered_map<uid_t, User> _users OST_GUARDED_BY(_mutex);
 };
 
 } // namespace ost::platform

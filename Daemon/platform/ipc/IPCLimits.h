@@ -13,6 +13,7 @@ struct IPCLimits {
     std::size_t connections = 4096;           ///< in all
     std::size_t connectionsKeptForRoot = 256; ///< of these; so the others can never lock root out
     std::size_t connectionsOfOneUser = 256;   ///< of a user id above 0, so that no user can take them all
+    unsigned turnsOfOneUser = 2;              ///< connections of a user id above 0 that are served at a time
     std::uint32_t payload = IPCFrameHeader::maximumPayload;
     std::uint32_t payloadWithoutEntitlements = 64 * 1024; ///< of a program that may run no command anyway
     std::size_t unreadReplies = 64 * 1024 * 1024;         ///< bytes kept for a client that does not read

@@ -98,6 +98,7 @@ private:
         const auto connection =
             std::make_shared<IPCConnection>(std::exchange(_next, {}), *std::move(peer), _surroundings);
         if (const auto added = _surroundings.registry.add(connection, connection->peer().effectiveUserId())) {
+            connection->setTurns(*added);
             _introduce(connection);
         } else {
             logError("connection of pid %d closed: %s", connection->peer().processId(), added.error());

@@ -9,10 +9,17 @@ namespace ost::platform {
 /// Entering and leaving cost a mutex, and entering may wake a thread: try a lock first, and enter only if it is taken.
 class BlockingSection {
 public:
-    BlockingSection();
+    /// Whether others of the same `TurnGroup` are served meanwhile: not while waiting for a lock that everybody needs,
+    /// because each of them would come to stand before other users' requests.
+    enum class Turn : bool { giveAway, keep };
+
+    explicit BlockingSection(Turn turn = Turn::giveAway);
     ~BlockingSection();
     BlockingSection(const BlockingSection&) = delete;
     BlockingSection& operator=(const BlockingSection&) = delete;
+
+private:
+    bool _gaveTurnAway = false;
 };
 
 } // namespace ost::platform

@@ -4,8 +4,11 @@
 #include <cstdint>
 #include <memory>
 #include <span>
+#include <utility>
 
 namespace ost::platform {
+
+class TurnGroup;
 
 /// Something that a `WorkerPool` serves: the object behind a watched descriptor.
 ///
@@ -27,6 +30,11 @@ public:
 protected:
     EventSource() = default;
 
+    /// The group in which it takes turns; without one it is served whenever there is something to serve. To be set
+    /// before it is watched or posted.
+    void setTurns(std::shared_ptr<TurnGroup> turns) { _turns = std::move(turns); }
+    [[nodiscard]] bool takesTurns() const { return _turns != nullptr; }
+
 private:
     friend class WorkerPool;
 
@@ -35,6 +43,7 @@ private:
     virtual void serve(std::uint32_t events, std::span<char> scratch) = 0;
 
     static constexpr std::uint32_t _running = 1U << 23;
+    std::shared_ptr<TurnGroup> _turns;
     std::atomic<std::uint32_t> _state{0}; ///< events to be served, and _running while they are being served or queued
 };
 

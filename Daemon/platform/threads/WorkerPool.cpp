@@ -4,6 +4,7 @@
 #include "platform/base/Log.h"
 #include "platform/threads/BlockingSection.h"
 #include "platform/threads/ThreadName.h"
+#include "platform/threads/TurnGroup.h"
 
 #include <sys/epoll.h>
 #include <sys/eventfd.h>
@@ -34,6 +35,8 @@ constexpr std::uint64_t wakeEverybody = std::uint64_t{1} << 62;
 /// The pool whose thread this is, and how many blocking sections it is inside.
 thread_local WorkerPool* currentPool = nullptr;
 thread_local unsigned blockingDepth = 0;
+/// The group of the source that this thread serves.
+thread_local TurnGroup* currentTurns = nullptr;
 
 unsigned runningThreadsFor(const WorkerPool::Options& options) {
     return options.runningThreads > 0 ? options.runningThreads : std::max(2U, std::thread::hardware_concurrency());
@@ -220,14 +223,22 @@ void WorkerPool::_returnFromBlocking() {
     ++_runningThreads;
 }
 
-BlockingSection::BlockingSection() {
-    if (currentPool && blockingDepth++ == 0)
-        currentPool->_replaceBlockedThread();
+BlockingSection::BlockingSection(Turn turn) {
+    if (!currentPool || blockingDepth++ > 0)
+        return;
+    currentPool->_replaceBlockedThread();
+    if (turn == Turn::giveAway && currentTurns) {
+        _gaveTurnAway = true;
+        currentPool->_giveTurnBack(*currentTurns);
+    }
 }
 
 BlockingSection::~BlockingSection() {
-    if (currentPool && --blockingDepth == 0)
-        currentPool->_returnFromBlocking();
+    if (!currentPool || --blockingDepth > 0)
+        return;
+    if (_gaveTurnAway)
+        currentTurns->takeAnyway();
+    currentPool->_returnFromBlocking();
 }
 
 // Sources
@@ -281,8 +292,18 @@ void WorkerPool::remove(Watch watch, int fd) {
 }
 
 void WorkerPool::post(const std::shared_ptr<EventSource>& source, std::uint32_t events) {
-    if ((source->_state.fetch_or(events | EventSource::_running) & EventSource::_running) == 0)
+    if ((source->_state.fetch_or(events | EventSource::_running) & EventSource::_running) == 0 && _mayRun(source))
         _enqueue(source);
+}
+
+/// Takes the turn that a source needs; one that gets none is kept by its group, and served when it has one.
+bool WorkerPool::_mayRun(const std::shared_ptr<EventSource>& source) {
+    return !source->_turns || source->_turns->take(source);
+}
+
+void WorkerPool::_giveTurnBack(TurnGroup& turns) {
+    if (auto next = turns.giveBack())
+        _enqueue(std::move(next));
 }
 
 void WorkerPool::_enqueue(std::shared_ptr<EventSource> source) {
@@ -303,7 +324,8 @@ void WorkerPool::_serveWatched(std::uint64_t watch, std::uint32_t events, std::s
         if (slot.generation == watch >> 32)
             source = slot.source;
     }
-    if (source && (source->_state.fetch_or(events | EventSource::_running) & EventSource::_running) == 0)
+    if (source && (source->_state.fetch_or(events | EventSource::_running) & EventSource::_running) == 0 &&
+        _mayRun(source))
         _run(source, scratch);
 }
 
@@ -324,16 +346,25 @@ void WorkerPool::_servePosted(std::span<char> scratch) {
     _run(source, scratch);
 }
 
-/// Serves a source whose running bit this thread holds, until nothing is left to serve or its share is used up.
+/// Serves a source whose running bit and turn this thread holds, until nothing is left to serve or its share is used
+/// up.
 void WorkerPool::_run(const std::shared_ptr<EventSource>& source, std::span<char> scratch) {
-    for (unsigned round = 0; round < roundsInARow && !_stopping.load(std::memory_order_relaxed); ++round) {
+    const auto turns = source->_turns;
+    currentTurns = turns.get();
+    bool finished = false;
+    for (unsigned round = 0; !finished && round < roundsInARow && !_stopping.load(std::memory_order_relaxed); ++round) {
         const auto events = source->_state.exchange(EventSource::_running) & ~EventSource::_running;
         source->serve(events, scratch);
         auto expected = EventSource::_running;
-        if (source->_state.compare_exchange_strong(expected, 0))
-            return;
+        finished = source->_state.compare_exchange_strong(expected, 0);
+        if (turns) // is one share
+            break;
     }
-    _enqueue(source);
+    currentTurns = nullptr;
+    if (turns)
+        _giveTurnBack(*turns);
+    if (!finished && _mayRun(source))
+        _enqueue(source);
 }
 
 } // namespace ost::platform

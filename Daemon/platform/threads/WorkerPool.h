@@ -29,7 +29,7 @@ namespace ost::platform {
 ///
 /// A source is watched edge-triggered and registered once; an event that arrives while its source is being served is
 /// remembered in the source. One that is still not finished after some rounds goes to the end of a queue, so no source
-/// can keep the others waiting.
+/// can keep the others waiting. Sources that share turns are served only as many at a time as there are turns.
 ///
 /// Threads: any may call. Destroying the pool stops it and waits for every thread.
 class WorkerPool {
@@ -93,6 +93,8 @@ private:
     void _serveWatched(std::uint64_t watch, std::uint32_t events, std::span<char> scratch);
     void _servePosted(std::span<char> scratch);
     void _run(const std::shared_ptr<EventSource>& source, std::span<char> scratch);
+    [[nodiscard]] static bool _mayRun(const std::shared_ptr<EventSource>& source);
+    void _giveTurnBack(TurnGroup& turns);
     void _enqueue(std::shared_ptr<EventSource> source);
 
     // Constant after construction.
