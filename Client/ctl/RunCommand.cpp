@@ -5,6 +5,7 @@
 #include "Client/Upcall.h"
 #include "Client/ctl/Commands.h"
 #include "Client/ctl/Values.h"
+#include "platform/base/FileName.h"
 #include "platform/base/Path.h"
 #include "platform/base/Try.h"
 #include "platform/device/Accounts.h"
@@ -18,6 +19,7 @@
 #include <algorithm>
 #include <array>
 #include <cerrno>
+#include <climits>
 #include <filesystem>
 #include <span>
 #include <utility>
@@ -111,6 +113,15 @@ std::expected<ProcessContainers, Failure> containersOf(const Device& device, con
         return std::unexpected(
             Failure::local(escaped(identifierOf(process)) + ": " + containers.error().description()));
     return *std::move(containers);
+}
+
+/// An application that runs is on record under its identifier, which has to fit there before anything is made.
+std::expected<void, Failure> refuseUnrecordable(const std::string& identifier) {
+    const auto name = ost::platform::fileNameForKey(identifier);
+    if (!name.empty() && name.size() <= NAME_MAX)
+        return {};
+    return std::unexpected(Failure::local("an identifier of " + std::to_string(identifier.size()) +
+                                          " bytes cannot be that of a program that runs"));
 }
 
 // --print
@@ -329,6 +340,7 @@ Outcome launch(const Arguments& arguments, const Device& device, Program program
     if (!arguments.has(unconfinedOption.name))
         confinement = OST_TRY(systemConfinement(program, device));
     auto groups = OST_TRY(groupsOf(account, device));
+    OST_TRY(refuseUnrecordable(identifierOf(process)));
     const auto containers = OST_TRY(containersOf(device, process));
     OST_TRY(refuseLineBreaks(containers));
     if (confinement)

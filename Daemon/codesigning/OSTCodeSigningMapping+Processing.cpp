@@ -1,6 +1,7 @@
 #include "Protocol/OSTEntitlements.h"
 #include "codesigning/OSTCodeSigningMapping.h"
 #include "codesigning/OSTGroupManager.h"
+#include "model/OSTContainerName.h"
 #include "model/OSTFailureReport.h"
 #include "platform/base/Assert.h"
 #include "platform/base/Log.h"
@@ -17,6 +18,21 @@ namespace {
 const OSTDictionary* entitlementsOf(const std::shared_ptr<const OSTDictionary>& info) {
     const auto* const value = info ? info->find(OSTEntitlementsKey) : nullptr;
     return value ? value->asDictionary() : nullptr;
+}
+
+bool isTooLong(std::string_view identifier) { return identifier.size() > OSTLongestIdentifier; }
+
+bool isTooLongText(const OSTValue& value) { return value.asString() && isTooLong(*value.asString()); }
+
+bool namesTooLongGroup(const OSTDictionary* entitlements) {
+    for (const auto& keys : {OSTGroupKeys::application, OSTGroupKeys::system})
+        for (const char* const key : {keys.key, keys.fallbackKey}) {
+            const auto* const groups = entitlements && key ? entitlements->find(key) : nullptr;
+            if (groups && (isTooLongText(*groups) ||
+                           (groups->asArray() && std::ranges::any_of(*groups->asArray(), isTooLongText))))
+                return true;
+        }
+    return false;
 }
 
 /// The lines of all its steps go by the operation's name.
@@ -46,6 +62,11 @@ OSTCodeSigningMapping::processCodeSigningInfo(const std::shared_ptr<const OSTDic
         return std::unexpected(OSTErrorCode::noProcessingResult);
     if (!identifier)
         return std::unexpected(OSTErrorCode::noIdentifier);
+    if (info && (isTooLong(*identifier) || isTooLong(options.parentBundleIdentifier.value_or(std::string())) ||
+                 namesTooLongGroup(entitlementsOf(info)))) {
+        logOfProcessing("An identifier of the registration of %@ is too long", *identifier);
+        return std::unexpected(OSTErrorCode::invalidObject);
+    }
     const OSTAllIdentifiersLock lock(OSTLockKind::writing);
     return _sync([&] { return _onQueue_processCodeSigningInfo(info, *identifier, options); });
 }

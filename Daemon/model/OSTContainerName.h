@@ -3,11 +3,16 @@
 #include "Protocol/OSTContainerClass.h"
 #include "platform/base/UUID.h"
 
+#include <cstddef>
 #include <cstdint>
 #include <optional>
 #include <string_view>
 
 namespace ost {
+
+/// The longest identifier, in bytes, under which something is made, registered or set: with paths and UUIDs beside
+/// them, thousands of such fit into one reply. What is on disk under a longer one stays valid.
+inline constexpr std::size_t OSTLongestIdentifier = 1024;
 
 /// What names one container among all: at most one has a name at a time.
 ///

@@ -96,6 +96,9 @@ std::expected<void, OSTErrorCode> OSTClientConnection::setInfoValue(const std::o
         if (!key)
             return std::unexpected(
                 OSTCreateError(OSTErrorCode::invalidParameter, "Can't set nil or non-VxString key: %@", key));
+        if (value && key->size() > OSTLongestIdentifier)
+            return std::unexpected(
+                OSTCreateError(OSTErrorCode::invalidParameter, "Can't set a key of %llu bytes", key->size()));
         const OSTIdentifierLock lock({container.uuid->string()}, OSTLockKind::writing,
                                      useLocking == OSTUseLocking::yes);
         const auto record = OST_TRY(_container(container));

@@ -124,6 +124,8 @@ OSTResult<OSTClientConnection::LookUpResult> OSTClientConnection::_lookUp(const 
     const auto found = OSTContainerCache::sharedInstance().entryForUser(lookup.name);
     if (found && !lookup.name.transient)
         return LookUpResult{.entry = *found};
+    if (lookup.createIfNecessary && (found || found.error().is(OSTErrorCode::notFound)))
+        OST_TRY(_checkNewIdentifier(lookup.name));
     if (found) {
         // A transient container is never reused.
         const auto& url = found->record->url;
@@ -142,6 +144,14 @@ OSTResult<OSTClientConnection::LookUpResult> OSTClientConnection::_lookUp(const 
         return std::unexpected(OSTCreateError(OSTErrorCode::notFound, OSTLogging::silent, nullptr,
                                               "Container with identifier: \"%@\" Not Found", lookup.name.identifier));
     return LookUpResult{.threwTransientAway = found.has_value()};
+}
+
+OSTResult<void> OSTClientConnection::_checkNewIdentifier(const OSTContainerName& name) {
+    if (name.identifier->size() <= OSTLongestIdentifier)
+        return {};
+    return std::unexpected(OSTCreateError(
+        OSTErrorCode::invalidObject, "Can't make a container with an identifier of %llu bytes: userId: %u, class: %ld",
+        name.identifier->size(), name.userId, name.containerClass));
 }
 
 OSTResult<OSTMetadata> OSTClientConnection::_buildInStaging(const OSTContainerName& name, std::string& staging) {

@@ -217,6 +217,7 @@ private:
         bool threwTransientAway = false;
     };
     [[nodiscard]] OSTResult<LookUpResult> _lookUp(const OSTContainerLookup& lookup) const;
+    [[nodiscard]] static OSTResult<void> _checkNewIdentifier(const OSTContainerName& name);
     [[nodiscard]] static OSTResult<OSTMetadata> _buildInStaging(const OSTContainerName& name, std::string& staging);
     [[nodiscard]] static OSTResult<OSTCacheEntry> _putInPlace(OSTMetadata metadata, std::string& staging);
     [[nodiscard]] static OSTResult<OSTCacheEntry> _putInPlaceOfThrownAway(const OSTContainerName& name,

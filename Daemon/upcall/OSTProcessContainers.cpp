@@ -3,6 +3,7 @@
 #include "Protocol/OSTContainerClass.h"
 #include "Protocol/OSTUpcall.h"
 #include "codesigning/OSTCodeSigningMapping.h"
+#include "model/OSTContainerName.h"
 #include "model/OSTGlobalConfiguration.h"
 #include "platform/base/Log.h"
 #include "platform/base/Path.h"
@@ -12,6 +13,7 @@
 #include "platform/ipc/UpcallPacket.h"
 #include "store/OSTClientConnection.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <optional>
 #include <string>
@@ -45,6 +47,15 @@ struct ProcessRequest {
     std::uint32_t type = applicationType;
     std::vector<std::string_view> appGroupIds;
     std::vector<std::string_view> systemGroupIds;
+
+    /// Nothing is made for a process that also asks under an identifier too long for anything to be made: it could not
+    /// get all that it asks for.
+    [[nodiscard]] bool mayMakeContainers() const {
+        const auto fits = [](std::string_view identifier) { return identifier.size() <= OSTLongestIdentifier; };
+        const auto data = containerId ? containerId : codeSignatureId;
+        return fits(data.value_or("")) && fits(systemContainerId.value_or("")) &&
+               std::ranges::all_of(appGroupIds, fits) && std::ranges::all_of(systemGroupIds, fits);
+    }
 };
 
 template<typename Value>
@@ -128,9 +139,10 @@ struct ProcessContainers {
 
 using LookupResult = std::expected<OSTMetadataRecord, OSTErrorCode>;
 
-LookupResult lookUp(std::uint32_t userId, std::string_view identifier, OSTContainerClass containerClass) {
+LookupResult lookUp(const ProcessRequest& request, std::uint32_t userId, std::string_view identifier,
+                    OSTContainerClass containerClass) {
     return OSTClientConnection::sharedClientConnection().createOrLookupContainerForUser(
-        {.name = {userId, containerClass, identifier}, .createIfNecessary = true});
+        {.name = {userId, containerClass, identifier}, .createIfNecessary = request.mayMakeContainers()});
 }
 
 /// The class of the data container: what the mapping knows, seen beside what the sandbox says.
@@ -156,7 +168,7 @@ void findDataContainer(const ProcessRequest& request, ProcessContainers& found) 
     const auto identifier = request.containerId ? request.containerId : request.codeSignatureId;
     if (!identifier)
         return;
-    const auto container = lookUp(request.userId, *identifier, dataClassFor(*identifier, request.type));
+    const auto container = lookUp(request, request.userId, *identifier, dataClassFor(*identifier, request.type));
     if (container) {
         found.data = *container;
         return;
@@ -168,7 +180,7 @@ void findDataContainer(const ProcessRequest& request, ProcessContainers& found) 
 void findSystemContainer(const ProcessRequest& request, ProcessContainers& found) {
     if (!request.systemContainerId)
         return;
-    const auto container = lookUp(OSTSystemUserId, *request.systemContainerId, OSTContainerClass::dataSystem);
+    const auto container = lookUp(request, OSTSystemUserId, *request.systemContainerId, OSTContainerClass::dataSystem);
     if (container) {
         found.system = *container;
         return;
@@ -180,7 +192,7 @@ void findSystemContainer(const ProcessRequest& request, ProcessContainers& found
 
 void findAppGroups(const ProcessRequest& request, ProcessContainers& found) {
     for (const auto identifier : request.appGroupIds) {
-        const auto container = lookUp(request.userId, identifier, OSTContainerClass::sharedAppGroup);
+        const auto container = lookUp(request, request.userId, identifier, OSTContainerClass::sharedAppGroup);
         if (container) {
             found.appGroups.emplace_back(identifier, *container);
             continue;
@@ -192,7 +204,7 @@ void findAppGroups(const ProcessRequest& request, ProcessContainers& found) {
 
 void findSystemGroups(const ProcessRequest& request, ProcessContainers& found) {
     for (const auto identifier : request.systemGroupIds) {
-        const auto container = lookUp(OSTSystemUserId, identifier, OSTContainerClass::sharedSystemGroup);
+        const auto container = lookUp(request, OSTSystemUserId, identifier, OSTContainerClass::sharedSystemGroup);
         if (container) {
             found.systemGroups.emplace_back(identifier, *container);
             continue;

@@ -275,22 +275,31 @@ TEST_F(RequestTest, CreatesOnceFindsAndLists) {
     EXPECT_EQ(refused.keys(), "ReplyError");
 }
 
-TEST_F(RequestTest, AReplyThatNoFrameHoldsIsAnErrorAndNotTheEnd) {
+TEST_F(RequestTest, AListingThatNoFrameHoldsLacksTheLongestIdentifiers) {
     for (char name = 'a'; name < 'a' + 17; ++name) {
         const std::string url = "/private/var/mobile/Containers/Data/Application/" + std::string(1, name);
         std::filesystem::create_directories(device().onHost(url));
         ASSERT_TRUE((OSTMetadata{.uid = 501,
                                  .uuid = platform::UUID::generate(),
                                  .containerClass = OSTContainerClass::dataApplication,
-                                 .identifier = std::string(1'040'000, name),
+                                 .identifier = std::string(name == 'c' ? 1'040'001 : 1'040'000, name),
                                  .url = device().onHost(url)}
                          .writeMetadataToDisk()));
     }
     const auto caller = client(allowed());
-    auto connection = caller.connect();
-    const auto listing = request(1, {{"Command", number(1)}, {"ContainerClass", number(2)}, {"UserID", number(501)}});
-    EXPECT_EQ(connection.call(listing).error(), std::uint64_t{EMSGSIZE});
-    EXPECT_EQ(connection.call(listing).keys(), "ReplyError");
+    DeviceLog log(device());
+    const auto listing = caller.connect().call(
+        request(1, {{"Command", number(1)}, {"ContainerClass", number(2)}, {"UserID", number(501)}}));
+    EXPECT_EQ(listing.error(), 1U);
+    std::string first;
+    for (const auto& identifier : listing.texts("ReplyIdsArray"))
+        first += identifier[0];
+    std::ranges::sort(first);
+    EXPECT_EQ(first, "abdefghijklmnopq");
+    EXPECT_EQ(listing.uuids("ReplyUUIDsArray").size(), first.size());
+    const auto errors = log.takeErrors();
+    ASSERT_EQ(errors.size(), 1U);
+    EXPECT_NE(errors[0].find("/Data/Application/c)"), std::string::npos) << errors[0];
 }
 
 TEST_F(RequestTest, RepliesComeInOrderUnderTheNumbersOfTheirRequests) {

@@ -184,6 +184,8 @@ TEST_F(RunTest, WhatCannotBeRunMakesNothing) {
         {{"--identifier", app, "--", scratch / "data"}, "Permission denied", false},
         {{"--identifier", app, "--", scratch}, "Permission denied", false},
         {{"--", "/bin/true"}, "is not signed with an identifier", false},
+        {{"--identifier", "", "--", "/bin/true"}, "an identifier of 0 bytes", false},
+        {{"--identifier", std::string(256, 'a'), "--", "/bin/true"}, "an identifier of 256 bytes", false},
         {{"--identifier", app, "--user", "502", "--", "/bin/true"}, "no account of user 502", false},
         {{"--identifier", app, "--user", "4294967797", "--", "/bin/true"}, "no account of user", false},
         {{"--identifier", app, "--user", "root", "--", "/bin/true"}, "the daemon's log says which", false},

@@ -78,6 +78,19 @@ TEST_F(CodeSigningProcessing, ARegistrationCountsAndNothingOfTheOneBefore) {
     EXPECT_EQ(OSTErrorCode::noIdentifier, codeOf(mapping().processCodeSigningInfo(nullptr, std::nullopt, {})));
 }
 
+TEST_F(CodeSigningProcessing, NoIdentifierOfARegistrationIsEndless) {
+    const std::string endless(1025, 'a');
+    const auto group = "systemgroup." + endless;
+    EXPECT_EQ(OSTErrorCode::invalidObject, registerEntitlements(endless, OSTDictionary()));
+    EXPECT_EQ(OSTErrorCode::invalidObject,
+              registerEntitlements(app, OSTDictionary(), {.parentBundleIdentifier = endless}));
+    EXPECT_EQ(OSTErrorCode::invalidObject, registerEntitlements(app, test::appGroups({"g", endless})));
+    EXPECT_EQ(OSTErrorCode::invalidObject,
+              registerEntitlements(app, OSTDictionary({{test::olderSystemGroupsKey, group}})));
+    EXPECT_FALSE(mapping().codeSigningInfoExistForIdentifier(app));
+    EXPECT_EQ(OSTErrorCode::success, registerEntitlements(app, test::appGroups({std::string(1024, 'a')})));
+}
+
 TEST_F(CodeSigningProcessing, ChildrenAreLinkedToTheirParentAndDroppedWithTheirEntries) {
     const auto registerChild = [](std::string_view child) {
         return registerEntitlements(child, OSTDictionary(), {.parentBundleIdentifier = app});
@@ -176,7 +189,7 @@ TEST_F(CodeSigningProcessing, NoPathIsMadeOfAnIdentifier) {
                                                   "/private/var/evil",
                                                   "a/evil\n\t\x01\x7f",
                                                   "evil \u65e5\u672c",
-                                                  std::string(100'000, 'e'),
+                                                  std::string(1000, 'e'),
                                                   "evil%2f..%2f",
                                                   ".evil"};
     for (const auto& identifier : identifiers) {

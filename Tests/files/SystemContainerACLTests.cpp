@@ -55,7 +55,9 @@ int openFile(const std::string& path, int flags) {
     return file ? 0 : errno;
 }
 
-int makeDirectory(const std::string& path) { return ::mkdir(path.c_str(), 0777) == 0 ? 0 : errno; }
+int errnoOf(int result) { return result == 0 ? 0 : errno; }
+
+int makeDirectory(const std::string& path) { return errnoOf(::mkdir(path.c_str(), 0777)); }
 
 class SystemContainerACLTest : public test::DeviceTest {
 protected:
@@ -99,6 +101,16 @@ TEST_F(SystemContainerACLTest, OnlySystemServicesGetIntoANewContainer) {
     expectServiceAccess(std::string(container) + "/Library/Caches");
 
     EXPECT_EQ(asService(true, [] { return makeDirectory(std::string(container) + "/added"); }), 0);
+    EXPECT_EQ(asService(true, [] { return errnoOf(::unlink((std::string(container) + "/" + metadataName).c_str())); }),
+              EPERM);
+    EXPECT_EQ(asService(true,
+                        [] {
+                            const auto library = std::string(container) + "/Library";
+                            return errnoOf(::rename(library.c_str(), (library + "2").c_str()));
+                        }),
+              EPERM);
+    EXPECT_EQ(asService(true, [] { return errnoOf(::rmdir((std::string(container) + "/added").c_str())); }), 0)
+        << "it is its own";
     EXPECT_EQ(asService(false, [] { return makeDirectory(std::string(container) + "/refused"); }), EACCES);
     // The metadata file is everybody's to read and root's to write, also when it is written again below the ACL.
     const auto metadata = std::string(container) + "/" + metadataName;

@@ -111,7 +111,7 @@ TEST_F(AccessControlListTest, OpensASystemContainerToSystemUsersAlone) {
         EXPECT_FALSE(nobodyCan(opens(made, O_RDONLY)));
         EXPECT_FALSE(nobodyCan(lists(made + "-directory")));
     }
-    EXPECT_EQ(modeOf(top), 0775U) << "owner and others keep their bits, the group bits show the mask";
+    EXPECT_EQ(modeOf(top), 01775U) << "owner and others keep their bits, the group bits show the mask";
 }
 
 TEST_F(AccessControlListTest, HandsEntriesDownToDirectoriesOfTheDaemon) {

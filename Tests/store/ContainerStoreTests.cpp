@@ -104,7 +104,7 @@ TEST_F(ContainerStore, MakesEveryClassAsItShouldBe) {
         ASSERT_EQ(0, ::stat((*made)->url.c_str(), &status));
         EXPECT_EQ(c.owner, status.st_uid);
         EXPECT_EQ(c.owner, status.st_gid);
-        EXPECT_EQ(0755U, status.st_mode & 07777U);
+        EXPECT_EQ(isSystemClass(c.containerClass) ? 01755U : 0755U, status.st_mode & 07777U);
 
         const auto found = create(c.user, c.containerClass, "org.example.app");
         ASSERT_TRUE(found);
@@ -161,6 +161,31 @@ TEST_F(ContainerStore, RefusesWhatFitsNoContainerBeforeAnyLock) {
                           {.name = {c.user, static_cast<OSTContainerClass>(c.containerClass), c.identifier},
                            .createIfNecessary = true})
                       .error());
+}
+
+TEST_F(ContainerStore, NothingIsMadeOrSetUnderAnEndlessName) {
+    const std::string longest(1024, 'a'), endless(1025, 'b');
+    const fs::path planted = fs::path(classDirectory) / "planted";
+    fs::create_directories(planted);
+    ASSERT_TRUE((OSTMetadata{.uid = 501,
+                             .uuid = platform::UUID::generate(),
+                             .containerClass = OSTContainerClass::dataApplication,
+                             .identifier = std::string(2000, 'c'),
+                             .url = planted}
+                     .writeMetadataToDisk()));
+    EXPECT_TRUE(lookUp(std::string(2000, 'c'), true)) << "one that is there is found";
+    const auto made = lookUp(longest, true);
+    ASSERT_TRUE(made);
+    for (const bool transient : {false, true})
+        EXPECT_EQ(OSTErrorCode::invalidObject, lookUp(endless, true, transient).error());
+    EXPECT_EQ(OSTErrorCode::notFound, lookUp(endless, false).error());
+    EXPECT_EQ(2, std::distance(fs::directory_iterator(classDirectory), {}));
+    EXPECT_TRUE(isEmpty(stagingDirectory));
+
+    const OSTContainerReference container{.name = {501, OSTContainerClass::dataApplication, longest},
+                                          .uuid = (*made)->uuid};
+    EXPECT_TRUE(store().setInfoValue(OSTValue(true), longest, container));
+    EXPECT_EQ(OSTErrorCode::invalidParameter, store().setInfoValue(OSTValue(true), endless, container).error());
 }
 
 TEST_F(ContainerStore, LooksUpWithoutMaking) {
@@ -307,10 +332,8 @@ TEST_F(ContainerStore, CacheTellsLiveAndTransientContainersApart) {
               *cache.allContainerIdentifiersForUser(501, dataApplication, false));
 }
 
-/// Long enough that all who want the container are building it before one of them has finished.
-std::string longIdentifier(std::size_t number) {
-    return std::to_string(number).append(OSTSmallDictionaryFileSize / 2, 'x');
-}
+/// As long as it may be, so that several who want the container are building it before one of them has finished.
+std::string longIdentifier(std::size_t number) { return std::to_string(number).append(1000, 'x'); }
 
 std::vector<std::vector<OSTMetadataRecord>> ContainerStore::createInParallel(std::size_t containers, bool transient) {
     constexpr std::ptrdiff_t threads = 8;

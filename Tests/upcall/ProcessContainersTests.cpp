@@ -205,6 +205,14 @@ TEST_F(ProcessContainersTest, OneFailedLookUpLeavesOutEveryPath) {
                      "<Error> createOrLookupContainerForUser:(system group container) Failed with error: 7"}));
 }
 
+TEST_F(ProcessContainersTest, WhoAlsoAsksUnderAnEndlessIdentifierGetsNothingMade) {
+    EXPECT_EQ(
+        ask(number(3, 501) + string(1, "com.example.app") + string(4, "group.a") + string(4, std::string(1025, 'g'))),
+        Lines{"0=0"});
+    EXPECT_EQ(pathOf(dataApplication, "com.example.app"), "(none)");
+    EXPECT_EQ(pathOf(sharedAppGroup, "group.a"), "(none)");
+}
+
 TEST_F(ProcessContainersTest, AnAnswerMayBeLong) {
     std::string request = number(3, 501);
     Lines expected{"100=/private/var/mobile"};

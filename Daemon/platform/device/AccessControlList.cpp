@@ -130,6 +130,17 @@ PosixACL makeACL(const OwnPermissions& own, const std::map<gid_t, std::uint16_t>
     return acl;
 }
 
+/// To Linux, who may add to a directory may also remove from it, unless it is sticky.
+bool addsOnly(std::uint32_t permissions) {
+    return (permissions & AccessControlList::writeData) != 0 && (permissions & AccessControlList::deleteChild) == 0;
+}
+
+std::expected<void, Errno> setSticky(int fd, mode_t mode, bool sticky) {
+    constexpr mode_t settable = 07777;
+    const auto wanted = sticky ? mode | S_ISVTX : mode & ~static_cast<mode_t>(S_ISVTX);
+    return wanted == mode ? std::expected<void, Errno>() : changeMode(fd, wanted & settable);
+}
+
 std::uint16_t posixPermissions(std::uint32_t permissions) {
     return static_cast<std::uint16_t>(((permissions & AccessControlList::readData) != 0 ? 4 : 0) |
                                       ((permissions & AccessControlList::writeData) != 0 ? 2 : 0) |
@@ -193,13 +204,18 @@ std::expected<void, Errno> AccessControlList::apply(int fd) const {
         auto& permissions = groups[groupIdForUUID(entry._qualifier).value()];
         permissions = static_cast<std::uint16_t>(permissions | posixPermissions(entry._permissions));
     };
+    bool sticky = false;
     for (const auto& entry : _entries) {
-        if (entry._grants() && (entry._flags & onlyInherit) == 0)
+        if (entry._grants() && (entry._flags & onlyInherit) == 0) {
             grant(governing, entry);
+            sticky |= addsOnly(entry._permissions);
+        }
         if (entry._grants() && (entry._flags & (fileInherit | directoryInherit)) != 0)
             grant(handedDown, entry);
     }
 
+    if (S_ISDIR(status.st_mode))
+        OST_TRY(setSticky(fd, status.st_mode, sticky));
     const auto own = OST_TRY(ownPermissions(fd, status.st_mode));
     if (own.isExtended || !governing.empty())
         OST_TRY(write(fd, accessAttribute, makeACL(own, governing)));

@@ -22,6 +22,7 @@ public:
     static constexpr std::uint32_t readData = 0x2;
     static constexpr std::uint32_t writeData = 0x4; ///< of a directory: add file
     static constexpr std::uint32_t execute = 0x8;   ///< of a directory: search
+    static constexpr std::uint32_t deleteChild = 0x40;
     static constexpr std::uint32_t allPermissions = 0x3ffe;
 
     /// Flag bits.
@@ -76,7 +77,9 @@ public:
     ///
     /// Entries that govern the item become named groups of its access ACL, beside its own mode bits; those to be
     /// inherited become named groups of a directory's default ACL. A named group is never granted less than others,
-    /// because it does not fall back to them. In the default ACL the owner has everything, so that a service keeps
+    /// because it does not fall back to them. A directory that an entry governs with add file and without delete child
+    /// becomes sticky, so that who may add items removes and renames none but his own; any other one is not. In the
+    /// default ACL the owner has everything, so that a service keeps
     /// access to what it makes itself, and the owning group and others have nothing, so that nobody else gets any. A
     /// symbolic link is left alone: on Linux its permissions are never looked at. Fails with the errno of reading or
     /// writing the ACL.
