@@ -61,6 +61,14 @@ Result<Connection> Connection::open(const std::string& device, Timeout timeout) 
     return Connection(std::move(socket), timeout);
 }
 
+bool Connection::isClosed() const {
+    if (_sendingEnded || _receivingEnded)
+        return true;
+    char byte = 0;
+    const auto count = ::recv(_socket.get(), &byte, 1, MSG_PEEK | MSG_DONTWAIT);
+    return count == 0 || (count < 0 && meansClosed(errno));
+}
+
 Connection::Deadline Connection::_deadline() const {
     return _timeout ? Deadline(std::chrono::steady_clock::now() + *_timeout) : std::nullopt;
 }

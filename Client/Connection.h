@@ -98,6 +98,10 @@ public:
     /// been received. After ETIMEDOUT the reply may be waited for again.
     [[nodiscard]] Result<Reply> receive(std::uint32_t requestNumber);
 
+    /// Whether the daemon has ended the connection already, so that a further request could never be answered. Waits
+    /// for nothing.
+    [[nodiscard]] bool isClosed() const;
+
 private:
     using Deadline = std::optional<std::chrono::steady_clock::time_point>;
 

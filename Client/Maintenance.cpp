@@ -31,6 +31,13 @@ Result<void> wipe(Connection& connection, const ContainerRequest& container) {
     return carriedOut(connection, request);
 }
 
+Result<void> wipePlugIn(Connection& connection, const std::string& identifier, std::uint64_t user) {
+    Request request(OSTCommand::wipePlugInData);
+    request.key(requestKey::container.userId).unsignedNumber(user);
+    request.key(requestKey::identifier).text(identifier);
+    return carriedOut(connection, request);
+}
+
 Result<std::uint64_t> diskUsage(Connection& connection, const ContainerReference& container) {
     Request request(OSTCommand::diskUsage);
     const auto& keys = requestKey::container;

@@ -11,6 +11,10 @@ namespace ostrand {
 /// holds no data, with 21 when there is no such container.
 [[nodiscard]] Result<void> wipe(Connection& connection, const ContainerRequest& container);
 
+/// The same with the plug-in data of an identifier that the caller's entitlement lists, which takes no other right.
+/// Fails with 55 for one that it does not list.
+[[nodiscard]] Result<void> wipePlugIn(Connection& connection, const std::string& identifier, std::uint64_t user);
+
 /// The bytes that a container takes on disk. Fails with 21 when it is not there under that UUID.
 [[nodiscard]] Result<std::uint64_t> diskUsage(Connection& connection, const ContainerReference& container);
 
