@@ -76,9 +76,13 @@ void OSTReplaceFile::wasDiscarded() {
 OSTResult<void> OSTReplaceFile::makeDiscardsDurable() {
     auto& discards = Discards::shared();
     const platform::MutexLock lock(discards.mutex); // during the wait, for which others would have to wait as well
-    if (discards.pending)
-        OST_TRY(OSTFileManager::defaultManager().makeDirectoryDurable(
-            OSTGlobalConfiguration::sharedInstance().replaceDirectory()));
+    if (!discards.pending)
+        return {};
+    const auto durable = OSTFileManager::defaultManager().makeDirectoryDurable(
+        OSTGlobalConfiguration::sharedInstance().replaceDirectory());
+    if (!durable && durable.error().isPOSIX(ENOENT))
+        return {}; // Nothing can come back.
+    OST_TRY(durable);
     discards.pending = false;
     return {};
 }
