@@ -19,7 +19,7 @@ inline constexpr std::array<Option, 6> infoValueOptions = {{
     {"plist", "FILE", "the value in a property-list file of either encoding; - is standard input"},
 }};
 inline constexpr std::string_view aboutInfoValues =
-    "The value is given once, as in: info set ID KEY '{\"a\": [1, true]}'   or: info set ID KEY --string text\n"
+    "The value is given once, as in: info set ID KEY '{\"a\": [1, true]}'   or: info set ID KEY --string text.\n"
     "A negative number in JSON stands behind --, so that it is no option.";
 
 [[nodiscard]] std::expected<ost::OSTValue, Failure> infoValueOf(const Arguments& arguments);

@@ -8,6 +8,7 @@
 #include "Device/ImageLayout.h"
 #include "Protocol/OSTErrorCode.h"
 
+#include <algorithm>
 #include <cctype>
 #include <cstdio>
 #include <fstream>
@@ -56,8 +57,6 @@ std::string sentence(std::string_view text) {
     return prose(out.ends_with('.') ? out : out + ".");
 }
 
-std::string literal(std::string_view text) { return ".Bd -literal -compact\n" + escaped(text) + "\n.Ed\n"; }
-
 /// The argument of a macro that says what a value is.
 std::string argument(std::string_view name) { return name.empty() ? "" : " Ar " + std::string(name); }
 
@@ -93,15 +92,15 @@ std::string inSynopsis(const Operand& operand) {
     return ".Ar " + std::string(operand.name) + "\n";
 }
 
-/// Help of several lines: those that are indented stand as they are.
+/// Help of several paragraphs, without what all commands say and the page says once.
 std::string details(std::string_view text) {
-    if (text.empty() || text == classesAndUsers)
-        return {};
-    std::string out = ".Pp\n", running;
-    std::istringstream lines{std::string(text)};
-    for (std::string line; std::getline(lines, line);)
-        running += line + "\n";
-    return out + prose(running);
+    std::string out;
+    while (!text.empty() && text != classesAndUsers) {
+        const auto end = std::min(text.find("\n\n"), text.size());
+        out += ".Pp\n" + prose(text.substr(0, end));
+        text.remove_prefix(std::min(end + 2, text.size()));
+    }
+    return out;
 }
 
 std::string commandSection(const Command& command) {
@@ -120,8 +119,8 @@ std::string commandSection(const Command& command) {
             out += ".It Ar " + std::string(operand.name) + "\n" + sentence(operand.help);
         out += ".El\n";
     }
-    return out + optionsList(command.options) + details(command.details) + ".Pp\nWith\n.Fl -json :\n" +
-           literal(command.json);
+    return out + optionsList(command.options) + details(command.details) +
+           ".Pp\nWith\n.Fl -json :\n.Bd -ragged -compact\n" + prose(command.json) + ".Ed\n";
 }
 
 std::string commands() {
