@@ -299,6 +299,8 @@ OSTResult<void> OSTClientConnection::_putNewContainerInPlace(const OSTReplacemen
     const auto durable = files.makeDirectoryDurable(pathByDeletingLastComponent(destination));
     if (!durable && files.moveItemAtURL(destination, operation.newContainer->url)) {
         operation.newIsInPlace = false;
+        // Where it is again, before anybody makes durable that it has left its destination.
+        static_cast<void>(files.makeDirectoryDurable(pathByDeletingLastComponent(operation.newContainer->url)));
         return std::unexpected(operation.failedMove(durable.error()));
     }
 
