@@ -53,8 +53,9 @@ sockaddr_un addressOf(const std::filesystem::path& socket) {
 
 } // namespace
 
-GatedDevice::GatedDevice()
-    : _scratch(makeScratchDirectory(0755)), _image(require(device::DeviceImage::openOrMake(_scratch / "device"))),
+GatedDevice::GatedDevice(const std::filesystem::path& directory)
+    : _scratch(makeScratchDirectory(0755)),
+      _image(require(device::DeviceImage::openOrMake(directory.empty() ? _scratch / "device" : directory))),
       _program(::open(builtProgram("ostrandd").c_str(), O_RDONLY | O_CLOEXEC)),
       _complaints(::open((_scratch / "complaints").c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0600)),
       _listener(_listen()), _client(_socket(), wire::allowed("com.example.Installer")) {
@@ -75,14 +76,15 @@ std::filesystem::path GatedDevice::_socket() const { return onHost("/private/var
 FileDescriptor GatedDevice::_listen() const {
     FileDescriptor listener(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
     const auto address = addressOf(_socket());
+    std::filesystem::remove(_socket()); // of an earlier boot
     require(listener && ::bind(listener.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0 &&
                 ::listen(listener.get(), SOMAXCONN) == 0,
             address.sun_path);
     return listener;
 }
 
-void GatedDevice::startDaemon(const Fault& fault) {
-    _daemon.emplace([this] { return _becomeDaemon(); }, fault);
+void GatedDevice::startDaemon(const Fault& fault, GatedCallWatcher watcher) {
+    _daemon.emplace([this] { return _becomeDaemon(); }, fault, std::move(watcher));
 }
 
 /// As the service launcher does it, with one of the sockets.

@@ -19,14 +19,15 @@ namespace ost::test {
 /// meanwhile, as the service launcher does it, so a client waits for a daemon that is starting. Requires root.
 class GatedDevice {
 public:
-    GatedDevice();
+    /// The device in the directory, or a new one in a scratch directory.
+    explicit GatedDevice(const std::filesystem::path& directory = {});
     GatedDevice(const GatedDevice&) = delete;
     GatedDevice& operator=(const GatedDevice&) = delete;
     /// The test fails when a daemon of this device reported a broken invariant or a sanitizer's finding.
     ~GatedDevice();
 
     /// Returns before the daemon serves. The fault may befall its start-up.
-    void startDaemon(const Fault& fault = {});
+    void startDaemon(const Fault& fault = {}, GatedCallWatcher watcher = {});
     void killDaemon();
     /// Waits until the daemon has done what a start has to do, the first death-row pass included. False when it ends
     /// before, or does not say so.

@@ -112,7 +112,8 @@ bool isFile(pid_t thread, std::uint64_t descriptor) {
 
 } // namespace
 
-GatedProcess::GatedProcess(const std::function<int()>& body, const Fault& fault) : _fault(fault) {
+GatedProcess::GatedProcess(const std::function<int()>& body, const Fault& fault, GatedCallWatcher watcher)
+    : _tell(std::move(watcher)), _fault(fault) {
     std::array<int, 2> ends{};
     require(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends.data()) == 0, "socketpair");
     const FileDescriptor own(ends[0]);
@@ -173,8 +174,9 @@ void GatedProcess::_watchGate() {
         seccomp_notif notification{};
         if (::ioctl(_gate.get(), SECCOMP_IOCTL_NOTIF_RECV, &notification) != 0)
             continue; // Who asked has been killed.
-        const auto verdict =
-            _judge(static_cast<pid_t>(notification.pid), notification.data.nr, notification.data.args[0]);
+        std::array<std::uint64_t, std::size(notification.data.args)> arguments{};
+        std::ranges::copy(notification.data.args, arguments.begin());
+        const auto verdict = _judge({static_cast<pid_t>(notification.pid), notification.data.nr, arguments.data()});
         seccomp_notif_resp response{.id = notification.id, .val = 0, .error = -verdict.error, .flags = 0};
         if (verdict.pass)
             response.flags = SECCOMP_USER_NOTIF_FLAG_CONTINUE;
@@ -183,15 +185,18 @@ void GatedProcess::_watchGate() {
     }
 }
 
-GatedProcess::Verdict GatedProcess::_judge(pid_t thread, int number, std::uint64_t descriptor) {
-    const auto* const call = std::ranges::find(gatedCalls, number, &Call::number);
-    if (call->onDescriptor && !isFile(thread, descriptor))
+GatedProcess::Verdict GatedProcess::_judge(const GatedCall& made) {
+    const auto* const call = std::ranges::find(gatedCalls, made.number, &Call::number);
+    if (call->onDescriptor && !isFile(made.thread, made.arguments[0]))
         return {};
     const std::lock_guard lock(_mutex);
     const unsigned ordinal = ++_course.calls;
     const bool befalls = _fault.kind == Fault::Kind::failForGood ? ordinal >= _fault.call : ordinal == _fault.call;
-    if (_fault.kind == Fault::Kind::none || !befalls)
+    if (_fault.kind == Fault::Kind::none || !befalls) {
+        if (_tell)
+            _tell(made);
         return {};
+    }
     if (_course.faultedCall.empty())
         _course.faultedCall = call->name;
     if (_fault.kind != Fault::Kind::kill)

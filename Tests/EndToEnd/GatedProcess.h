@@ -31,6 +31,14 @@ struct Fault {
 /// takes long under a sanitizer, which is there for the ways through the code and not for each of the calls.
 inline constexpr unsigned toNextCall = isSanitized ? 5 : 1;
 
+/// A call that is about to be made, by a thread that waits meanwhile.
+struct GatedCall {
+    pid_t thread;
+    int number;
+    const std::uint64_t* arguments;
+};
+using GatedCallWatcher = std::function<void(const GatedCall&)>;
+
 /// A child process that makes every file-system call through a gate, where the calls are counted and faults befall
 /// them.
 ///
@@ -42,8 +50,9 @@ inline constexpr unsigned toNextCall = isSanitized ? 5 : 1;
 /// Requires root. Failures of the system are thrown.
 class GatedProcess {
 public:
-    /// Runs `body`, whose result is the exit status, in a child. `fault` is the first one.
-    explicit GatedProcess(const std::function<int()>& body, const Fault& fault = {});
+    /// Runs `body`, whose result is the exit status, in a child. `fault` is the first one. `watcher` is told of each
+    /// call that a fault does not befall, on a thread of this object.
+    explicit GatedProcess(const std::function<int()>& body, const Fault& fault = {}, GatedCallWatcher watcher = {});
     GatedProcess(const GatedProcess&) = delete;
     GatedProcess& operator=(const GatedProcess&) = delete;
     ~GatedProcess();
@@ -74,16 +83,16 @@ private:
         bool pass = true;
         int error = 0;
     };
-    [[nodiscard]] Verdict _judge(pid_t thread, int call, std::uint64_t descriptor);
+    [[nodiscard]] Verdict _judge(const GatedCall& made);
 
     pid_t _id = 0; ///< 0 once it has been waited for
     platform::FileDescriptor _process;
     platform::FileDescriptor _gate;
-    std::thread _watcher;
-
+    const GatedCallWatcher _tell;
     std::mutex _mutex; ///< guards the rest
     Fault _fault;
     Course _course;
+    std::thread _watcher; ///< uses all of the above
 };
 
 } // namespace ost::test
