@@ -11,6 +11,7 @@
 #include <charconv>
 #include <chrono>
 #include <cstdio>
+#include <cstdlib>
 #include <fstream>
 #include <iterator>
 #include <stdexcept>
@@ -74,7 +75,10 @@ Daemon awaitDaemonOf(pid_t launcher) {
 
 } // namespace
 
-std::string builtProgram(const char* name) { return std::string(OSTRAND_BIN_DIR "/") + name; }
+std::string builtProgram(const char* name) {
+    const char* const installed = std::getenv("OSTRAND_PROGRAMS");
+    return std::string(installed ? installed : OSTRAND_BIN_DIR).append("/").append(name);
+}
 
 BootedDevice::BootedDevice(std::filesystem::path image, FaultReport report)
     : _image(std::move(image)), _report(std::move(report)) {

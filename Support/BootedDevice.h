@@ -75,7 +75,8 @@ private:
     std::optional<ChildProcess> _launcher;
 };
 
-/// The program of this build with that name.
+/// The program of this build with that name, or, where the environment's OSTRAND_PROGRAMS names a directory, the one in
+/// there.
 [[nodiscard]] std::string builtProgram(const char* name);
 
 } // namespace ost::test
