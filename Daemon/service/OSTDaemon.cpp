@@ -1,6 +1,7 @@
 #include "service/OSTDaemon.h"
 
 #include "Protocol/OSTServices.h"
+#include "codesigning/OSTCodeSigningMapping.h"
 #include "codesigning/OSTCodeSigningStoreDelegate.h"
 #include "migration/OSTContainerMigrator.h"
 #include "model/OSTGlobalConfiguration.h"
@@ -97,6 +98,7 @@ bool OSTDaemon::start() {
         set_first_boot_work_completed();
     }
     store.containerManagerCleanup();
+    static_cast<void>(OSTCodeSigningMapping::sharedInstance().isAvailable()); // read before clients take descriptors
     transaction.end();
     _startListener();
     return true;
@@ -138,7 +140,16 @@ bool OSTDaemon::_startRunLoop() {
     if (!source)
         return false;
     _signalSource = *std::move(source);
+    _sayWhatIsLeftOutOfLog();
     return true;
+}
+
+void OSTDaemon::_sayWhatIsLeftOutOfLog() {
+    auto source = _runLoop->addSource(platform::Log::shared().leftOutDescriptor(), EPOLLIN, [](std::uint32_t) {
+        platform::Log::shared().sayWhatWasLeftOut(platform::Log::LeftOut::whereTimeIsOver);
+    });
+    if (source) // else the next line of a user says it
+        _leftOutSource = *std::move(source);
 }
 
 void OSTDaemon::_followLockState() {
@@ -178,6 +189,7 @@ void OSTDaemon::_finish() {
     const bool requestsDone = !_listener || _listener->finish(deadline);
     // What waits for an unlock would wait for longer than there is time.
     OSTLockStateQueue().abandon();
+    platform::Log::shared().sayWhatWasLeftOut(platform::Log::LeftOut::everywhere);
     if (platform::Transactions::shared().waitUntilNone(deadline) && requestsDone)
         return;
     auto open = platform::Transactions::shared().describeOpen();

@@ -34,6 +34,7 @@ private:
     static void _openLog();
     [[nodiscard]] static bool _createQueues();
     [[nodiscard]] bool _startRunLoop();
+    void _sayWhatIsLeftOutOfLog();
     void _followLockState();
     void _startListener();
     void _finish();
@@ -42,6 +43,7 @@ private:
     std::unique_ptr<platform::RunLoop> _runLoop;
     platform::FileDescriptor _signals;
     platform::RunLoop::Source _signalSource;
+    platform::RunLoop::Source _leftOutSource; ///< lines were left out of the log, and it is time to say so
     std::unique_ptr<platform::UpcallPort> _upcallPort;
     std::optional<platform::DeviceLockStateNotification> _lockStateNotification;
     std::unique_ptr<platform::IPCListener> _listener;

@@ -5,6 +5,7 @@
 #include <fcntl.h>
 #include <poll.h>
 #include <sys/stat.h>
+#include <sys/timerfd.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -12,8 +13,12 @@
 #include <climits>
 #include <cstdio>
 #include <ctime>
+#include <optional>
+#include <utility>
 
 namespace ost::platform {
+
+using namespace std::chrono_literals;
 
 namespace {
 
@@ -41,6 +46,27 @@ std::string linePrefix(LogLevel level) {
     return {buffer, date + static_cast<std::size_t>(rest)};
 }
 
+/// A quarter: four users together still leave some of the file to root and to the daemon.
+constexpr std::uint64_t partOfUser = 4;
+
+/// Whom this thread's lines are caused by.
+thread_local uid_t currentOrigin = 0;
+
+std::string makeLine(LogLevel level, std::string_view function, std::string_view message) {
+    std::string line = linePrefix(level);
+    if (message.ends_with('\n')) // Some texts bring the end of their line with them.
+        message.remove_suffix(1);
+    line.append(function).append(": ");
+    while (!message.empty()) {
+        const auto tab = std::min(message.find('\t'), message.size());
+        appendEscaped(line, message.substr(0, tab));
+        if (tab < message.size())
+            line += '\t';
+        message.remove_prefix(std::min(tab + 1, message.size()));
+    }
+    return line += '\n';
+}
+
 /// Copies a line to standard error unless that would wait: its reader may have stopped reading.
 void copyToStandardError(std::string_view line) {
     pollfd out{.fd = STDERR_FILENO, .events = POLLOUT, .revents = 0};
@@ -63,6 +89,8 @@ std::expected<void, Errno> Log::open(LogLevel level, DiskFile file) {
     const MutexLock lock(_mutex);
     _level = level;
     _disk = std::move(file);
+    if (!_timer)
+        _timer.reset(::timerfd_create(CLOCK_MONOTONIC, TFD_CLOEXEC | TFD_NONBLOCK));
     return _openFile();
 }
 
@@ -103,22 +131,70 @@ void Log::_rotate() {
 }
 
 void Log::write(LogLevel level, std::string_view function, std::string_view message) {
-    std::string line = linePrefix(level);
-    if (message.ends_with('\n')) // Some texts bring the end of their line with them.
-        message.remove_suffix(1);
-    line.append(function).append(": ");
-    while (!message.empty()) {
-        const auto tab = std::min(message.find('\t'), message.size());
-        appendEscaped(line, message.substr(0, tab));
-        if (tab < message.size())
-            line += '\t';
-        message.remove_prefix(std::min(tab + 1, message.size()));
-    }
-    line += '\n';
-
+    const auto line = makeLine(level, function, message);
     const MutexLock lock(_mutex);
     if (level == LogLevel::error)
         copyToStandardError(line);
+    if (currentOrigin == 0 || _mayCause(currentOrigin, line.size()))
+        _put(line);
+}
+
+/// Counts a line of a user, as one that is written or as one that is left out.
+bool Log::_mayCause(uid_t user, std::size_t bytes) {
+    const auto now = Clock::now();
+    if (const auto known = _users.find(user); known == _users.end() || now - known->second.begin >= _disk.userTime)
+        _sayWhatWasLeftOut(LeftOut::whereTimeIsOver);
+    auto& ofUser = _users.try_emplace(user, OfUser{.begin = now}).first->second;
+    if (_disk.path.empty() || (ofUser.leftOut == 0 && ofUser.bytes + bytes <= _disk.size / partOfUser)) {
+        ofUser.bytes += bytes;
+        return true;
+    }
+    if (ofUser.leftOut++ == 0)
+        _armTimer();
+    return false;
+}
+
+/// For the next user whose time is over and of whom there is something to say.
+void Log::_armTimer() {
+    std::optional<Clock::time_point> next;
+    for (const auto& [user, caused] : _users)
+        if (caused.leftOut > 0)
+            next = std::min(next.value_or(Clock::time_point::max()), caused.begin + _disk.userTime);
+    itimerspec time{};
+    if (next) {
+        const auto left = std::max(std::chrono::ceil<std::chrono::milliseconds>(*next - Clock::now()), 1ms).count();
+        time.it_value = {.tv_sec = left / 1000, .tv_nsec = left % 1000 * 1'000'000};
+    }
+    ::timerfd_settime(_timer.get(), 0, &time, nullptr);
+}
+
+int Log::leftOutDescriptor() {
+    const MutexLock lock(_mutex);
+    return _timer.get();
+}
+
+void Log::sayWhatWasLeftOut(LeftOut where) {
+    const MutexLock lock(_mutex);
+    _sayWhatWasLeftOut(where);
+}
+
+void Log::_sayWhatWasLeftOut(LeftOut where) {
+    const auto now = Clock::now();
+    for (auto user = _users.begin(); user != _users.end();) {
+        const auto& caused = user->second;
+        if (where == LeftOut::whereTimeIsOver && now - caused.begin < _disk.userTime) {
+            ++user;
+            continue;
+        }
+        if (caused.leftOut > 0)
+            _put(makeLine(LogLevel::error, "Log",
+                          formatMessage("%llu lines that user %u caused were left out", caused.leftOut, user->first)));
+        user = _users.erase(user);
+    }
+    _armTimer();
+}
+
+void Log::_put(const std::string& line) {
     if (_disk.path.empty() || (!_fileIsLinked() && !_openFile()))
         return;
     if (_written > 0 && _written + line.size() > _disk.size)
@@ -126,5 +202,9 @@ void Log::write(LogLevel level, std::string_view function, std::string_view mess
     if (_file && ::write(_file.get(), line.data(), line.size()) > 0)
         _written += line.size();
 }
+
+LogOrigin::LogOrigin(uid_t user) : _before(std::exchange(currentOrigin, user)) {}
+
+LogOrigin::~LogOrigin() { currentOrigin = _before; }
 
 } // namespace ost::platform

@@ -5,11 +5,16 @@
 #include "platform/base/MessageFormat.h"
 #include "platform/base/Mutex.h"
 
+#include <sys/types.h>
+
 #include <atomic>
+#include <chrono>
+#include <cstddef>
 #include <cstdint>
 #include <expected>
 #include <string>
 #include <string_view>
+#include <unordered_map>
 
 namespace ost::platform {
 
@@ -17,6 +22,9 @@ enum class LogLevel : int { error = 3, notice = 5, debug = 7 };
 
 /// The process's leveled, rotating log. One line is
 /// `2026-11-22T19:46:01.123456Z <Error> [PID:TID] function: message`, written with one `write`.
+///
+/// Nobody above 0 fills the file: the lines that one user causes may take a quarter of its size in a while. What is
+/// left out beyond that is counted, and said in one line. Standard error gets every error line.
 ///
 /// Threads: any. Before `open`, and while the disk file cannot be written, lines are lost and nothing else happens;
 /// error lines still reach standard error, which is never waited for.
@@ -26,6 +34,7 @@ public:
         std::string path;
         unsigned files;     ///< files kept, the one being written included; at least 1
         std::uint64_t size; ///< bytes a file may reach before the next line starts a new one
+        std::chrono::milliseconds userTime = std::chrono::minutes(10); ///< in which a user's lines take so much of it
     };
 
     static Log& shared();
@@ -39,7 +48,26 @@ public:
     /// Writes one line, control characters of `message` (other than tab) escaped.
     void write(LogLevel level, std::string_view function, std::string_view message);
 
+    /// Readable when the time of a user is over of whom lines were left out; -1 before `open`.
+    [[nodiscard]] int leftOutDescriptor();
+    /// Says how many lines were left out: of users whose time is over, or of all, and begins their time anew.
+    enum class LeftOut : bool { whereTimeIsOver, everywhere };
+    void sayWhatWasLeftOut(LeftOut where);
+
 private:
+    using Clock = std::chrono::steady_clock;
+
+    /// What a user has caused since a moment.
+    struct OfUser {
+        Clock::time_point begin;
+        std::uint64_t bytes = 0;
+        std::uint64_t leftOut = 0; ///< lines
+    };
+
+    [[nodiscard]] bool _mayCause(uid_t user, std::size_t bytes) OST_REQUIRES(_mutex);
+    void _sayWhatWasLeftOut(LeftOut where) OST_REQUIRES(_mutex);
+    void _armTimer() OST_REQUIRES(_mutex);
+    void _put(const std::string& line) OST_REQUIRES(_mutex);
     [[nodiscard]] bool _fileIsLinked() const OST_REQUIRES(_mutex);
     [[nodiscard]] std::expected<void, Errno> _openFile() OST_REQUIRES(_mutex);
     void _rotate() OST_REQUIRES(_mutex);
@@ -49,6 +77,20 @@ private:
     DiskFile _disk OST_GUARDED_BY(_mutex){};
     FileDescriptor _file OST_GUARDED_BY(_mutex);
     std::uint64_t _written OST_GUARDED_BY(_mutex) = 0;
+    std::unordered_map<uid_t, OfUser> _users OST_GUARDED_BY(_mutex);
+    FileDescriptor _timer OST_GUARDED_BY(_mutex);
+};
+
+/// While it exists, the lines of its thread are caused by that user. Those of other threads are the daemon's own.
+class LogOrigin {
+public:
+    explicit LogOrigin(uid_t user);
+    LogOrigin(const LogOrigin&) = delete;
+    LogOrigin& operator=(const LogOrigin&) = delete;
+    ~LogOrigin();
+
+private:
+    const uid_t _before;
 };
 
 /// Writes a line whose function field is the calling function's name.

@@ -73,6 +73,7 @@ void IPCConnection::cancel() {
 // Receiving
 
 void IPCConnection::serve(std::uint32_t events, std::span<char> scratch) {
+    const LogOrigin origin(_peer.effectiveUserId());
     try {
         _serveEvents(events, scratch);
     } catch (const std::exception& exception) {

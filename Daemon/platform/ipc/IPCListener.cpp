@@ -95,6 +95,7 @@ private:
         auto peer = PeerIdentity::ofSocket(_next.get());
         if (!peer)
             return peer.error();
+        const LogOrigin origin(peer->effectiveUserId());
         const auto connection =
             std::make_shared<IPCConnection>(std::exchange(_next, {}), *std::move(peer), _surroundings);
         if (const auto added = _surroundings.registry.add(connection, connection->peer().effectiveUserId())) {
