@@ -14,6 +14,7 @@
 #include "protection/OSTLockStateQueue.h"
 #include "service/OSTRequestDispatcher.h"
 #include "store/OSTClientConnection.h"
+#include "store/OSTContainerCache.h"
 #include "upcall/OSTKernServer.h"
 
 #include <sys/epoll.h>
@@ -78,11 +79,13 @@ bool OSTDaemon::start() {
         return false;
     }
     const bool firstBoot = !*firstBootWorkDone;
-    if (firstBoot)
+    if (firstBoot) {
         logAs(LogLevel::notice, "main", "ostrandd performing first boot initialization");
-    if (firstBoot)
         OSTClientConnection::rebootContainerManagerSetup(
             [] { return OSTContainerMigrator::sharedInstance().performSynchronousDaemonStartupMigration(); });
+    } else {
+        OSTContainerCache::sharedInstance().expectChangesOfEarlierProcess();
+    }
     store.containerManagerSetup();
 
     if (_startRunLoop())

@@ -122,6 +122,11 @@ OSTContainerCache& OSTContainerCache::sharedInstance() {
     return *cache;
 }
 
+void OSTContainerCache::expectChangesOfEarlierProcess() {
+    const CacheLock lock(_cacheLock);
+    _changesOfEarlierProcess = true;
+}
+
 OSTResult<OSTMetadataRecord> OSTContainerCache::containerForUser(const OSTContainerName& name) {
     return OST_TRY(entryForUser(name)).record;
 }
@@ -338,12 +343,12 @@ OSTResult<OSTContainerCache::ClassTable*> OSTContainerCache::_getCacheForUserId(
     return &tables.emplace(key, std::move(table)).first->second;
 }
 
-OSTResult<OSTContainerCache::ClassTable> OSTContainerCache::_readClassDirectory(const std::string& directory,
-                                                                                std::uint32_t userId, bool transient) {
+OSTResult<OSTContainerCache::ClassTable>
+OSTContainerCache::_readClassDirectory(const std::string& directory, std::uint32_t userId, bool transient) const {
     const auto& files = OSTFileManager::defaultManager();
     const auto items = OST_TRY(files.urlsForItemsInDirectoryAtURL(directory));
     // An earlier process may have been killed before it had waited for what it moved. This one answers for it.
-    OST_TRY(files.makeDirectoryDurable(directory));
+    OST_TRY(_changesOfEarlierProcess ? files.makeFileSystemDurable(directory) : files.makeDirectoryDurable(directory));
     const auto open = OST_TRY(files.openDirectoryAtURL(directory));
     std::vector<OSTResult<OSTMetadataRecord>> records(items.size());
     const auto read = [&](std::size_t first, std::size_t last) {

@@ -41,6 +41,10 @@ class OSTContainerCache {
 public:
     static OSTContainerCache& sharedInstance();
 
+    /// To be called at the start of a process that is not the first one since the device has booted: an earlier one may
+    /// have been killed before it had waited for what it wrote in containers.
+    void expectChangesOfEarlierProcess();
+
     /// Finds a container by its identifier. Fails with `invalidCacheInput`, `notFound` (not logged),
     /// `cacheInconsistent` when the container's metadata file has gone from the disk, or `cacheRebuildFailed` when that
     /// or the class directory cannot be looked at. The record stays in any case.
@@ -90,8 +94,8 @@ private:
     /// The same for the public operations, which report any failure as `cacheRebuildFailed`.
     [[nodiscard]] OSTResult<ClassTable*> _tableForUserId(const OSTContainerName& name, std::source_location where)
         OST_REQUIRES(_cacheLock);
-    [[nodiscard]] static OSTResult<ClassTable> _readClassDirectory(const std::string& directory, std::uint32_t userId,
-                                                                   bool transient);
+    [[nodiscard]] OSTResult<ClassTable> _readClassDirectory(const std::string& directory, std::uint32_t userId,
+                                                            bool transient) const OST_REQUIRES(_cacheLock);
     static void _put(ClassTable& table, OSTCacheEntry entry);
     /// What is held under a name; without a record when there is nothing.
     [[nodiscard]] OSTResult<Held> _heldForUser(const OSTContainerName& name, std::source_location where);
@@ -102,6 +106,7 @@ private:
     platform::Mutex _cacheLock;
     ClassTables _liveContainerCache OST_GUARDED_BY(_cacheLock);
     ClassTables _transientContainerCache OST_GUARDED_BY(_cacheLock);
+    bool _changesOfEarlierProcess OST_GUARDED_BY(_cacheLock) = false;
 };
 
 } // namespace ost

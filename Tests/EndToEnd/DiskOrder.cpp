@@ -279,10 +279,12 @@ void DiskOrder::_judgeDiscard(const std::string& name) {
 void DiskOrder::_waits(int item, bool wholeFileSystem) {
     const auto status = statusOf(item);
     _waitedFor.insert(_pathOf(item));
-    if (wholeFileSystem)
-        std::erase_if(_changes, [&](const auto& change) { return change.first.first == status.st_dev; });
-    else
+    if (!wholeFileSystem) {
         _changes.erase({status.st_dev, status.st_ino});
+        return;
+    }
+    _waitedFor.insert(_pathOf(item) + ofFileSystem);
+    std::erase_if(_changes, [&](const auto& change) { return change.first.first == status.st_dev; });
 }
 
 bool DiskOrder::_counts(const Change& change) const {

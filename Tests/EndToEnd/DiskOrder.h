@@ -33,8 +33,9 @@ public:
     [[nodiscard]] std::vector<std::string> notOnDisk();
     /// Steps that were taken before one on which they rely was on disk.
     [[nodiscard]] std::vector<std::string> takenTooEarly();
-    /// The paths that were waited for.
+    /// The paths that were waited for. One that stood for its file system is there with `ofFileSystem` behind it, too.
     [[nodiscard]] std::set<std::string> waitedFor();
+    static constexpr const char* ofFileSystem = " and all with it";
     /// Forgets all that happened. `isSuccessor`: what the daemon finds was left by another one that was killed.
     void forget(bool isSuccessor = false);
 

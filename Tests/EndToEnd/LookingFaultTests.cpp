@@ -102,7 +102,7 @@ TEST_F(LookingFaultTest, WhatAnEarlierDaemonLeftIsWaitedForOnce) {
         device().daemon().prepare({.kind = Fault::Kind::fail, .call = call, .error = EIO});
         const auto found = look(connection, kept, ostrand::WhenMissing::fail);
         const auto course = device().daemon().conclude();
-        if (course.faultedCall == "fsync") {
+        if (course.faultedCall == "syncfs") {
             EXPECT_FALSE(found) << "at call " << call;
             ++waits;
         }
