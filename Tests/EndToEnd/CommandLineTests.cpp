@@ -191,7 +191,7 @@ TEST_F(CommandLine, MeasuresWipesMigratesAndChecks) {
     std::filesystem::remove(device->onHost("/private/var/db/sandbox-state/501/1/com.example.a"));
     const auto checked = ostrandctl({"check", "--json"});
     EXPECT_EQ(checked.status, 1);
-    for (const std::string name : {"planted", "link", container.filename().c_str()})
+    for (const auto& name : {std::string("planted"), std::string("link"), container.filename().string()})
         EXPECT_NE(checked.output.find("/" + name + "\""), std::string::npos) << checked.output;
 }
 
