@@ -156,7 +156,7 @@ void OSTGroupManager::reconcileGroupContainersOfType(OSTGroupType type) const {
     OST_ASSERT(OSTHoldsAllIdentifiersLock());
     OST_ASSERT(type == OSTGroupType::application);
     const auto [userId, containerClass] = placeOf(type);
-    if (!userHasHome(userId))
+    if (!_copyReferenceCountSetOfType(type, {}) || !userHasHome(userId))
         return;
     const auto containers = OSTContainerCache::sharedInstance().allContainersForUser(userId, containerClass, false);
     if (!containers) {

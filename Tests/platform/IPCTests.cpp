@@ -515,7 +515,7 @@ TEST(IPC, AClientWithoutDebtsMayStay) {
     EXPECT_EQ(stays.receiveNumber(), 2);
 }
 
-TEST(IPC, RefusesConnectionsOverALimitUntilOneHasGone) {
+TEST(IPC, WhereThereIsNoRoomAnIdleConnectionOfTheUserWithTheMostLeaves) {
     Service service({.connections = 5, .connectionsKeptForRoot = 3, .connectionsOfOneUser = 1});
     const auto isServed = [](Client& client) {
         client.send(request(1, echo));
@@ -529,14 +529,15 @@ TEST(IPC, RefusesConnectionsOverALimitUntilOneHasGone) {
     EXPECT_TRUE(connectAs(501, 0));
     EXPECT_FALSE(connectAs(501, 1)) << "it has one";
     EXPECT_TRUE(connectAs(502, 2));
-    EXPECT_FALSE(connectAs(503, 3)) << "the rest is root's";
+    EXPECT_TRUE(connectAs(503, 3)) << "the one that is idle for the longest makes room";
+    EXPECT_EQ(clients[0].receiveNumber(), std::nullopt);
     EXPECT_TRUE(connectAs(0, 4) && connectAs(0, 5) && connectAs(0, 6));
-    EXPECT_FALSE(connectAs(0, 7));
-
-    const int gone = service.invalidated;
-    clients[2].close();
-    Service::await(service.invalidated, gone + 1);
-    EXPECT_TRUE(connectAs(503, 8));
+    EXPECT_TRUE(isServed(clients[4]));
+    EXPECT_TRUE(connectAs(504, 7)) << "root's do not make room for users";
+    EXPECT_EQ(clients[2].receiveNumber(), std::nullopt);
+    EXPECT_TRUE(connectAs(0, 8));
+    EXPECT_EQ(clients[5].receiveNumber(), std::nullopt) << "root has the most";
+    EXPECT_TRUE(isServed(clients[3]) && isServed(clients[4]));
 }
 
 TEST(IPC, AcceptingPausesWithoutDescriptorsAndGoesOnWhenTheyAreBack) {

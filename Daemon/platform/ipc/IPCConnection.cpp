@@ -40,7 +40,9 @@ void discardReceived(int socket) {
 
 IPCConnection::IPCConnection(FileDescriptor socket, PeerIdentity peer, const Surroundings& surroundings)
     : _surroundings(surroundings), _peer(std::move(peer)), _reader(surroundings.limits.payloadWithoutEntitlements),
-      _socket(std::move(socket)) {}
+      _socket(std::move(socket)) {
+    _noteUse();
+}
 
 void IPCConnection::resume() {
     {
@@ -96,6 +98,12 @@ void IPCConnection::_serveEvents(std::uint32_t events, std::span<char> scratch) 
                  _peer.processId());
         return _close();
     }
+    if ((events & (receptionEvents | EPOLLOUT)) != 0)
+        _noteUse();
+    else if ((events & placeEvent) != 0) {
+        logError("connection of pid %d closed: others need its place", _peer.processId());
+        return _close();
+    }
     if (_end.load() == End::none)
         _receive(scratch);
     _reader.settle();
@@ -147,6 +155,8 @@ bool IPCConnection::_receiveSome(std::span<char> scratch) {
     return true;
 }
 
+void IPCConnection::_noteUse() { _use.lastServed = Clock::now().time_since_epoch().count(); }
+
 /// A frame that is longer than others may be is taken from a program that has entitlements; else it is refused. The
 /// program is asked for at each, because it may be another one by then.
 bool IPCConnection::_allowsLongFrame() {
@@ -183,6 +193,7 @@ void IPCConnection::_handle(IPCFrame frame) {
     _messageHandler(std::static_pointer_cast<IPCConnection>(shared_from_this()),
                     IPCRequest(std::move(frame), sequence));
     _firstUnhandled.store(_sequence);
+    _use.hasEntitlements = _peer.hasEntitlements();
 }
 
 /// Keeps the deadline of a frame that has arrived in part. While more is there to be received, none begins.
@@ -260,7 +271,8 @@ std::optional<std::size_t> IPCConnection::_trySending(std::string_view bytes) {
     const auto count = ::send(_socket.get(), bytes.data(), bytes.size(), MSG_DONTWAIT | MSG_NOSIGNAL);
     if (count >= 0)
         return static_cast<std::size_t>(count);
-    if (errno == EAGAIN || errno == EINTR)
+    // For want of memory it is tried again when the socket is next reported writable.
+    if (errno == EAGAIN || errno == EINTR || errno == ENOBUFS || errno == ENOMEM)
         return 0;
     // Requests that have arrived are still handled, as they would be had the client gone a moment later.
     _repliesEnd = 0;

@@ -89,6 +89,7 @@ private:
     void _serveEvents(std::uint32_t events, std::span<char> scratch);
     void _receive(std::span<char> scratch);
     [[nodiscard]] bool _receiveSome(std::span<char> scratch);
+    void _noteUse();
     [[nodiscard]] bool _allowsLongFrame();
     void _handle(IPCFrame frame);
     void _countReceived(std::size_t atHand);
@@ -130,6 +131,7 @@ private:
     std::uint64_t _awaitedFrame = 0; ///< then, for the frame after this many
 
     // Own locking.
+    IPCUse _use;
     std::atomic<End> _end{End::none};              ///< written under _mutex
     std::atomic<std::size_t> _openReplies{0};      ///< made and neither sent nor abandoned
     std::atomic<std::uint64_t> _firstUnhandled{0}; ///< sequence of the request at hand, or else of the next

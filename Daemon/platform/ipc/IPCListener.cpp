@@ -86,8 +86,34 @@ private:
         _surroundings.pool.post(shared_from_this(), EPOLLIN);
     }
 
-    /// Gives 0, EAGAIN when nobody waits, or the errno that forbids to go on for now.
+    /// Gives 0, EAGAIN when nobody waits, EUSERS when somebody leaves to make room, or the errno that forbids to go on
+    /// for now.
     int _acceptOne() {
+        if (!_arrived) {
+            if (const int error = _makeConnection(); error != 0 || !_arrived)
+                return error;
+        }
+        const auto user = _arrived->peer().effectiveUserId();
+        const LogOrigin origin(user);
+        const auto added = _surroundings.registry.add(_arrived, user, _arrived->_use);
+        if (!added)
+            if (const auto leaving = _surroundings.registry.whoLeavesFor(user)) {
+                _surroundings.pool.post(leaving, placeEvent);
+                return EUSERS;
+            }
+        const auto connection = std::exchange(_arrived, nullptr);
+        if (added) {
+            connection->setTurns(*added);
+            _introduce(connection);
+        } else {
+            logError("connection of pid %d closed: %s", connection->peer().processId(), added.error());
+            connection->_close();
+        }
+        return 0;
+    }
+
+    /// Gives 0 without a connection, too, when the one that waited has gone.
+    int _makeConnection() {
         if (!_next)
             _next.reset(::accept4(_socket.get(), nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK));
         if (!_next)
@@ -95,16 +121,7 @@ private:
         auto peer = PeerIdentity::ofSocket(_next.get());
         if (!peer)
             return peer.error();
-        const LogOrigin origin(peer->effectiveUserId());
-        const auto connection =
-            std::make_shared<IPCConnection>(std::exchange(_next, {}), *std::move(peer), _surroundings);
-        if (const auto added = _surroundings.registry.add(connection, connection->peer().effectiveUserId())) {
-            connection->setTurns(*added);
-            _introduce(connection);
-        } else {
-            logError("connection of pid %d closed: %s", connection->peer().processId(), added.error());
-            connection->_close();
-        }
+        _arrived = std::make_shared<IPCConnection>(std::exchange(_next, {}), *std::move(peer), _surroundings);
         return 0;
     }
 
@@ -120,7 +137,7 @@ private:
     /// A client that waits already causes no further event, so it is a descriptor that is given back, or the time, that
     /// makes us try again.
     void _pause(Errno error, unsigned goneBefore) {
-        if (!std::exchange(_complained, true))
+        if (error != EUSERS && !std::exchange(_complained, true))
             logError("accepting pauses: %s", error);
         _retry = Clock::now() + _surroundings.limits.acceptAgain;
         _surroundings.timer.change(shared_from_this(), std::nullopt, _retry);
@@ -139,7 +156,8 @@ private:
     std::atomic<unsigned> _gone{0}; ///< connections that have gone, ever
 
     // Of the thread that serves.
-    FileDescriptor _next; ///< accepted, but its peer is not known yet
+    FileDescriptor _next;                    ///< accepted, but its peer is not known yet
+    std::shared_ptr<IPCConnection> _arrived; ///< there is no room for it yet
     bool _complained = false;
     std::optional<Clock::time_point> _retry;
 };

@@ -38,6 +38,9 @@ public:
     /// ended.
     [[nodiscard]] std::expected<const CodeSigningIdentity*, Errno> codeSigningIdentity();
 
+    /// Whether the program that was last asked for has entitlements.
+    [[nodiscard]] bool hasEntitlements() const { return _identity.entitlements != nullptr; }
+
     /// Gives the descriptors back; no program can be determined any more.
     void unpin() {
         _process.reset();

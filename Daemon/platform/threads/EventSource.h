@@ -22,10 +22,11 @@ public:
     EventSource& operator=(const EventSource&) = delete;
 
     /// Beside the epoll events: a deadline has passed, the source asked to be served for a reason of its own, or it has
-    /// to leave because of the memory that it takes.
+    /// to leave because of the memory that it takes, or of others who need its place.
     static constexpr std::uint32_t deadlineEvent = 1U << 24;
     static constexpr std::uint32_t attentionEvent = 1U << 25;
     static constexpr std::uint32_t memoryEvent = 1U << 26;
+    static constexpr std::uint32_t placeEvent = 1U << 27;
 
 protected:
     EventSource() = default;
