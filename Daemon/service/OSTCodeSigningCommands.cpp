@@ -9,6 +9,7 @@
 #include "service/OSTRequestReaders.h"
 
 #include <algorithm>
+#include <cerrno>
 
 namespace ost {
 
@@ -162,6 +163,8 @@ OSTCommandResult OSTCodeSigningInfoCommand(const platform::IPCRequest& request, 
         identifier ? OSTCodeSigningMapping::sharedInstance().getCodeSigningInfoForIdentifier(*identifier) : nullptr;
     if (!info)
         return std::unexpected(OSTErrorCode::notFound);
+    if (!platform::fitsIntoMessage(*info))
+        return std::unexpected(static_cast<OSTErrorCode>(EMSGSIZE));
     auto encoder = reply.encoder(replyKey::infoDictionary);
     platform::encodePropertyListValue(encoder, *info);
     return {};

@@ -24,19 +24,19 @@ std::string OSTError::description() const {
     return text;
 }
 
-OSTError makeError(OSTError::Domain domain, OSTErrorCode code, const std::source_location& where,
-                   const OSTError* underlyingError, bool log, std::optional<std::string> message) {
-    std::string function = platform::qualifiedFunctionName(where);
+OSTError makeError(OSTError::Domain domain, OSTErrorCode code, const ErrorPlace& where, const OSTError* underlyingError,
+                   bool log, std::optional<std::string> message) {
+    std::string function = platform::qualifiedFunctionName(where.function);
     if (log && message) {
         const auto name = platform::lastPartOfFunctionName(function);
         if (underlyingError)
-            platform::logAs(platform::LogLevel::error, name, "%d: %@ (%@)", where.line(), *message, *underlyingError);
+            platform::logAs(platform::LogLevel::error, name, "%d: %@ (%@)", where.line, *message, *underlyingError);
         else
-            platform::logAs(platform::LogLevel::error, name, "%d: %@", where.line(), *message);
+            platform::logAs(platform::LogLevel::error, name, "%d: %@", where.line, *message);
     }
     return OSTError({domain, code, std::move(message),
                      underlyingError ? std::make_shared<const OSTError>(*underlyingError) : nullptr,
-                     std::move(function), where.line()});
+                     std::move(function), where.line});
 }
 
 } // namespace ost

@@ -15,6 +15,17 @@
 
 namespace ost {
 
+/// The function that a failure is reported for, and the line of the statement that raises it.
+struct ErrorPlace {
+    // NOLINTNEXTLINE(google-explicit-constructor): a place of the source is one
+    ErrorPlace(const std::source_location& raised) : ErrorPlace(raised, raised.line()) {}
+    ErrorPlace(const std::source_location& reported, std::uint32_t lineOfRaise)
+        : function(reported), line(lineOfRaise) {}
+
+    std::source_location function;
+    std::uint32_t line;
+};
+
 /// A failure: its domain and code, the message, what caused it, and the place that raised it.
 ///
 /// A value, cheap to copy; immutable and safe to share between threads. `OSTCreateError` and `OSTCreatePOSIXError` are
@@ -58,7 +69,7 @@ private:
     };
     explicit OSTError(Record record) : _record(std::make_shared<const Record>(std::move(record))) {}
 
-    friend OSTError makeError(OSTError::Domain, OSTErrorCode, const std::source_location&, const OSTError*, bool,
+    friend OSTError makeError(OSTError::Domain, OSTErrorCode, const ErrorPlace&, const OSTError*, bool,
                               std::optional<std::string>);
     std::shared_ptr<const Record> _record;
 };
@@ -70,7 +81,7 @@ using OSTResult = std::expected<T, OSTError>;
 enum class OSTLogging : bool { silent, logged };
 
 /// The common part of the makers below; call those.
-[[nodiscard]] OSTError makeError(OSTError::Domain domain, OSTErrorCode code, const std::source_location& where,
+[[nodiscard]] OSTError makeError(OSTError::Domain domain, OSTErrorCode code, const ErrorPlace& where,
                                  const OSTError* underlyingError, bool log, std::optional<std::string> message);
 
 /// Makes an error of the system's own domain and, unless `logging` says otherwise, writes it to the log at error level
@@ -93,12 +104,12 @@ template<typename... Arguments>
     return OSTCreateError<Arguments...>(code, OSTLogging::logged, &underlyingError, format, arguments...);
 }
 
-/// The same for a failure that several operations share: function name and line are those of `where`.
+/// The same for a failure that several operations share: the function name is that of `where`.
 template<typename... Arguments>
 [[nodiscard]] OSTError OSTCreateErrorAt(const std::source_location& where, OSTErrorCode code,
                                         const OSTError* underlyingError, platform::Message<Arguments...> format,
                                         const Arguments&... arguments) {
-    return makeError(OSTError::Domain::ost, code, where, underlyingError, true,
+    return makeError(OSTError::Domain::ost, code, {where, format.where().line()}, underlyingError, true,
                      platform::formatMessage<Arguments...>(format, arguments...));
 }
 

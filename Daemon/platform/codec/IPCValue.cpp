@@ -39,11 +39,13 @@ public:
         return std::nullopt;
     }
 
-    [[nodiscard]] bool isWithinLimit() const { return _objects <= maximumConvertedObjects; }
+    /// Whether the value says what the item says.
+    [[nodiscard]] bool isFaithful() const { return _objects <= maximumConvertedObjects && !_isTooSmall; }
 
 private:
-    static std::optional<OSTValue> _negative(const CBORItem& item) {
+    std::optional<OSTValue> _negative(const CBORItem& item) {
         const auto value = item.asSigned();
+        _isTooSmall = _isTooSmall || !value;
         return value ? std::optional(OSTValue(*value)) : std::nullopt;
     }
     std::optional<OSTValue> _array(const CBORItem& item) {
@@ -63,18 +65,26 @@ private:
     }
 
     std::size_t _objects = 0;
+    bool _isTooSmall = false; ///< a number that is
 };
+
+bool fits(const OSTDictionary& dictionary, std::size_t depth);
 
 /// `depth` is that of an array or dictionary in the place of the value.
 bool fits(const OSTValue& value, std::size_t depth) {
-    const auto below = [&](const OSTValue& element) { return fits(element, depth + 1); };
     if (const auto* const array = value.asArray())
-        return depth <= CBORMaximumDepth && std::ranges::all_of(*array, below);
-    if (const auto* const dictionary = value.asDictionary())
         return depth <= CBORMaximumDepth &&
-               std::ranges::all_of(*dictionary, [&](const auto& entry) { return below(entry.second); });
-    return true;
+               std::ranges::all_of(*array, [&](const OSTValue& element) { return fits(element, depth + 1); });
+    const auto* const dictionary = value.asDictionary();
+    return !dictionary || fits(*dictionary, depth);
 }
+
+bool fits(const OSTDictionary& dictionary, std::size_t depth) {
+    return depth <= CBORMaximumDepth &&
+           std::ranges::all_of(dictionary, [&](const auto& entry) { return fits(entry.second, depth + 1); });
+}
+
+constexpr std::size_t depthOfValues = 2; // in the message's dictionary
 
 struct Encode {
     CBOREncoder& encoder;
@@ -101,10 +111,12 @@ struct Encode {
 std::optional<OSTValue> propertyListValue(const CBORItem& item) {
     Converter converter;
     auto value = converter.convert(item);
-    return converter.isWithinLimit() ? value : std::nullopt;
+    return converter.isFaithful() ? value : std::nullopt;
 }
 
-bool fitsIntoMessage(const OSTValue& value) { return fits(value, 2); }
+bool fitsIntoMessage(const OSTValue& value) { return fits(value, depthOfValues); }
+
+bool fitsIntoMessage(const OSTDictionary& dictionary) { return fits(dictionary, depthOfValues); }
 
 void encodePropertyListValue(CBOREncoder& encoder, const OSTValue& value) {
     std::visit(Encode{encoder}, value.variant());

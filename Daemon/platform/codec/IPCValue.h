@@ -11,7 +11,8 @@ namespace ost::platform {
 /// booleans, data and dates are the same in both; a UUID is no property-list value.
 
 /// The property-list value of an item. What is null or has no counterpart is left out of arrays and dictionaries.
-/// Absent when the item itself is such a thing, or holds more than `maximumConvertedObjects`.
+/// Absent when the item itself is such a thing, holds a number below all signed ones, or more than
+/// `maximumConvertedObjects`.
 [[nodiscard]] std::optional<OSTValue> propertyListValue(const CBORItem& item);
 
 /// The most objects that one item may become. A byte of the wire can be an object of 40 bytes, so a frame could
@@ -20,6 +21,7 @@ inline constexpr std::size_t maximumConvertedObjects = 4'000'000;
 
 /// Whether a message can hold the value under one of its keys: nothing in it lies deeper than a message may be.
 [[nodiscard]] bool fitsIntoMessage(const OSTValue& value);
+[[nodiscard]] bool fitsIntoMessage(const OSTDictionary& dictionary);
 
 /// Writes a property-list value as one item.
 void encodePropertyListValue(CBOREncoder& encoder, const OSTValue& value);
