@@ -21,7 +21,9 @@
 #include <cstring>
 #include <filesystem>
 #include <future>
+#include <initializer_list>
 #include <map>
+#include <memory>
 
 namespace ost {
 namespace {
@@ -88,6 +90,29 @@ protected:
     const OSTMetadataRecord container = make(dataApplication, "a");
     const fs::path url = container->url;
 };
+
+TEST_F(DataProtection, WhatWaitsForAnUnlockFollowsTheStateHoweverOftenItIsSeen) {
+    const auto see = [](std::initializer_list<int> states) {
+        for (const int state : states) {
+            ASSERT_TRUE(platform::writeDeviceLockState(state));
+            brevind_notification_callback();
+        }
+    };
+    const auto runs = [&] {
+        auto ran = std::make_shared<std::promise<int>>();
+        run_when_unlocked([ran] { ran->set_value(0); });
+        return ran->get_future();
+    };
+    for (int turn = 0; turn < 2; ++turn) {
+        see({1, 1, 2});
+        const auto waiting = runs();
+        see({1, 2});
+        EXPECT_FALSE(isReady(waiting));
+        see({0, 0, 2});
+        EXPECT_EQ(waiting.wait_for(std::chrono::minutes(1)), std::future_status::ready);
+        EXPECT_EQ(runs().wait_for(std::chrono::minutes(1)), std::future_status::ready) << "in no known state";
+    }
+}
 
 TEST_F(DataProtection, RefusesWhatCannotBeMeant) {
     const auto codeFor = [](const OSTContainerName& name, std::int32_t protectionClass) {
