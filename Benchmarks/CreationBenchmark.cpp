@@ -172,7 +172,7 @@ void eightConnections(benchmark::State& state) {
     };
     Comparison{
         .unit = Unit::perSecond,
-        .target = {Target::Kind::ratioAtLeast, 1.3},
+        .target = {Target::Kind::ratioAtLeast, 2.5},
         .daemon = [&] { return connections * (creationsInTurn / 2) / secondsOf(createFromAll); },
         .baseline = [&] { return creationsInTurn / secondsOf([&] { creators.front().createMany(creationsInTurn); }); }}
         .run(state);

@@ -90,7 +90,7 @@ void manyConnections(benchmark::State& state) {
     BusyConnections daemon(servers.device.socket(), servers.request, servers.reply.size(), connections);
     BusyConnections echo(servers.echoPath(), servers.request, servers.reply.size(), connections);
     Comparison{.unit = Unit::perSecond,
-               .target = {Target::Kind::ratioAtLeast, 0.5},
+               .target = {Target::Kind::ratioAtLeast, 0.7},
                .daemon = [&] { return daemon.rate(duration); },
                .baseline = [&] { return echo.rate(duration); }}
         .run(state);
