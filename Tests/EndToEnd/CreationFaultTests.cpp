@@ -51,7 +51,7 @@ protected:
 
 TEST_P(CreationFaultTest, AKillAtAnyMomentLeavesAWholeContainerOrNone) {
     std::set<bool> outcomes;
-    for (unsigned call = 1;; call += toNextCall) {
+    for (unsigned call = 1;; ++call) {
         const auto identifier = "com.example." + std::to_string(call);
         auto connection = device().connect();
         device().daemon().prepare({.kind = Fault::Kind::kill, .call = call});
