@@ -48,13 +48,8 @@ struct ProcessRequest {
     std::vector<std::string_view> appGroupIds;
     std::vector<std::string_view> systemGroupIds;
 
-    /// Nothing is made for a process that also asks under an identifier too long for anything to be made: it could not
-    /// get all that it asks for.
-    [[nodiscard]] bool mayMakeContainers() const {
-        const auto fits = [](std::string_view identifier) { return identifier.size() <= OSTLongestIdentifier; };
-        const auto data = containerId ? containerId : codeSignatureId;
-        return fits(data.value_or("")) && fits(systemContainerId.value_or("")) &&
-               std::ranges::all_of(appGroupIds, fits) && std::ranges::all_of(systemGroupIds, fits);
+    [[nodiscard]] const std::optional<std::string_view>& dataContainerId() const {
+        return containerId ? containerId : codeSignatureId;
     }
 };
 
@@ -134,15 +129,24 @@ struct ProcessContainers {
     OSTMetadataRecord system;
     GroupContainers appGroups;
     GroupContainers systemGroups;
+    bool makeMissing = false;
     bool complete = true; ///< every look-up has succeeded
 };
 
+/// Nothing is made for a process that also asks under an identifier too long for anything to be made: it could not get
+/// all that it asks for.
+bool mayMakeContainers(const ProcessRequest& request) {
+    const auto fits = [](std::string_view identifier) { return identifier.size() <= OSTLongestIdentifier; };
+    return fits(request.dataContainerId().value_or("")) && fits(request.systemContainerId.value_or("")) &&
+           std::ranges::all_of(request.appGroupIds, fits) && std::ranges::all_of(request.systemGroupIds, fits);
+}
+
 using LookupResult = std::expected<OSTMetadataRecord, OSTErrorCode>;
 
-LookupResult lookUp(const ProcessRequest& request, std::uint32_t userId, std::string_view identifier,
+LookupResult lookUp(const ProcessContainers& found, std::uint32_t userId, std::string_view identifier,
                     OSTContainerClass containerClass) {
     return OSTClientConnection::sharedClientConnection().createOrLookupContainerForUser(
-        {.name = {userId, containerClass, identifier}, .createIfNecessary = request.mayMakeContainers()});
+        {.name = {userId, containerClass, identifier}, .createIfNecessary = found.makeMissing});
 }
 
 /// The class of the data container: what the mapping knows, seen beside what the sandbox says.
@@ -165,10 +169,10 @@ OSTContainerClass dataClassFor(std::string_view identifier, std::uint32_t type) 
 }
 
 void findDataContainer(const ProcessRequest& request, ProcessContainers& found) {
-    const auto identifier = request.containerId ? request.containerId : request.codeSignatureId;
+    const auto& identifier = request.dataContainerId();
     if (!identifier)
         return;
-    const auto container = lookUp(request, request.userId, *identifier, dataClassFor(*identifier, request.type));
+    const auto container = lookUp(found, request.userId, *identifier, dataClassFor(*identifier, request.type));
     if (container) {
         found.data = *container;
         return;
@@ -180,7 +184,7 @@ void findDataContainer(const ProcessRequest& request, ProcessContainers& found) 
 void findSystemContainer(const ProcessRequest& request, ProcessContainers& found) {
     if (!request.systemContainerId)
         return;
-    const auto container = lookUp(request, OSTSystemUserId, *request.systemContainerId, OSTContainerClass::dataSystem);
+    const auto container = lookUp(found, OSTSystemUserId, *request.systemContainerId, OSTContainerClass::dataSystem);
     if (container) {
         found.system = *container;
         return;
@@ -192,7 +196,7 @@ void findSystemContainer(const ProcessRequest& request, ProcessContainers& found
 
 void findAppGroups(const ProcessRequest& request, ProcessContainers& found) {
     for (const auto identifier : request.appGroupIds) {
-        const auto container = lookUp(request, request.userId, identifier, OSTContainerClass::sharedAppGroup);
+        const auto container = lookUp(found, request.userId, identifier, OSTContainerClass::sharedAppGroup);
         if (container) {
             found.appGroups.emplace_back(identifier, *container);
             continue;
@@ -204,7 +208,7 @@ void findAppGroups(const ProcessRequest& request, ProcessContainers& found) {
 
 void findSystemGroups(const ProcessRequest& request, ProcessContainers& found) {
     for (const auto identifier : request.systemGroupIds) {
-        const auto container = lookUp(request, OSTSystemUserId, identifier, OSTContainerClass::sharedSystemGroup);
+        const auto container = lookUp(found, OSTSystemUserId, identifier, OSTContainerClass::sharedSystemGroup);
         if (container) {
             found.systemGroups.emplace_back(identifier, *container);
             continue;
@@ -217,6 +221,7 @@ void findSystemGroups(const ProcessRequest& request, ProcessContainers& found) {
 
 ProcessContainers findContainers(const ProcessRequest& request) {
     ProcessContainers found;
+    found.makeMissing = mayMakeContainers(request);
     findDataContainer(request, found);
     findSystemContainer(request, found);
     findAppGroups(request, found);
@@ -260,9 +265,7 @@ std::vector<std::string> descriptionOf(const GroupPaths& groups) {
 void logPaths(const ProcessRequest& request, const ProcessPaths& paths) {
     if (!platform::Log::shared().accepts(LogLevel::debug))
         return;
-    log(LogLevel::debug,
-        "UPCALL-Containers for %@(%u):", request.containerId ? request.containerId : request.codeSignatureId,
-        request.userId);
+    log(LogLevel::debug, "UPCALL-Containers for %@(%u):", request.dataContainerId(), request.userId);
     log(LogLevel::debug, "dataContainerURL: %@", paths.data);
     log(LogLevel::debug, "tempContainerURL: %@", paths.temporary);
     log(LogLevel::debug, "homeDirURL: %@", paths.home);
