@@ -1,26 +1,22 @@
 #include "Client/StoreCheck.h"
 
 #include "Client/Containers.h"
+#include "Client/DeviceFiles.h"
 #include "Protocol/OSTSandboxItem.h"
 #include "platform/base/Errno.h"
-#include "platform/base/FileDescriptor.h"
 #include "platform/base/FileName.h"
 #include "platform/base/Path.h"
 #include "platform/base/Try.h"
 #include "platform/base/UUID.h"
-#include "platform/codec/PropertyList.h"
 #include "platform/device/Accounts.h"
 #include "platform/device/SandboxUserState.h"
 
-#include <dirent.h>
 #include <fcntl.h>
 #include <sys/stat.h>
-#include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
 #include <map>
-#include <memory>
 #include <optional>
 #include <set>
 
@@ -28,91 +24,18 @@ namespace ostrand {
 
 using ost::OSTDictionary;
 using ost::platform::Errno;
-using ost::platform::FileDescriptor;
 using ost::platform::pathByAppending;
 using ost::platform::UUID;
 
 namespace {
 
-constexpr const char* metadataName = ".com.tamarok.ostrand.metadata.plist";
 constexpr const char* sharedContainers = "/private/var/containers";
 constexpr const char* caches = "/private/var/root/Library/Caches/com.tamarok.ostrandd";
 constexpr const char* library = "/private/var/root/Library/Ostrand";
 constexpr const char* mappingFile = "/private/var/root/Library/Ostrand/ost_code_signing_info.plist";
 constexpr const char* applicationGroups = "com.tamarok.security.application-groups";
 
-constexpr std::size_t largestMetadata = std::size_t{1} << 20U;
 constexpr std::size_t largestMapping = std::size_t{64} << 20U;
-
-/// Reads paths of a device, none of them through a link.
-class DeviceFiles {
-public:
-    explicit DeviceFiles(FileDescriptor root) : _root(std::move(root)) {}
-
-    [[nodiscard]] std::expected<FileDescriptor, Errno> open(const std::string& path, int flags) const {
-        return ost::platform::openWithoutLinks(_root.get(), path.substr(1).c_str(), flags | O_NONBLOCK | O_NOCTTY);
-    }
-
-    /// The names in a directory, without hidden ones, sorted; none when there is no directory.
-    [[nodiscard]] std::expected<std::vector<std::string>, Errno> names(const std::string& path) const {
-        auto directory = open(path, O_RDONLY | O_DIRECTORY);
-        if (!directory && directory.error() == ENOENT)
-            return std::vector<std::string>();
-        const int descriptor = OST_TRY(std::move(directory)).release();
-        const std::unique_ptr<DIR, int (*)(DIR*)> stream(::fdopendir(descriptor), ::closedir);
-        std::vector<std::string> names;
-        while (const auto* const entry = ::readdir(stream.get()))
-            if (entry->d_name[0] != '.')
-                names.emplace_back(entry->d_name);
-        std::ranges::sort(names);
-        return names;
-    }
-
-    [[nodiscard]] std::expected<std::string, Errno> content(const std::string& path, std::size_t largest) const {
-        const auto file = OST_TRY(open(path, O_RDONLY));
-        struct stat status{};
-        if (::fstat(file.get(), &status) != 0)
-            return std::unexpected(errno);
-        if (!S_ISREG(status.st_mode))
-            return std::unexpected(EINVAL);
-        if (static_cast<std::size_t>(status.st_size) > largest)
-            return std::unexpected(EFBIG);
-        std::string bytes(static_cast<std::size_t>(status.st_size), '\0');
-        const auto count = ::pread(file.get(), bytes.data(), bytes.size(), 0);
-        if (count < 0)
-            return std::unexpected(errno);
-        bytes.resize(static_cast<std::size_t>(count));
-        return bytes;
-    }
-
-    [[nodiscard]] std::optional<std::string> linkTarget(const std::string& path) const {
-        const auto link = ost::platform::openWithoutLinks(_root.get(), path.substr(1, path.rfind('/') - 1).c_str(),
-                                                          O_PATH | O_DIRECTORY);
-        std::string target(PATH_MAX, '\0');
-        const auto length =
-            link ? ::readlinkat(link->get(), path.c_str() + path.rfind('/') + 1, target.data(), target.size()) : -1;
-        if (length < 0)
-            return std::nullopt;
-        target.resize(static_cast<std::size_t>(length));
-        return target;
-    }
-
-    [[nodiscard]] std::expected<struct stat, Errno> status(const std::string& path) const {
-        const auto item = OST_TRY(ost::platform::openWithoutLinks(_root.get(), path.substr(1).c_str(), O_PATH));
-        struct stat found{};
-        if (::fstat(item.get(), &found) != 0)
-            return std::unexpected(errno);
-        return found;
-    }
-
-private:
-    FileDescriptor _root;
-};
-
-std::optional<OSTDictionary> dictionaryIn(const std::string& bytes) {
-    const auto value = ost::platform::parsePropertyList(bytes);
-    return value && value->asDictionary() ? std::optional(*value->asDictionary()) : std::nullopt;
-}
 
 /// All containers of one class and user.
 struct ClassDirectory {
@@ -343,7 +266,7 @@ private:
         const std::pair<std::string, const char*> places[] = {
             {pathByAppending(caches, "Staging"), "being built or put aside"},
             {pathByAppending(library, "Replace"), "replacements to be finished at the next start"},
-            {pathByAppending(caches, "Dead"), "to be destroyed by the next pass"}};
+            {deathRowDirectory, "to be destroyed by the next pass"}};
         for (const auto& [path, what] : places)
             if (const auto count = _namesOrReport(path).size(); count > 0)
                 _report.waiting.push_back(std::to_string(count) + " in " + path + ": " + what);
@@ -378,10 +301,10 @@ private:
 } // namespace
 
 Result<StoreReport> checkStore(Connection& connection, const std::string& device) {
-    FileDescriptor root(::open(device.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
-    if (!root)
-        return std::unexpected(Error::transport(errno));
-    return Check(connection, DeviceFiles(std::move(root)), device).run();
+    auto files = DeviceFiles::of(device);
+    if (!files)
+        return std::unexpected(Error::transport(files.error()));
+    return Check(connection, *std::move(files), device).run();
 }
 
 } // namespace ostrand

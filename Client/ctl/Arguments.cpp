@@ -150,7 +150,8 @@ private:
 
     std::string _takeOption(std::string_view word) {
         const auto equals = word.find('=');
-        const auto* const option = word.starts_with("--") ? _optionNamed(word.substr(2, equals - 2)) : nullptr;
+        const auto* const option =
+            word.starts_with("--") ? optionNamed(_table, _command, word.substr(2, equals - 2)) : nullptr;
         if (!option)
             return "unknown option " + escaped(word.substr(0, equals)) +
                    didYouMean(word.substr(0, equals), _optionSpellings());
@@ -187,33 +188,16 @@ private:
         else if (std::ranges::any_of(_table.commands, [&](const auto& each) { return isBelow(each, name); }))
             _group = name;
         else
-            return "unknown command \"" + escaped(name) + "\"" + didYouMean(name, _commandSpellings());
+            return "unknown command \"" + escaped(name) + "\"" + didYouMean(name, namesBelow(_table, _group));
         return {};
-    }
-
-    /// What may stand where a command's name is read, groups included.
-    std::vector<std::string> _commandSpellings() const {
-        std::vector<std::string> spellings;
-        for (const auto& command : _table.commands)
-            if (isBelow(command, _group)) {
-                const auto end = command.name.find(' ', _group.empty() ? 0 : _group.size() + 1);
-                spellings.emplace_back(command.name.substr(0, end));
-            }
-        std::ranges::sort(spellings);
-        spellings.erase(std::ranges::unique(spellings).begin(), spellings.end());
-        return spellings;
     }
 
     std::vector<std::string> _optionSpellings() const {
         std::vector<std::string> spellings{"--help"};
-        for (const auto options : _optionsNow())
+        for (const auto options : optionsOf(_table, _command))
             for (const auto& option : options)
                 spellings.push_back("--" + std::string(option.name));
         return spellings;
-    }
-
-    std::array<std::span<const Option>, 2> _optionsNow() const {
-        return {_command ? std::span(_command->options) : std::span<const Option>{}, _table.options};
     }
 
     std::string _whatIsMissing() const {
@@ -226,13 +210,6 @@ private:
             if (option.count == Option::Count::required && !_arguments.has(option.name))
                 return "missing " + spelled(option);
         return {};
-    }
-
-    const Option* _optionNamed(std::string_view name) const {
-        for (const auto options : _optionsNow())
-            if (const auto found = std::ranges::find(options, name, &Option::name); found != options.end())
-                return &*found;
-        return nullptr;
     }
 
     UsageError _usageError(std::string message) const {
@@ -268,6 +245,29 @@ std::vector<std::string> Arguments::values(std::string_view name) const {
 std::variant<Invocation, Help, UsageError> parseCommandLine(const CommandTable& table,
                                                             std::span<const std::string_view> words) {
     return Parser(table, words).parse();
+}
+
+std::array<std::span<const Option>, 2> optionsOf(const CommandTable& table, const Command* command) {
+    return {command ? std::span(command->options) : std::span<const Option>{}, table.options};
+}
+
+const Option* optionNamed(const CommandTable& table, const Command* command, std::string_view name) {
+    for (const auto options : optionsOf(table, command))
+        if (const auto found = std::ranges::find(options, name, &Option::name); found != options.end())
+            return &*found;
+    return nullptr;
+}
+
+std::vector<std::string> namesBelow(const CommandTable& table, std::string_view group) {
+    std::vector<std::string> names;
+    for (const auto& command : table.commands)
+        if (isBelow(command, group)) {
+            const auto end = command.name.find(' ', group.empty() ? 0 : group.size() + 1);
+            names.emplace_back(command.name.substr(0, end));
+        }
+    std::ranges::sort(names);
+    names.erase(std::ranges::unique(names).begin(), names.end());
+    return names;
 }
 
 std::string usageLine(const CommandTable& table, const Command& command) {

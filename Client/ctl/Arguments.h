@@ -2,6 +2,7 @@
 
 #include "Client/ctl/Output.h"
 
+#include <array>
 #include <map>
 #include <optional>
 #include <span>
@@ -88,6 +89,15 @@ struct UsageError {
 /// Reads the words behind the program's name. `--` ends the options; behind `--help` nothing is read.
 [[nodiscard]] std::variant<Invocation, Help, UsageError> parseCommandLine(const CommandTable& table,
                                                                           std::span<const std::string_view> words);
+
+/// The options that a command takes, or all commands where it is null: its own and the common ones.
+[[nodiscard]] std::array<std::span<const Option>, 2> optionsOf(const CommandTable& table, const Command* command);
+/// The one of that name among them; null when there is none.
+[[nodiscard]] const Option* optionNamed(const CommandTable& table, const Command* command, std::string_view name);
+
+/// The names of commands, and of groups of them, with one word more than the group's; sorted. Without a group, first
+/// words.
+[[nodiscard]] std::vector<std::string> namesBelow(const CommandTable& table, std::string_view group);
 
 /// "usage: ostrandctl create --class C ...", for errors that show only when the values are looked at.
 [[nodiscard]] std::string usageLine(const CommandTable& table, const Command& command);

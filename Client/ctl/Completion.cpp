@@ -1,12 +1,11 @@
 #include "Client/ctl/Completion.h"
 
 #include "Client/ctl/Commands.h"
+#include "Client/ctl/LogLine.h"
 #include "Client/ctl/Values.h"
+#include "platform/device/Accounts.h"
 
 #include <algorithm>
-#include <cstdio>
-#include <memory>
-#include <pwd.h>
 
 namespace ostrand::ctl {
 
@@ -24,10 +23,12 @@ bool isHarmless(std::string_view name) {
 
 std::vector<std::string> usersOf(const std::string& device) {
     std::vector<std::string> users;
-    const std::unique_ptr<FILE, int (*)(FILE*)> file(std::fopen((device + "/etc/passwd").c_str(), "re"), &std::fclose);
-    while (const passwd* account = file ? fgetpwent(file.get()) : nullptr)
-        if (isHarmless(account->pw_name))
-            users.emplace_back(account->pw_name);
+    const auto collect = [&](const ost::platform::Account& account) {
+        if (isHarmless(account.name))
+            users.push_back(account.name);
+        return false;
+    };
+    (void)ost::platform::accountMatching(collect, device);
     return users;
 }
 
@@ -89,7 +90,7 @@ private:
 
     void _takeOption(std::string_view word) {
         const auto equals = word.find('=');
-        const auto* const option = _optionNamed(word.substr(2, equals - 2));
+        const auto* const option = optionNamed(_table, _command, word.substr(2, equals - 2));
         if (option && !option->value.empty() && equals == word.npos)
             _pending = option;
         else if (option)
@@ -103,40 +104,24 @@ private:
             _command = &*found;
     }
 
-    [[nodiscard]] std::vector<Option> _allOptions() const {
-        auto options = _command ? _command->options : std::vector<Option>();
-        options.insert(options.end(), _table.options.begin(), _table.options.end());
-        return options;
-    }
-
-    [[nodiscard]] const Option* _optionNamed(std::string_view name) const {
-        for (const auto* const options : {&_table.options, _command ? &_command->options : &_table.options})
-            if (const auto found = std::ranges::find(*options, name, &Option::name); found != options->end())
-                return &*found;
-        return nullptr;
-    }
-
     [[nodiscard]] std::vector<std::string> _options() const {
         std::vector<std::string> spellings{"--help"};
-        for (const auto& option : _allOptions())
-            if (option.count == Option::Count::repeated || !_arguments.has(option.name))
-                spellings.push_back("--" + std::string(option.name));
+        for (const auto options : optionsOf(_table, _command))
+            for (const auto& option : options)
+                if (option.count == Option::Count::repeated || !_arguments.has(option.name))
+                    spellings.push_back("--" + std::string(option.name));
         return spellings;
     }
 
     [[nodiscard]] std::vector<std::string> _commandWords() const {
-        const auto prefix = _group.empty() ? "" : _group + " ";
-        std::vector<std::string> words;
-        for (const auto& command : _table.commands)
-            if (command.name.starts_with(prefix)) {
-                const auto rest = command.name.substr(prefix.size());
-                words.emplace_back(rest.substr(0, rest.find(' ')));
-            }
+        auto words = namesBelow(_table, _group);
+        for (auto& word : words)
+            word.erase(0, _group.empty() ? 0 : _group.size() + 1);
         return words;
     }
 
     [[nodiscard]] std::vector<std::string> _valuesBehind(std::string_view spelling) const {
-        const auto* const option = _optionNamed(spelling.substr(2));
+        const auto* const option = optionNamed(_table, _command, spelling.substr(2));
         auto values = option ? _values(option->value) : std::vector<std::string>();
         if (!values.empty() && values.front().starts_with(':'))
             return {};
@@ -156,7 +141,7 @@ private:
         if (name == "GROUP")
             return identifiersFor(_arguments, ContainerClass::sharedSystemGroup);
         if (name == "LEVEL")
-            return {"error", "notice", "debug"};
+            return logLevelNames();
         if (name == "true|false")
             return {"true", "false"};
         if (name == "DIR")

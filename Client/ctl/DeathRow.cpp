@@ -1,8 +1,8 @@
 #include "Client/ctl/DeathRow.h"
 
-#include "platform/base/FileDescriptor.h"
+#include "Client/DeviceFiles.h"
+#include "platform/base/Path.h"
 #include "platform/base/Try.h"
-#include "platform/codec/PropertyList.h"
 
 #include <dirent.h>
 #include <fcntl.h>
@@ -19,10 +19,8 @@ namespace {
 
 using ost::platform::Errno;
 using ost::platform::FileDescriptor;
+using ost::platform::pathByAppending;
 
-constexpr const char* deathRow = "private/var/root/Library/Caches/com.tamarok.ostrandd/Dead";
-constexpr const char* metadataName = ".com.tamarok.ostrand.metadata.plist";
-constexpr std::size_t largestMetadata = std::size_t{1} << 20U;
 constexpr unsigned deepest = 200; ///< each level holds a descriptor
 constexpr std::uint64_t blockSize = 512;
 
@@ -67,22 +65,15 @@ void measure(FileDescriptor directory, CondemnedItem& item, unsigned depth) {
     });
 }
 
-std::string identifierIn(int directory) {
-    const FileDescriptor file(::openat(directory, metadataName, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
-    struct stat status{};
-    if (!file || ::fstat(file.get(), &status) != 0 || !S_ISREG(status.st_mode) ||
-        static_cast<std::size_t>(status.st_size) > largestMetadata)
-        return {};
-    std::string bytes(static_cast<std::size_t>(status.st_size), '\0');
-    const auto count = ::pread(file.get(), bytes.data(), bytes.size(), 0);
-    bytes.resize(static_cast<std::size_t>(std::max<ssize_t>(count, 0)));
-    const auto metadata = ost::platform::parsePropertyList(bytes);
-    const auto* const dictionary = metadata ? metadata->asDictionary() : nullptr;
-    const auto* const identifier = dictionary ? dictionary->find("OSTMetadataIdentifier") : nullptr;
+std::string identifierOf(const DeviceFiles& files, const char* name) {
+    const auto bytes =
+        files.content(pathByAppending(pathByAppending(deathRowDirectory, name), metadataName), largestMetadata);
+    const auto metadata = bytes ? dictionaryIn(*bytes) : std::nullopt;
+    const auto* const identifier = metadata ? metadata->find("OSTMetadataIdentifier") : nullptr;
     return identifier && identifier->asString() ? *identifier->asString() : "";
 }
 
-CondemnedItem lookAt(int parent, const char* name) {
+CondemnedItem lookAt(const DeviceFiles& files, int parent, const char* name) {
     CondemnedItem item{.name = name, .identifier = {}};
     auto directory = openDirectory(parent, name);
     if (!directory) {
@@ -90,16 +81,13 @@ CondemnedItem lookAt(int parent, const char* name) {
         item.measured = errno == ENOTDIR || errno == ELOOP;
         return item;
     }
-    item.identifier = identifierIn(directory.get());
+    item.identifier = identifierOf(files, name);
     measure(std::move(directory), item, 0);
     return item;
 }
 
-std::expected<DirectoryStream, Errno> openDeathRow(const std::string& device) {
-    const FileDescriptor root(::open(device.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
-    if (!root)
-        return std::unexpected(errno);
-    auto directory = ost::platform::openWithoutLinks(root.get(), deathRow, O_RDONLY | O_DIRECTORY);
+std::expected<DirectoryStream, Errno> openDeathRow(const DeviceFiles& files) {
+    auto directory = files.open(deathRowDirectory, O_RDONLY | O_DIRECTORY);
     if (!directory && directory.error() == ENOENT)
         return DirectoryStream(nullptr, ::closedir);
     auto stream = streamOf(OST_TRY(std::move(directory)));
@@ -111,16 +99,19 @@ std::expected<DirectoryStream, Errno> openDeathRow(const std::string& device) {
 } // namespace
 
 std::expected<std::vector<CondemnedItem>, Errno> deathRowOf(const std::string& device) {
-    const auto stream = OST_TRY(openDeathRow(device));
+    const auto files = OST_TRY(DeviceFiles::of(device));
+    const auto stream = OST_TRY(openDeathRow(files));
     std::vector<CondemnedItem> items;
     if (stream)
-        forEachName(stream.get(), [&](const char* name) { items.push_back(lookAt(::dirfd(stream.get()), name)); });
+        forEachName(stream.get(),
+                    [&](const char* name) { items.push_back(lookAt(files, ::dirfd(stream.get()), name)); });
     std::ranges::sort(items, std::greater(), &CondemnedItem::bytes);
     return items;
 }
 
 std::size_t deathRowLength(const std::string& device) {
-    const auto stream = openDeathRow(device);
+    const auto files = DeviceFiles::of(device);
+    const auto stream = files ? openDeathRow(*files) : std::unexpected(files.error());
     std::size_t length = 0;
     if (stream && *stream)
         forEachName(stream->get(), [&](const char*) { ++length; });

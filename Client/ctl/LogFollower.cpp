@@ -1,5 +1,6 @@
 #include "Client/ctl/LogFollower.h"
 
+#include "Client/DeviceFiles.h"
 #include "platform/base/Try.h"
 
 #include <cerrno>
@@ -14,7 +15,7 @@ using ost::platform::FileDescriptor;
 
 namespace {
 
-constexpr const char* logDirectory = "private/var/root/Library/Logs/Ostrand";
+constexpr const char* logDirectory = "/private/var/root/Library/Logs/Ostrand";
 constexpr const char* logName = "ostrandd.log";
 
 FileDescriptor openLog(int directory) {
@@ -24,10 +25,8 @@ FileDescriptor openLog(int directory) {
 } // namespace
 
 std::expected<LogFollower, Errno> LogFollower::open(const std::string& device) {
-    const FileDescriptor root(::open(device.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
-    if (!root)
-        return std::unexpected(errno);
-    auto directory = OST_TRY(ost::platform::openWithoutLinks(root.get(), logDirectory, O_RDONLY | O_DIRECTORY));
+    const auto files = OST_TRY(DeviceFiles::of(device));
+    auto directory = OST_TRY(files.open(logDirectory, O_RDONLY | O_DIRECTORY));
     FileDescriptor changes(::inotify_init1(IN_CLOEXEC));
     const auto path = "/proc/self/fd/" + std::to_string(directory.get());
     if (!changes || ::inotify_add_watch(changes.get(), path.c_str(), IN_MODIFY | IN_CREATE | IN_MOVED_TO) < 0)

@@ -2,13 +2,15 @@
 
 #include <strings.h>
 
+#include <algorithm>
 #include <array>
+#include <cctype>
 
 namespace ostrand::ctl {
 
 namespace {
 
-constexpr std::array<std::string_view, 3> names{"Error", "Notice", "Debug"};
+constexpr std::array levels{LogLevel::error, LogLevel::notice, LogLevel::debug};
 
 /// Takes what stands before `end` from the front of a text, and `end` with it.
 std::optional<std::string_view> takeUntil(std::string_view& text, std::string_view end) {
@@ -22,10 +24,22 @@ std::optional<std::string_view> takeUntil(std::string_view& text, std::string_vi
 
 } // namespace
 
+std::vector<std::string> logLevelNames() {
+    std::vector<std::string> names;
+    for (const auto level : levels) {
+        std::string name = ost::platform::nameOfLogLevel(level);
+        std::ranges::transform(name, name.begin(), [](unsigned char letter) { return std::tolower(letter); });
+        names.push_back(std::move(name));
+    }
+    return names;
+}
+
 std::optional<LogLevel> logLevelNamed(std::string_view name) {
-    for (std::size_t i = 0; i < names.size(); ++i)
-        if (names[i].size() == name.size() && strncasecmp(names[i].data(), name.data(), name.size()) == 0)
-            return static_cast<LogLevel>(i);
+    for (const auto level : levels) {
+        const std::string_view known = ost::platform::nameOfLogLevel(level);
+        if (known.size() == name.size() && strncasecmp(known.data(), name.data(), name.size()) == 0)
+            return level;
+    }
     return std::nullopt;
 }
 
@@ -50,7 +64,7 @@ LogLine LogLine::parse(std::string text) {
 ost::OSTDictionary LogLine::json() const {
     ost::OSTDictionary json;
     json.set("time", time);
-    json.set("level", std::string(names.at(static_cast<std::size_t>(level))));
+    json.set("level", std::string(ost::platform::nameOfLogLevel(level)));
     json.set("thread", thread);
     json.set("message", message);
     return json;

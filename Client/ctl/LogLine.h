@@ -1,18 +1,21 @@
 #pragma once
 
+#include "platform/base/Log.h"
 #include "platform/base/OSTValue.h"
 
-#include <cstdint>
 #include <optional>
 #include <string>
 #include <string_view>
+#include <vector>
 
 namespace ostrand::ctl {
 
 /// What a line of the log weighs, the heaviest first.
-enum class LogLevel : std::uint8_t { error, notice, debug };
+using LogLevel = ost::platform::LogLevel;
 
-/// "error", in any case.
+/// What users call the levels: "error", "notice", "debug".
+[[nodiscard]] std::vector<std::string> logLevelNames();
+/// The level of that name, in any case.
 [[nodiscard]] std::optional<LogLevel> logLevelNamed(std::string_view name);
 
 /// One line of the daemon's log: "2026-11-22T19:46:01.123456Z <Error> [PID:TID] function: message".

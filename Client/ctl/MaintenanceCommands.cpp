@@ -5,6 +5,7 @@
 #include "Client/ctl/Terminal.h"
 #include "Client/ctl/Values.h"
 #include "Client/ctl/Waiting.h"
+#include "platform/base/Text.h"
 #include "platform/base/Try.h"
 
 #include <unistd.h>
@@ -134,7 +135,7 @@ Outcome migrateAll(const Arguments& arguments) {
 
 Outcome runRetryTest(const Arguments& arguments) {
     const auto text = *arguments.value(crashesOperand.name);
-    const auto crashes = numberIn(text);
+    const auto crashes = ost::platform::numberIn<std::uint64_t>(text);
     if (!crashes)
         return std::unexpected(Failure::usage("\"" + escaped(text) + "\" is no number"));
     const auto user = OST_TRY(userOf(arguments, ContainerClass::dataApplication));

@@ -1,13 +1,14 @@
 #include "Client/ctl/Values.h"
 
 #include "Client/ctl/Suggestion.h"
+#include "platform/base/Text.h"
 #include "platform/base/Try.h"
 #include "platform/codec/PropertyList.h"
 
 #include <cerrno>
-#include <charconv>
 #include <cstdio>
 #include <memory>
+#include <optional>
 #include <pwd.h>
 #include <strings.h>
 
@@ -15,6 +16,7 @@ namespace ostrand::ctl {
 
 namespace {
 
+using ost::platform::numberIn;
 using File = std::unique_ptr<FILE, int (*)(FILE*)>;
 
 /// How deep a property list may be to go into a request, which is a level of its own.
@@ -59,12 +61,6 @@ std::expected<ost::OSTValue, Failure> propertyListIn(const std::string& path, st
 
 } // namespace
 
-std::optional<std::uint64_t> numberIn(std::string_view text) {
-    std::uint64_t number = 0;
-    const auto [end, problem] = std::from_chars(text.data(), text.data() + text.size(), number);
-    return problem == std::errc{} && end == text.data() + text.size() ? std::optional(number) : std::nullopt;
-}
-
 std::vector<std::string> classNames() {
     std::vector<std::string> names;
     for (std::uint64_t number = 1; isValidContainerClass(static_cast<ContainerClass>(number)); ++number)
@@ -73,7 +69,7 @@ std::vector<std::string> classNames() {
 }
 
 std::expected<ContainerClass, Failure> classNamed(const std::string& text) {
-    if (const auto number = numberIn(text))
+    if (const auto number = numberIn<std::uint64_t>(text))
         return static_cast<ContainerClass>(*number);
     if (const auto named = containerClassNamed(text))
         return *named;
@@ -82,7 +78,7 @@ std::expected<ContainerClass, Failure> classNamed(const std::string& text) {
 }
 
 std::expected<std::uint64_t, Failure> userNamed(const std::string& text, const std::string& device) {
-    if (const auto number = numberIn(text))
+    if (const auto number = numberIn<std::uint64_t>(text))
         return *number;
     const std::string path = device + "/etc/passwd";
     const File accounts(std::fopen(path.c_str(), "re"), &std::fclose);

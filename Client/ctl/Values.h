@@ -6,17 +6,12 @@
 
 #include <cstdint>
 #include <expected>
-#include <optional>
 #include <string>
-#include <string_view>
 #include <vector>
 
 namespace ostrand::ctl {
 
 // What users type, and what it means. What means nothing is a failure that says why.
-
-/// A decimal number of 64 bits; nothing when the text is anything else.
-[[nodiscard]] std::optional<std::uint64_t> numberIn(std::string_view text);
 
 /// The names of all container classes, in the order of their numbers.
 [[nodiscard]] std::vector<std::string> classNames();

@@ -3,12 +3,11 @@
 #include "Client/ctl/LogLine.h"
 #include "Client/ctl/Suggestion.h"
 #include "Client/ctl/Terminal.h"
-#include "Client/ctl/Values.h"
+#include "platform/base/Text.h"
 #include "platform/base/Try.h"
 
 #include <unistd.h>
 
-#include <array>
 #include <cerrno>
 #include <cstdio>
 #include <deque>
@@ -29,15 +28,15 @@ std::expected<LogLevel, Failure> levelOf(const Arguments& arguments) {
         return LogLevel::debug;
     if (const auto level = logLevelNamed(*name))
         return *level;
-    const std::array<std::string, 3> names{"error", "notice", "debug"};
-    return std::unexpected(Failure::usage("no level is called \"" + escaped(*name) + "\"" + didYouMean(*name, names)));
+    return std::unexpected(
+        Failure::usage("no level is called \"" + escaped(*name) + "\"" + didYouMean(*name, logLevelNames())));
 }
 
 std::expected<std::size_t, Failure> lineCountOf(const Arguments& arguments) {
     const auto text = arguments.value(linesOption.name);
     if (!text)
         return arguments.has(onceOption.name) ? std::string::npos : usualLines;
-    const auto number = numberIn(*text);
+    const auto number = ost::platform::numberIn<std::uint64_t>(*text);
     if (!number)
         return std::unexpected(Failure::usage("\"" + escaped(*text) + "\" is no number"));
     return static_cast<std::size_t>(*number);

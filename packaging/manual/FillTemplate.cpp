@@ -1,5 +1,5 @@
-// Prints a manual page: its template, with what the programs' own tables say in the place of lines such as
-// "@COMMANDS@".
+// Prints a file that packages install, such as a manual page: its template, with what the programs' own tables say in
+// the place of lines such as "@COMMANDS@".
 
 #include "Client/ctl/Commands.h"
 #include "Client/ctl/ContainerArguments.h"

@@ -3,8 +3,8 @@
 // The container daemon's client library. This header needs nothing but the standard library (C++23).
 //
 //     ostrand::v1::Client client;
-//     const auto container = client.create({.containerClass = ContainerClass::dataApplication, .identifier =
-//     "com.example.a"}); if (!container)
+//     const auto container = client.create({.identifier = "com.example.a"}); // of the class dataApplication
+//     if (!container)
 //         std::cerr << container.error().description() << '\n';
 //
 // What the daemon may answer to each request, `docs/protocol.md` says. Nothing here throws.

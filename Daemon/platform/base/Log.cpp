@@ -20,9 +20,7 @@ namespace ost::platform {
 
 using namespace std::chrono_literals;
 
-namespace {
-
-const char* nameOf(LogLevel level) {
+const char* nameOfLogLevel(LogLevel level) {
     switch (level) {
     case LogLevel::error:
         return "Error";
@@ -34,6 +32,8 @@ const char* nameOf(LogLevel level) {
     return "Error";
 }
 
+namespace {
+
 std::string linePrefix(LogLevel level) {
     timespec now{};
     ::clock_gettime(CLOCK_REALTIME, &now);
@@ -42,7 +42,7 @@ std::string linePrefix(LogLevel level) {
     char buffer[96];
     const auto date = std::strftime(buffer, sizeof buffer, "%Y-%m-%dT%H:%M:%S", &utc);
     const auto rest = std::snprintf(buffer + date, sizeof buffer - date, ".%06ldZ <%s> [%d:%d] ", now.tv_nsec / 1000,
-                                    nameOf(level), ::getpid(), ::gettid());
+                                    nameOfLogLevel(level), ::getpid(), ::gettid());
     return {buffer, date + static_cast<std::size_t>(rest)};
 }
 

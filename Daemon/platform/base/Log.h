@@ -20,6 +20,9 @@ namespace ost::platform {
 
 enum class LogLevel : int { error = 3, notice = 5, debug = 7 };
 
+/// "Error": as a line has it.
+[[nodiscard]] const char* nameOfLogLevel(LogLevel level);
+
 /// The process's leveled, rotating log. One line is
 /// `2026-11-22T19:46:01.123456Z <Error> [PID:TID] function: message`, written with one `write`.
 ///
