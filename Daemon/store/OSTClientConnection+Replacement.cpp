@@ -19,15 +19,12 @@
 
 namespace ost {
 
+using platform::isAtOrBelow;
 using platform::lastPathComponent;
 using platform::pathByAppending;
 using platform::pathByDeletingLastComponent;
 
 namespace {
-
-bool isAtOrBelow(std::string_view path, std::string_view place) {
-    return path.starts_with(place) && (path.size() == place.size() || path[place.size()] == '/');
-}
 
 OSTError failedRecovery(const OSTReplaceFile& file, const OSTError& cause) {
     return OSTCreateError(OSTErrorCode::replaceFileInvalid, cause, "Failed to recover replace move: %@ to %@",

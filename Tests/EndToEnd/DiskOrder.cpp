@@ -16,6 +16,7 @@
 namespace ost::test {
 
 using platform::FileDescriptor;
+using platform::isAtOrBelow;
 
 namespace {
 
@@ -27,10 +28,6 @@ constexpr std::string_view replaceFiles = "/private/var/root/Library/Ostrand/Rep
 constexpr std::string_view oldBundles = "/private/var/mobile/Containers/Bundle";
 const std::string bundles = "/private/var/containers/Bundle";
 constexpr std::string_view sandboxItems = "/private/var/db/sandbox-state";
-
-bool isAtOrBelow(std::string_view path, std::string_view place) {
-    return path.starts_with(place) && (path.size() == place.size() || path[place.size()] == '/');
-}
 
 /// The class directory at or above a path; empty when there is none.
 std::string_view classDirectoryOf(std::string_view path) {

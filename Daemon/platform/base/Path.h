@@ -29,4 +29,8 @@ namespace ost::platform {
     return slash == std::string_view::npos ? std::string_view() : path.substr(0, slash);
 }
 
+[[nodiscard]] inline bool isAtOrBelow(std::string_view path, std::string_view place) {
+    return path.starts_with(place) && (path.size() == place.size() || path[place.size()] == '/');
+}
+
 } // namespace ost::platform

@@ -79,10 +79,9 @@ public:
     /// inherited become named groups of a directory's default ACL. A named group is never granted less than others,
     /// because it does not fall back to them. A directory that an entry governs with add file and without delete child
     /// becomes sticky, so that who may add items removes and renames none but his own; any other one is not. In the
-    /// default ACL the owner has everything, so that a service keeps
-    /// access to what it makes itself, and the owning group and others have nothing, so that nobody else gets any. A
-    /// symbolic link is left alone: on Linux its permissions are never looked at. Fails with the errno of reading or
-    /// writing the ACL.
+    /// default ACL the owner has everything, so that a service keeps access to what it makes itself, and the owning
+    /// group and others have nothing, so that nobody else gets any. A symbolic link is left alone: on Linux its
+    /// permissions are never looked at. Fails with the errno of reading or writing the ACL.
     [[nodiscard]] std::expected<void, Errno> apply(int fd) const;
 
 private:

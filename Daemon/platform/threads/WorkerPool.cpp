@@ -351,14 +351,13 @@ void WorkerPool::_servePosted(std::span<char> scratch) {
 void WorkerPool::_run(const std::shared_ptr<EventSource>& source, std::span<char> scratch) {
     const auto turns = source->_turns;
     currentTurns = turns.get();
+    const unsigned rounds = turns ? 1 : roundsInARow;
     bool finished = false;
-    for (unsigned round = 0; !finished && round < roundsInARow && !_stopping.load(std::memory_order_relaxed); ++round) {
+    for (unsigned round = 0; !finished && round < rounds && !_stopping.load(std::memory_order_relaxed); ++round) {
         const auto events = source->_state.exchange(EventSource::_running) & ~EventSource::_running;
         source->serve(events, scratch);
         auto expected = EventSource::_running;
         finished = source->_state.compare_exchange_strong(expected, 0);
-        if (turns) // is one share
-            break;
     }
     currentTurns = nullptr;
     if (turns)
