@@ -26,7 +26,11 @@ Outcome setState(const Arguments& arguments, int state) {
 Outcome lock(const Arguments& arguments) { return setState(arguments, ost::platform::deviceLocked); }
 Outcome unlock(const Arguments& arguments) { return setState(arguments, ost::platform::deviceUnlocked); }
 Outcome state(const Arguments& arguments) {
-    return reportOf(ost::platform::deviceLockState(deviceDirectory(arguments)));
+    const auto device = deviceDirectory(arguments);
+    const auto state = ost::platform::deviceLockState(device);
+    if (!state)
+        return std::unexpected(Failure::system("cannot read the lock state of " + device, state.error()));
+    return reportOf(*state);
 }
 
 } // namespace

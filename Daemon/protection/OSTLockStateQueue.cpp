@@ -14,12 +14,14 @@ platform::WorkQueue& OSTLockStateQueue() {
     return *queue;
 }
 
-void brevind_notification_callback() {
+bool brevind_notification_callback() {
     static std::mutex mutex;
     static bool isSuspended = false; // guarded by the mutex, as is the order of looking and acting
     const std::lock_guard lock(mutex);
     const auto state = platform::deviceLockState();
-    platform::logDebug("LockState=%d", state);
+    if (!state)
+        return false;
+    platform::logDebug("LockState=%d", *state);
     if (state == platform::deviceLocked && !isSuspended) {
         OSTLockStateQueue().suspend();
         isSuspended = true;
@@ -27,6 +29,7 @@ void brevind_notification_callback() {
         OSTLockStateQueue().resume();
         isSuspended = false;
     }
+    return true;
 }
 
 void run_when_unlocked(platform::WorkQueue::Work work) {

@@ -7,7 +7,6 @@
 #include "platform/threads/RunLoop.h"
 
 #include <memory>
-#include <optional>
 
 namespace ost {
 
@@ -45,7 +44,7 @@ private:
     platform::RunLoop::Source _signalSource;
     platform::RunLoop::Source _leftOutSource; ///< lines were left out of the log, and it is time to say so
     std::unique_ptr<platform::UpcallPort> _upcallPort;
-    std::optional<platform::DeviceLockStateNotification> _lockStateNotification;
+    std::unique_ptr<platform::DeviceLockStateNotification> _lockStateNotification;
     std::unique_ptr<platform::IPCListener> _listener;
 };
 

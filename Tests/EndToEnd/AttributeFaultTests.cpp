@@ -2,14 +2,18 @@
 #include "EndToEnd/GatedDevice.h"
 #include "EndToEnd/StoreView.h"
 #include "model/OSTMetadata.h"
+#include "platform/device/Applications.h"
+#include "platform/device/DeviceLockState.h"
 #include "support/DeviceTest.h"
 
 #include <gtest/gtest.h>
 
 #include <sys/xattr.h>
 
+#include <array>
 #include <cerrno>
 #include <filesystem>
+#include <functional>
 #include <set>
 #include <string>
 
@@ -21,6 +25,7 @@ namespace {
 
 namespace fs = std::filesystem;
 
+constexpr const char* classAttribute = "trusted.ostrand.protection-class";
 constexpr const char* classDirectory = "/private/var/mobile/Containers/Data/Application";
 
 /// A daemon whose file-system calls fail or kill it while it changes what one container carries.
@@ -39,12 +44,15 @@ protected:
     }
 
     /// Has the fault befall one call after the other of what `act` asks of the daemon, until it comes to none. `check`
-    /// gets what `act` answered, and a connection to a daemon that serves.
-    void atEveryCall(Fault::Kind kind, const auto& act, const auto& check) {
+    /// gets what `act` answered, and a connection to a daemon that serves. `begin` is done before, without faults.
+    void atEveryCall(
+        Fault::Kind kind, const auto& act, const auto& check,
+        const std::function<void(Connection&)>& begin = [](Connection&) {}) {
         for (unsigned call = 1; !HasFailure(); ++call) {
             auto connection = device().connect();
             ASSERT_TRUE(ostrand::metadata(connection, container));
-            device().daemon().prepare({.kind = kind, .call = call, .error = EIO});
+            begin(connection);
+            device().daemon().prepare({.kind = kind, .call = call, .error = error});
             const auto answer = act(connection);
             const auto course = device().daemon().conclude();
             SCOPED_TRACE("fault at call " + std::to_string(call) + ", " + course.faultedCall);
@@ -69,10 +77,23 @@ protected:
         return value ? value->description() : value.error() == ostrand::Error::failed(24) ? "none" : "no answer";
     }
     [[nodiscard]] std::string valueOnDisk(const std::string& key) {
-        const auto url = device().onHost(classDirectory) / namesIn(device().onHost(classDirectory)).at(0);
-        const auto read = ost::OSTMetadata::readAndValidateMetadataAtUrl(url.native(), 501, ost::OSTCheckClassPath::no);
+        const auto read =
+            ost::OSTMetadata::readAndValidateMetadataAtUrl(directory().native(), 501, ost::OSTCheckClassPath::no);
         const auto* const value = read && read->info ? read->info->find(key) : nullptr;
         return value ? value->description() : read ? "none" : "no file";
+    }
+
+    /// The protection class that an item of the container bears, empty when it bears none.
+    [[nodiscard]] std::string classOf(const char* item) {
+        char text[16];
+        const auto size = ::lgetxattr((directory() / item).c_str(), classAttribute, text, sizeof text);
+        return std::string(text, size < 0 ? 0 : static_cast<std::size_t>(size));
+    }
+    void setClass(const char* item, const std::string& to) {
+        ASSERT_EQ(::lsetxattr((directory() / item).c_str(), classAttribute, to.data(), to.size(), 0), 0) << item;
+    }
+    [[nodiscard]] fs::path directory() {
+        return device().onHost(classDirectory) / namesIn(device().onHost(classDirectory)).at(0);
     }
 
     /// Where the sandbox finds the container.
@@ -81,6 +102,7 @@ protected:
     }
 
     ostrand::ContainerReference container;
+    int error = EIO; ///< of a call that fails
 };
 
 /// A setter that gives a key another number each time.
@@ -181,14 +203,8 @@ TEST_F(AttributeFaultTest, AnItemOfTheSandboxThatWasLostIsSetAgainWhenTheClassIs
 }
 
 TEST_F(AttributeFaultTest, AKillAtAnyMomentOfAClassChangeLeavesEveryItemAndTheRecordOldOrNew) {
-    const auto url = device().onHost(classDirectory) / namesIn(device().onHost(classDirectory)).at(0);
     for (const auto* const name : {"Documents/a", "tmp/b"})
-        writeFile(url / name, "");
-    const auto classOf = [&](const char* item) {
-        char text[16];
-        const auto size = ::lgetxattr((url / item).c_str(), "trusted.ostrand.protection-class", text, sizeof text);
-        return std::string(text, size < 0 ? 0 : static_cast<std::size_t>(size));
-    };
+        writeFile(directory() / name, "");
     // Lowers and raises in turn, so that each change has something to do; files are only ever lowered, once.
     int number = 0;
     std::string before = "3", current;
@@ -211,5 +227,91 @@ TEST_F(AttributeFaultTest, AKillAtAnyMomentOfAClassChangeLeavesEveryItemAndTheRe
             for (const auto* const file : {"Documents/a", "tmp/b"})
                 EXPECT_TRUE(classOf(file).empty() || classOf(file) == "1") << file;
             before = now;
+        });
+}
+
+namespace {
+
+/// A daemon whose file-system calls fail while it lowers the class of a container.
+class ClassChangeFaultTest : public AttributeFaultTest {
+protected:
+    void SetUp() override {
+        AttributeFaultTest::SetUp();
+        if (IsSkipped() || HasFatalFailure())
+            return;
+        error = ENOMEM; // An item that cannot be read for good is left out.
+        for (const auto* const file : {"Documents/a", "tmp/b", outside})
+            writeFile(directory() / file, "");
+        auto connection = device().connect();
+        raise(connection);
+    }
+
+    /// Every item as it was, and the class that is on record.
+    void raise(Connection& connection) {
+        for (const auto* const item : items)
+            setClass(item, "3");
+        EXPECT_TRUE(
+            ostrand::setInfoValue(connection, container, ostrand::protectionClassKey, OSTValue(std::uint64_t{3})));
+    }
+    void lock(bool locked) {
+        ASSERT_TRUE(ost::platform::writeDeviceLockState(
+            locked ? ost::platform::deviceLocked : ost::platform::deviceUnlocked, device().image()));
+    }
+    [[nodiscard]] std::set<std::string> classes() {
+        std::set<std::string> found;
+        for (const auto* const item : items)
+            found.insert(classOf(item));
+        return found;
+    }
+
+    /// What holds after a change that failed, and that it can be made again.
+    void check(Connection& connection, const auto& answer) {
+        using ostrand::Error;
+        const bool succeeded = answer.has_value();
+        EXPECT_TRUE(succeeded || answer.error() == Error::failed(ENOMEM) || answer.error() == Error::failed(21) ||
+                    answer.error() == Error::refused())
+            << answer.error().description();
+        const std::set<std::string> old{"3"}, changed{"1"}, halfway{"1", "3"};
+        const auto recorded = valueAnswered(connection, ostrand::protectionClassKey);
+        EXPECT_EQ(valueOnDisk(ostrand::protectionClassKey), recorded);
+        EXPECT_TRUE(recorded == "3" || (succeeded && recorded == "1")) << recorded;
+        EXPECT_TRUE(classes() == changed || (!succeeded && (classes() == old || classes() == halfway)));
+        EXPECT_EQ(classOf("."), "0");
+        EXPECT_EQ(classOf(outside), "");
+        const auto asserted = ost::platform::terminationAssertion("a", device().image());
+        EXPECT_TRUE(asserted && !*asserted);
+
+        EXPECT_TRUE(ostrand::setDataProtection(connection, lowered));
+        EXPECT_EQ(valueAnswered(connection, ostrand::protectionClassKey), "1");
+        EXPECT_EQ(classes(), changed);
+        raise(connection);
+    }
+
+    static constexpr std::array items{"Documents", "Documents/a", "Library", "Library/Caches", "tmp", "tmp/b"};
+    static constexpr const char* outside = "other";
+    const ostrand::DataProtection lowered{.user = 501, .identifier = "a", .protectionClass = 1, .retryIfLocked = true};
+};
+
+} // namespace
+
+TEST_F(ClassChangeFaultTest, OneThatFailsLeavesEveryItemOldOrNewAndCanBeMadeAgain) {
+    atEveryCall(
+        Fault::Kind::fail, [&](auto& connection) { return ostrand::setDataProtection(connection, lowered); },
+        [&](auto& connection, const auto& answer) { check(connection, answer); });
+}
+
+TEST_F(ClassChangeFaultTest, OneThatWaitedForTheUnlockNoLess) {
+    std::uint32_t number = 0;
+    atEveryCall(
+        Fault::Kind::fail,
+        [&](auto& connection) {
+            lock(false);
+            return connection.receive(number);
+        },
+        [&](auto& connection, const auto& answer) { check(connection, answer); },
+        [&](auto& connection) {
+            lock(true);
+            number = ostrand::beginSettingDataProtection(connection, lowered).value();
+            ASSERT_TRUE(ostrand::metadata(connection, container)); // is answered once the change is parked
         });
 }

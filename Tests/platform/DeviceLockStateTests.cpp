@@ -55,7 +55,7 @@ TEST_F(DeviceLockStateTest, IsWrittenIntoAnImage) {
 TEST_F(DeviceLockStateTest, NotifiesOnceAboutChangesThatComeTogether) {
     auto loop = RunLoop::create().value();
     int calls = 0;
-    const auto registration = DeviceLockStateNotification::registerHandler(*loop, [&] { ++calls; }).value();
+    const auto registration = DeviceLockStateNotification::registerHandler(*loop, [&] { return ++calls > 0; }).value();
     const auto callsAfter = [&](auto change) {
         calls = 0;
         change();
@@ -76,7 +76,7 @@ TEST_F(DeviceLockStateTest, NotifiesOnceAboutChangesThatComeTogether) {
     EXPECT_EQ(callsAfter([] {}), 0);
 
     std::filesystem::remove_all("/private/var/run");
-    EXPECT_EQ(DeviceLockStateNotification::registerHandler(*loop, [] {}).error(), ENOENT);
+    EXPECT_EQ(DeviceLockStateNotification::registerHandler(*loop, [] { return true; }).error(), ENOENT);
 }
 
 } // namespace

@@ -1,5 +1,6 @@
 #include "platform/device/DeviceLockState.h"
 
+#include "platform/base/PassingReason.h"
 #include "platform/base/Path.h"
 #include "platform/base/SmallFile.h"
 #include "platform/base/Try.h"
@@ -8,6 +9,7 @@
 #include <sys/epoll.h>
 #include <sys/inotify.h>
 #include <sys/stat.h>
+#include <sys/timerfd.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -77,22 +79,24 @@ bool drainEvents(int watch) {
 
 } // namespace
 
-int deviceLockState() {
+std::expected<int, Errno> deviceLockState() {
     thread_local KnownState known;
     const auto status = statusOfStateFile();
     if (!status && status.error() == ENOENT)
         return deviceUnlocked;
     if (status && known.of == *status)
         return known.state;
-    const int state = deviceLockState(std::string());
+    const int state = OST_TRY(deviceLockState(std::string()));
     // A later change in the same tick of the file system's clock would bear the same time.
     if (status && isLongAgo(status->changed))
         known = {.of = *status, .state = state};
     return state;
 }
 
-int deviceLockState(const std::string& image) {
+std::expected<int, Errno> deviceLockState(const std::string& image) {
     const auto content = readSmallFile((image + deviceLockStateFile).c_str(), stateTextLimit, FinalLink::refuse);
+    if (!content && !speaksOfTheItem(content.error()))
+        return std::unexpected(content.error());
     if (!content)
         return content.error() == ENOENT ? deviceUnlocked : deviceLockStateUnknown;
     int state = 0;
@@ -119,20 +123,31 @@ std::expected<void, Errno> writeDeviceLockState(int state, const std::string& im
     return std::unexpected(error);
 }
 
-std::expected<DeviceLockStateNotification, Errno> DeviceLockStateNotification::registerHandler(RunLoop& loop,
-                                                                                               Handler handler) {
+std::expected<std::unique_ptr<DeviceLockStateNotification>, Errno>
+DeviceLockStateNotification::registerHandler(RunLoop& loop, Handler handler) {
     FileDescriptor watch(::inotify_init1(IN_NONBLOCK | IN_CLOEXEC));
+    FileDescriptor timer(::timerfd_create(CLOCK_MONOTONIC, TFD_NONBLOCK | TFD_CLOEXEC));
     // The directory is watched, because the file itself may be replaced or missing.
     const std::string directory(pathByDeletingLastComponent(deviceLockStateFile));
     constexpr auto events = IN_CREATE | IN_CLOSE_WRITE | IN_MOVED_FROM | IN_MOVED_TO | IN_DELETE | IN_ONLYDIR;
-    if (!watch || ::inotify_add_watch(watch.get(), directory.c_str(), events) < 0)
+    if (!watch || !timer || ::inotify_add_watch(watch.get(), directory.c_str(), events) < 0)
         return std::unexpected(errno);
-    auto source = OST_TRY(
-        loop.addSource(watch.get(), EPOLLIN, [fd = watch.get(), handler = std::move(handler)](std::uint32_t) mutable {
-            if (drainEvents(fd))
-                handler();
-        }));
-    return DeviceLockStateNotification(std::move(watch), std::move(source));
+    std::unique_ptr<DeviceLockStateNotification> notification(
+        new DeviceLockStateNotification(std::move(watch), std::move(timer), std::move(handler)));
+    auto* self = notification.get();
+    self->_watchSource = OST_TRY(loop.addSource(self->_watch.get(), EPOLLIN, [self](std::uint32_t) {
+        if (drainEvents(self->_watch.get()))
+            self->_notify();
+    }));
+    self->_timerSource =
+        OST_TRY(loop.addSource(self->_timer.get(), EPOLLIN, [self](std::uint32_t) { self->_notify(); }));
+    return notification;
+}
+
+void DeviceLockStateNotification::_notify() {
+    constexpr itimerspec never{}, soon{.it_interval = {}, .it_value = {.tv_sec = 1, .tv_nsec = 0}};
+    const bool isDone = _handler();
+    ::timerfd_settime(_timer.get(), 0, isDone ? &never : &soon, nullptr);
 }
 
 } // namespace ost::platform

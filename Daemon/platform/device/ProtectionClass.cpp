@@ -70,7 +70,7 @@ std::expected<void, Errno> setProtectionClass(int fd, std::int32_t protectionCla
         if (recorded.error() != EEXIST)
             return std::unexpected(errorOfAttribute(recorded.error()));
     }
-    if (deviceLockState() == deviceLocked &&
+    if (OST_TRY(deviceLockState()) == deviceLocked &&
         (needsKeys(protectionClass) || needsKeys(OST_TRY(recordedClass(fd)).value_or(defaultDirectoryProtectionClass))))
         return std::unexpected(EPERM);
     const auto recorded = recordClass(fd, protectionClass, 0);
