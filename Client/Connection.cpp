@@ -9,7 +9,6 @@
 
 #include <algorithm>
 #include <cerrno>
-#include <limits>
 #include <poll.h>
 #include <sys/socket.h>
 
@@ -69,7 +68,7 @@ bool Connection::isClosed() const {
     return count == 0 || (count < 0 && meansClosed(errno));
 }
 
-Connection::Deadline Connection::_deadline() const {
+Deadline Connection::_deadline() const {
     return _timeout ? Deadline(std::chrono::steady_clock::now() + *_timeout) : std::nullopt;
 }
 
@@ -105,7 +104,7 @@ Result<void> Connection::_sendBytes(std::string_view bytes, const Deadline& dead
         } else if (meansClosed(errno)) {
             return std::unexpected(Error::refused());
         } else if (errno == EAGAIN) {
-            const auto ready = OST_TRY(_wait(POLLIN | POLLOUT, deadline));
+            const auto ready = OST_TRY(awaitEvents(_socket, POLLIN | POLLOUT, deadline));
             if (!(ready & POLLOUT))
                 if (auto taken = _takeInWhatArrives(deadline); !taken)
                     return taken;
@@ -140,7 +139,7 @@ Result<void> Connection::_takeInWhatArrives(const Deadline& deadline) {
     if (_receivingEnded)
         return std::unexpected(*_receivingEnded);
     if (deadline)
-        if (const auto ready = _wait(POLLIN, deadline); !ready)
+        if (const auto ready = awaitEvents(_socket, POLLIN, deadline); !ready)
             return std::unexpected(ready.error());
     char scratch[receiveSize];
     const auto space = _reader->space(scratch);
@@ -172,25 +171,6 @@ Result<void> Connection::_takeIn(IPCFrame frame) {
         return transportError(EBADMSG);
     _arrived.emplace(number, std::move(frame));
     return {};
-}
-
-Result<short> Connection::_wait(short events, const Deadline& deadline) const {
-    using namespace std::chrono;
-    while (true) {
-        int limit = -1;
-        if (deadline) {
-            const auto left = std::max(ceil<milliseconds>(*deadline - steady_clock::now()), milliseconds(0));
-            limit = static_cast<int>(std::min<milliseconds::rep>(left.count(), std::numeric_limits<int>::max()));
-        }
-        pollfd entry{.fd = _socket.get(), .events = events, .revents = 0};
-        const int ready = ::poll(&entry, 1, limit);
-        if (ready > 0)
-            return entry.revents;
-        if (ready == 0)
-            return transportError(ETIMEDOUT);
-        if (errno != EINTR)
-            return transportError(errno);
-    }
 }
 
 } // namespace ostrand

@@ -1,6 +1,7 @@
 #pragma once
 
 #include "Client/Error.h"
+#include "Client/ServiceSocket.h"
 #include "Protocol/OSTCommand.h"
 #include "platform/base/FileDescriptor.h"
 #include "platform/codec/CBOR.h"
@@ -103,15 +104,12 @@ public:
     [[nodiscard]] bool isClosed() const;
 
 private:
-    using Deadline = std::optional<std::chrono::steady_clock::time_point>;
-
     [[nodiscard]] Deadline _deadline() const;
     [[nodiscard]] Result<std::uint32_t> _send(const Request& request, const Deadline& deadline);
     [[nodiscard]] Result<void> _sendBytes(std::string_view bytes, const Deadline& deadline);
     [[nodiscard]] Result<Reply> _receive(std::uint32_t requestNumber, const Deadline& deadline);
     [[nodiscard]] Result<void> _takeInWhatArrives(const Deadline& deadline);
     [[nodiscard]] Result<void> _takeIn(ost::platform::IPCFrame frame);
-    [[nodiscard]] Result<short> _wait(short events, const Deadline& deadline) const;
 
     ost::platform::FileDescriptor _socket;
     Timeout _timeout;

@@ -7,6 +7,8 @@
 #include <algorithm>
 #include <cerrno>
 #include <fcntl.h>
+#include <limits>
+#include <poll.h>
 #include <sys/socket.h>
 #include <sys/time.h>
 #include <sys/un.h>
@@ -58,6 +60,25 @@ Result<FileDescriptor> connectToService(const std::string& device, std::string_v
         if (errno != EINTR)
             return transportError(errno == EAGAIN ? ETIMEDOUT : errno);
     return socket;
+}
+
+Result<short> awaitEvents(const FileDescriptor& socket, short events, const Deadline& deadline) {
+    using namespace std::chrono;
+    while (true) {
+        int limit = -1;
+        if (deadline) {
+            const auto left = std::max(ceil<milliseconds>(*deadline - steady_clock::now()), milliseconds(0));
+            limit = static_cast<int>(std::min<milliseconds::rep>(left.count(), std::numeric_limits<int>::max()));
+        }
+        pollfd entry{.fd = socket.get(), .events = events, .revents = 0};
+        const int ready = ::poll(&entry, 1, limit);
+        if (ready > 0)
+            return entry.revents;
+        if (ready == 0)
+            return transportError(ETIMEDOUT);
+        if (errno != EINTR)
+            return transportError(errno);
+    }
 }
 
 } // namespace ostrand

@@ -17,4 +17,12 @@ namespace ostrand {
 connectToService(const std::string& device, std::string_view service, int type,
                  std::optional<std::chrono::milliseconds> timeout = {});
 
+/// When a wait ends; absent: never.
+using Deadline = std::optional<std::chrono::steady_clock::time_point>;
+
+/// Waits until a socket has one of poll's events, and gives those that it has. Fails with ETIMEDOUT once the deadline
+/// has passed.
+[[nodiscard]] Result<short> awaitEvents(const ost::platform::FileDescriptor& socket, short events,
+                                        const Deadline& deadline);
+
 } // namespace ostrand

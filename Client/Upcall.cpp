@@ -7,6 +7,7 @@
 #include "platform/codec/OSTPackBuffer.h"
 #include "platform/ipc/UpcallPacket.h"
 
+#include <poll.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -241,13 +242,17 @@ std::string UpcallError::description() const {
     return "a container could not be looked up or made; the daemon's log says which, and why";
 }
 
-Answer<ProcessContainers> processContainers(const std::string& device, const ProcessDescription& process) {
+Answer<ProcessContainers> processContainers(const std::string& device, const ProcessDescription& process,
+                                            std::optional<std::chrono::milliseconds> timeout) {
+    const auto deadline = timeout ? Deadline(std::chrono::steady_clock::now() + *timeout) : std::nullopt;
     const auto packer = packed(process);
     const auto bytes = OST_TRY(packer.bytes());
-    const auto socket = connectToService(device, ost::OSTKernServiceName, SOCK_SEQPACKET);
+    const auto socket = connectToService(device, ost::OSTKernServiceName, SOCK_SEQPACKET, timeout);
     if (!socket)
         return transportError(static_cast<int>(socket.error().code));
     OST_TRY(sendRequest(*socket, bytes));
+    if (const auto ready = awaitEvents(*socket, POLLIN, deadline); !ready)
+        return transportError(static_cast<int>(ready.error().code));
     auto answer = OST_TRY(receiveAnswer(*socket));
     return AnswerReader(answer).read();
 }

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <chrono>
 #include <cstdint>
 #include <expected>
 #include <optional>
@@ -46,9 +47,10 @@ struct UpcallError {
 };
 
 /// Asks a device's daemon, as the kernel does, for the containers of a process; those that are missing are made.
-/// `device` is the device's directory as this process sees it. Only root gets an answer. Blocks until the daemon has
-/// answered.
-[[nodiscard]] std::expected<ProcessContainers, UpcallError> processContainers(const std::string& device,
-                                                                              const ProcessDescription& process);
+/// `device` is the device's directory as this process sees it. Only root gets an answer. Waits for it at most `timeout`
+/// (absent: without limit), then fails with ETIMEDOUT; the daemon may make the containers later all the same.
+[[nodiscard]] std::expected<ProcessContainers, UpcallError>
+processContainers(const std::string& device, const ProcessDescription& process,
+                  std::optional<std::chrono::milliseconds> timeout = {});
 
 } // namespace ostrand

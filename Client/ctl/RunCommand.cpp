@@ -7,6 +7,7 @@
 #include "Client/ctl/Values.h"
 #include "platform/base/FileName.h"
 #include "platform/base/Path.h"
+#include "platform/base/Text.h"
 #include "platform/base/Try.h"
 #include "platform/device/Accounts.h"
 #include "platform/device/Applications.h"
@@ -19,6 +20,7 @@
 #include <algorithm>
 #include <array>
 #include <cerrno>
+#include <chrono>
 #include <climits>
 #include <filesystem>
 #include <span>
@@ -35,6 +37,7 @@ constexpr Option identifierOption{"identifier", "ID", "the application's identif
 constexpr Option userOption{"user", "U",
                             "a number, or the name of one of the device's accounts; 501 when none is given"};
 constexpr Option pluginOption{"plugin", "", "the program is a plug-in"};
+constexpr Option timeoutOption{"timeout", "SECONDS", "how long to wait for the daemon's answer; 30 when none is given"};
 constexpr Option printOption{"print", "", "print the containers instead of running the program"};
 constexpr Option unconfinedOption{"unconfined", "", "leave the program every right of its user"};
 constexpr Operand programOperand{"PROGRAM", "a program of the host, found as a shell does"};
@@ -42,6 +45,8 @@ constexpr Operand argumentOperand{"ARGUMENT", "what it is given; behind -- also 
                                   Operand::Count::any};
 
 constexpr std::uint32_t usualUser = 501;
+/// A daemon whose disk is slow may take long to make containers.
+constexpr std::chrono::seconds usualTimeout{30}, longestTimeout = std::chrono::hours(24);
 
 /// What programs need of the system, beside the devices that everybody has.
 constexpr std::array programDirectories{"/usr", "/bin", "/sbin", "/lib", "/lib32", "/lib64", "/libx32"};
@@ -107,8 +112,24 @@ const std::string& identifierOf(const ProcessDescription& process) {
     return process.containerIdentifier ? *process.containerIdentifier : *process.codeSigningIdentifier;
 }
 
-std::expected<ProcessContainers, Failure> containersOf(const Device& device, const ProcessDescription& process) {
-    auto containers = processContainers(device.path, process);
+std::expected<std::chrono::seconds, Failure> timeoutOf(const Arguments& arguments) {
+    const auto text = arguments.value(timeoutOption.name);
+    if (!text)
+        return usualTimeout;
+    const auto number = ost::platform::numberIn<std::uint32_t>(*text);
+    if (number && *number > 0 && *number <= longestTimeout.count())
+        return std::chrono::seconds(*number);
+    return std::unexpected(
+        Failure::usage("\"" + escaped(*text) + "\" is no number from 1 to " + std::to_string(longestTimeout.count())));
+}
+
+std::expected<ProcessContainers, Failure> containersOf(const Device& device, const ProcessDescription& process,
+                                                       std::chrono::seconds timeout) {
+    auto containers = processContainers(device.path, process, timeout);
+    if (!containers && containers.error() == UpcallError{UpcallError::Kind::transport, ETIMEDOUT})
+        return std::unexpected(Failure::local(
+            escaped(identifierOf(process)) + ": the daemon has not said for " + std::to_string(timeout.count()) +
+            " s where the containers are, so nothing was started; it is stopped, or waits for its disk"));
     if (!containers)
         return std::unexpected(
             Failure::local(escaped(identifierOf(process)) + ": " + containers.error().description()));
@@ -335,13 +356,14 @@ std::vector<std::string> argumentsOf(const Arguments& arguments) {
 
 Outcome launch(const Arguments& arguments, const Device& device, Program program,
                const ost::platform::Account& account) {
+    const auto timeout = OST_TRY(timeoutOf(arguments));
     const auto process = OST_TRY(processOf(arguments, program, account.uid));
     std::optional<Confinement> confinement;
     if (!arguments.has(unconfinedOption.name))
         confinement = OST_TRY(systemConfinement(program, device));
     auto groups = OST_TRY(groupsOf(account, device));
     OST_TRY(refuseUnrecordable(identifierOf(process)));
-    const auto containers = OST_TRY(containersOf(device, process));
+    const auto containers = OST_TRY(containersOf(device, process, timeout));
     OST_TRY(refuseLineBreaks(containers));
     if (confinement)
         OST_TRY(allowContainers(*confinement, device, containers));
@@ -366,8 +388,9 @@ Outcome run(const Arguments& arguments) {
     const auto account = OST_TRY(accountOf(arguments, device));
     if (!arguments.has(printOption.name))
         return launch(arguments, device, std::move(program), account);
+    const auto timeout = OST_TRY(timeoutOf(arguments));
     const auto process = OST_TRY(processOf(arguments, program, account.uid));
-    return printed(OST_TRY(containersOf(device, process)));
+    return printed(OST_TRY(containersOf(device, process, timeout)));
 }
 
 } // namespace
@@ -377,7 +400,7 @@ std::vector<Command> runCommands() {
         {"run",
          "runs a program in its containers, which are made when they are missing",
          {programOperand, argumentOperand},
-         {identifierOption, userOption, pluginOption, printOption, unconfinedOption},
+         {identifierOption, userOption, pluginOption, timeoutOption, printOption, unconfinedOption},
          "The program's signature says who it is and which groups it has. It runs in its data container, with the\n"
          "rights of its user but without reach into anything but its containers and what programs need of the\n"
          "system. HOME and TMPDIR lie in its data container; OSTRAND_DATA_CONTAINER, OSTRAND_GROUP_CONTAINERS,\n"
@@ -385,7 +408,7 @@ std::vector<Command> runCommands() {
          "ID=PATH each. Of the caller's environment, PATH, TERM, TZ, LANG and LC_* are kept.\n"
          "\n"
          "The exit status is the program's, 128 and the number of the signal that ended it, or 1 when it was not\n"
-         "run.",
+         "run, for instance because the daemon did not answer in time.",
          run,
          R"({"home?": "string", "data?": "string", "temporary?": "string", "groups?": {"*": "string"}, "system?": "string", "systemGroups?": {"*": "string"}})"}};
 }

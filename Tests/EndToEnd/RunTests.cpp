@@ -203,6 +203,18 @@ TEST_F(RunTest, WhatCannotBeRunMakesNothing) {
     EXPECT_EQ(tree(records()), "");
 }
 
+TEST_F(RunTest, ADaemonThatDoesNotAnswerIsNotWaitedForWithoutEnd) {
+    const std::vector<std::string> words{"--identifier", app, "--timeout", "1", "--", "/bin/true"};
+    ::kill(device->daemonId(), SIGSTOP);
+    const auto result = run(words);
+    ::kill(device->daemonId(), SIGCONT);
+    EXPECT_EQ(result.status, 1);
+    EXPECT_NE(result.errors.find("the daemon has not said for 1 s"), std::string::npos) << result.errors;
+    EXPECT_FALSE(fs::exists(records()));
+    EXPECT_EQ(run(words).status, 0);
+    EXPECT_EQ(run({"--identifier", app, "--timeout", "0", "--", "/bin/true"}).status, 2);
+}
+
 TEST_F(RunTest, WhatStandsInTheWayOfTemporaryFilesIsLeftAlone) {
     ASSERT_EQ(shell("rmdir tmp && ln -s /etc tmp").status, 0);
     EXPECT_EQ(shell("echo $TMPDIR; ls -ld tmp; touch tmp/x 2>&1 || echo refused").output.substr(0, 1), "/");
