@@ -2,6 +2,7 @@
 #include "support/Sanitized.h"
 
 #include "codesigning/OSTGroupManager.h"
+#include "platform/base/Log.h"
 
 #include <filesystem>
 #include <map>
@@ -197,6 +198,15 @@ TEST_F(GroupManager, ReconciliationDeletesNothingWhenNobodyKnowsWhoReferencesWha
     const OSTAllIdentifiersLock lock(OSTLockKind::writing);
     manager().reconcileGroupContainersOfType(OSTGroupType::application);
     EXPECT_TRUE(lives(sharedAppGroup, "g", path));
+}
+
+TEST_F(GroupManager, ReconciliationSaysThatNobodyKnowsEvenWhereThereIsNothingToClean) {
+    test::writeFile(test::mappingFile, "damaged");
+    ASSERT_TRUE(platform::Log::shared().open(platform::LogLevel::notice, {"/log", 1, 1U << 20U}));
+    fs::rename("/private/var/mobile", "/private/var/elsewhere");
+    const OSTAllIdentifiersLock lock(OSTLockKind::writing);
+    manager().reconcileGroupContainersOfType(OSTGroupType::application);
+    EXPECT_TRUE(test::readFile("/log").contains("Failed to get reference count information for group type: 0"));
 }
 
 TEST_F(GroupManager, AMillionGroupsAreOneListLikeAnother) {

@@ -15,6 +15,7 @@
 
 #include <algorithm>
 #include <atomic>
+#include <cerrno>
 #include <chrono>
 #include <filesystem>
 #include <functional>
@@ -25,6 +26,23 @@
 #include <string>
 #include <thread>
 #include <vector>
+
+namespace {
+
+/// With what the next `send` of a service fails; 0: it does not.
+std::atomic<int> nextSendError{0};
+
+} // namespace
+
+/// Stands before the C library's for this whole program. Services are those that never wait.
+extern "C" ssize_t send(int socket, const void* bytes, size_t size, int flags) {
+    if ((flags & MSG_DONTWAIT) != 0)
+        if (const int error = nextSendError.exchange(0); error != 0) {
+            errno = error;
+            return -1;
+        }
+    return ::sendto(socket, bytes, size, flags, nullptr, 0);
+}
 
 namespace ost::platform {
 namespace {
@@ -435,6 +453,18 @@ TEST(IPC, AReplyThatTheSocketCannotHoldComesWhole) {
         if (number % 2 == 1) {
             EXPECT_EQ(validateCBOR(reply->payload())->find("Filling")->asText()->size(), size);
         }
+    }
+}
+
+TEST(IPC, AReplyForWhichTheKernelHasNoMemoryComesLater) {
+    const Service service;
+    Client client(service);
+    std::uint32_t number = 0;
+    for (const int error : {ENOBUFS, ENOMEM}) {
+        nextSendError = error;
+        client.send(request(++number, echo));
+        ASSERT_EQ(client.receiveNumber(), number);
+        EXPECT_EQ(nextSendError, 0) << "it failed";
     }
 }
 
