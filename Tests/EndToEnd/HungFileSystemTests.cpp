@@ -1,13 +1,16 @@
 #include "EndToEnd/DeviceLog.h"
 #include "EndToEnd/Wire.h"
+#include "Support/ScratchDirectory.h"
 #include "support/BootedDeviceTest.h"
 #include "support/ServedFileSystem.h"
 
 #include <gtest/gtest.h>
 
 #include <sched.h>
+#include <sys/mount.h>
 #include <unistd.h>
 
+#include <filesystem>
 #include <optional>
 #include <vector>
 
@@ -27,8 +30,9 @@ protected:
     }
 
     /// Connections of a client whose program lies there.
-    std::vector<Connection> connect(const ServedFileSystem& fileSystem) {
-        _client.emplace(device().socket(), Identity{.user = 501, .program = fileSystem.program()});
+    std::vector<Connection> connect(const ServedFileSystem& fileSystem) { return connect(fileSystem.program()); }
+    std::vector<Connection> connect(const std::filesystem::path& program) {
+        _client.emplace(device().socket(), Identity{.user = 501, .program = program});
         std::vector<Connection> connections;
         for (std::size_t i = 0; i < connectionsOfTheHung; ++i)
             connections.push_back(_client->connect());
@@ -70,6 +74,26 @@ TEST_F(HungFileSystemTest, ItsMakerDoesNotHaveToForbidSetUserIdInAMountTableOfHi
         connection.send(creation(1, "com.example.hung"));
     for (auto& connection : connections)
         EXPECT_TRUE(connection.isClosed());
+}
+
+TEST_F(HungFileSystemTest, AUserWhoLaysOneOverAnotherWaitsAlone) {
+    ASSERT_EQ(::unshare(CLONE_NEWNS), 0);
+    const auto place = makeScratchDirectory(0755);
+    std::vector<Connection> connections;
+    {
+        ServedFileSystem fileSystem(builtProgram("wire-client"), false);
+        const auto layers = "lowerdir=" + place.string() + ":" + fileSystem.program().parent_path().string();
+        if (::mount("test", place.c_str(), "overlay", MS_NOSUID | MS_NODEV, layers.c_str()) != 0)
+            GTEST_SKIP() << "this host has no overlays: errno " << errno;
+        connections = connect(place / "program");
+        fileSystem.stopAnswering();
+        for (auto& connection : connections)
+            connection.send(creation(1, "com.example.hung"));
+        expectServiceOfOthers();
+    }
+    for (auto& connection : connections)
+        EXPECT_TRUE(connection.isClosed());
+    ::umount2(place.c_str(), MNT_DETACH);
 }
 
 TEST_F(HungFileSystemTest, AnAdministratorsThatHangsKeepsItsOwnClientsWaiting) {

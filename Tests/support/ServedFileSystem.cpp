@@ -130,6 +130,11 @@ void ServedFileSystem::_answer(const std::string& request) {
         return _reply(head.unique, 0, _content.data() + offset,
                       std::min<std::size_t>(wanted.size, _content.size() - offset));
     }
+    case FUSE_STATFS: {
+        fuse_statfs_out out{};
+        out.st.namelen = 255;
+        return _reply(head.unique, 0, &out, sizeof out);
+    }
     case FUSE_RELEASE:
     case FUSE_FLUSH:
         return _reply(head.unique, 0, nullptr, 0);
