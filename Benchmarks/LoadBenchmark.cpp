@@ -1,204 +1,35 @@
 // A look-up while a thousand other connections are idle, dozens are busy and a hundred mean harm, beside one while the
 // daemon has nothing else to do.
 
-#include "Client/Containers.h"
-#include "Support/BootedDevice.h"
-#include "Support/ScratchDirectory.h"
-#include "platform/codec/CBOR.h"
 #include "support/Comparison.h"
-#include "support/DeviceClient.h"
-#include "support/Require.h"
-#include "support/RoundTrips.h"
-#include "support/Socket.h"
-#include "support/Stopwatch.h"
+#include "support/LoadedDevice.h"
 
-#include <sys/resource.h>
-#include <sys/socket.h>
-#include <sys/syscall.h>
-#include <unistd.h>
-
-#include <algorithm>
-#include <array>
-#include <chrono>
-#include <filesystem>
-#include <iterator>
 #include <stdexcept>
-#include <string>
-#include <thread>
-#include <vector>
 
 namespace ost::benchmarks {
 
-using test::BootedDevice;
-using test::makeScratchDirectory;
-
 namespace {
 
-using namespace std::chrono_literals;
-using ostrand::ContainerClass;
-using platform::FileDescriptor;
+constexpr unsigned lookUps = 2000;
 
-constexpr const char* identifier = "com.example.Sketches";
-constexpr std::array<uid_t, 3> users{501, 502, 503};
-constexpr unsigned idleConnections = 1000;
-constexpr unsigned busyConnectionsOfUser = 21;
-constexpr unsigned hostileConnectionsOfUser = 33;
-
-std::string requestOf(std::uint64_t command) {
-    return requestWith(4, [&](platform::CBOREncoder& encoder) {
-        encoder.key("Command");
-        encoder.unsignedNumber(command);
-        encoder.key("ContainerClass");
-        encoder.unsignedNumber(static_cast<std::uint64_t>(ContainerClass::dataApplication));
-        encoder.key("UserID");
-        encoder.unsignedNumber(501);
-        encoder.key("Identifier");
-        encoder.text(identifier);
-    });
+double secondsUnderLoad(LoadedDevice& device, double percentile) {
+    const auto before = device.holding();
+    double seconds = 0;
+    {
+        const LoadedDevice::Load load(device);
+        seconds = percentileOf(device.lookUps(lookUps), percentile);
+    }
+    if (!device.returnsTo(before))
+        throw std::runtime_error("the daemon keeps what the load has taken");
+    return seconds;
 }
-
-/// The calling thread alone acts for the user from now on, as far as the sockets that it connects tell.
-void become(uid_t user) { require(::syscall(SYS_setresuid, -1, user, -1) == 0, "setresuid"); }
-
-/// Connections that each do harm in their own way, over and over.
-class HostileConnections {
-public:
-    explicit HostileConnections(std::string socketPath) : _socketPath(std::move(socketPath)) {
-        while (_sockets.size() < hostileConnectionsOfUser)
-            _sockets.push_back(connectTo(_socketPath));
-    }
-
-    void doHarm() {
-        for (std::size_t index = 0; index < _sockets.size(); ++index)
-            if (!_doHarm(index % 5, _sockets[index].get()))
-                _sockets[index] = connectTo(_socketPath);
-    }
-
-private:
-    /// False when another connection is needed.
-    bool _doHarm(std::size_t way, int socket) {
-        switch (way) {
-        case 0: // a frame without an end
-            return _send(socket, _lookUp.substr(0, _lookUp.size() / 2)) || errno == EAGAIN;
-        case 1:
-            return _send(socket, std::string(100, '\xff'));
-        case 2: // replies that nobody reads
-            while (_send(socket, _lookUp))
-                ;
-            return errno == EAGAIN;
-        case 3:
-            return _send(socket, _unknown) && ::recv(socket, _reply.data(), _reply.size(), 0) > 0;
-        default:
-            return false;
-        }
-    }
-    static bool _send(int socket, const std::string& bytes) {
-        return ::send(socket, bytes.data(), bytes.size(), MSG_NOSIGNAL | MSG_DONTWAIT) ==
-               static_cast<ssize_t>(bytes.size());
-    }
-
-    const std::string _socketPath;
-    const std::string _lookUp = requestOf(0), _unknown = requestOf(999);
-    std::array<char, 4096> _reply;
-    std::vector<FileDescriptor> _sockets;
-};
-
-void beBusy(const std::stop_token& end, const std::string& socketPath, uid_t user) {
-    become(user);
-    const auto request = requestOf(0);
-    const auto reply = RoundTrips(socketPath, request).once().size();
-    BusyConnections connections(socketPath, request, reply, busyConnectionsOfUser);
-    while (!end.stop_requested())
-        connections.rate(20ms);
-}
-
-void beHostile(const std::stop_token& end, const std::string& socketPath, uid_t user) {
-    become(user);
-    HostileConnections connections(socketPath);
-    for (; !end.stop_requested(); std::this_thread::sleep_for(1ms))
-        connections.doHarm();
-}
-
-/// Everything that bears upon the daemon, as long as the object lives.
-class Load {
-public:
-    explicit Load(const BootedDevice& device) {
-        const auto path = device.socket().string();
-        while (_idle.size() < idleConnections)
-            _idle.push_back(connectTo(path));
-        for (const auto user : users) {
-            _threads.emplace_back([=](const std::stop_token& end) { beBusy(end, path, user); });
-            _threads.emplace_back([=](const std::stop_token& end) { beHostile(end, path, user); });
-        }
-    }
-
-private:
-    std::vector<FileDescriptor> _idle;
-    std::vector<std::jthread> _threads;
-};
-
-std::size_t descriptorsOf(const BootedDevice& device) {
-    const std::filesystem::directory_iterator all("/proc/" + std::to_string(device.daemonId()) + "/fd");
-    return static_cast<std::size_t>(std::distance(begin(all), end(all)));
-}
-
-/// A device whose daemon gives back what a load has taken.
-class LoadedDevice {
-public:
-    LoadedDevice() {
-        const rlimit descriptors{.rlim_cur = 4096, .rlim_max = 4096};
-        require(::setrlimit(RLIMIT_NOFILE, &descriptors) == 0, "setrlimit");
-        auto connection = connectTo(_device);
-        require(ostrand::createOrLookup(
-                    connection,
-                    {.containerClass = ContainerClass::dataApplication, .user = 501, .identifier = identifier},
-                    ostrand::WhenMissing::create),
-                "create a container");
-        secondsOfLookUp(0.5);
-    }
-
-    /// A percentile of look-ups, between 0 and 1.
-    double secondsOfLookUp(double percentile) {
-        constexpr unsigned lookUps = 2000;
-        std::vector<double> seconds;
-        while (seconds.size() < lookUps)
-            seconds.push_back(secondsOf([&] { _lookUp.once(); }));
-        std::ranges::sort(seconds);
-        return seconds[static_cast<std::size_t>(percentile * (lookUps - 1))];
-    }
-    double secondsOfLookUpUnderLoad(double percentile) {
-        const auto descriptors = descriptorsOf(_device);
-        const auto memory = residentBytes(_device);
-        double seconds = 0;
-        {
-            const Load load(_device);
-            seconds = secondsOfLookUp(percentile);
-        }
-        _expectReturnTo(descriptors, memory);
-        return seconds;
-    }
-
-private:
-    void _expectReturnTo(std::size_t descriptors, std::uint64_t memory) const {
-        constexpr std::uint64_t mayStay = std::uint64_t{16} << 20;
-        const auto patience = Clock::now() + 10s;
-        while (descriptorsOf(_device) > descriptors || residentBytes(_device) > memory + mayStay) {
-            if (Clock::now() > patience)
-                throw std::runtime_error("the daemon keeps what the load has taken");
-            std::this_thread::sleep_for(10ms);
-        }
-    }
-
-    BootedDevice _device{makeScratchDirectory(0711) / "device"};
-    RoundTrips _lookUp{_device.socket(), requestOf(0)};
-};
 
 void compare(benchmark::State& state, double percentile) {
     LoadedDevice device;
     Comparison{.unit = Unit::seconds,
                .target = {Target::Kind::ratioAtMost, 2.0},
-               .daemon = [&] { return device.secondsOfLookUpUnderLoad(percentile); },
-               .baseline = [&] { return device.secondsOfLookUp(percentile); }}
+               .daemon = [&] { return secondsUnderLoad(device, percentile); },
+               .baseline = [&] { return percentileOf(device.lookUps(lookUps), percentile); }}
         .run(state);
 }
 
