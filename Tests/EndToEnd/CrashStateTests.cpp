@@ -2,11 +2,14 @@
 #include "Client/CodeSigning.h"
 #include "Client/Containers.h"
 #include "Client/Maintenance.h"
+#include "Client/Upcall.h"
+#include "EndToEnd/DeviceView.h"
 #include "EndToEnd/GatedDevice.h"
 #include "EndToEnd/StoreView.h"
 #include "Support/ChildProcess.h"
 #include "Support/ScratchDirectory.h"
 #include "files/OSTTreeCopy.h"
+#include "platform/codec/PropertyList.h"
 #include "support/DeviceTest.h"
 
 #include <gtest/gtest.h>
@@ -17,7 +20,9 @@
 #include <sys/syscall.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <array>
+#include <atomic>
 #include <cstdlib>
 #include <filesystem>
 #include <functional>
@@ -40,18 +45,17 @@ namespace {
 
 namespace fs = std::filesystem;
 
-constexpr std::array classes{dataApplication, bundleApplication, sharedAppGroup};
-
 /// What has reached the disk when the power fails.
 enum class Reached {
     least, ///< what was waited for, and nothing else
     most,  ///< everything that was done
 };
 
-/// A command, and what has to be there for it.
+/// A command. It is given a connection and the device's directory on the host.
 struct Command {
     const char* name;
-    std::function<bool(Connection&)> run;
+    std::function<bool(Connection&, const fs::path&)> run;
+    Leaves leaves = Leaves::oneOfTwo;
 };
 
 void mustWork(bool worked, const std::string& what) {
@@ -84,13 +88,15 @@ public:
         const FileDescriptor top(::open(_place.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
         mustWork(::syncfs(top.get()) == 0, "syncfs");
     }
-    /// What would be found if the power failed now.
-    void copyTo(const fs::path& directory, const std::string& name) const {
+    /// What would be found if the power failed now. A copy of that name is replaced.
+    void copyTo(const fs::path& directory, const std::string& name) const { copy(_file, directory, name); }
+    static void copy(const fs::path& file, const fs::path& directory, const std::string& name) {
         const auto open = [](const fs::path& path) {
             return FileDescriptor(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
         };
-        const auto from = open(_file.parent_path()), to = open(directory);
-        mustWork(ost::OSTCopyTree(from.get(), _file.filename().c_str(), to.get(), name.c_str()).has_value(),
+        const auto from = open(file.parent_path()), to = open(directory);
+        fs::remove(directory / name);
+        mustWork(ost::OSTCopyTree(from.get(), file.filename().c_str(), to.get(), name.c_str()).has_value(),
                  "copy a disk");
     }
 
@@ -98,38 +104,33 @@ private:
     fs::path _file, _place;
 };
 
-/// The sandbox knows of no other place.
-void expectItem(const GatedDevice& device, const std::string& identifier, const std::string& path) {
-    const auto item = device.onHost("/private/var/db/sandbox-state/501/1") / identifier;
-    if (fs::is_symlink(item)) {
-        EXPECT_EQ(fs::read_symlink(item), path);
+/// The device of a disk, with a daemon that has just started. It is the first one since a boot of the device.
+struct BootedDisk {
+    BootedDisk(const fs::path& file, const fs::path& place, GatedCallWatcher watcher = {})
+        : disk(file, place), device(disk.place() / "device") {
+        device.startDaemon({}, std::move(watcher));
+        mustWork(device.waitForFirstPass(), "start");
     }
-}
-
-/// What clients are told of a device, and what they find there.
-std::string viewOf(const GatedDevice& device) {
-    auto connection = device.connect();
-    std::string view;
-    for (const auto containerClass : classes) {
-        const auto user = ost::usualUserOf(containerClass);
-        const auto listed = listedContainers(connection, containerClass, false);
-        for (const auto& [identifier, uuid] : listed) {
-            const ostrand::ContainerReference reference{containerClass, user, identifier,
-                                                        *ost::platform::UUID::parse(uuid)};
-            const auto found = ostrand::metadata(connection, reference);
-            mustWork(found.has_value(), "no metadata of " + identifier);
-            const auto value = ostrand::infoValue(connection, reference, "k");
-            const auto place = device.onHost(found->path);
-            view += found->path;
-            for (const auto& part : {identifier, uuid, value ? value->description() : "", tree(place)})
-                view.append(" ").append(part);
-            EXPECT_EQ(containersOnDisk(place.parent_path()), listed);
-            if (containerClass == dataApplication)
-                expectItem(device, identifier, found->path);
+    bool run(const Command& command) {
+        auto connection = device.connect();
+        return command.run(connection, device.image());
+    }
+    /// The same where the daemon may be killed, or the command has been done.
+    void attempt(const Command& command) {
+        try {
+            run(command);
+        } catch (const std::runtime_error&) {
+            // The connection has ended.
         }
     }
-    const auto registered = ostrand::codeSigningInfo(connection, "b");
-    return view + (registered ? registered->description() : "nothing registered");
+
+    Disk disk;
+    GatedDevice device;
+};
+
+bool changes(int call) {
+    constexpr std::array calls{SYS_renameat, SYS_renameat2, SYS_unlinkat, SYS_mkdirat, SYS_symlinkat, SYS_write};
+    return std::ranges::find(calls, call) != calls.end();
 }
 
 /// A device on such a disk. Runs only when it is asked for: it needs loop devices and some minutes.
@@ -143,34 +144,66 @@ protected:
         Disk::make(_scratch / "disk");
         _disk.emplace(_scratch / "disk", _scratch / "mounted");
         _device.emplace(_disk->place() / "device");
+        start();
+    }
+    void TearDown() override {
+        if (!IsSkipped())
+            std::cout << _states << " states\n";
+    }
+
+    [[nodiscard]] GatedDevice& device() { return *_device; }
+    void start() {
         _device->startDaemon({}, [this](const GatedCall& call) { beforeEach(call); });
         mustWork(_device->waitForFirstPass(), "start");
     }
 
-    /// Runs the command and keeps the disk as it was at each moment of it.
+    /// Runs the command and looks what a power cut leaves at each moment of it.
     void run(const Command& command) {
         _disk->settle();
         const auto before = viewOf(*_device);
         follow(true);
         auto connection = _device->connect();
-        EXPECT_TRUE(command.run(connection)) << command.name;
+        EXPECT_TRUE(command.run(connection, _device->image())) << command.name;
         follow(false);
-        const auto after = viewOf(*_device);
-        for (unsigned number = 0; number < _kept; ++number) {
-            SCOPED_TRACE(std::string(command.name) + ", moment " + std::to_string(number) + " of " +
-                         std::to_string(_kept));
-            const auto found = viewAfterPowerCut(_scratch / nameOf(number));
-            const bool answered = number + 1 == _kept;
-            EXPECT_TRUE(found == after || (!answered && found == before)) << "before:\n"
-                                                                          << before << "\nafter:\n"
-                                                                          << after << "\nfound:\n"
-                                                                          << found;
-            fs::remove(_scratch / nameOf(number));
-        }
-        states += std::exchange(_kept, 0U);
+        judge(command, before, viewOf(*_device));
     }
 
-    unsigned states = 0;
+    /// The same with a start after a boot, which comes to the same end wherever it is cut.
+    void runStart(const char* name, const DeviceView& expected) {
+        _device->killDaemon();
+        fs::remove(_device->onHost("/dev/shm/sem.ostrandd.fb_check"));
+        _disk->settle();
+        follow(true);
+        start();
+        follow(false);
+        judge({name, {}}, expected, expected);
+    }
+
+    /// Kills the daemon after each change that it makes for the command, gives the next daemon the same command, and
+    /// cuts the power as soon as that has answered.
+    void killAndAskAgain(const Command& command) {
+        _device->killDaemon();
+        _disk->settle();
+        _disk->copyTo(_scratch, "before");
+        for (const unsigned call : changesOf(command)) {
+            SCOPED_TRACE(std::string(command.name) + ", killed at call " + std::to_string(call));
+            Disk::copy(_scratch / "before", _scratch, "killed");
+            BootedDisk killed(_scratch / "killed", _scratch / "working");
+            killed.device.daemon().prepare({.kind = Fault::Kind::kill, .call = call});
+            killed.attempt(command);
+            if (killed.device.daemon().conclude().faultedCall.empty())
+                continue; // It has made fewer calls this time.
+            killed.device.startDaemon();
+            mustWork(killed.device.waitForFirstPass(), "start after a kill");
+            killed.attempt(command); // It may have been done already.
+            killed.disk.copyTo(_scratch, "cut");
+            const auto told = viewOf(killed.device);
+            const auto found = viewOf(BootedDisk(_scratch / "cut", _scratch / "after").device);
+            ++_states;
+            ASSERT_EQ(textOf(told), textOf(found));
+        }
+        start();
+    }
 
 private:
     static std::string nameOf(unsigned number) { return "state" + std::to_string(number); }
@@ -196,14 +229,42 @@ private:
         _hasWaited |= call.number == SYS_fsync || call.number == SYS_fdatasync || call.number == SYS_syncfs;
     }
 
-    std::string viewAfterPowerCut(const fs::path& file) {
-        const Disk copy(file, _scratch / "after");
-        GatedDevice booted(copy.place() / "device");
-        booted.startDaemon();
-        mustWork(booted.waitForFirstPass(), "start after a power cut");
-        const auto view = viewOf(booted);
-        EXPECT_EQ(leftovers(booted.image()), std::vector<std::string>());
-        return view;
+    void judge(const Command& command, const DeviceView& before, const DeviceView& after) {
+        for (unsigned number = 0; number < _kept; ++number) {
+            SCOPED_TRACE(std::string(command.name) + ", moment " + std::to_string(number) + " of " +
+                         std::to_string(_kept));
+            const bool answered = number + 1 == _kept;
+            BootedDisk booted(_scratch / nameOf(number), _scratch / "after");
+            const auto found = viewOf(booted.device);
+            EXPECT_EQ(leftovers(booted.device.image()), std::vector<std::string>());
+            EXPECT_TRUE(found == after || (!answered && mayBeLeft(command.leaves, found, before, after)))
+                << "before:\n"
+                << textOf(before) << "\nafter:\n"
+                << textOf(after) << "\nfound:\n"
+                << textOf(found);
+            if (command.leaves == Leaves::aTask) {
+                EXPECT_TRUE(booted.run(command));
+                EXPECT_EQ(textOf(viewOf(booted.device)), textOf(after));
+            }
+            fs::remove(_scratch / nameOf(number));
+        }
+        _states += std::exchange(_kept, 0U);
+    }
+
+    /// The calls right after those with which the daemon changes something for the command.
+    std::vector<unsigned> changesOf(const Command& command) {
+        Disk::copy(_scratch / "before", _scratch, "tried");
+        std::vector<unsigned> found;
+        std::atomic<bool> counts = false;
+        unsigned number = 0;
+        BootedDisk tried(_scratch / "tried", _scratch / "working", [&](const GatedCall& call) {
+            if (counts && (++number, changes(call.number)))
+                found.push_back(number + 1);
+        });
+        counts = true;
+        EXPECT_TRUE(tried.run(command)) << command.name;
+        tried.device.killDaemon(); // before what watches it
+        return found;
     }
 
     const fs::path _scratch = makeScratchDirectory(0755);
@@ -211,7 +272,7 @@ private:
     std::optional<GatedDevice> _device;
     std::mutex _mutex; ///< guards the rest
     bool _isRunning = false, _hasWaited = false;
-    unsigned _kept = 0;
+    unsigned _kept = 0, _states = 0;
 };
 
 ostrand::ContainerRequest named(ost::OSTContainerClass containerClass, const std::string& identifier,
@@ -238,38 +299,155 @@ bool registerB(Connection& connection, std::uint64_t number) {
         .has_value();
 }
 
+const Command upcall{"an upcall",
+                     [](auto&, const fs::path& image) {
+                         return ostrand::processContainers(image, {.containerIdentifier = "com.tamarok.pellord",
+                                                                   .user = 501,
+                                                                   .groups = {"group.x", "group.y"},
+                                                                   .systemContainer = "com.tamarok.pellord"})
+                             .has_value();
+                     },
+                     Leaves::parts};
+
+const auto data = named(dataApplication, "a");
+const Command creation{"create", [](auto& c, auto&) { return find(c, data).identifier == "a"; }};
+const Command settingAValue{
+    "set an info value", [](auto& c, auto&) {
+        return ostrand::setInfoValue(c, find(c, data), "k", OSTValue(std::uint64_t{1})).has_value();
+    }};
+const Command regeneration{
+    "regenerate", [](auto& c, auto&) { return ostrand::regenerateDirectoryUUID(c, find(c, data)).has_value(); }};
+const Command replacement{"replace", [](auto& c, auto&) { return replaceByTransient(c, dataApplication, "a"); }};
+const Command wipe{"wipe", [](auto& c, auto&) { return ostrand::wipe(c, data).has_value(); }};
+const Command registrationAnew{"register anew", [](auto& c, auto&) { return registerB(c, 2); }};
+const Command deletion{"delete", [](auto& c, auto&) { return ostrand::deleteContainer(c, data).has_value(); }};
+const Command migration{"migrate", [](auto& c, auto&) { return ostrand::migrate(c).has_value(); }, Leaves::aTask};
+
+/// Entitlements as older releases kept them: in a bundle, in data containers and in a file; and a group of nobody.
+void prepareMigration(const GatedDevice& device) {
+    auto connection = device.connect();
+    const auto carry = [&](ost::OSTContainerClass containerClass, const char* identifier, const char* key,
+                           const OSTValue& value) {
+        mustWork(ostrand::setInfoValue(connection, find(connection, named(containerClass, identifier)), key, value)
+                     .has_value(),
+                 key);
+    };
+    const auto from = [](const char* where) { return OSTDictionary({{"from", OSTValue(std::string(where))}}); };
+    carry(bundleApplication, "cached", "com.tamarok.Tessaly.CachedCodeSigningInfo",
+          OSTDictionary({{"Entitlements", from("bundle")}}));
+    for (const auto* const identifier : {"cached", "legacy", "grouped"})
+        carry(dataApplication, identifier, "com.tamarok.Tessaly.GroupContainerIDs",
+              ost::OSTArray{OSTValue(std::string("group.kept"))});
+    for (const auto& container : {named(sharedAppGroup, "group.kept"), named(sharedAppGroup, "group.of-nobody"),
+                                  named(dataSystem, "com.tamarok.pellord")})
+        find(connection, container);
+    writeFile(device.onHost("/private/var/root/Library/Ostrand/ost_entitlements.plist"),
+              ost::platform::serializeBinaryPropertyList(
+                  OSTDictionary({{"cached", from("legacy")}, {"legacy", from("legacy")}})));
+}
+
 } // namespace
 
 TEST_P(CrashStateTest, WhatWasAnsweredIsThereOnceAndWhole) {
-    const auto data = named(dataApplication, "a"), bundle = named(bundleApplication, "b");
+    const auto bundle = named(bundleApplication, "b");
     const Command commands[] = {
-        {"create", [&](auto& c) { return find(c, data).identifier == "a"; }},
-        {"create a group", [&](auto& c) { return find(c, named(sharedAppGroup, "group.a")).identifier == "group.a"; }},
-        {"create a bundle", [&](auto& c) { return find(c, bundle).identifier == "b"; }},
+        creation,
+        {"create a group",
+         [&](auto& c, auto&) { return find(c, named(sharedAppGroup, "group.a")).identifier == "group.a"; }},
+        {"create a bundle", [&](auto& c, auto&) { return find(c, bundle).identifier == "b"; }},
         // Before it is registered: a replacement that does not come to its end leaves the registration marked as stale.
-        {"replace a bundle", [&](auto& c) { return replaceByTransient(c, bundleApplication, "b"); }},
-        {"register", [&](auto& c) { return registerB(c, 1); }},
-        {"set an info value",
-         [&](auto& c) { return ostrand::setInfoValue(c, find(c, data), "k", OSTValue(std::uint64_t{1})).has_value(); }},
+        {"replace a bundle", [&](auto& c, auto&) { return replaceByTransient(c, bundleApplication, "b"); }},
+        {"register", [&](auto& c, auto&) { return registerB(c, 1); }},
+        settingAValue,
         {"change an info value",
-         [&](auto& c) { return ostrand::setInfoValue(c, find(c, data), "k", OSTValue(std::uint64_t{2})).has_value(); }},
-        {"regenerate", [&](auto& c) { return ostrand::regenerateDirectoryUUID(c, find(c, data)).has_value(); }},
-        {"replace", [&](auto& c) { return replaceByTransient(c, dataApplication, "a"); }},
-        {"wipe", [&](auto& c) { return ostrand::wipe(c, data).has_value(); }},
-        {"register anew", [&](auto& c) { return registerB(c, 2); }},
-        {"remove a registration", [&](auto& c) { return ostrand::removeCodeSigning(c, "b").has_value(); }},
-        {"stage for deletion", [&](auto& c) { return ostrand::stageForDeletion(c, {find(c, bundle)}).has_value(); }},
-        {"delete", [&](auto& c) { return ostrand::deleteContainer(c, data).has_value(); }},
+         [&](auto& c, auto&) {
+             return ostrand::setInfoValue(c, find(c, data), "k", OSTValue(std::uint64_t{2})).has_value();
+         }},
+        regeneration,
+        replacement,
+        wipe,
+        registrationAnew,
+        {"remove a registration", [&](auto& c, auto&) { return ostrand::removeCodeSigning(c, "b").has_value(); }},
+        {"stage for deletion",
+         [&](auto& c, auto&) { return ostrand::stageForDeletion(c, {find(c, bundle)}).has_value(); }},
+        deletion,
         {"place where nothing is",
-         [&](auto& c) { return ostrand::replace(c, {}, find(c, named(dataApplication, "a", true))).has_value(); }},
-        {"delete what was placed", [&](auto& c) { return ostrand::deleteContainer(c, data).has_value(); }},
+         [&](auto& c, auto&) {
+             return ostrand::replace(c, {}, find(c, named(dataApplication, "a", true))).has_value();
+         }},
+        {"delete what was placed", [&](auto& c, auto&) { return ostrand::deleteContainer(c, data).has_value(); }},
     };
     for (const auto& command : commands) {
         run(command);
         if (HasFailure())
             return;
     }
-    std::cout << states << " states\n";
+}
+
+TEST_P(CrashStateTest, AClassThatChangesIsRecordedWhenAllItemsHaveIt) {
+    auto connection = device().connect();
+    const auto container = find(connection, data);
+    const auto place = device().onHost(ostrand::metadata(connection, container)->path);
+    for (const char* file : {"Documents/a/note", "Documents/b", "Library/c"})
+        writeFile(place / file, "a person's");
+    for (const std::int64_t protectionClass : {1, 4})
+        run({"change the class",
+             [&](auto& c, auto&) {
+                 return ostrand::setDataProtection(c, {dataApplication, 501, "a", protectionClass}).has_value();
+             },
+             Leaves::parts});
+}
+
+TEST_P(CrashStateTest, AnUpcallMakesWholeContainers) { run(upcall); }
+
+TEST_P(CrashStateTest, AMigrationLosesNothingAndIsMadeGoodByTheNext) {
+    prepareMigration(device());
+    run(migration);
+}
+
+TEST_P(CrashStateTest, AStartAfterAnUpgradeLosesNothing) {
+    auto connection = device().connect();
+    for (const auto& container : {named(bundleApplication, "b"), named(bundleFramework, "f"),
+                                  named(dataApplication, "a"), named(dataSystem, "com.tamarok.pellord")})
+        find(connection, container);
+    const auto expected = viewOf(device());
+    const auto var = device().onHost("/private/var");
+    const auto old = var / "mobile/Containers/Bundle";
+    fs::create_directories(old / "Framework");
+    // One class as a whole, and one container into a class that is there.
+    fs::rename(var / "containers/Bundle/Application", old / "Application");
+    for (const auto& name : namesIn(var / "containers/Bundle/Framework"))
+        fs::rename(var / "containers/Bundle/Framework" / name, old / "Framework" / name);
+    fs::rename(var / "containers/Data/System/com.tamarok.pellord",
+               var / "containers/Data/System/0F0F0F0F-1111-4222-8333-444444444444");
+    runStart("start after an upgrade", expected);
+    EXPECT_FALSE(fs::exists(old));
+    EXPECT_TRUE(fs::exists(var / "containers/Data/System/com.tamarok.pellord/tmp"));
+}
+
+TEST_P(CrashStateTest, WhatADaemonAnswersAfterAKilledOneIsThere) {
+    if (GetParam() == Reached::most)
+        GTEST_SKIP() << "Nothing can be missing";
+    ASSERT_NO_FATAL_FAILURE(killAndAskAgain(creation));
+    auto connection = device().connect();
+    find(connection, data);
+    mustWork(registerB(connection, 1), "register");
+    prepareMigration(device());
+    const Command commands[] = {
+        settingAValue,
+        regeneration,
+        replacement,
+        {"replace a bundle", [&](auto& c, auto&) { return replaceByTransient(c, bundleApplication, "cached"); }},
+        wipe,
+        registrationAnew,
+        deletion,
+        {"change the class",
+         [&](auto& c, auto&) { return ostrand::setDataProtection(c, {dataApplication, 501, "a", 1}).has_value(); }},
+        upcall,
+        migration,
+    };
+    for (const auto& command : commands)
+        ASSERT_NO_FATAL_FAILURE(killAndAskAgain(command));
 }
 
 INSTANTIATE_TEST_SUITE_P(, CrashStateTest, testing::Values(Reached::least, Reached::most),
