@@ -4,6 +4,7 @@
 #include "Client/Attributes.h"
 #include "Support/BootedDevice.h"
 #include "Support/ScratchDirectory.h"
+#include "support/BareWalk.h"
 #include "support/Comparison.h"
 #include "support/DeviceClient.h"
 #include "support/JournaledFileSystem.h"
@@ -13,7 +14,6 @@
 #include "support/RoundTrips.h"
 #include "support/Stopwatch.h"
 
-#include <dirent.h>
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <sys/xattr.h>
@@ -45,12 +45,7 @@ constexpr const char* key = "com.example.Sketches.LastOpened";
 class Owner {
 public:
     Owner(const BootedDevice& device, const std::string& identifier) : _connection(connectTo(device)) {
-        const auto made =
-            require(ostrand::createOrLookup(
-                        _connection,
-                        {.containerClass = ContainerClass::dataApplication, .user = user, .identifier = identifier},
-                        ostrand::WhenMissing::create),
-                    "create a container");
+        const auto made = createContainer(_connection, identifier);
         container = {ContainerClass::dataApplication, user, identifier, made.uuid};
         path = device.onHost(made.path);
     }
@@ -172,26 +167,6 @@ void changeAttribute(int item, const std::string& value) {
     require(::fsetxattr(item, classAttribute, value.data(), value.size(), 0) == 0, classAttribute);
 }
 
-/// The bare walk: every item opened relative to its directory.
-void changeTree(FileDescriptor top, const std::string& value) {
-    const auto close = [](DIR* stream) { ::closedir(stream); };
-    const std::unique_ptr<DIR, decltype(close)> stream(::fdopendir(top.get()));
-    require(static_cast<bool>(stream), "fdopendir");
-    const int directory = top.release();
-    while (const dirent* const entry = ::readdir(stream.get())) {
-        const std::string_view name = entry->d_name;
-        if (name == "." || name == "..")
-            continue;
-        FileDescriptor item(::openat(directory, entry->d_name, O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
-        require(static_cast<bool>(item), entry->d_name);
-        if (entry->d_type == DT_DIR)
-            changeTree(std::move(item), value);
-        else
-            changeAttribute(item.get(), value);
-    }
-    changeAttribute(directory, value);
-}
-
 /// A container with a large tree, whose class goes to and fro.
 struct LargeContainer {
     std::filesystem::path scratch = makeScratchDirectory(0711);
@@ -202,8 +177,16 @@ struct LargeContainer {
     LargeContainer() { makeLargeTree(items[0]); }
 
     void changeBare(const std::string& value) const {
+        const BareWalk bare{.item =
+                                [&](int directory, const char* name) {
+                                    const FileDescriptor item(
+                                        ::openat(directory, name, O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
+                                    require(static_cast<bool>(item), name);
+                                    changeAttribute(item.get(), value);
+                                },
+                            .directory = [&](int directory) { changeAttribute(directory, value); }};
         for (const auto& item : items)
-            changeTree(FileDescriptor(::open(item.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC)), value);
+            bare.run(item);
     }
 };
 

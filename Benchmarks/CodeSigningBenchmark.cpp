@@ -5,7 +5,6 @@
 #include "Client/Containers.h"
 #include "Client/Maintenance.h"
 #include "Support/BootedDevice.h"
-#include "Support/ChildProcess.h"
 #include "Support/ScratchDirectory.h"
 #include "codesigning/OSTCodeSigningMapping.h"
 #include "codesigning/OSTGroupManager.h"
@@ -15,6 +14,7 @@
 #include "platform/ipc/IPCFrame.h"
 #include "support/Comparison.h"
 #include "support/DeviceClient.h"
+#include "support/InsideImage.h"
 #include "support/JournaledFileSystem.h"
 #include "support/OneProcessor.h"
 #include "support/Require.h"
@@ -34,7 +34,6 @@
 namespace ost::benchmarks {
 
 using test::BootedDevice;
-using test::ChildProcess;
 using test::makeScratchDirectory;
 
 namespace {
@@ -228,24 +227,6 @@ void unchanged(benchmark::State& state) {
         .run(state);
     if (written() != before)
         throw std::runtime_error("a registration that changes nothing writes the file");
-}
-
-/// Runs work in a process whose root directory is the image, and gives the seconds that the work says it took.
-double secondsInside(const std::filesystem::path& image, const std::function<double()>& work) {
-    int ends[2];
-    require(::pipe2(ends, O_CLOEXEC) == 0, "pipe");
-    const FileDescriptor result(ends[0]);
-    FileDescriptor writer(ends[1]);
-    ChildProcess process([&] {
-        if (::chroot(image.c_str()) != 0 || ::chdir("/") != 0)
-            return 1;
-        const double seconds = work();
-        return ::write(writer.get(), &seconds, sizeof seconds) == sizeof seconds ? 0 : 1;
-    });
-    writer.reset();
-    double seconds = 0;
-    require(::read(result.get(), &seconds, sizeof seconds) == sizeof seconds && process.wait() == 0, image);
-    return seconds;
 }
 
 /// The median of some turns, without the first, which reads the file.

@@ -41,12 +41,7 @@ public:
 
     ostrand::Container create() {
         static std::atomic<unsigned> number{0};
-        const auto container =
-            require(ostrand::createOrLookup(_connection,
-                                            {.containerClass = ostrand::ContainerClass::dataApplication,
-                                             .identifier = "com.example.Sketches." + std::to_string(++number)},
-                                            ostrand::WhenMissing::create),
-                    "create a container");
+        const auto container = createContainer(_connection, "com.example.Sketches." + std::to_string(++number));
         require(!container.existed, "create a container that was not there");
         return container;
     }

@@ -57,10 +57,7 @@ struct Servers {
 private:
     [[nodiscard]] std::string _replyOfDaemon() const {
         auto connection = connectTo(device);
-        require(ostrand::createOrLookup(connection,
-                                        {.containerClass = ContainerClass::dataApplication, .identifier = identifier},
-                                        ostrand::WhenMissing::create),
-                "create a container");
+        createContainer(connection, identifier);
         const std::string bytes(RoundTrips(device.socket(), request).once());
         const auto answer = platform::validateCBOR(std::string_view(bytes).substr(IPCFrameHeader::size));
         const auto existed = answer ? answer->find("ReplyExisted") : std::nullopt;

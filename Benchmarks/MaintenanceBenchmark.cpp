@@ -1,4 +1,5 @@
-// What is done with whole trees and whole stores: disk usage, the repair of owners, a start among many containers.
+// What is done with whole trees and whole stores: disk usage, the repair of owners and ACLs, a start among many
+// containers.
 
 #include "Client/Containers.h"
 #include "Client/Maintenance.h"
@@ -6,19 +7,23 @@
 #include "Support/ChildProcess.h"
 #include "Support/ScratchDirectory.h"
 #include "files/OSTFileManager.h"
+#include "support/BareWalk.h"
 #include "support/Comparison.h"
 #include "support/DeviceClient.h"
+#include "support/InsideImage.h"
 #include "support/LargeTree.h"
 #include "support/Require.h"
 #include "support/Stopwatch.h"
 
-#include <dirent.h>
 #include <fcntl.h>
+#include <sys/stat.h>
+#include <sys/xattr.h>
 #include <unistd.h>
 
+#include <array>
 #include <chrono>
 #include <cstdint>
-#include <memory>
+#include <functional>
 #include <stdexcept>
 #include <string>
 #include <thread>
@@ -34,17 +39,10 @@ namespace {
 using ostrand::ContainerClass;
 using platform::FileDescriptor;
 
-ostrand::Container create(ostrand::Connection& connection, const std::string& identifier) {
-    return require(ostrand::createOrLookup(
-                       connection, {.containerClass = ContainerClass::dataApplication, .identifier = identifier},
-                       ostrand::WhenMissing::create),
-                   "create a container");
-}
-
 void diskUsage(benchmark::State& state) {
     const BootedDevice device(makeScratchDirectory(0711) / "device");
     auto connection = connectTo(device);
-    const auto container = create(connection, "com.example.Sketches");
+    const auto container = createContainer(connection, "com.example.Sketches");
     makeLargeTree(device.onHost(container.path) / "Documents/tree");
     const ostrand::ContainerReference reference{
         .containerClass = ContainerClass::dataApplication, .identifier = container.identifier, .uuid = container.uuid};
@@ -63,44 +61,112 @@ void diskUsage(benchmark::State& state) {
         .run(state);
 }
 
-/// The bare walk: every item is given away relative to its directory.
-void giveAway(FileDescriptor top, uid_t owner) {
-    const auto close = [](DIR* stream) { ::closedir(stream); };
-    const std::unique_ptr<DIR, decltype(close)> stream(::fdopendir(top.get()));
-    require(static_cast<bool>(stream), "fdopendir");
-    const int directory = top.release();
-    while (const dirent* const entry = ::readdir(stream.get())) {
-        const std::string_view name = entry->d_name;
-        if (name == "." || name == "..")
-            continue;
-        require(::fchownat(directory, entry->d_name, owner, owner, AT_SYMLINK_NOFOLLOW) == 0, entry->d_name);
-        if (entry->d_type == DT_DIR)
-            giveAway(
-                FileDescriptor(::openat(directory, entry->d_name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC)),
-                owner);
-    }
+/// Every item is given away, relative to its directory where it is not open anyway.
+void giveAway(const std::filesystem::path& tree, uid_t owner) {
+    BareWalk{.item =
+                 [=](int directory, const char* name) {
+                     require(::fchownat(directory, name, owner, owner, AT_SYMLINK_NOFOLLOW) == 0, name);
+                 },
+             .directory = [=](int directory) { require(::fchown(directory, owner, owner) == 0, "fchown"); }}
+        .run(tree);
 }
 
 void ownershipRepair(benchmark::State& state) {
     constexpr uid_t before = 501, after = 33;
     const auto tree = makeScratchDirectory(0711) / "tree";
     makeLargeTree(tree);
-    const auto giveAllAway = [&](uid_t owner) {
-        giveAway(FileDescriptor(::open(tree.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC)), owner);
-    };
     const auto daemon = [&] {
-        giveAllAway(before);
+        giveAway(tree, before);
         return secondsOf([&] {
             require(OSTFileManager::defaultManager().standardizeOwnershipAtURL(tree.native(), after, after),
                     "repair the ownership");
         });
     };
     const auto baseline = [&] {
-        giveAllAway(before);
-        return secondsOf([&] { giveAllAway(after); });
+        giveAway(tree, before);
+        return secondsOf([&] { giveAway(tree, after); });
     };
     Comparison{
         .unit = Unit::seconds, .target = {Target::Kind::ratioAtMost, 1.3}, .daemon = daemon, .baseline = baseline}
+        .run(state);
+}
+
+constexpr std::array aclAttributes{"system.posix_acl_access", "system.posix_acl_default"};
+
+/// Owner and ACLs of an item.
+struct Permissions {
+    struct stat status;
+    std::array<std::string, aclAttributes.size()> acls; ///< empty where there is none
+
+    static Permissions of(const std::filesystem::path& path) {
+        Permissions permissions{};
+        require(::lstat(path.c_str(), &permissions.status) == 0, path);
+        for (std::size_t i = 0; i < aclAttributes.size(); ++i) {
+            std::array<char, 256> value;
+            const auto size = ::lgetxattr(path.c_str(), aclAttributes[i], value.data(), value.size());
+            permissions.acls[i].assign(value.data(), size > 0 ? static_cast<std::size_t>(size) : 0);
+        }
+        return permissions;
+    }
+
+    /// With the fewest calls: an ACL brings the mode along.
+    void give(int item) const {
+        require(::fchown(item, status.st_uid, status.st_gid) == 0, "fchown");
+        for (std::size_t i = 0; i < aclAttributes.size(); ++i)
+            if (!acls[i].empty())
+                require(::fsetxattr(item, aclAttributes[i], acls[i].data(), acls[i].size(), 0) == 0, aclAttributes[i]);
+    }
+    /// The same for an item that may have other ACLs.
+    void restore(int item) const {
+        for (const auto* const attribute : aclAttributes)
+            static_cast<void>(::fremovexattr(item, attribute));
+        give(item);
+        require(::fchmod(item, status.st_mode) == 0, "fchmod");
+    }
+};
+
+/// Does something to every item of a tree.
+void toAll(const std::filesystem::path& tree, const std::function<void(int item)>& toFile,
+           const std::function<void(int item)>& toDirectory) {
+    BareWalk{.item =
+                 [&](int directory, const char* name) {
+                     const FileDescriptor item(::openat(directory, name, O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
+                     require(static_cast<bool>(item), name);
+                     toFile(item.get());
+                 },
+             .directory = toDirectory}
+        .run(tree);
+}
+
+void aclRepair(benchmark::State& state) {
+    const auto image = makeScratchDirectory(0711) / "device";
+    {
+        const BootedDevice device(image); // which makes the group
+    }
+    const auto tree = image / "tree", directory = tree / "0", file = directory / "0";
+    makeLargeTree(tree);
+    const auto repair = [&] {
+        return secondsInside(image, [] {
+            return secondsOf([] {
+                require(OSTFileManager::defaultManager().standardizeACLsForSystemContainerAtURL("/tree"),
+                        "repair the ACLs");
+            });
+        });
+    };
+    const auto fileBefore = Permissions::of(file), directoryBefore = Permissions::of(directory);
+    repair();
+    const auto fileAfter = Permissions::of(file), directoryAfter = Permissions::of(directory);
+    require(!fileAfter.acls[0].empty() && !directoryAfter.acls[1].empty(), "The ACLs are not set");
+    const auto restore = [&] {
+        toAll(tree, [&](int item) { fileBefore.restore(item); }, [&](int item) { directoryBefore.restore(item); });
+    };
+    const auto giveAll = [&] {
+        toAll(tree, [&](int item) { fileAfter.give(item); }, [&](int item) { directoryAfter.give(item); });
+    };
+    Comparison{.unit = Unit::seconds,
+               .target = {Target::Kind::ratioAtMost, 1.3},
+               .daemon = [&] { return restore(), repair(); },
+               .baseline = [&] { return restore(), secondsOf(giveAll); }}
         .run(state);
 }
 
@@ -110,7 +176,7 @@ public:
     explicit RestartingDevice(unsigned containers) {
         auto connection = connectTo(_device);
         for (unsigned number = 0; number < containers; ++number)
-            create(connection, identifierOf(number));
+            createContainer(connection, identifierOf(number));
     }
 
     /// From the end of one daemon to what the next one answers first, in a class that has no containers.
@@ -149,6 +215,7 @@ void start(benchmark::State& state) {
 
 [[maybe_unused]] const int usage = registerComparison("disk usage of 100,000 files", 7, diskUsage);
 [[maybe_unused]] const int repair = registerComparison("ownership repair of 100,000 files", 7, ownershipRepair);
+[[maybe_unused]] const int acls = registerComparison("ACL repair of 100,000 files", 7, aclRepair);
 [[maybe_unused]] const int starts = registerComparison("restart to first answer, 10,000 containers", 7, start);
 
 } // namespace

@@ -40,15 +40,6 @@ using platform::UUID;
 /// Few enough that a turn is short against the drift of the disk.
 constexpr unsigned containersInTurn = 24;
 
-ostrand::Container create(ostrand::Connection& connection, const std::string& identifier, bool transient = false) {
-    return require(
-        ostrand::createOrLookup(
-            connection,
-            {.containerClass = ContainerClass::dataApplication, .identifier = identifier, .transient = transient},
-            ostrand::WhenMissing::create),
-        "create a container");
-}
-
 std::string newIdentifier() {
     static unsigned number = 0;
     return "com.example.Sketches." + std::to_string(++number);
@@ -135,7 +126,7 @@ void staging(benchmark::State& state) {
     const auto daemon = [&] {
         std::vector<ostrand::ContainerReference> containers;
         for (unsigned made = 0; made < containersInTurn; ++made)
-            containers.push_back(referenceTo(create(connection, newIdentifier())));
+            containers.push_back(referenceTo(createContainer(connection, newIdentifier())));
         return secondsOf([&] { require(ostrand::stageForDeletion(connection, containers), "stage for deletion"); }) /
                containersInTurn;
     };
@@ -159,8 +150,8 @@ void replacement(benchmark::State& state) {
         double seconds = 0;
         for (unsigned made = 0; made < containersInTurn; ++made) {
             const auto identifier = newIdentifier();
-            const auto oldContainer = create(connection, identifier);
-            const auto newContainer = create(connection, identifier, true);
+            const auto oldContainer = createContainer(connection, identifier);
+            const auto newContainer = createContainer(connection, identifier, true);
             seconds += secondsOf([&] {
                 require(ostrand::replace(connection, referenceTo(oldContainer), referenceTo(newContainer)), "replace");
             });
@@ -187,7 +178,7 @@ public:
     ostrand::Connection& connection() { return _connection; }
 
     void makeWaste() {
-        const auto container = create(_connection, newIdentifier());
+        const auto container = createContainer(_connection, newIdentifier());
         makeLargeTree(_device.onHost(container.path) / "Documents/tree");
         require(ostrand::stageForDeletion(_connection, {referenceTo(container)}), "stage for deletion");
     }
@@ -224,12 +215,12 @@ void destruction(benchmark::State& state) {
 void lookUpsMeanwhile(benchmark::State& state) {
     constexpr std::chrono::milliseconds duration{300};
     DeviceWithWaste device;
-    create(device.connection(), "com.example.found");
+    createContainer(device.connection(), "com.example.found");
     const auto secondsEach = [&](const std::function<bool()>& goesOn) {
         unsigned count = 0;
         const auto seconds = secondsOf([&] {
             for (; goesOn(); ++count)
-                create(device.connection(), "com.example.found");
+                createContainer(device.connection(), "com.example.found");
         });
         return seconds / std::max(1U, count);
     };

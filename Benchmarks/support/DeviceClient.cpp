@@ -14,6 +14,15 @@ ostrand::Connection connectTo(const test::BootedDevice& device) {
     return require(ostrand::Connection::open(device.image(), patience), "connect to the daemon");
 }
 
+ostrand::Container createContainer(ostrand::Connection& connection, const std::string& identifier, bool transient) {
+    return require(ostrand::createOrLookup(connection,
+                                           {.containerClass = ostrand::ContainerClass::dataApplication,
+                                            .identifier = identifier,
+                                            .transient = transient},
+                                           ostrand::WhenMissing::create),
+                   "create a container");
+}
+
 void registerApplication(const test::BootedDevice& device, const std::string& identifier) {
     auto connection = connectTo(device);
     require(ostrand::registerCodeSigning(

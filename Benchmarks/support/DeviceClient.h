@@ -1,6 +1,7 @@
 #pragma once
 
 #include "Client/Connection.h"
+#include "Client/Containers.h"
 #include "Support/BootedDevice.h"
 
 #include <cstdint>
@@ -9,6 +10,10 @@
 namespace ost::benchmarks {
 
 [[nodiscard]] ostrand::Connection connectTo(const test::BootedDevice& device);
+
+/// Creates an application's data container unless it is there.
+ostrand::Container createContainer(ostrand::Connection& connection, const std::string& identifier,
+                                   bool transient = false);
 
 /// As the installer does: an upcall for an identifier that nobody knows leaves lines in the log.
 void registerApplication(const test::BootedDevice& device, const std::string& identifier);

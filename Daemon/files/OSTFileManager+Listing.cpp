@@ -84,20 +84,4 @@ bool OSTFileManager::itemDoesNotExist(int directory, std::string_view relativePa
     return absent;
 }
 
-OSTResult<void> OSTFileManager::_traverseDirectory(std::string_view path, const TreeBlock& block) const {
-    if (path.empty())
-        return std::unexpected(
-            OSTCreatePOSIXError(ENOENT, "fts_open failed for %s with error %s", path, platform::Errno(ENOENT)));
-    OSTResult<void> result;
-    OSTWalkTree(path, [&](const OSTTreeEntry& entry) {
-        if (entry.visit == OSTTreeEntry::Visit::failure)
-            result =
-                std::unexpected(OSTCreatePOSIXError(entry.error, "Error for path %s: %s", entry.path, entry.error));
-        else
-            result = block(entry);
-        return result.has_value();
-    });
-    return result;
-}
-
 } // namespace ost

@@ -60,6 +60,7 @@ std::expected<bool, platform::Errno> OSTTreeCursor::next() {
             continue;
         _setItem(entry->d_name);
         _type = entry->d_type;
+        ++_levels.back().items;
         return true;
     }
 }

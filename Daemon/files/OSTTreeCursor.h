@@ -7,6 +7,7 @@
 
 #include <array>
 #include <cstddef>
+#include <cstdint>
 #include <expected>
 #include <memory>
 #include <string>
@@ -44,6 +45,8 @@ public:
     /// Borrowed; valid until the cursor enters or leaves a directory.
     [[nodiscard]] int directory() const { return _open[depth() % maximumOpenDirectories].descriptor.get(); }
     [[nodiscard]] std::string directoryPath() const { return _path.substr(0, _levels.back().pathLength); }
+    /// How many items of the current directory have been stepped to.
+    [[nodiscard]] std::uint64_t number() const { return _levels.back().items; }
 
     // Of the current item; valid until the cursor moves.
     [[nodiscard]] const char* name() const { return _path.c_str() + _levels.back().pathLength + 1; }
@@ -55,6 +58,7 @@ private:
     /// What is kept of every directory on the way to the current one. The last three are set while it is not open.
     struct Level {
         std::size_t pathLength;
+        std::uint64_t items = 0;
         off_t position = 0;
         dev_t device = 0;
         ino_t inode = 0;

@@ -229,5 +229,32 @@ TEST_F(SystemContainerACLTest, StandardizesOwnership) {
     EXPECT_TRUE(missing.error().isPOSIX(ENOENT));
 }
 
+TEST_F(SystemContainerACLTest, ALargeTreeIsChangedWholeWhateverIsRightAlready) {
+    writeFile("/outside", "kept");
+    for (int directory = 0; directory < 100; ++directory) { // more than one thread works on at a time, some nested
+        const auto name = "/bundle/" + std::to_string(directory % 10) + "/" + std::to_string(directory);
+        for (int file = 0; file < 5; ++file)
+            writeFile(name + "/" + std::to_string(file), "x", file % 2 == 0 ? 0644 : 04644);
+        ASSERT_EQ(::chown((name + "/2").c_str(), 33, 33), 0);
+        fs::create_hard_link("/bundle/0/0/0", name + "/inside");
+    }
+    fs::create_hard_link("/outside", "/bundle/9/planted");
+    std::string deep = "/bundle/9";
+    for (int depth = 0; depth < 100; ++depth)
+        deep += "/d";
+    writeFile(deep + "/file", "x", 0600);
+
+    EXPECT_TRUE(files.standardizeOwnershipAtURL("/bundle", 33, 33));
+    for (const auto& item : fs::recursive_directory_iterator("/bundle")) {
+        struct stat status{};
+        ASSERT_EQ(::lstat(item.path().c_str(), &status), 0);
+        const bool planted = item.path().filename() == "planted";
+        ASSERT_EQ(status.st_uid, planted ? 0U : 33U) << item;
+        ASSERT_EQ(status.st_mode & 07777U, item.is_directory() ? 0755U : 0644U) << item;
+    }
+    EXPECT_TRUE(logged("Could not chown /bundle/9/planted: Too many links"));
+    EXPECT_FALSE(logged("inside: Too many links"));
+}
+
 } // namespace
 } // namespace ost

@@ -109,10 +109,18 @@ struct OwnPermissions {
     bool isExtended; ///< the item has an extended ACL now
 };
 
-std::expected<OwnPermissions, Errno> ownPermissions(int fd, mode_t mode) {
+OwnPermissions permissionsOf(mode_t mode) {
     const auto bits = [&](unsigned shift) { return static_cast<std::uint16_t>(mode >> shift & everything); };
+    return {.owner = bits(6), .group = bits(3), .other = bits(0), .isExtended = false};
+}
+
+std::expected<OwnPermissions, Errno> ownPermissions(int fd, mode_t mode) {
+    auto own = permissionsOf(mode);
     auto acl = OST_TRY(read(fd, accessAttribute));
-    return OwnPermissions{bits(6), acl.empty() ? bits(3) : permissionsOf(acl, owningGroup), bits(0), !acl.empty()};
+    own.isExtended = !acl.empty();
+    if (own.isExtended)
+        own.group = permissionsOf(acl, owningGroup);
+    return own;
 }
 
 /// An ACL with entries for named groups, each of which gets what others get, too.
@@ -128,6 +136,14 @@ PosixACL makeACL(const OwnPermissions& own, const std::map<gid_t, std::uint16_t>
         acl.push_back({mask, needed, noId});
     acl.push_back({other, own.other, noId});
     return acl;
+}
+
+/// The default ACL of a directory, which gives the groups what is handed down.
+std::expected<void, Errno> writeDefault(int fd, const std::map<gid_t, std::uint16_t>& groups) {
+    if (groups.empty())
+        return removeDefaultACL(fd);
+    return write(fd, defaultAttribute,
+                 makeACL({.owner = everything, .group = 0, .other = 0, .isExtended = true}, groups));
 }
 
 /// To Linux, who may add to a directory may also remove from it, unless it is sticky.
@@ -191,40 +207,48 @@ std::expected<AccessControlList::Entry*, Errno> AccessControlList::createEntry()
     return &_entries.emplace_back();
 }
 
+AccessControlList::Grants AccessControlList::_grants() const {
+    Grants grants;
+    const auto add = [](auto& groups, const Entry& entry) {
+        auto& permissions = groups[groupIdForUUID(entry._qualifier).value()];
+        permissions = static_cast<std::uint16_t>(permissions | posixPermissions(entry._permissions));
+    };
+    for (const auto& entry : _entries) {
+        if (entry._grants() && (entry._flags & onlyInherit) == 0) {
+            add(grants.governing, entry);
+            grants.sticky |= addsOnly(entry._permissions);
+        }
+        if (entry._grants() && (entry._flags & (fileInherit | directoryInherit)) != 0)
+            add(grants.handedDown, entry);
+    }
+    return grants;
+}
+
 std::expected<void, Errno> AccessControlList::apply(int fd) const {
     struct stat status{};
     if (::fstat(fd, &status) != 0)
         return std::unexpected(errno);
     if (S_ISLNK(status.st_mode))
         return {};
-
-    std::map<gid_t, std::uint16_t> governing;
-    std::map<gid_t, std::uint16_t> handedDown;
-    const auto grant = [](auto& groups, const Entry& entry) {
-        auto& permissions = groups[groupIdForUUID(entry._qualifier).value()];
-        permissions = static_cast<std::uint16_t>(permissions | posixPermissions(entry._permissions));
-    };
-    bool sticky = false;
-    for (const auto& entry : _entries) {
-        if (entry._grants() && (entry._flags & onlyInherit) == 0) {
-            grant(governing, entry);
-            sticky |= addsOnly(entry._permissions);
-        }
-        if (entry._grants() && (entry._flags & (fileInherit | directoryInherit)) != 0)
-            grant(handedDown, entry);
-    }
-
+    const auto grants = _grants();
     if (S_ISDIR(status.st_mode))
-        OST_TRY(setSticky(fd, status.st_mode, sticky));
+        OST_TRY(setSticky(fd, status.st_mode, grants.sticky));
     const auto own = OST_TRY(ownPermissions(fd, status.st_mode));
-    if (own.isExtended || !governing.empty())
-        OST_TRY(write(fd, accessAttribute, makeACL(own, governing)));
-    if (!S_ISDIR(status.st_mode))
+    if (own.isExtended || !grants.governing.empty())
+        OST_TRY(write(fd, accessAttribute, makeACL(own, grants.governing)));
+    return S_ISDIR(status.st_mode) ? writeDefault(fd, grants.handedDown) : std::expected<void, Errno>();
+}
+
+std::expected<void, Errno> AccessControlList::applyWithMode(int fd, mode_t itemMode, mode_t mode) const {
+    if (S_ISLNK(itemMode))
         return {};
-    if (handedDown.empty())
-        return removeDefaultACL(fd);
-    return write(fd, defaultAttribute,
-                 makeACL({.owner = everything, .group = 0, .other = 0, .isExtended = true}, handedDown));
+    const auto grants = _grants();
+    constexpr mode_t special = S_ISUID | S_ISGID | S_ISVTX; // which an ACL leaves as they are
+    const mode_t sticky = S_ISDIR(itemMode) && grants.sticky ? S_ISVTX : 0;
+    if ((itemMode & special) != sticky)
+        OST_TRY(changeMode(fd, mode | sticky));
+    OST_TRY(write(fd, accessAttribute, makeACL(permissionsOf(mode), grants.governing)));
+    return S_ISDIR(itemMode) ? writeDefault(fd, grants.handedDown) : std::expected<void, Errno>();
 }
 
 std::expected<void, Errno> setModeKeepingMask(int fd, mode_t mode) {

@@ -8,6 +8,7 @@
 #include <cstddef>
 #include <cstdint>
 #include <expected>
+#include <map>
 #include <vector>
 
 namespace ost::platform {
@@ -84,8 +85,19 @@ public:
     /// permissions are never looked at. Fails with the errno of reading or writing the ACL.
     [[nodiscard]] std::expected<void, Errno> apply(int fd) const;
 
+    /// The same, and gives the item the permissions of `mode`, without looking at it: its own mode is `itemMode`.
+    [[nodiscard]] std::expected<void, Errno> applyWithMode(int fd, mode_t itemMode, mode_t mode) const;
+
 private:
+    /// What groups get.
+    struct Grants {
+        std::map<gid_t, std::uint16_t> governing;
+        std::map<gid_t, std::uint16_t> handedDown;
+        bool sticky = false;
+    };
+
     AccessControlList() = default;
+    [[nodiscard]] Grants _grants() const;
 
     std::vector<Entry> _entries;
 };
