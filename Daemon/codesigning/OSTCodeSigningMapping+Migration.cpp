@@ -13,11 +13,8 @@
 #include "store/OSTLocks.h"
 
 #include <algorithm>
-#include <atomic>
 #include <cerrno>
-#include <exception>
 #include <functional>
-#include <thread>
 
 namespace ost {
 
@@ -33,8 +30,6 @@ constexpr std::string_view legacyFileName = "ost_entitlements.plist";
 
 constexpr const char* groupIdsKey = "com.tamarok.Tessaly.GroupContainerIDs";
 
-constexpr std::size_t writesSideBySide = 32;
-
 /// A container whose info values hold what is migrated, and that value.
 struct Holder {
     OSTMetadataRecord container;
@@ -47,38 +42,28 @@ void appendHolders(const std::vector<OSTMetadataRecord>& containers, const char*
             holders.push_back({container, *value});
 }
 
-/// Removes a migrated info value. The all-identifiers lock is held.
-OSTResult<void> clearInfoValue(const OSTMetadata& container, const char* key) {
+OSTMetadata withoutInfoValue(const OSTMetadata& container, const char* key) {
     OSTMetadata cleared = container;
     OSTDictionary info = *container.info;
     info.remove(key);
     cleared.info = info.empty() ? nullptr : std::make_shared<const OSTDictionary>(std::move(info));
-    OST_TRY(cleared.writeMetadataToDisk());
-    OST_TRY(OSTContainerCache::sharedInstance().addContainerMetadata(cleared));
-    return {};
+    return cleared;
 }
 
-/// Removes a migrated info value from all its holders. Each write waits for the disk, and everybody waits for the lock
-/// meanwhile, so several are made side by side and share the disk's commits.
+/// Removes a migrated info value from all its holders. The all-identifiers lock is held, so everybody waits meanwhile.
 void clearInfoValues(const std::vector<Holder>& holders, const char* key,
                      const std::function<void(const OSTMetadata&, OSTErrorCode)>& failed) {
-    std::atomic<std::size_t> next = 0;
-    const auto clearRemaining = [&] {
-        for (auto index = next++; index < holders.size(); index = next++) {
-            const auto& container = *holders[index].container;
-            if (const auto cleared = OSTGuarded([&] { return clearInfoValue(container, key); }); !cleared)
-                failed(container, cleared.error().code());
-        }
-    };
-    std::vector<std::jthread> helpers;
-    try {
-        while (helpers.size() + 1 < std::min(writesSideBySide, holders.size()))
-            helpers.emplace_back(clearRemaining);
-    } catch (const std::exception& exception) {
-        // With as many as there are; this thread is enough.
-        logNotice("No further thread clears migrated info values: %s", exception.what());
+    std::vector<OSTMetadata> cleared;
+    cleared.reserve(holders.size());
+    for (const auto& holder : holders)
+        cleared.push_back(withoutInfoValue(*holder.container, key));
+    const auto written = OSTMetadata::writeMetadataToDisk(cleared);
+    for (std::size_t i = 0; i < cleared.size(); ++i) {
+        if (!written[i])
+            failed(cleared[i], written[i].error().code());
+        else if (const auto added = OSTContainerCache::sharedInstance().addContainerMetadata(cleared[i]); !added)
+            failed(cleared[i], added.error().code());
     }
-    clearRemaining();
 }
 
 std::shared_ptr<const OSTDictionary> infoWithEntitlements(const OSTValue& entitlements) {

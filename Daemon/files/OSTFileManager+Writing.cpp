@@ -14,10 +14,13 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
+#include <map>
 #include <memory>
+#include <set>
 
 namespace ost {
 
@@ -36,6 +39,7 @@ public:
             ::unlinkat(_directory, _name.c_str(), 0);
     }
 
+    [[nodiscard]] int directory() const { return _directory; }
     [[nodiscard]] const char* name() const { return _name.c_str(); }
     void keep() { _name.clear(); }
 
@@ -72,15 +76,19 @@ std::expected<void, platform::Errno> finish(int file, std::string_view bytes, co
     return platform::writeAll(file, bytes);
 }
 
+/// Creates a file in the directory `workshop` and gives its name.
+std::expected<std::string, platform::Errno> createUnfinished(int workshop, mode_t mode, FileDescriptor& file) {
+    return OSTMakeUnderUniqueName(OSTOwnUnfinishedPrefix(), [&](const char* candidate) {
+        file = createExclusively(workshop, candidate, mode);
+        return static_cast<bool>(file);
+    });
+}
+
 /// `workshop` is the directory in which the file is unfinished.
 std::expected<void, platform::Errno> writeAtomically(const OSTItemPlace& place, int workshop, std::string_view bytes,
                                                      const OSTFileAttributes& attributes) {
     FileDescriptor file;
-    UnfinishedFile unfinished(workshop,
-                              OST_TRY(OSTMakeUnderUniqueName(OSTOwnUnfinishedPrefix(), [&](const char* candidate) {
-                                  file = createExclusively(workshop, candidate, attributes.mode);
-                                  return static_cast<bool>(file);
-                              })));
+    UnfinishedFile unfinished(workshop, OST_TRY(createUnfinished(workshop, attributes.mode, file)));
     OST_TRY(finish(file.get(), bytes, attributes));
     OST_TRY(OSTWaitForDisk(file.get(), ::fsync)); // the protection class is an attribute, which fdatasync may leave out
     if (::renameat(workshop, unfinished.name(), place.directory(), place.name()) != 0)
@@ -101,6 +109,85 @@ std::expected<void, platform::Errno> writeAtomically(std::string_view path, std:
     return writeAtomically(place, place.directory(), bytes, attributes);
 }
 
+/// Writes many files, each in one step, on few waits for the disk: all of them are made beside their places, waited for
+/// together, moved into their places, and waited for again.
+class FileBatch {
+public:
+    using Result = std::expected<void, platform::Errno>;
+
+    explicit FileBatch(const std::vector<OSTFileContent>& files) : _files(files), _results(files.size()) {}
+
+    [[nodiscard]] std::vector<Result> write() && {
+        for (std::size_t first = 0; first < _files.size(); first += unfinishedAtOnce)
+            _write(first, std::min(first + unfinishedAtOnce, _files.size()));
+        _waitForDisk(0, _files.size());
+        return std::move(_results);
+    }
+
+private:
+    /// So that neither directories nor the disk grow much for a while.
+    static constexpr std::size_t unfinishedAtOnce = 2048;
+
+    void _write(std::size_t first, std::size_t end) {
+        std::map<std::size_t, UnfinishedFile> unfinished;
+        for (auto index = first; index < end; ++index)
+            _results[index] = _prepare(index, unfinished);
+        _waitForDisk(first, end);
+        for (auto& [index, file] : unfinished)
+            if (_results[index])
+                _results[index] = _put(file, _files[index]);
+    }
+
+    [[nodiscard]] Result _prepare(std::size_t index, std::map<std::size_t, UnfinishedFile>& unfinished) {
+        const OSTFileAttributes attributes;
+        const int workshop = OST_TRY(_workshopOf(_files[index].path));
+        FileDescriptor file;
+        unfinished.try_emplace(index, workshop, OST_TRY(createUnfinished(workshop, attributes.mode, file)));
+        return finish(file.get(), _files[index].bytes, attributes);
+    }
+
+    [[nodiscard]] static Result _put(UnfinishedFile& unfinished, const OSTFileContent& content) {
+        const auto place = OST_TRY(OSTItemPlace::find(content.path));
+        if (::renameat(unfinished.directory(), unfinished.name(), place.directory(), place.name()) == 0)
+            unfinished.keep();
+        else if (errno == EXDEV)
+            return writeAtomically(content.path, content.bytes, {}, OSTWorkshop::ownDirectory);
+        else
+            return std::unexpected(errno);
+        return {};
+    }
+
+    /// The directory above that of the file.
+    [[nodiscard]] std::expected<int, platform::Errno> _workshopOf(std::string_view path) {
+        const std::string above(platform::pathByDeletingLastComponent(platform::pathByDeletingLastComponent(path)));
+        auto found = _workshops.find(above);
+        if (found == _workshops.end())
+            found = _workshops.emplace(above, OST_TRY(OSTOpenItem(AT_FDCWD, above, O_RDONLY | O_DIRECTORY))).first;
+        return found->second.get();
+    }
+
+    /// Waits for all that was changed where the workshops are. When that fails, so do the files of the range.
+    void _waitForDisk(std::size_t first, std::size_t end) {
+        std::set<dev_t> waitedFor;
+        Result durable;
+        for (const auto& [path, workshop] : _workshops) {
+            struct stat status{};
+            if (::fstat(workshop.get(), &status) != 0)
+                durable = std::unexpected(errno);
+            else if (waitedFor.insert(status.st_dev).second)
+                if (const auto waited = OSTWaitForDisk(workshop.get(), ::syncfs); !waited)
+                    durable = waited;
+        }
+        for (auto index = first; !durable && index < end; ++index)
+            if (_results[index])
+                _results[index] = durable;
+    }
+
+    const std::vector<OSTFileContent>& _files;
+    std::vector<Result> _results;
+    std::map<std::string, FileDescriptor, std::less<>> _workshops; // few: one for each class of containers
+};
+
 /// Users may have items of such names.
 bool isOurs(int directory, const char* name) {
     struct stat status{};
@@ -116,6 +203,17 @@ OSTResult<void> OSTFileManager::writeFileAtomicallyAtURL(std::string_view path, 
     if (const auto written = writeAtomically(path, bytes, attributes, workshop); !written)
         return std::unexpected(OSTCreatePOSIXError(written.error(), "write of %@ failed: %s", path, written.error()));
     return {};
+}
+
+std::vector<OSTResult<void>>
+OSTFileManager::writeFilesAtomicallyAtURLs(const std::vector<OSTFileContent>& files) const {
+    std::vector<OSTResult<void>> results(files.size());
+    const auto written = FileBatch(files).write();
+    for (std::size_t i = 0; i < files.size(); ++i)
+        if (!written[i])
+            results[i] = std::unexpected(
+                OSTCreatePOSIXError(written[i].error(), "write of %@ failed: %s", files[i].path, written[i].error()));
+    return results;
 }
 
 const std::string& OSTOwnUnfinishedPrefix() {

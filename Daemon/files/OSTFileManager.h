@@ -38,6 +38,12 @@ struct OSTFileAttributes {
     std::int32_t protectionClass = OSTNoProtectionClass;
 };
 
+/// What a file is to hold.
+struct OSTFileContent {
+    std::string path;
+    std::string bytes;
+};
+
 /// Where a file is while it is being written: in its own directory, or in the one that holds that.
 enum class OSTWorkshop : bool { ownDirectory, directoryAbove };
 
@@ -171,6 +177,10 @@ public:
     [[nodiscard]] OSTResult<void> writeFileAtomicallyAtURL(std::string_view path, std::string_view bytes,
                                                            const OSTFileAttributes& attributes = {},
                                                            OSTWorkshop workshop = OSTWorkshop::ownDirectory) const;
+    /// The same for many files, with a wait for the file system before they take their places and one afterwards; they
+    /// are unfinished in the directories above their own. The results are in the order of the files.
+    [[nodiscard]] std::vector<OSTResult<void>>
+    writeFilesAtomicallyAtURLs(const std::vector<OSTFileContent>& files) const;
     /// The paths of the unfinished files and copies that an earlier process left in a directory; none when it cannot be
     /// listed.
     [[nodiscard]] std::vector<std::string> unfinishedItemsInDirectoryURL(std::string_view path) const;
@@ -219,7 +229,6 @@ public:
 
 private:
     enum class MissingSource : bool { isSuccess, fails };
-    using TreeBlock = std::function<OSTResult<void>(const OSTTreeEntry&)>;
 
     OSTFileManager() = default;
 
@@ -228,8 +237,6 @@ private:
                                                  MissingSource missingSource) const;
     [[nodiscard]] OSTResult<void> _moveItemAtURL(std::string_view source, std::string_view destination,
                                                  MissingSource missingSource) const;
-    /// Calls `block` for every stop of a walk; the first error, of the walk or of the block, ends it.
-    [[nodiscard]] OSTResult<void> _traverseDirectory(std::string_view path, const TreeBlock& block) const;
 };
 
 } // namespace ost

@@ -123,6 +123,26 @@ OSTResult<void> OSTMetadata::writeMetadataToDisk() const {
         OST_writeToURL(dictionary(), metadataFileURL(), OSTSmallDictionaryFileSize, OSTWorkshop::directoryAbove));
 }
 
+std::vector<OSTResult<void>> OSTMetadata::writeMetadataToDisk(const std::vector<OSTMetadata>& containers) {
+    std::vector<OSTResult<void>> results(containers.size());
+    std::vector<OSTFileContent> files;
+    std::vector<std::size_t> numbers; // of the containers that the files belong to
+    for (std::size_t i = 0; i < containers.size(); ++i) {
+        auto contents =
+            OST_contentsOfDictionary(containers[i].dictionary(), containers[i].url, OSTSmallDictionaryFileSize);
+        if (!contents) {
+            results[i] = containers[i]._written(OSTResult<void>(std::unexpected(contents.error())));
+            continue;
+        }
+        files.push_back({containers[i].metadataFileURL(), *std::move(contents)});
+        numbers.push_back(i);
+    }
+    auto written = OSTFileManager::defaultManager().writeFilesAtomicallyAtURLs(files);
+    for (std::size_t i = 0; i < numbers.size(); ++i)
+        results[numbers[i]] = containers[numbers[i]]._written(std::move(written[i]));
+    return results;
+}
+
 OSTResult<OSTNewFile> OSTMetadata::writeMetadataToNewDirectory() const {
     const auto contents = OST_contentsOfDictionary(dictionary(), url, OSTSmallDictionaryFileSize);
     return _written(contents ? OSTFileManager::defaultManager().createFileAtURL(metadataFileURL(), *contents)

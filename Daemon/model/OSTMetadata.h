@@ -10,6 +10,7 @@
 #include <memory>
 #include <string>
 #include <string_view>
+#include <vector>
 
 namespace ost {
 
@@ -53,6 +54,9 @@ struct OSTMetadata {
     /// Writes the metadata file at `url`, atomically; durable when this returns. Fails with `dictionaryWriteFailed`,
     /// logged.
     [[nodiscard]] OSTResult<void> writeMetadataToDisk() const;
+
+    /// The same for the files of many containers, which share the waits for the disk. The results are in their order.
+    [[nodiscard]] static std::vector<OSTResult<void>> writeMetadataToDisk(const std::vector<OSTMetadata>& containers);
 
     /// The same for a directory that nobody else can see yet; what it returns still has to be made durable.
     [[nodiscard]] OSTResult<OSTNewFile> writeMetadataToNewDirectory() const;
