@@ -120,10 +120,7 @@ std::filesystem::path placeOfDevice() {
 
 LoadedDevice::LoadedDevice() : _device(placeOfDevice()), _lookUp(_device.socket(), requestOf(0)) {
     auto connection = connectTo(_device);
-    require(ostrand::createOrLookup(
-                connection, {.containerClass = ContainerClass::dataApplication, .user = 501, .identifier = identifier},
-                ostrand::WhenMissing::create),
-            "create a container");
+    createContainer(connection, identifier);
     static_cast<void>(lookUps(2000));
 }
 
