@@ -59,6 +59,7 @@ enum Command : std::uint64_t {
     silence,  ///< gives no reply
     wait,     ///< replies once the service's gate is open, waiting in a blocking section
     stand,    ///< the same, keeping the user's turn
+    hold,     ///< the same, keeping the thread
     openGate, ///< opens the gate
     fill,     ///< replies with as many bytes as "Value" says
     fail,     ///< throws
@@ -135,6 +136,10 @@ private:
             break;
         case stand:
             _wait(BlockingSection::Turn::keep);
+            break;
+        case hold:
+            _count(waiting);
+            gate.wait();
             break;
         case openGate:
             gate.count_down();
@@ -415,6 +420,25 @@ TEST(IPC, AUserStandsBeforeOthersWithFewRequestsAtATime) {
         EXPECT_EQ(client.receiveNumber(), 1);
         EXPECT_EQ(client.receiveNumber(), 2);
     }
+}
+
+TEST(IPC, OneThreadIsLeftForRootHoweverManyUsersTakeTheirs) {
+    if (::geteuid() != 0)
+        GTEST_SKIP() << "Only root can connect for others";
+    const unsigned threads = std::max(2U, std::thread::hardware_concurrency());
+    Service service;
+    std::vector<Client> holding(2 * std::size_t{threads});
+    for (std::size_t index = 0; index < holding.size(); ++index) {
+        holding[index].connectAs(static_cast<uid_t>(600 + index / 2), service);
+        holding[index].send(request(1, hold));
+    }
+    Service::await(service.waiting, static_cast<int>(threads));
+    Client root(service);
+    root.send(request(1, echo) + request(2, openGate));
+    EXPECT_EQ(root.receiveNumber(), 1U);
+    EXPECT_EQ(root.receiveNumber(), 2U);
+    for (auto& client : holding)
+        EXPECT_EQ(client.receiveNumber(), 1U);
 }
 
 TEST(IPC, ClientsWithoutEndLeaveOthersTheirTurn) {

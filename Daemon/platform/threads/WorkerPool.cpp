@@ -38,8 +38,8 @@ thread_local unsigned blockingDepth = 0;
 /// The group of the source that this thread serves.
 thread_local TurnGroup* currentTurns = nullptr;
 
-unsigned runningThreadsFor(const WorkerPool::Options& options) {
-    return options.runningThreads > 0 ? options.runningThreads : std::max(2U, std::thread::hardware_concurrency());
+unsigned sharedThreadsFor(const WorkerPool::Options& options) {
+    return options.sharedThreads > 0 ? options.sharedThreads : std::max(2U, std::thread::hardware_concurrency());
 }
 
 /// Signals are for the main thread, but for those that a fault of the thread itself raises.
@@ -65,8 +65,9 @@ std::expected<std::unique_ptr<WorkerPool>, Errno> WorkerPool::create(std::string
 }
 
 WorkerPool::WorkerPool(std::string name, const Options& options, FileDescriptor epoll, FileDescriptor wake)
-    : _name(std::move(name)), _target(runningThreadsFor(options)), _maximumThreads(options.sources + _target),
-      _idleTime(options.idleTime), _epoll(std::move(epoll)), _wake(std::move(wake)), _slots(options.sources) {
+    : _name(std::move(name)), _target(sharedThreadsFor(options) + 1), _maximumThreads(options.sources + _target),
+      _idleTime(options.idleTime), _epoll(std::move(epoll)), _wake(std::move(wake)), _slots(options.sources),
+      _sharedThreads(sharedThreadsFor(options)) {
     // From the back, so that the first slots are the first to be used.
     for (auto index = static_cast<std::uint32_t>(options.sources); index-- > 0;)
         _freeSlots.push_back(index);
@@ -227,7 +228,10 @@ BlockingSection::BlockingSection(Turn turn) {
     if (!currentPool || blockingDepth++ > 0)
         return;
     currentPool->_replaceBlockedThread();
-    if (turn == Turn::giveAway && currentTurns) {
+    if (!currentTurns)
+        return;
+    currentPool->_giveThreadBack();
+    if (turn == Turn::giveAway) {
         _gaveTurnAway = true;
         currentPool->_giveTurnBack(*currentTurns);
     }
@@ -238,6 +242,8 @@ BlockingSection::~BlockingSection() {
         return;
     if (_gaveTurnAway)
         currentTurns->takeAnyway();
+    if (currentTurns)
+        currentPool->_sharedThreads.takeAnyway();
     currentPool->_returnFromBlocking();
 }
 
@@ -296,13 +302,19 @@ void WorkerPool::post(const std::shared_ptr<EventSource>& source, std::uint32_t 
         _enqueue(source);
 }
 
-/// Takes the turn that a source needs; one that gets none is kept by its group, and served when it has one.
+/// Takes what a source that shares turns needs: one of its group, then one of the threads for such. One that does not
+/// get both is kept, and served when it has them.
 bool WorkerPool::_mayRun(const std::shared_ptr<EventSource>& source) {
-    return !source->_turns || source->_turns->take(source);
+    return !source->_turns || (source->_turns->take(source) && _sharedThreads.take(source));
 }
 
 void WorkerPool::_giveTurnBack(TurnGroup& turns) {
-    if (auto next = turns.giveBack())
+    if (auto next = turns.giveBack(); next && _sharedThreads.take(next))
+        _enqueue(std::move(next));
+}
+
+void WorkerPool::_giveThreadBack() {
+    if (auto next = _sharedThreads.giveBack())
         _enqueue(std::move(next));
 }
 
@@ -360,8 +372,10 @@ void WorkerPool::_run(const std::shared_ptr<EventSource>& source, std::span<char
         finished = source->_state.compare_exchange_strong(expected, 0);
     }
     currentTurns = nullptr;
-    if (turns)
+    if (turns) {
+        _giveThreadBack();
         _giveTurnBack(*turns);
+    }
     if (!finished && _mayRun(source))
         _enqueue(source);
 }

@@ -4,6 +4,7 @@
 #include "platform/base/FileDescriptor.h"
 #include "platform/base/Mutex.h"
 #include "platform/threads/EventSource.h"
+#include "platform/threads/TurnGroup.h"
 
 #include <pthread.h>
 
@@ -23,9 +24,10 @@ namespace ost::platform {
 
 /// Threads that wait for descriptors and serve what they find themselves, without handing it to another thread.
 ///
-/// As many threads run as there are processors. One that enters a `BlockingSection` is replaced for that long by a
-/// parked or a new one; those that are then too many park when they have finished, and end when nobody needs them for a
-/// while.
+/// As many threads as there are processors serve sources that share turns. One more runs, so that the others never wait
+/// for one of these, which the system may have set aside. A thread that enters a `BlockingSection` is replaced for that
+/// long by a parked or a new one; those that are then too many park when they have finished, and end when nobody needs
+/// them for a while.
 ///
 /// A source is watched edge-triggered and registered once; an event that arrives while its source is being served is
 /// remembered in the source. One that is still not finished after some rounds goes to the end of a queue, so no source
@@ -35,8 +37,8 @@ namespace ost::platform {
 class WorkerPool {
 public:
     struct Options {
-        std::size_t sources;                                          ///< most descriptors watched at a time
-        unsigned runningThreads = 0;                                  ///< 0: one for each processor, and at least 2
+        std::size_t sources;        ///< most descriptors watched at a time
+        unsigned sharedThreads = 0; ///< that serve sources with turns; 0: one for each processor, and at least 2
         std::chrono::milliseconds idleTime = std::chrono::seconds(5); ///< how long a parked thread stays
     };
 
@@ -93,8 +95,9 @@ private:
     void _serveWatched(std::uint64_t watch, std::uint32_t events, std::span<char> scratch);
     void _servePosted(std::span<char> scratch);
     void _run(const std::shared_ptr<EventSource>& source, std::span<char> scratch);
-    [[nodiscard]] static bool _mayRun(const std::shared_ptr<EventSource>& source);
+    [[nodiscard]] bool _mayRun(const std::shared_ptr<EventSource>& source);
     void _giveTurnBack(TurnGroup& turns);
+    void _giveThreadBack();
     void _enqueue(std::shared_ptr<EventSource> source);
 
     // Constant after construction.
@@ -107,6 +110,7 @@ private:
 
     // Own locking.
     std::vector<Slot> _slots;
+    TurnGroup _sharedThreads;                 ///< turns of all sources that share turns
     std::atomic<unsigned> _runningThreads{0}; ///< neither parked nor blocked; written under _mutex
     std::atomic<bool> _stopping{false};       ///< written under _mutex
 
