@@ -116,8 +116,8 @@ std::string helpOfGroup(const CommandTable& table, std::string_view group) {
         if (isBelow(command, group))
             commands.add(std::string(command.name), command.summary);
     return usageOfGroup(table, group) + "\n\n" + std::string(table.summary) + "\n" + commands.text("commands") +
-           optionsText({}, table.options) + "\n\"" + std::string(table.program) +
-           " COMMAND --help\" says more about a command.\n" + std::string(table.exitStatus);
+           optionsText({}, table.options) + "\n\"" + std::string(table.program) + " COMMAND --help\", or \"" +
+           std::string(table.program) + " help COMMAND\", says more about a command.\n" + std::string(table.exitStatus);
 }
 
 /// Goes through the words once; knows the command as soon as its last word was seen.
@@ -127,7 +127,7 @@ public:
         : _table(table), _words(words) {}
 
     std::variant<Invocation, Help, UsageError> parse() {
-        bool optionsEnded = false;
+        bool optionsEnded = false, asksForHelp = false;
         while (!_words.empty()) {
             const auto word = _next();
             if (!optionsEnded && word == "--") {
@@ -135,11 +135,17 @@ public:
                 continue;
             }
             if (!optionsEnded && (word == "--help" || word == "-h"))
-                return Help{_command ? helpOf(_table, *_command) : helpOfGroup(_table, _group)};
+                return _help();
+            if (!optionsEnded && word == "help" && !_command && _group.empty()) {
+                asksForHelp = true;
+                continue;
+            }
             const bool isOption = !optionsEnded && word.size() > 1 && word.starts_with('-');
             if (auto problem = isOption ? _takeOption(word) : _takeWord(word); !problem.empty())
                 return _usageError(std::move(problem));
         }
+        if (asksForHelp)
+            return _help();
         if (auto problem = _whatIsMissing(); !problem.empty())
             return _usageError(std::move(problem));
         return Invocation{_command, std::move(_arguments)};
@@ -188,8 +194,21 @@ private:
         else if (std::ranges::any_of(_table.commands, [&](const auto& each) { return isBelow(each, name); }))
             _group = name;
         else
-            return "unknown command \"" + escaped(name) + "\"" + didYouMean(name, namesBelow(_table, _group));
+            return "unknown command \"" + escaped(name) + "\"" + _suggestion(name);
         return {};
+    }
+
+    std::string _suggestion(const std::string& name) const {
+        const auto nearest = didYouMean(name, namesBelow(_table, _group));
+        return nearest.empty() && !_group.empty() ? _choice() : nearest;
+    }
+
+    /// The commands of the group.
+    std::string _choice() const {
+        std::string text;
+        for (const auto& name : namesBelow(_table, _group))
+            text.append(text.empty() ? ": " : ", ").append(name);
+        return text;
     }
 
     std::vector<std::string> _optionSpellings() const {
@@ -202,7 +221,7 @@ private:
 
     std::string _whatIsMissing() const {
         if (!_command)
-            return _group.empty() ? "no command given" : "\"" + _group + "\" needs a further word";
+            return _group.empty() ? "no command given" : "\"" + _group + "\" needs a further word" + _choice();
         for (std::size_t i = _operandsSeen; i < _command->operands.size(); ++i)
             if (!mayBeMissing(_command->operands[i]))
                 return "missing " + std::string(_command->operands[i].name);
@@ -211,6 +230,8 @@ private:
                 return "missing " + spelled(option);
         return {};
     }
+
+    Help _help() const { return {_command ? helpOf(_table, *_command) : helpOfGroup(_table, _group)}; }
 
     UsageError _usageError(std::string message) const {
         return {std::move(message), _command ? usageLine(_table, *_command) : usageOfGroup(_table, _group)};

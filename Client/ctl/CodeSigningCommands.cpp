@@ -1,6 +1,7 @@
 #include "Client/CodeSigning.h"
 #include "Client/ctl/Commands.h"
 #include "Client/ctl/Values.h"
+#include "Protocol/OSTErrorCode.h"
 #include "platform/base/Try.h"
 
 #include <algorithm>
@@ -73,10 +74,21 @@ Outcome remove(const Arguments& arguments) {
     return reportOn("removed", identifier);
 }
 
+Failure whyNothingIsShown(const Error& error, const std::string& identifier) {
+    if (error != Error::failed(static_cast<std::uint64_t>(ost::OSTErrorCode::notFound)))
+        return Failure::of(error);
+    return Failure::of(error, "nothing that counts is registered for " + escaped(identifier),
+                       "Placeholders do not count, nor what was invalidated: ostrandctl codesign register ID --info "
+                       "PLIST.");
+}
+
 Outcome show(const Arguments& arguments) {
     auto connection = OST_TRY(connectToDevice(arguments));
-    const auto info = OST_TRY(orFailure(codeSigningInfo(connection, *arguments.value(identifierOperand.name))));
-    return Report{.text = treeText(info), .json = info};
+    const auto identifier = *arguments.value(identifierOperand.name);
+    const auto info = codeSigningInfo(connection, identifier);
+    if (!info)
+        return std::unexpected(whyNothingIsShown(info.error(), identifier));
+    return Report{.text = treeText(*info), .json = *info};
 }
 
 Outcome invalidate(const Arguments& arguments) {

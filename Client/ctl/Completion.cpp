@@ -167,6 +167,8 @@ private:
 std::vector<std::string> completions(const CommandTable& table, std::span<const std::string_view> words) {
     if (words.empty())
         return {};
+    if (words.size() > 1 && words.front() == "help")
+        words = words.subspan(1);
     const bool isEquals = words.back() == "=";
     const auto begun = isEquals ? std::string_view() : words.back();
     auto candidates = Reader(table, words.first(words.size() - 1)).candidatesFor(begun);

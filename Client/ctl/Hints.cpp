@@ -40,7 +40,8 @@ constexpr std::string_view hintForCode(ost::OSTErrorCode code) {
     case ost::OSTErrorCode::unexpectedPath:
         return "The container was replaced, wiped or renamed meanwhile: look it up again, then ask again.";
     case ost::OSTErrorCode::invalidObject:
-        return "Give a class from 1 to 13, a user and an identifier that is not empty and has no slash.";
+        return "Give a class from 1 to 13 that the command is for, a user whom it fits, and an identifier of at most "
+               "1024 bytes: see the command's --help.";
     case ost::OSTErrorCode::metadataUnreadable:
     case ost::OSTErrorCode::metadataInvalid:
     case ost::OSTErrorCode::cacheInconsistent:
@@ -66,10 +67,13 @@ constexpr std::string_view hintForCode(ost::OSTErrorCode code) {
     case ost::OSTErrorCode::dictionaryWriteFailed:
         return "Is the disk full? All info values of one container have room for 1 MiB.";
     case ost::OSTErrorCode::invalidParameter:
-        return "Bundles belong to user 33, system containers to 499, all others to users above 500 and to them alone.";
+        return "Bundles belong to user 33, system containers to 499, all others to users above 500 and to them alone. "
+               "Protection class 2 cannot be asked for, nor 4 with --outside-developer.";
     case ost::OSTErrorCode::exceptionCaught:
         return "This is a fault of the daemon: please report it with the lines of ostrandctl watch --once.";
     case ost::OSTErrorCode::cacheRebuildFailed:
+        return "Nothing is lost. The user may have no account on the device; else ask again, and when it stays, see "
+               "ostrandctl watch --once.";
     case ost::OSTErrorCode::cacheAddFailed:
     case ost::OSTErrorCode::cacheRemoveFailed:
     case ost::OSTErrorCode::invalidCacheInput:

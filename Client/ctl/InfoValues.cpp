@@ -54,6 +54,17 @@ Value dateIn(const std::string& text) {
     return end && *end == '\0' ? Value(ost::OSTDate{static_cast<double>(::timegm(&parts))}) : std::nullopt;
 }
 
+/// What such a text looks like, where that is not plain.
+std::string_view formOf(std::string_view type) {
+    if (type == "data")
+        return "; two hexadecimal digits make a byte";
+    if (type == "date")
+        return "; write it as 2026-11-22T19:46:01Z, or as seconds since 1970";
+    if (type == infoValueOperand.name)
+        return "; --string takes a text as it is";
+    return {};
+}
+
 Value valueIn(std::string_view type, const std::string& text) {
     if (type == "string")
         return text;
@@ -85,7 +96,8 @@ std::expected<ost::OSTValue, Failure> infoValueOf(const Arguments& arguments) {
         return propertyListIn(text);
     if (auto value = valueIn(type, text))
         return *std::move(value);
-    return std::unexpected(Failure::usage("\"" + escaped(text) + "\" is no " + std::string(type)));
+    return std::unexpected(
+        Failure::usage("\"" + escaped(text) + "\" is no " + std::string(type) + std::string(formOf(type))));
 }
 
 } // namespace ostrand::ctl

@@ -161,6 +161,11 @@ Failure Failure::of(const Error& error) {
     return makeFailure(EXIT_FAILURE, nameOf(error.kind), error.code, error.description(), std::string(hintFor(error)));
 }
 
+Failure Failure::of(const Error& error, const std::string& message, std::string hint) {
+    return makeFailure(EXIT_FAILURE, nameOf(error.kind), error.code,
+                       "error " + std::to_string(error.code) + ": " + message, std::move(hint));
+}
+
 Failure Failure::local(std::string message) { return makeFailure(EXIT_FAILURE, "local", 0, std::move(message)); }
 
 Failure Failure::system(std::string_view doing, int errnoValue) {

@@ -12,9 +12,10 @@ namespace ostrand::ctl {
 
 /// What a command has to say when it succeeded, for people and for programs.
 struct Report {
-    std::string text;        ///< whole lines, already escaped
-    ost::OSTDictionary json; ///< empty where standard output is that of a program that the command ran
-    int exitStatus = 0;      ///< the program's, or what the command found
+    std::string text; ///< whole lines, already escaped
+    ost::OSTDictionary json;
+    int exitStatus = 0;     ///< the program's, or what the command found
+    bool isPrinted = false; ///< standard output is that of a program that the command ran, or has what there was to say
 };
 
 /// Why a command did not do what it was asked.
@@ -25,6 +26,8 @@ struct Failure {
     [[nodiscard]] static Failure usage(std::string message);
     /// A request was refused, failed or never arrived.
     [[nodiscard]] static Failure of(const Error& error);
+    /// The same in other words, for a command of which the code says something else than usual.
+    [[nodiscard]] static Failure of(const Error& error, const std::string& message, std::string hint);
     /// Something on this side may not be done.
     [[nodiscard]] static Failure local(std::string message);
     /// A system call on this side failed: "doing: reason".

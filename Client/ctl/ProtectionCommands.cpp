@@ -32,14 +32,17 @@ constexpr std::string_view aboutProtection =
     "Classes of protection: 0 none, 1 to 3 only with the keys of an unlocked device, 4 always readable; 2 cannot be\n"
     "asked for. A container that was never given one counts as 3. Without --user, the container is the current user's.";
 
+constexpr std::int64_t highestClass = 4;
+
 std::expected<DataProtection, Failure> changeOf(const Arguments& arguments) {
     DataProtection change{.identifier = *arguments.value(identifierOperand.name),
                           .outsideDeveloper = arguments.has(outsideOption.name),
                           .retryIfLocked = arguments.has(retryOption.name)};
     const auto text = *arguments.value(protectionOption.name);
     const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), change.protectionClass);
-    if (error != std::errc{} || end != text.data() + text.size())
-        return std::unexpected(Failure::usage("\"" + escaped(text) + "\" is no protection class"));
+    if (error != std::errc{} || end != text.data() + text.size() || change.protectionClass < 0 ||
+        change.protectionClass > highestClass)
+        return std::unexpected(Failure::usage("\"" + escaped(text) + "\" is no protection class; they are 0 to 4"));
     if (const auto containerClass = arguments.value(containerClassOption.name))
         change.containerClass = OST_TRY(classNamed(*containerClass));
     change.user = OST_TRY(userOf(arguments, change.containerClass));

@@ -343,9 +343,7 @@ Outcome runToEnd(const Launch& launch, const std::string& identifier, const Devi
     if (const auto released = child->release(); !released)
         return std::unexpected(Failure::system(
             "cannot run " + launch.program.path() + ": cannot " + released.error().doing, released.error().error));
-    Report report;
-    report.exitStatus = child->waitForEnd();
-    return report;
+    return Report{.text = {}, .json = {}, .exitStatus = child->waitForEnd(), .isPrinted = true};
 }
 
 std::vector<std::string> argumentsOf(const Arguments& arguments) {

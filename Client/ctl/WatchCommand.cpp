@@ -88,7 +88,7 @@ Outcome watch(const Arguments& arguments) {
             if (const auto parsed = LogLine::parse(std::move(line)); parsed.level <= level)
                 OST_TRY(printer.print(parsed));
     }
-    return Report{};
+    return Report{.text = {}, .json = {}, .isPrinted = true};
 }
 
 } // namespace

@@ -39,8 +39,8 @@ int printFailure(const Failure& failure, bool asJSON, const std::string& usage) 
 int printOutcome(const Invocation& invocation, const Outcome& outcome) {
     const bool asJSON = invocation.arguments.has("json");
     if (outcome) {
-        const auto inJSON = [&] { return outcome->json.empty() ? std::string() : jsonText(outcome->json) + "\n"; };
-        const int failed = print(asJSON ? inJSON() : outcome->text);
+        const int failed =
+            outcome->isPrinted ? EXIT_SUCCESS : print(asJSON ? jsonText(outcome->json) + "\n" : outcome->text);
         return failed != 0 ? failed : outcome->exitStatus;
     }
     const bool isUsage = outcome.error().exitStatus == Failure::usageStatus;

@@ -149,6 +149,7 @@ TEST_F(CommandLine, ShowsAndChangesWhatAContainerCarries) {
         {{"--date", "1970-01-01T00:00:10Z"}, R"({"k": 10})"},
         {{"--plist", file}, R"({"k": [-1]})"},
     };
+    EXPECT_EQ(ostrandctl(with({"info", "list", "--json"})).output, "{}\n");
     for (const auto& [value, shown] : rows) {
         auto words = with({"info", "set"}, {"k"});
         words.insert(words.end(), value.begin(), value.end());
@@ -239,6 +240,11 @@ TEST_F(CommandLine, SaysHowARequestFailedAndLeavesTheDeviceAlone) {
         {signedProgram, {"replace", "--class", "2", "--new", "a", "--old-uuid", "x"}, 2, "--old-uuid needs --old"},
         {signedProgram, {"protect", "--class", "2", "com.example.b"}, 1, "error 21: no such container"},
         {signedProgram, {"protect", "--class", "x", "com.example.b"}, 2, "\"x\" is no protection class"},
+        {signedProgram, {"protect", "--class", "5", "com.example.b"}, 2, "\"5\" is no protection class"},
+        {signedProgram,
+         {"codesign", "show", "com.example.b"},
+         1,
+         "error 21: nothing that counts is registered for com"},
         {unsignedProgram, {"purge"}, 1, "the daemon refused the request"},
         {signedProgram, {"stage", "--class", "2", "com.exmaple.ctl"}, 1, "; did you mean \"com.example.ctl\"?\nhint: "},
         {signedProgram, {"create", "com.example.b"}, 2, "missing --class C\nusage: ostrandctl "},

@@ -24,6 +24,7 @@ TEST(Completion, ComesFromTheTableAndTheDevice) {
         {{"cre"}, "create "},
         {{"device", ""}, "lock state unlock "},
         {{"device", "un"}, "unlock "},
+        {{"help", "device", "un"}, "unlock "},
         {{"--device", directory, "codesign", "re"}, "register remove "},
         {{"create", "--cl"}, "--class "},
         {{"create", "--class", "data/"}, ""},
