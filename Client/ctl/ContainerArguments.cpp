@@ -1,6 +1,7 @@
 #include "Client/ctl/ContainerArguments.h"
 
 #include "Client/ctl/Commands.h"
+#include "Client/ctl/Hints.h"
 #include "Client/ctl/Suggestion.h"
 #include "Client/ctl/Values.h"
 #include "Protocol/OSTErrorCode.h"
@@ -16,9 +17,11 @@ Failure noContainer(const std::string& identifier, const std::vector<ListedConta
     std::vector<std::string> names;
     for (const auto& container : listed)
         names.push_back(container.identifier);
-    auto failure = Failure::of(Error::failed(static_cast<std::uint64_t>(ost::OSTErrorCode::notFound)));
-    failure.message += ": " + escaped(identifier) + didYouMean(identifier, names);
-    return failure;
+    const auto error = Error::failed(static_cast<std::uint64_t>(ost::OSTErrorCode::notFound));
+    return Failure::of(error,
+                       std::string(ost::meaningOf(ost::OSTErrorCode::notFound)) + ": " + escaped(identifier) +
+                           didYouMean(identifier, names),
+                       std::string(hintFor(error)));
 }
 
 } // namespace

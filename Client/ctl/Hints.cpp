@@ -133,8 +133,9 @@ constexpr std::string_view hintForTransport(std::uint64_t number) {
 std::string_view hintFor(const Error& error) {
     switch (error.kind) {
     case Error::Kind::refused:
-        return "A program must be signed for what it asks, and belong to root: ostrandctl sign FILE --identifier ID "
-               "--entitlement com.tamarok.private.Ostrand.allowed. The daemon's log says what was missing.";
+        return "A program must be signed for what it asks, and belong to root: ostrandctl sign COPY --identifier ID "
+               "--entitlement com.tamarok.private.Ostrand.allowed, with a copy that root alone may execute. The "
+               "daemon's log says what was missing.";
     case Error::Kind::transport:
         return hintForTransport(error.code);
     case Error::Kind::failed:

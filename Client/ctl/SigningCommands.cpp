@@ -86,16 +86,15 @@ Outcome sign(const Arguments& arguments) {
 } // namespace
 
 std::vector<Command> signingCommands() {
-    return {
-        {"sign",
-         "signs a program, replacing the signature that it has",
-         {fileOperand},
-         {identifierOption, entitlementsOption, entitlementOption, forceOption},
-         "A signature counts as long as the file belongs to root and neither group nor others may write it.\n"
-         "Whoever may execute a program has its entitlements: those that begin with \"com.tamarok.private.Ostrand.\"\n"
-         "are refused to a program that others may execute.",
-         sign,
-         R"({"file": "string", "signature": {"Identifier?": "string", "Entitlements?": {"*": "any"}}})"}};
+    return {{"sign",
+             "signs a program, replacing the signature that it has",
+             {fileOperand},
+             {identifierOption, entitlementsOption, entitlementOption, forceOption},
+             "A signature counts as long as the file belongs to root and neither group nor others may write it.\n"
+             "Everybody who may execute a program has its entitlements: those that begin with\n"
+             "\"com.tamarok.private.Ostrand.\" are refused to a program that others may execute.",
+             sign,
+             R"({"file": "string", "signature": {"Identifier?": "string", "Entitlements?": {"*": "any"}}})"}};
 }
 
 } // namespace ostrand::ctl

@@ -34,6 +34,9 @@ std::optional<ContainerClass> containerClassNamed(std::string_view name) {
     return std::nullopt;
 }
 
+/// What a person knows the file by.
+std::string nameOf(const std::string& path) { return path == "-" ? "standard input" : escaped(path); }
+
 std::expected<std::string, Failure> contentOf(const std::string& path, std::size_t largest) {
     const File file(path == "-" ? stdin : std::fopen(path.c_str(), "re"), &std::fclose);
     std::string content;
@@ -47,7 +50,7 @@ std::expected<std::string, Failure> contentOf(const std::string& path, std::size
     if (!file || std::ferror(file.get()))
         return std::unexpected(Failure::system("cannot read " + path, errno));
     if (content.size() > largest)
-        return std::unexpected(Failure::local(escaped(path) + " is too large"));
+        return std::unexpected(Failure::local(nameOf(path) + " is too large"));
     return content;
 }
 
@@ -55,7 +58,7 @@ std::expected<ost::OSTValue, Failure> propertyListIn(const std::string& path, st
     const auto content = OST_TRY(contentOf(path, largest));
     auto value = ost::platform::parsePropertyList(content, {.depth = deepestValue, .objectCount = content.size()});
     if (!value)
-        return std::unexpected(Failure::local(escaped(path) + " is no " + kind + ": " + escaped(value.error().reason)));
+        return std::unexpected(Failure::local(nameOf(path) + " is no " + kind + ": " + escaped(value.error().reason)));
     return *std::move(value);
 }
 
@@ -102,7 +105,7 @@ std::expected<ost::OSTDictionary, Failure> dictionaryIn(const std::string& path,
     constexpr const char* kind = "property-list dictionary";
     const auto value = OST_TRY(propertyListIn(path, largest, kind));
     if (!value.asDictionary())
-        return std::unexpected(Failure::local(escaped(path) + " is no " + kind));
+        return std::unexpected(Failure::local(nameOf(path) + " is no " + kind));
     return *value.asDictionary();
 }
 

@@ -247,6 +247,10 @@ TEST_F(CommandLine, SaysHowARequestFailedAndLeavesTheDeviceAlone) {
          "error 21: nothing that counts is registered for com"},
         {unsignedProgram, {"purge"}, 1, "the daemon refused the request"},
         {signedProgram, {"stage", "--class", "2", "com.exmaple.ctl"}, 1, "; did you mean \"com.example.ctl\"?\nhint: "},
+        {signedProgram,
+         {"codesign", "register", "b", "--info", "-"},
+         1,
+         "standard input is no property-list dictionary"},
         {signedProgram, {"create", "com.example.b"}, 2, "missing --class C\nusage: ostrandctl "},
     };
     ostrandctl({"create", "--class", "2"});
