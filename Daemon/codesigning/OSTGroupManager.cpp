@@ -98,17 +98,21 @@ void OSTGroupManager::handleChangeFromOldGroupContainerIds(const GroupList& oldG
     _removeReferenceForGroupIdentifiers(left, type);
 }
 
+bool OSTGroupManager::_mayCountReferencesOfType(OSTGroupType type) {
+    const bool isAvailable = OSTCodeSigningMapping::sharedInstance().isAvailable();
+    if (!isAvailable)
+        platform::logError("Failed to get reference count information for group type: %ld", type);
+    return isAvailable;
+}
+
 std::optional<OSTGroupManager::ReferenceCounts>
 OSTGroupManager::_copyReferenceCountSetOfType(OSTGroupType type, const std::vector<std::string>& groups) {
-    auto& mapping = OSTCodeSigningMapping::sharedInstance();
-    if (!mapping.isAvailable()) {
-        platform::logError("Failed to get reference count information for group type: %ld", type);
+    if (!_mayCountReferencesOfType(type))
         return std::nullopt;
-    }
     ReferenceCounts counts;
     for (const auto& group : groups)
         counts.emplace(group, 0);
-    mapping.iterateGroupIdsWithKey(
+    OSTCodeSigningMapping::sharedInstance().iterateGroupIdsWithKey(
         type == OSTGroupType::system ? OSTGroupKeys::system : OSTGroupKeys::application,
         [&](const std::string& identifier, const OSTCodeSigningMapping::GroupViews* referenced) {
             if (!referenced)
@@ -156,7 +160,7 @@ void OSTGroupManager::reconcileGroupContainersOfType(OSTGroupType type) const {
     OST_ASSERT(OSTHoldsAllIdentifiersLock());
     OST_ASSERT(type == OSTGroupType::application);
     const auto [userId, containerClass] = placeOf(type);
-    if (!_copyReferenceCountSetOfType(type, {}) || !userHasHome(userId))
+    if (!_mayCountReferencesOfType(type) || !userHasHome(userId))
         return;
     const auto containers = OSTContainerCache::sharedInstance().allContainersForUser(userId, containerClass, false);
     if (!containers) {

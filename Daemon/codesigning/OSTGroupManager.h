@@ -64,8 +64,10 @@ private:
 
     OSTGroupManager() = default;
 
-    /// How many identifiers of the mapping reference each of these groups, whatever state their entries are in. None,
-    /// which is logged, when the mapping is unavailable: nobody knows then who references what.
+    /// Whether the mapping is available. Without it, which is logged, nobody knows who references what.
+    [[nodiscard]] static bool _mayCountReferencesOfType(OSTGroupType type);
+    /// How many identifiers of the mapping reference each of these groups, whatever state their entries are in. None
+    /// when they may not be counted.
     [[nodiscard]] static std::optional<ReferenceCounts>
     _copyReferenceCountSetOfType(OSTGroupType type, const std::vector<std::string>& groups);
 
