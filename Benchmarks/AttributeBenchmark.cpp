@@ -177,14 +177,8 @@ struct LargeContainer {
     LargeContainer() { makeLargeTree(items[0]); }
 
     void changeBare(const std::string& value) const {
-        const BareWalk bare{.item =
-                                [&](int directory, const char* name) {
-                                    const FileDescriptor item(
-                                        ::openat(directory, name, O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
-                                    require(static_cast<bool>(item), name);
-                                    changeAttribute(item.get(), value);
-                                },
-                            .directory = [&](int directory) { changeAttribute(directory, value); }};
+        const auto change = [&](int item) { changeAttribute(item, value); };
+        const auto bare = BareWalk::opening(change, change);
         for (const auto& item : items)
             bare.run(item);
     }

@@ -23,7 +23,6 @@
 #include <array>
 #include <chrono>
 #include <cstdint>
-#include <functional>
 #include <stdexcept>
 #include <string>
 #include <thread>
@@ -37,7 +36,6 @@ using test::makeScratchDirectory;
 namespace {
 
 using ostrand::ContainerClass;
-using platform::FileDescriptor;
 
 void diskUsage(benchmark::State& state) {
     const BootedDevice device(makeScratchDirectory(0711) / "device");
@@ -125,19 +123,6 @@ struct Permissions {
     }
 };
 
-/// Does something to every item of a tree.
-void toAll(const std::filesystem::path& tree, const std::function<void(int item)>& toFile,
-           const std::function<void(int item)>& toDirectory) {
-    BareWalk{.item =
-                 [&](int directory, const char* name) {
-                     const FileDescriptor item(::openat(directory, name, O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
-                     require(static_cast<bool>(item), name);
-                     toFile(item.get());
-                 },
-             .directory = toDirectory}
-        .run(tree);
-}
-
 void aclRepair(benchmark::State& state) {
     const auto image = makeScratchDirectory(0711) / "device";
     {
@@ -158,10 +143,12 @@ void aclRepair(benchmark::State& state) {
     const auto fileAfter = Permissions::of(file), directoryAfter = Permissions::of(directory);
     require(!fileAfter.acls[0].empty() && !directoryAfter.acls[1].empty(), "The ACLs are not set");
     const auto restore = [&] {
-        toAll(tree, [&](int item) { fileBefore.restore(item); }, [&](int item) { directoryBefore.restore(item); });
+        BareWalk::opening([&](int item) { fileBefore.restore(item); }, [&](int item) { directoryBefore.restore(item); })
+            .run(tree);
     };
     const auto giveAll = [&] {
-        toAll(tree, [&](int item) { fileAfter.give(item); }, [&](int item) { directoryAfter.give(item); });
+        BareWalk::opening([&](int item) { fileAfter.give(item); }, [&](int item) { directoryAfter.give(item); })
+            .run(tree);
     };
     Comparison{.unit = Unit::seconds,
                .target = {Target::Kind::ratioAtMost, 1.3},

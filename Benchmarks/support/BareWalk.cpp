@@ -34,6 +34,17 @@ void walk(const BareWalk& what, int parent, const char* name) {
 
 } // namespace
 
+BareWalk BareWalk::opening(const std::function<void(int item)>& toFile,
+                           const std::function<void(int directory)>& toDirectory) {
+    return {.item =
+                [=](int directory, const char* name) {
+                    const platform::FileDescriptor item(::openat(directory, name, O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
+                    require(static_cast<bool>(item), name);
+                    toFile(item.get());
+                },
+            .directory = toDirectory};
+}
+
 void BareWalk::run(const std::filesystem::path& top) const { walk(*this, AT_FDCWD, top.c_str()); }
 
 } // namespace ost::benchmarks

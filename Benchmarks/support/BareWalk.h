@@ -13,6 +13,10 @@ struct BareWalk {
     std::function<void(int directory)> directory;
 
     void run(const std::filesystem::path& top) const;
+
+    /// One that opens what is no directory, too.
+    [[nodiscard]] static BareWalk opening(const std::function<void(int item)>& toFile,
+                                          const std::function<void(int directory)>& toDirectory);
 };
 
 } // namespace ost::benchmarks

@@ -125,16 +125,17 @@ LoadedDevice::LoadedDevice() : _device(placeOfDevice()), _lookUp(_device.socket(
 }
 
 std::vector<double> LoadedDevice::lookUps(unsigned count) {
-    std::vector<double> seconds;
-    while (seconds.size() < count)
-        seconds.push_back(secondsOf([&] { _lookUp.once(); }));
-    std::ranges::sort(seconds);
-    return seconds;
+    return _lookUpsWhile([=](std::size_t done) { return done < count; });
 }
 
 std::vector<double> LoadedDevice::lookUps(std::chrono::seconds duration) {
+    const auto end = Clock::now() + duration;
+    return _lookUpsWhile([=](std::size_t) { return Clock::now() < end; });
+}
+
+std::vector<double> LoadedDevice::_lookUpsWhile(const std::function<bool(std::size_t done)>& goesOn) {
     std::vector<double> seconds;
-    for (const auto end = Clock::now() + duration; Clock::now() < end;)
+    while (goesOn(seconds.size()))
         seconds.push_back(secondsOf([&] { _lookUp.once(); }));
     std::ranges::sort(seconds);
     return seconds;

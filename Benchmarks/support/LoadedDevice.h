@@ -7,6 +7,7 @@
 #include <chrono>
 #include <cstddef>
 #include <cstdint>
+#include <functional>
 #include <thread>
 #include <vector>
 
@@ -43,6 +44,8 @@ public:
     };
 
 private:
+    [[nodiscard]] std::vector<double> _lookUpsWhile(const std::function<bool(std::size_t done)>& goesOn);
+
     test::BootedDevice _device;
     RoundTrips _lookUp;
 };

@@ -8,8 +8,6 @@
 
 #include <gtest/gtest.h>
 
-#include <sys/xattr.h>
-
 #include <array>
 #include <cerrno>
 #include <filesystem>
@@ -25,7 +23,6 @@ namespace {
 
 namespace fs = std::filesystem;
 
-constexpr const char* classAttribute = "trusted.ostrand.protection-class";
 constexpr const char* classDirectory = "/private/var/mobile/Containers/Data/Application";
 
 /// A daemon whose file-system calls fail or kill it while it changes what one container carries.
@@ -85,12 +82,7 @@ protected:
 
     /// The protection class that an item of the container bears, empty when it bears none.
     [[nodiscard]] std::string classOf(const char* item) {
-        char text[16];
-        const auto size = ::lgetxattr((directory() / item).c_str(), classAttribute, text, sizeof text);
-        return std::string(text, size < 0 ? 0 : static_cast<std::size_t>(size));
-    }
-    void setClass(const char* item, const std::string& to) {
-        ASSERT_EQ(::lsetxattr((directory() / item).c_str(), classAttribute, to.data(), to.size(), 0), 0) << item;
+        return recordedProtectionClass(directory() / item).value_or("");
     }
     [[nodiscard]] fs::path directory() {
         return device().onHost(classDirectory) / namesIn(device().onHost(classDirectory)).at(0);
@@ -249,7 +241,7 @@ protected:
     /// Every item as it was, and the class that is on record.
     void raise(Connection& connection) {
         for (const auto* const item : items)
-            setClass(item, "3");
+            recordProtectionClass(directory() / item, "3");
         EXPECT_TRUE(
             ostrand::setInfoValue(connection, container, ostrand::protectionClassKey, OSTValue(std::uint64_t{3})));
     }

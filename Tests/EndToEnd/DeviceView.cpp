@@ -9,8 +9,6 @@
 
 #include <gtest/gtest.h>
 
-#include <sys/xattr.h>
-
 #include <algorithm>
 #include <array>
 #include <filesystem>
@@ -37,12 +35,6 @@ void expectItem(const GatedDevice& device, const std::string& identifier, const 
     }
 }
 
-std::string protectionClassOf(const fs::path& item) {
-    std::array<char, 16> text{};
-    const auto size = ::lgetxattr(item.c_str(), "trusted.ostrand.protection-class", text.data(), text.size());
-    return {text.data(), size < 0 ? 0 : static_cast<std::size_t>(size)};
-}
-
 /// Returns where it lies.
 fs::path lookAtContainer(DeviceView& view, const GatedDevice& device, Connection& connection,
                          const ostrand::ContainerReference& container) {
@@ -57,7 +49,8 @@ fs::path lookAtContainer(DeviceView& view, const GatedDevice& device, Connection
     view[name] = found->path + " " + container.uuid.string() + "\n" + tree(place);
     view[name + recordSuffix] = found->info.description();
     for (const auto& entry : fs::recursive_directory_iterator(place))
-        view[name + ", the class of " + entry.path().lexically_relative(place).string()] = protectionClassOf(entry);
+        view[name + ", the class of " + entry.path().lexically_relative(place).string()] =
+            recordedProtectionClass(entry).value_or("");
     if (container.containerClass == dataApplication)
         expectItem(device, identifier, found->path);
     return place;

@@ -39,6 +39,13 @@ protected:
         return connections;
     }
 
+    /// Each asks for something once their program's file system has stopped answering.
+    static void hang(ServedFileSystem& fileSystem, std::vector<Connection>& connections) {
+        fileSystem.stopAnswering();
+        for (auto& connection : connections)
+            connection.send(creation(1, "com.example.hung"));
+    }
+
     void expectServiceOfOthers() {
         const Client other(device().socket(), allowed());
         EXPECT_EQ(other.connect().call(creation(1, "com.example.other")).error(), 1U);
@@ -69,9 +76,7 @@ TEST_F(HungFileSystemTest, ItsMakerDoesNotHaveToForbidSetUserIdInAMountTableOfHi
     ASSERT_EQ(::unshare(CLONE_NEWNS), 0);
     ServedFileSystem fileSystem(builtProgram("wire-client"), false);
     auto connections = connect(fileSystem);
-    fileSystem.stopAnswering();
-    for (auto& connection : connections)
-        connection.send(creation(1, "com.example.hung"));
+    hang(fileSystem, connections);
     for (auto& connection : connections)
         EXPECT_TRUE(connection.isClosed());
 }
@@ -86,9 +91,7 @@ TEST_F(HungFileSystemTest, AUserWhoLaysOneOverAnotherWaitsAlone) {
         if (::mount("test", place.c_str(), "overlay", MS_NOSUID | MS_NODEV, layers.c_str()) != 0)
             GTEST_SKIP() << "this host has no overlays: errno " << errno;
         connections = connect(place / "program");
-        fileSystem.stopAnswering();
-        for (auto& connection : connections)
-            connection.send(creation(1, "com.example.hung"));
+        hang(fileSystem, connections);
         expectServiceOfOthers();
     }
     for (auto& connection : connections)
@@ -101,9 +104,7 @@ TEST_F(HungFileSystemTest, AnAdministratorsThatHangsKeepsItsOwnClientsWaiting) {
     {
         ServedFileSystem fileSystem(builtProgram("wire-client"), false);
         connections = connect(fileSystem);
-        fileSystem.stopAnswering();
-        for (auto& connection : connections)
-            connection.send(creation(1, "com.example.hung"));
+        hang(fileSystem, connections);
         expectServiceOfOthers();
     }
     for (auto& connection : connections)

@@ -13,7 +13,6 @@
 #include <linux/fs.h>
 #include <sys/ioctl.h>
 #include <sys/stat.h>
-#include <sys/xattr.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -31,18 +30,10 @@ namespace {
 namespace fs = std::filesystem;
 using enum OSTContainerClass;
 
-constexpr const char* attribute = "trusted.ostrand.protection-class";
-
-void record(const fs::path& item, const std::string& protectionClass) {
-    ASSERT_EQ(::lsetxattr(item.c_str(), attribute, protectionClass.data(), protectionClass.size(), 0), 0) << item;
-}
+constexpr auto record = test::recordProtectionClass;
 
 /// "-" when none is recorded.
-std::string recorded(const fs::path& item) {
-    char text[16];
-    const auto size = ::lgetxattr(item.c_str(), attribute, text, sizeof text);
-    return size < 0 ? "-" : std::string(text, static_cast<std::size_t>(size));
-}
+std::string recorded(const fs::path& item) { return test::recordedProtectionClass(item).value_or("-"); }
 
 bool setImmutable(const fs::path& file, bool immutable) {
     const platform::FileDescriptor opened(::open(file.c_str(), O_RDONLY | O_CLOEXEC));

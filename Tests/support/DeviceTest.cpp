@@ -5,9 +5,11 @@
 #include "support/Sanitized.h"
 
 #include <sys/stat.h>
+#include <sys/xattr.h>
 #include <unistd.h>
 
 #include <algorithm>
+#include <array>
 #include <cstdio>
 #include <cstdlib>
 #include <fstream>
@@ -17,6 +19,8 @@
 namespace ost::test {
 
 namespace {
+
+constexpr const char* classAttribute = "trusted.ostrand.protection-class";
 
 /// A test must not go on outside its device: it would act on the host.
 template<typename Value, typename Error>
@@ -89,6 +93,16 @@ std::string readFile(const std::filesystem::path& file) {
     stream.exceptions(std::ios::failbit | std::ios::badbit);
     stream.open(file, std::ios::binary);
     return {std::istreambuf_iterator<char>(stream), std::istreambuf_iterator<char>()};
+}
+
+std::optional<std::string> recordedProtectionClass(const std::filesystem::path& item) {
+    std::array<char, 16> text;
+    const auto size = ::lgetxattr(item.c_str(), classAttribute, text.data(), text.size());
+    return size < 0 ? std::nullopt : std::optional(std::string(text.data(), static_cast<std::size_t>(size)));
+}
+
+void recordProtectionClass(const std::filesystem::path& item, const std::string& protectionClass) {
+    ASSERT_EQ(::lsetxattr(item.c_str(), classAttribute, protectionClass.data(), protectionClass.size(), 0), 0) << item;
 }
 
 std::string tree(const std::filesystem::path& directory) {

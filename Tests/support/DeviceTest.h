@@ -5,6 +5,7 @@
 #include <sys/types.h>
 
 #include <filesystem>
+#include <optional>
 #include <string>
 #include <string_view>
 
@@ -28,6 +29,11 @@ void writeFile(const std::filesystem::path& file, std::string_view content, mode
 
 /// The content of a file. Throws when it cannot be read.
 std::string readFile(const std::filesystem::path& file);
+
+/// The protection class that an item bears on disk; absent when it bears none.
+std::optional<std::string> recordedProtectionClass(const std::filesystem::path& item);
+/// Has the item bear that class. The test fails when it cannot.
+void recordProtectionClass(const std::filesystem::path& item, const std::string& protectionClass);
 
 /// What lies below a directory, sorted, one line for each item: mode, owner, path relative to `directory`, and where a
 /// link points: "drwxr-xr-x 501:501 Data/Application", "lrwxrwxrwx 0:0 link -> target". Links are not followed.
