@@ -140,8 +140,12 @@ void OSTCodeSigningMapping::performAllCodeSigningMigrationAndReconciliation() {
 
 OSTResult<void> OSTCodeSigningMapping::_storeMigrated(const std::function<bool()>& storeEntries) {
     return _sync([&]() -> OSTResult<void> {
+        const auto storeAll = [&] {
+            const platform::LogBatch lines; // one for each identifier
+            return storeEntries();
+        };
         // What an earlier run stored may still be in memory alone.
-        return storeEntries() || _unwritten ? _writeCodeSigningMappingToDisk() : OSTResult<void>();
+        return storeAll() || _unwritten ? _writeCodeSigningMappingToDisk() : OSTResult<void>();
     });
 }
 

@@ -11,6 +11,7 @@
 #include <fstream>
 #include <iterator>
 #include <string>
+#include <thread>
 
 namespace ost::platform {
 namespace {
@@ -56,6 +57,30 @@ TEST_F(LogTest, RotatesAtEitherSizeAndKeepsAsManyFilesAsItShould) {
             EXPECT_GT(fs::file_size(path.native() + ".1"), size - 2000);
         }
     }
+}
+
+TEST_F(LogTest, ABatchKeepsTheOrderAndTheSizeAndHoldsNoErrorBack) {
+    constexpr std::uint64_t size = 20'000;
+    open(3, size);
+    const auto numbered = [](int number) { return "line " + std::to_string(number) + ";"; };
+    {
+        const LogBatch batch;
+        logNotice("%@", numbered(1));
+        EXPECT_FALSE(has(numbered(1)));
+        logError("%@", numbered(2));
+        EXPECT_LT(content().find(numbered(1)), content().find(numbered(2)));
+        logNotice("%@", numbered(3));
+        std::thread([&] { logNotice("%@", numbered(4)); }).join();
+        EXPECT_LT(content().find(numbered(3)), content().find(numbered(4)));
+        for (int number = 5; number < 300; ++number)
+            logNotice("%@", numbered(number));
+    }
+    const auto all = content(".2") + content(".1") + content();
+    std::size_t at = 0;
+    for (int number = 1; number < 300; ++number, ++at)
+        ASSERT_NE(at = all.find(numbered(number), at), std::string::npos) << number;
+    for (const auto& entry : fs::directory_iterator(directory))
+        EXPECT_LE(entry.file_size(), size) << entry.path();
 }
 
 TEST_F(LogTest, AUsersLinesPushNobodyElsesOut) {

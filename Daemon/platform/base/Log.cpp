@@ -9,6 +9,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <array>
 #include <cerrno>
 #include <climits>
 #include <cstdio>
@@ -34,16 +35,30 @@ const char* nameOfLogLevel(LogLevel level) {
 
 namespace {
 
+/// The time as the lines have it, worked out once a second for each thread.
+std::string_view dateAndTime(std::time_t second) {
+    struct Shown {
+        std::time_t second = -1;
+        std::array<char, 32> text{};
+        std::size_t size = 0;
+    };
+    thread_local Shown shown;
+    if (second != shown.second) {
+        tm utc{};
+        ::gmtime_r(&second, &utc);
+        shown.size = std::strftime(shown.text.data(), shown.text.size(), "%Y-%m-%dT%H:%M:%S", &utc);
+        shown.second = second;
+    }
+    return {shown.text.data(), shown.size};
+}
+
 std::string linePrefix(LogLevel level) {
     timespec now{};
     ::clock_gettime(CLOCK_REALTIME, &now);
-    tm utc{};
-    ::gmtime_r(&now.tv_sec, &utc);
-    char buffer[96];
-    const auto date = std::strftime(buffer, sizeof buffer, "%Y-%m-%dT%H:%M:%S", &utc);
-    const auto rest = std::snprintf(buffer + date, sizeof buffer - date, ".%06ldZ <%s> [%d:%d] ", now.tv_nsec / 1000,
+    char rest[64];
+    const auto size = std::snprintf(rest, sizeof rest, ".%06ldZ <%s> [%d:%d] ", now.tv_nsec / 1000,
                                     nameOfLogLevel(level), ::getpid(), ::gettid());
-    return {buffer, date + static_cast<std::size_t>(rest)};
+    return std::string(dateAndTime(now.tv_sec)).append(rest, static_cast<std::size_t>(size));
 }
 
 /// A quarter: four users together still leave some of the file to root and to the daemon.
@@ -51,6 +66,11 @@ constexpr std::uint64_t partOfUser = 4;
 
 /// Whom this thread's lines are caused by.
 thread_local uid_t currentOrigin = 0;
+
+/// Whether this thread has a batch.
+thread_local bool isCollecting = false;
+/// Some thirty lines: more would hardly save anything, and would be lost when the process is killed.
+constexpr std::uint64_t batchSize = 4096;
 
 std::string makeLine(LogLevel level, std::string_view function, std::string_view message) {
     std::string line = linePrefix(level);
@@ -137,6 +157,8 @@ void Log::write(LogLevel level, std::string_view function, std::string_view mess
         copyToStandardError(line);
     if (currentOrigin == 0 || _mayCause(currentOrigin, line.size()))
         _put(line);
+    if (level == LogLevel::error || !isCollecting)
+        _putCollected();
 }
 
 /// Counts a line of a user, as one that is written or as one that is left out.
@@ -176,6 +198,7 @@ int Log::leftOutDescriptor() {
 void Log::sayWhatWasLeftOut(LeftOut where) {
     const MutexLock lock(_mutex);
     _sayWhatWasLeftOut(where);
+    _putCollected();
 }
 
 void Log::_sayWhatWasLeftOut(LeftOut where) {
@@ -194,17 +217,36 @@ void Log::_sayWhatWasLeftOut(LeftOut where) {
     _armTimer();
 }
 
-void Log::_put(const std::string& line) {
-    if (_disk.path.empty() || (!_fileIsLinked() && !_openFile()))
+void Log::_put(std::string_view line) {
+    if (!_collected.empty() && _collected.size() + line.size() > std::min(batchSize, _disk.size / partOfUser))
+        _putCollected();
+    _collected += line;
+}
+
+void Log::_putCollected() {
+    const auto lines = std::exchange(_collected, {});
+    if (lines.empty() || _disk.path.empty() || (!_fileIsLinked() && !_openFile()))
         return;
-    if (_written > 0 && _written + line.size() > _disk.size)
+    if (_written > 0 && _written + lines.size() > _disk.size)
         _rotate();
-    if (_file && ::write(_file.get(), line.data(), line.size()) > 0)
-        _written += line.size();
+    if (_file && ::write(_file.get(), lines.data(), lines.size()) > 0)
+        _written += lines.size();
+}
+
+void Log::_writeCollected() {
+    const MutexLock lock(_mutex);
+    _putCollected();
 }
 
 LogOrigin::LogOrigin(uid_t user) : _before(std::exchange(currentOrigin, user)) {}
 
 LogOrigin::~LogOrigin() { currentOrigin = _before; }
+
+LogBatch::LogBatch() : _before(std::exchange(isCollecting, true)) {}
+
+LogBatch::~LogBatch() {
+    isCollecting = _before;
+    Log::shared()._writeCollected();
+}
 
 } // namespace ost::platform

@@ -24,7 +24,8 @@ enum class LogLevel : int { error = 3, notice = 5, debug = 7 };
 [[nodiscard]] const char* nameOfLogLevel(LogLevel level);
 
 /// The process's leveled, rotating log. One line is
-/// `2026-11-22T19:46:01.123456Z <Error> [PID:TID] function: message`, written with one `write`.
+/// `2026-11-22T19:46:01.123456Z <Error> [PID:TID] function: message`, written with one `write`, alone or behind the
+/// lines of a `LogBatch`. Lines stand in the file in the order in which they were logged.
 ///
 /// Nobody above 0 fills the file: the lines that one user causes may take a quarter of its size in a while. What is
 /// left out beyond that is counted, and said in one line. Standard error gets every error line.
@@ -70,7 +71,10 @@ private:
     [[nodiscard]] bool _mayCause(uid_t user, std::size_t bytes) OST_REQUIRES(_mutex);
     void _sayWhatWasLeftOut(LeftOut where) OST_REQUIRES(_mutex);
     void _armTimer() OST_REQUIRES(_mutex);
-    void _put(const std::string& line) OST_REQUIRES(_mutex);
+    friend class LogBatch;
+    void _writeCollected();
+    void _put(std::string_view line) OST_REQUIRES(_mutex);
+    void _putCollected() OST_REQUIRES(_mutex);
     [[nodiscard]] bool _fileIsLinked() const OST_REQUIRES(_mutex);
     [[nodiscard]] std::expected<void, Errno> _openFile() OST_REQUIRES(_mutex);
     void _rotate() OST_REQUIRES(_mutex);
@@ -80,6 +84,7 @@ private:
     DiskFile _disk OST_GUARDED_BY(_mutex){};
     FileDescriptor _file OST_GUARDED_BY(_mutex);
     std::uint64_t _written OST_GUARDED_BY(_mutex) = 0;
+    std::string _collected OST_GUARDED_BY(_mutex); ///< lines of a batch that are not written yet
     std::unordered_map<uid_t, OfUser> _users OST_GUARDED_BY(_mutex);
     FileDescriptor _timer OST_GUARDED_BY(_mutex);
 };
@@ -94,6 +99,19 @@ public:
 
 private:
     const uid_t _before;
+};
+
+/// While it exists, lines of its thread below an error are collected and written some at a time: for work that logs
+/// thousands. An error line, a line of another thread and the end of the batch write what was collected before.
+class LogBatch {
+public:
+    LogBatch();
+    LogBatch(const LogBatch&) = delete;
+    LogBatch& operator=(const LogBatch&) = delete;
+    ~LogBatch();
+
+private:
+    const bool _before;
 };
 
 /// Writes a line whose function field is the calling function's name.

@@ -52,8 +52,11 @@ void appendNumber(std::string& out, auto value, int base) {
 } // namespace
 
 void appendEscaped(std::string& out, std::string_view text) {
+    const auto isPlain = [](char c) { return c >= ' ' && c <= '~'; };
     while (!text.empty()) {
-        std::size_t length = printableSequence(text);
+        const auto plain = std::ranges::find_if_not(text, isPlain);
+        std::size_t length =
+            plain != text.begin() ? static_cast<std::size_t>(plain - text.begin()) : printableSequence(text);
         if (length > 0) {
             out.append(text.substr(0, length));
         } else {
