@@ -4,8 +4,13 @@
 
 #include <sys/stat.h>
 
+#include <chrono>
+#include <filesystem>
+
 namespace ost::platform {
 namespace {
+
+namespace fs = std::filesystem;
 
 class DeviceLockStateTest : public test::DeviceTest {};
 
@@ -32,20 +37,44 @@ TEST_F(DeviceLockStateTest, IsTheNumberInItsFile) {
         EXPECT_EQ(deviceLockState(), state) << content;
     }
     for (const auto& place : {"symlink", "fifo", "directory"}) {
-        std::filesystem::remove(deviceLockStateFile);
+        fs::remove(deviceLockStateFile);
         test::writeFile("/elsewhere", "1");
         if (place == std::string("symlink"))
-            std::filesystem::create_symlink("/elsewhere", deviceLockStateFile);
+            fs::create_symlink("/elsewhere", deviceLockStateFile);
         else if (place == std::string("fifo"))
             ::mkfifo(deviceLockStateFile, 0666);
         else
-            std::filesystem::create_directory(deviceLockStateFile);
+            fs::create_directory(deviceLockStateFile);
         EXPECT_EQ(deviceLockState(), deviceLockStateUnknown) << place;
     }
 }
 
+TEST_F(DeviceLockStateTest, ALockIsSeenHoweverOftenThereWasNoFile) {
+    const fs::path directory = fs::path(deviceLockStateFile).parent_path(), others = directory.parent_path() / "others";
+    // Longer than what is remembered of a directory has to be old.
+    const auto askWithoutFile = [] {
+        const auto end = std::chrono::steady_clock::now() + std::chrono::milliseconds(100);
+        do
+            ASSERT_EQ(deviceLockState(), deviceUnlocked);
+        while (std::chrono::steady_clock::now() < end);
+    };
+    askWithoutFile();
+    test::writeFile("/new", "1");
+    fs::rename("/new", deviceLockStateFile);
+    EXPECT_EQ(deviceLockState(), deviceLocked);
+    fs::remove(deviceLockStateFile);
+    askWithoutFile();
+    fs::create_directory(others);
+    test::writeFile(others / "device-lock-state", "1");
+    fs::rename(directory, directory.parent_path() / "former");
+    fs::rename(others, directory);
+    EXPECT_EQ(deviceLockState(), deviceLocked) << "of another directory";
+    fs::remove_all(directory);
+    EXPECT_EQ(deviceLockState(), deviceUnlocked) << "nor a directory";
+}
+
 TEST_F(DeviceLockStateTest, IsWrittenIntoAnImage) {
-    std::filesystem::create_directories("/image/private/var/run");
+    fs::create_directories("/image/private/var/run");
     ASSERT_TRUE(writeDeviceLockState(deviceLocked, "/image"));
     EXPECT_EQ(test::readFile("/image/private/var/run/device-lock-state"), "1\n");
     EXPECT_EQ(test::tree("/image/private/var/run"), "-rw-r--r-- 0:0 device-lock-state\n");
@@ -70,12 +99,12 @@ TEST_F(DeviceLockStateTest, NotifiesOnceAboutChangesThatComeTogether) {
               }),
               1);
     EXPECT_EQ(callsAfter([] { test::writeFile(deviceLockStateFile, "1"); }), 1);
-    EXPECT_EQ(callsAfter([] { std::filesystem::remove(deviceLockStateFile); }), 1);
-    EXPECT_EQ(callsAfter([] { std::filesystem::create_hard_link("/etc/group", deviceLockStateFile); }), 1);
-    EXPECT_EQ(callsAfter([] { std::filesystem::rename(deviceLockStateFile, "/private/var/run/away"); }), 1);
+    EXPECT_EQ(callsAfter([] { fs::remove(deviceLockStateFile); }), 1);
+    EXPECT_EQ(callsAfter([] { fs::create_hard_link("/etc/group", deviceLockStateFile); }), 1);
+    EXPECT_EQ(callsAfter([] { fs::rename(deviceLockStateFile, "/private/var/run/away"); }), 1);
     EXPECT_EQ(callsAfter([] {}), 0);
 
-    std::filesystem::remove_all("/private/var/run");
+    fs::remove_all("/private/var/run");
     EXPECT_EQ(DeviceLockStateNotification::registerHandler(*loop, [] { return true; }).error(), ENOENT);
 }
 

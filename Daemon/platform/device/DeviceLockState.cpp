@@ -1,5 +1,6 @@
 #include "platform/device/DeviceLockState.h"
 
+#include "platform/base/Immortal.h"
 #include "platform/base/PassingReason.h"
 #include "platform/base/Path.h"
 #include "platform/base/SmallFile.h"
@@ -18,6 +19,8 @@
 #include <cstdio>
 #include <cstring>
 #include <ctime>
+#include <optional>
+#include <string>
 #include <string_view>
 
 namespace ost::platform {
@@ -26,7 +29,7 @@ namespace {
 
 constexpr std::size_t stateTextLimit = 16; // a number of 32 bits and a newline
 
-/// By which one content of the state's file is told from another.
+/// By which one content of a file or of a directory is told from another.
 struct FileStatus {
     dev_t device = 0;
     ino_t inode = 0;
@@ -44,11 +47,18 @@ std::chrono::nanoseconds durationOf(const timespec& time) {
     return std::chrono::seconds(time.tv_sec) + std::chrono::nanoseconds(time.tv_nsec);
 }
 
-std::expected<FileStatus, Errno> statusOfStateFile() {
+std::expected<FileStatus, Errno> statusOf(const char* path, int flags) {
     struct stat status{};
-    if (::lstat(deviceLockStateFile, &status) != 0)
+    if (::fstatat(AT_FDCWD, path, &status, flags) != 0)
         return std::unexpected(errno);
     return FileStatus{.device = status.st_dev, .inode = status.st_ino, .changed = durationOf(status.st_ctim)};
+}
+
+std::expected<FileStatus, Errno> statusOfStateFile() { return statusOf(deviceLockStateFile, AT_SYMLINK_NOFOLLOW); }
+
+std::expected<FileStatus, Errno> statusOfDirectory() {
+    static Immortal directory([] { return std::string(pathByDeletingLastComponent(deviceLockStateFile)); });
+    return statusOf((*directory).c_str(), 0);
 }
 
 /// Whether nothing that changes now can bear that time any more.
@@ -57,6 +67,15 @@ bool isLongAgo(std::chrono::nanoseconds time) {
     timespec now{};
     ::clock_gettime(CLOCK_REALTIME, &now);
     return durationOf(now) - time > 2 * clockTick;
+}
+
+/// The status of the directory from before it was seen to be without the file, when any file made later must change it.
+std::optional<FileStatus> directoryWithoutStateFile() {
+    const auto directory = statusOfDirectory();
+    if (!directory || !isLongAgo(directory->changed))
+        return std::nullopt;
+    const auto file = statusOfStateFile();
+    return !file && file.error() == ENOENT ? std::optional(*directory) : std::nullopt;
 }
 
 /// Fetches every event that is due. True when one of them concerns the state's file.
@@ -81,9 +100,16 @@ bool drainEvents(int watch) {
 
 std::expected<int, Errno> deviceLockState() {
     thread_local KnownState known;
-    const auto status = statusOfStateFile();
-    if (!status && status.error() == ENOENT)
+    // Many a file system looks for a file that is not there anew each time, which costs far more than this status.
+    thread_local std::optional<FileStatus> withoutFile;
+    if (withoutFile && withoutFile == statusOfDirectory())
         return deviceUnlocked;
+    withoutFile.reset();
+    const auto status = statusOfStateFile();
+    if (!status && status.error() == ENOENT) {
+        withoutFile = directoryWithoutStateFile();
+        return deviceUnlocked;
+    }
     if (status && known.of == *status)
         return known.state;
     const int state = OST_TRY(deviceLockState(std::string()));
