@@ -136,22 +136,32 @@ TEST_F(HostileFrameTest, WhatAUserTakesOfTheMemoryIsBoundedAndGivenBack) {
     if (isSanitized)
         GTEST_SKIP() << "sanitizers keep what is freed";
     const Client user(device().socket(), allowed("com.example.user", 501));
-    expectService("before");
+    const auto lookUp = creation(1, "com.example.unread");
+    EXPECT_EQ(user.connect().call(lookUp).error(), 1U);
     const auto before = residentMemory(device().daemonId());
-    const auto most = [&] {
+    const auto mostOf = [&](int count, const std::string& bytes) {
         std::vector<Connection> connections;
-        std::size_t seen = 0;
-        for (int i = 0; i < 60; ++i) {
+        std::size_t most = 0;
+        while (std::ssize(connections) < count) {
             connections.push_back(user.connect());
-            connections.back().send(header(16 << 20, 1) + std::string(4 << 20, 'x'));
-            seen = std::max(seen, residentMemory(device().daemonId()));
+            connections.back().send(bytes);
+            most = std::max(most, residentMemory(device().daemonId()));
         }
-        return seen;
-    }();
-    EXPECT_LT(most, before + (std::size_t{128} << 20));
-    expectService("meanwhile");
-    EXPECT_TRUE(comesTrue([&] { return residentMemory(device().daemonId()) < before + (std::size_t{16} << 20); }))
-        << before << " bytes before, " << residentMemory(device().daemonId()) << " after";
+        return most;
+    };
+    const struct {
+        const char* what;
+        int connections;
+        std::string bytes;
+        std::size_t megabytes;
+    } kinds[] = {{"frames without an end", 60, header(16 << 20, 1) + std::string(4 << 20, 'x'), 128},
+                 {"replies that nobody reads", 12, repeated(lookUp, 5000), 17}};
+    for (const auto& [what, connections, bytes, megabytes] : kinds) {
+        EXPECT_LT(mostOf(connections, bytes), before + (megabytes << 20)) << what;
+        expectService("meanwhile");
+        EXPECT_TRUE(comesTrue([&] { return residentMemory(device().daemonId()) < before + (std::size_t{16} << 20); }))
+            << what << ": " << before << " bytes before, " << residentMemory(device().daemonId()) << " after";
+    }
 }
 
 TEST_F(HostileFrameTest, AClientThatLeavesCostsNothing) {

@@ -289,6 +289,7 @@ void IPCConnection::_sendOrKeep(std::string frame) {
         _updateDeadline();
         _surroundings.pool.change(_watch, _socket.get(), receptionEvents | EPOLLOUT);
     }
+    frame.shrink_to_fit(); // The encoder has reserved several times as much, which nobody counts.
     const auto size = frame.size();
     _unsent.push_back(std::move(frame));
     _countUnsent(_unsentBytes + size);

@@ -10,6 +10,8 @@ namespace {
 
 /// So much has to come together, because looking for free pages takes as long as some ordinary requests.
 constexpr std::size_t worthReleasing = std::size_t{4} << 20;
+/// When nobody takes anything any more, whole pages are free that one piece has kept before.
+constexpr std::size_t worthReleasingAtTheEnd = std::size_t{1} << 20;
 /// The allocator begins with this size and would raise it with each large piece that is freed.
 constexpr int largePiece = 128 << 10;
 
@@ -21,11 +23,10 @@ IPCMemoryBudget::IPCMemoryBudget(WorkerPool& pool, const IPCLimits& limits) : _p
 }
 
 void IPCMemoryBudget::change(EventSource& connection, uid_t user, std::size_t before, std::size_t after) {
-    if (after < before)
-        _releaseToSystem(before - after);
     if (user == 0 || before == after)
-        return;
+        return _noteReleased(before, after, worthReleasing);
     std::shared_ptr<EventSource> over;
+    bool isTheEnd = false;
     {
         const MutexLock lock(_mutex);
         auto& ofUser = _users[user];
@@ -37,9 +38,11 @@ void IPCMemoryBudget::change(EventSource& connection, uid_t user, std::size_t be
         }
         if (after > before)
             over = _takeOneOver(ofUser);
+        isTheEnd = _bytes == 0;
     }
     if (over)
         _pool.post(over, EventSource::memoryEvent);
+    _noteReleased(before, after, isTheEnd ? worthReleasingAtTheEnd : worthReleasing);
 }
 
 void IPCMemoryBudget::forget(EventSource& connection, uid_t user) {
@@ -68,8 +71,8 @@ std::shared_ptr<EventSource> IPCMemoryBudget::_takeOneOver(User& changed) {
     return connection->shared_from_this();
 }
 
-void IPCMemoryBudget::_releaseToSystem(std::size_t bytes) {
-    if (_unreleased.fetch_add(bytes) + bytes < worthReleasing)
+void IPCMemoryBudget::_noteReleased(std::size_t before, std::size_t after, std::size_t worthReleasingNow) {
+    if (after >= before || _unreleased.fetch_add(before - after) + (before - after) < worthReleasingNow)
         return;
     _unreleased = 0;
     ::malloc_trim(0);

@@ -42,7 +42,7 @@ private:
     };
 
     [[nodiscard]] std::shared_ptr<EventSource> _takeOneOver(User& changed) OST_REQUIRES(_mutex);
-    void _releaseToSystem(std::size_t bytes);
+    void _noteReleased(std::size_t before, std::size_t after, std::size_t worthReleasingNow);
 
     WorkerPool& _pool;
     const IPCLimits& _limits;
