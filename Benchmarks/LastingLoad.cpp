@@ -1,5 +1,5 @@
-// Looks containers up beside a load that lasts, and says how long that takes, what it takes of a quiet daemon, and
-// whether the daemon gives back what the load has taken.
+// Looks containers up beside a load that lasts, and says how long that takes, what it takes of a quiet daemon, how long
+// the echo of another process takes beside the same load, and whether the daemon gives back what the load has taken.
 
 #include "support/LoadedDevice.h"
 #include "support/Workshop.h"
@@ -18,7 +18,7 @@ void printRow(const char* name, const std::vector<double>& quiet, const std::vec
               double percentile) {
     constexpr double microseconds = 1e6;
     const auto alone = percentileOf(quiet, percentile), beside = percentileOf(loaded, percentile);
-    std::printf("look-up, %-15s %9.1f us quiet %9.1f us under load %6.2f times\n", name, alone * microseconds,
+    std::printf("%-24s %9.1f us quiet %9.1f us under load %6.2f times\n", name, alone * microseconds,
                 beside * microseconds, beside / alone);
 }
 
@@ -29,21 +29,24 @@ void printHolding(const char* when, const LoadedDevice::Holding& holding) {
 
 /// Whether the daemon gave everything back.
 bool bear(std::chrono::seconds duration) {
-    constexpr unsigned quietLookUps = 20'000;
+    constexpr unsigned samples = 20'000;
     LoadedDevice device;
-    const auto quiet = device.lookUps(quietLookUps);
+    const auto quiet = device.lookUps(samples), quietEchoes = device.echoes(samples);
     const auto before = device.holding();
     printHolding("before the load", before);
-    std::vector<double> loaded;
+    std::vector<double> loaded, loadedEchoes;
     {
         const LoadedDevice::Load load(device);
         loaded = device.lookUps(duration);
+        loadedEchoes = device.echoes(samples);
         printHolding("under the load", device.holding());
     }
     const bool isBack = device.returnsTo(before);
     printHolding("after the load", device.holding());
-    printRow("median", quiet, loaded, 0.5);
-    printRow("99th percentile", quiet, loaded, 0.99);
+    printRow("look-up, median", quiet, loaded, 0.5);
+    printRow("look-up, 99th percentile", quiet, loaded, 0.99);
+    printRow("echo, median", quietEchoes, loadedEchoes, 0.5);
+    printRow("echo, 99th percentile", quietEchoes, loadedEchoes, 0.99);
     if (!isBack)
         std::printf("the daemon keeps what the load has taken\n");
     return isBack;

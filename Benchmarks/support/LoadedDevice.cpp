@@ -17,6 +17,7 @@
 #include <array>
 #include <cerrno>
 #include <filesystem>
+#include <functional>
 #include <iterator>
 #include <string>
 
@@ -113,33 +114,49 @@ void beHostile(const std::stop_token& end, const std::string& socketPath, uid_t 
 std::filesystem::path placeOfDevice() {
     const rlimit descriptors{.rlim_cur = 4096, .rlim_max = 4096};
     require(::setrlimit(RLIMIT_NOFILE, &descriptors) == 0, "setrlimit");
-    return test::makeScratchDirectory(0711) / "device";
+    return test::makeScratchDirectory(0711);
+}
+
+/// A device's socket, when its daemon has the container that is looked up.
+std::string socketOf(const test::BootedDevice& device) {
+    auto connection = connectTo(device);
+    createContainer(connection, identifier);
+    return device.socket();
+}
+
+/// The seconds of each round trip as long as `goesOn` says of so many, sorted.
+std::vector<double> secondsOfEach(RoundTrips& trips, const std::function<bool(std::size_t done)>& goesOn) {
+    std::vector<double> seconds;
+    while (goesOn(seconds.size()))
+        seconds.push_back(secondsOf([&] { trips.once(); }));
+    std::ranges::sort(seconds);
+    return seconds;
+}
+
+std::vector<double> secondsOfEach(RoundTrips& trips, unsigned count) {
+    return secondsOfEach(trips, [=](std::size_t done) { return done < count; });
 }
 
 } // namespace
 
-LoadedDevice::LoadedDevice() : _device(placeOfDevice()), _lookUp(_device.socket(), requestOf(0)) {
-    auto connection = connectTo(_device);
-    createContainer(connection, identifier);
+LoadedDevice::LoadedDevice() : LoadedDevice(placeOfDevice()) {}
+
+LoadedDevice::LoadedDevice(const std::filesystem::path& directory)
+    : _device(directory / "device"), _lookUp(socketOf(_device), requestOf(0)),
+      _echoServer(directory / "echo", requestOf(0).size(), std::string(_lookUp.once())),
+      _echo(directory / "echo", requestOf(0)) {
     static_cast<void>(lookUps(2000));
+    static_cast<void>(echoes(2000));
 }
 
-std::vector<double> LoadedDevice::lookUps(unsigned count) {
-    return _lookUpsWhile([=](std::size_t done) { return done < count; });
-}
+std::vector<double> LoadedDevice::lookUps(unsigned count) { return secondsOfEach(_lookUp, count); }
 
 std::vector<double> LoadedDevice::lookUps(std::chrono::seconds duration) {
     const auto end = Clock::now() + duration;
-    return _lookUpsWhile([=](std::size_t) { return Clock::now() < end; });
+    return secondsOfEach(_lookUp, [=](std::size_t) { return Clock::now() < end; });
 }
 
-std::vector<double> LoadedDevice::_lookUpsWhile(const std::function<bool(std::size_t done)>& goesOn) {
-    std::vector<double> seconds;
-    while (goesOn(seconds.size()))
-        seconds.push_back(secondsOf([&] { _lookUp.once(); }));
-    std::ranges::sort(seconds);
-    return seconds;
-}
+std::vector<double> LoadedDevice::echoes(unsigned count) { return secondsOfEach(_echo, count); }
 
 LoadedDevice::Holding LoadedDevice::holding() const {
     const std::filesystem::directory_iterator all("/proc/" + std::to_string(_device.daemonId()) + "/fd");

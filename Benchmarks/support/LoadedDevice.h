@@ -2,12 +2,13 @@
 
 #include "Support/BootedDevice.h"
 #include "platform/base/FileDescriptor.h"
+#include "support/EchoServer.h"
 #include "support/RoundTrips.h"
 
 #include <chrono>
 #include <cstddef>
 #include <cstdint>
-#include <functional>
+#include <filesystem>
 #include <thread>
 #include <vector>
 
@@ -22,6 +23,9 @@ public:
     [[nodiscard]] std::vector<double> lookUps(unsigned count);
     /// The same of as many as there is time for.
     [[nodiscard]] std::vector<double> lookUps(std::chrono::seconds duration);
+
+    /// The same of an echo that nobody else asks: what the machine has left for anybody.
+    [[nodiscard]] std::vector<double> echoes(unsigned count);
 
     /// What the daemon has of the system.
     struct Holding {
@@ -44,10 +48,12 @@ public:
     };
 
 private:
-    [[nodiscard]] std::vector<double> _lookUpsWhile(const std::function<bool(std::size_t done)>& goesOn);
+    explicit LoadedDevice(const std::filesystem::path& directory);
 
     test::BootedDevice _device;
     RoundTrips _lookUp;
+    EchoServer _echoServer;
+    RoundTrips _echo;
 };
 
 /// A percentile, between 0 and 1, of sorted samples, of which there are some.

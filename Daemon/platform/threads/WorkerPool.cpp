@@ -25,6 +25,8 @@ namespace {
 constexpr std::size_t stackSize = 512 * 1024;
 /// Room to receive many small requests, or a good part of a large one, with one call.
 constexpr std::size_t scratchSize = 64 * 1024;
+/// What a source that shares turns gets of it, so that its round stays short.
+constexpr std::size_t scratchSizeWithTurns = 4 * 1024;
 /// How often a source whose work does not end is served before others get their turn.
 constexpr unsigned roundsInARow = 4;
 
@@ -367,7 +369,7 @@ void WorkerPool::_run(const std::shared_ptr<EventSource>& source, std::span<char
     bool finished = false;
     for (unsigned round = 0; !finished && round < rounds && !_stopping.load(std::memory_order_relaxed); ++round) {
         const auto events = source->_state.exchange(EventSource::_running) & ~EventSource::_running;
-        source->serve(events, scratch);
+        source->serve(events, turns ? scratch.first(scratchSizeWithTurns) : scratch);
         auto expected = EventSource::_running;
         finished = source->_state.compare_exchange_strong(expected, 0);
     }
