@@ -51,24 +51,23 @@ TEST_F(DeviceLockStateTest, IsTheNumberInItsFile) {
 
 TEST_F(DeviceLockStateTest, ALockIsSeenHoweverOftenThereWasNoFile) {
     const fs::path directory = fs::path(deviceLockStateFile).parent_path(), others = directory.parent_path() / "others";
-    // Longer than what is remembered of a directory has to be old.
+    // Nothing is remembered of a directory that has changed in the last two seconds.
     const auto askWithoutFile = [] {
-        const auto end = std::chrono::steady_clock::now() + std::chrono::milliseconds(100);
-        do
+        const auto end = std::chrono::steady_clock::now() + std::chrono::milliseconds(2100);
+        while (std::chrono::steady_clock::now() < end)
             ASSERT_EQ(deviceLockState(), deviceUnlocked);
-        while (std::chrono::steady_clock::now() < end);
     };
+    fs::create_directory(others);
+    test::writeFile(others / "device-lock-state", "1");
+    askWithoutFile();
+    fs::rename(directory, directory.parent_path() / "former");
+    fs::rename(others, directory);
+    EXPECT_EQ(deviceLockState(), deviceLocked) << "of another directory";
+    fs::remove(deviceLockStateFile);
     askWithoutFile();
     test::writeFile("/new", "1");
     fs::rename("/new", deviceLockStateFile);
     EXPECT_EQ(deviceLockState(), deviceLocked);
-    fs::remove(deviceLockStateFile);
-    askWithoutFile();
-    fs::create_directory(others);
-    test::writeFile(others / "device-lock-state", "1");
-    fs::rename(directory, directory.parent_path() / "former");
-    fs::rename(others, directory);
-    EXPECT_EQ(deviceLockState(), deviceLocked) << "of another directory";
     fs::remove_all(directory);
     EXPECT_EQ(deviceLockState(), deviceUnlocked) << "nor a directory";
 }

@@ -63,10 +63,11 @@ std::expected<FileStatus, Errno> statusOfDirectory() {
 
 /// Whether nothing that changes now can bear that time any more.
 bool isLongAgo(std::chrono::nanoseconds time) {
-    constexpr std::chrono::milliseconds clockTick{10}; // the longest that kernels have
+    constexpr std::chrono::seconds coarsestTime{2}; // in which file systems count
+    constexpr std::chrono::milliseconds clockTick{10};
     timespec now{};
     ::clock_gettime(CLOCK_REALTIME, &now);
-    return durationOf(now) - time > 2 * clockTick;
+    return durationOf(now) - time > coarsestTime + 2 * clockTick;
 }
 
 /// The status of the directory from before it was seen to be without the file, when any file made later must change it.
@@ -113,7 +114,7 @@ std::expected<int, Errno> deviceLockState() {
     if (status && known.of == *status)
         return known.state;
     const int state = OST_TRY(deviceLockState(std::string()));
-    // A later change in the same tick of the file system's clock would bear the same time.
+    // A later change in the same moment of the file system's clock would bear the same time.
     if (status && isLongAgo(status->changed))
         known = {.of = *status, .state = state};
     return state;
