@@ -6,7 +6,9 @@
 #include "platform/base/Path.h"
 
 #include <dirent.h>
+#include <fcntl.h>
 #include <sys/stat.h>
+#include <sys/sysmacros.h>
 
 #include <cerrno>
 
@@ -52,13 +54,16 @@ OSTResult<std::vector<OSTDirectoryItem>> OSTFileManager::urlsForItemsInDirectory
 
 OSTResult<OSTItemIdentity> OSTFileManager::identityOfItemAtURL(std::string_view path) const {
     const auto item = OSTOpenItem(AT_FDCWD, path, O_PATH);
-    struct stat status{};
+    struct statx status{};
     platform::Errno error = item ? platform::Errno(0) : item.error();
-    if (item && ::fstat(item->get(), &status) != 0)
+    if (item && ::statx(item->get(), "", AT_EMPTY_PATH, STATX_INO | STATX_BTIME, &status) != 0)
         error = errno;
     if (error != 0)
         return std::unexpected(OSTCreatePOSIXError(error, "stat of %@ failed: %s", path, error));
-    return OSTItemIdentity{.device = status.st_dev, .inode = status.st_ino};
+    return OSTItemIdentity{.device = ::makedev(status.stx_dev_major, status.stx_dev_minor),
+                           .inode = status.stx_ino,
+                           .made = std::chrono::seconds(status.stx_btime.tv_sec) +
+                                   std::chrono::nanoseconds(status.stx_btime.tv_nsec)};
 }
 
 bool OSTFileManager::itemExistsAtURL(std::string_view path) const {

@@ -7,6 +7,7 @@
 
 #include <sys/types.h>
 
+#include <chrono>
 #include <cstddef>
 #include <cstdint>
 #include <expected>
@@ -47,10 +48,12 @@ struct OSTFileContent {
 /// Where a file is while it is being written: in its own directory, or in the one that holds that.
 enum class OSTWorkshop : bool { ownDirectory, directoryAbove };
 
-/// What an item is whatever its path, as long as it exists.
+/// What an item is whatever its path. A later item that gets its number is told apart by the time at which it was made,
+/// where the file system keeps that.
 struct OSTItemIdentity {
     dev_t device;
     ino_t inode;
+    std::chrono::nanoseconds made;
     friend bool operator==(const OSTItemIdentity&, const OSTItemIdentity&) = default;
 };
 

@@ -118,6 +118,21 @@ int errorOf(const auto& result) { return result ? 0 : static_cast<int>(result.er
 
 std::string messageOf(const auto& result) { return result ? "" : result.error().message().value_or(""); }
 
+TEST_F(OSTFileManagerTest, AnItemIsToldFromALaterOneByWhenItWasMade) {
+    const auto make = [&] {
+        fs::remove(at("item"));
+        fs::create_directory(at("item"));
+        return OSTFileManager::defaultManager().identityOfItemAtURL(at("item")).value();
+    };
+    const auto first = make();
+    EXPECT_EQ(OSTFileManager::defaultManager().identityOfItemAtURL(at("item")), first);
+    auto later = make();
+    for (int attempt = 0; attempt < 100'000 && later.made == first.made; ++attempt) // until the clock of files moves on
+        later = make();
+    later.inode = first.inode;
+    EXPECT_NE(later, first);
+}
+
 TEST_F(OSTFileManagerTest, CreatesDirectoriesWithModeOwnerAndClass) {
     const struct {
         const char* path;
