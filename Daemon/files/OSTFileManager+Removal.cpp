@@ -1,6 +1,7 @@
 #include "files/OSTFileManager.h"
 
 #include "files/OSTPathResolution.h"
+#include "files/OSTSharedWalk.h"
 #include "files/OSTTreeCursor.h"
 #include "platform/base/Log.h"
 
@@ -64,30 +65,45 @@ bool unsetImmutable(const Survivor& item, const char* name, const std::string& p
     return true;
 }
 
+/// Removes what is no directory, as far as one call does it.
+class FilesRemover final : public OSTTreeVisitor {
+public:
+    [[nodiscard]] Next visitItem(const OSTTreeCursor& cursor) override {
+        if (cursor.type() == DT_DIR)
+            return Next::enter;
+        const bool isDirectory = ::unlinkat(cursor.directory(), cursor.name(), 0) != 0 && errno == EISDIR;
+        return isDirectory ? Next::enter : Next::goOn;
+    }
+    [[nodiscard]] Next cannotOpen(const std::string&, platform::Errno) override { return Next::goOn; }
+    [[nodiscard]] Next cannotRead(const std::string&, std::uint64_t, platform::Errno) override { return Next::goOn; }
+};
+
 /// The removal of one tree, which goes on after an item that cannot be removed.
 class Removal {
 public:
-    /// Removes the item at `place`. Fails when nothing could be tried.
-    [[nodiscard]] std::expected<void, platform::Errno> remove(const OSTItemPlace& place, const std::string& path) {
-        auto top = OSTOpenSubdirectory(place.directory(), place.name());
+    Removal(const OSTItemPlace& place, const std::string& path) : _place(place), _path(path) {}
+
+    /// Fails when nothing could be tried.
+    [[nodiscard]] std::expected<void, platform::Errno> run() {
+        auto top = _openTop();
         if (!top && !isNoDirectory(top.error()))
             return std::unexpected(top.error());
         const bool isDirectory = top.has_value();
         for (int fillings = 0; isDirectory; ++fillings) {
             if (!top)
                 return std::unexpected(top.error());
-            OST_TRY(_removeContent(*std::move(top), path));
+            OST_TRY(_removeContent(*std::move(top)));
             if (_firstError != 0 || fillings == mostFillings)
                 break;
-            if (::unlinkat(place.directory(), place.name(), AT_REMOVEDIR) == 0)
+            if (::unlinkat(_place.directory(), _place.name(), AT_REMOVEDIR) == 0)
                 return {};
             if (errno != ENOTEMPTY)
                 break;
-            top = OSTOpenSubdirectory(place.directory(), place.name());
+            top = _openTop();
         }
-        _unlink({.directory = place.directory(),
-                 .name = place.name(),
-                 .path = path,
+        _unlink({.directory = _place.directory(),
+                 .name = _place.name(),
+                 .path = _path,
                  .unlinkFlags = isDirectory ? AT_REMOVEDIR : 0,
                  .liesInTree = false});
         return {};
@@ -101,10 +117,17 @@ private:
     /// item.
     static constexpr int mostFillings = 4;
 
+    /// From so many items on, a second reading of the tree costs less than a second thread saves.
+    static constexpr std::uint64_t itemsOfLargeTree = 1024;
+
     static bool isNoDirectory(int error) { return error == ENOTDIR || error == ELOOP; }
 
-    [[nodiscard]] std::expected<void, platform::Errno> _removeContent(FileDescriptor top, const std::string& path) {
-        OSTTreeCursor cursor(std::move(top), path);
+    [[nodiscard]] std::expected<FileDescriptor, platform::Errno> _openTop() const {
+        return OSTOpenSubdirectory(_place.directory(), _place.name());
+    }
+
+    [[nodiscard]] std::expected<void, platform::Errno> _removeContent(FileDescriptor top) {
+        OSTTreeCursor cursor(std::move(top), _path);
         for (;;) {
             const auto found = cursor.next();
             if (found && *found) {
@@ -122,6 +145,8 @@ private:
 
     /// Enters the current item when it is a directory, else removes it.
     void _removeItem(OSTTreeCursor& cursor) {
+        if (++_items == itemsOfLargeTree)
+            _removeFilesByTwo();
         if (cursor.type() == DT_DIR || cursor.type() == DT_UNKNOWN) {
             const auto entered = cursor.enter();
             if (entered)
@@ -130,6 +155,13 @@ private:
                 return _record(entered.error(), cursor.path());
         }
         _unlinkItem(cursor, 0);
+    }
+
+    /// The directories are left, and what needs more than one call.
+    void _removeFilesByTwo() const {
+        FilesRemover remover;
+        if (auto top = _openTop())
+            OSTWalkShared(*std::move(top), _path, remover);
     }
 
     void _unlinkItem(const OSTTreeCursor& cursor, int flags) {
@@ -180,20 +212,28 @@ private:
             _firstError = error;
     }
 
+    const OSTItemPlace& _place;
+    const std::string& _path;
+    std::uint64_t _items = 0;
     platform::Errno _firstError = 0;
 };
+
+/// Answers the errno of what could not be removed, or 0.
+platform::Errno removeTree(const std::string& path) {
+    const auto place = OSTItemPlace::find(path);
+    if (!place)
+        return place.error() == ENOENT ? platform::Errno(0) : place.error();
+    Removal removal(*place, path);
+    const auto removed = removal.run();
+    return removed || removed.error() == ENOENT ? removal.firstError() : removed.error();
+}
 
 } // namespace
 
 OSTResult<void> OSTFileManager::removeItemAtURL(std::string_view path) const {
     if (path.empty())
         return std::unexpected(OSTCreatePOSIXError(EFAULT, "nil url passed to -removeItemAtURL:error:"));
-    Removal removal;
-    const auto place = OSTItemPlace::find(path);
-    const auto removed = place ? removal.remove(*place, std::string(path))
-                               : std::expected<void, platform::Errno>(std::unexpected(place.error()));
-    const platform::Errno error = removed || removed.error() == ENOENT ? removal.firstError() : removed.error();
-    if (error != 0)
+    if (const auto error = removeTree(std::string(path)); error != 0)
         return std::unexpected(OSTCreatePOSIXError(error, "sweeptree of %@ failed: %s", path, error));
     return {};
 }

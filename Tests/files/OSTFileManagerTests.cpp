@@ -229,7 +229,14 @@ TEST_F(OSTFileManagerTest, RemovesATreeDeeperThanPathsAndDescriptorsReach) {
     EXPECT_FALSE(fs::exists(at("deep")));
 }
 
+/// Files of which a tree is large enough to be removed by two threads.
+void fill(const std::string& directory) {
+    for (int number = 0; number < 2000; ++number)
+        writeFile(directory + "/" + std::to_string(number), "");
+}
+
 TEST_F(OSTFileManagerTest, RemovalClearsImmutableFlagsInTheWay) {
+    fill(at("tree/many"));
     writeFile(at("tree/immutable"), "x");
     writeFile(at("tree/directory/file"), "x");
     writeFile(at("tree/both/immutable"), "x");
@@ -258,8 +265,8 @@ TEST_F(OSTFileManagerTest, RemovalClearsImmutableFlagsInTheWay) {
 }
 
 TEST_F(OSTFileManagerTest, RemovalStopsAtMountPointsAndGoesOn) {
-    writeFile(at("tree/a/file"), "x");
-    writeFile(at("tree/z/file"), "x");
+    fill(at("tree/a"));
+    fill(at("tree/z"));
     const Mount mount(at("tree/m/mounted"));
     if (!mount)
         GTEST_SKIP() << "Nothing can be mounted here";
