@@ -210,9 +210,11 @@ int LaunchedProcess::waitForEnd() {
     }
 }
 
-/// What comes from a terminal is for the whole job, what comes from a process for the program alone.
+/// What comes from a terminal is for the whole job, what comes from a process for the program alone. A shell is a
+/// process, too, when it continues what its terminal has stopped.
 void LaunchedProcess::_forward(const siginfo_t& signal) const {
-    const pid_t receiver = signal.si_code == SI_KERNEL ? -_id : _id;
+    const bool isForAll = signal.si_code == SI_KERNEL || signal.si_signo == SIGCONT;
+    const pid_t receiver = isForAll ? -_id : _id;
     const bool isStop = signal.si_signo == SIGTSTP;
     // The child's group has nobody who could continue it, so the softer signal would do nothing.
     ::kill(receiver, isStop ? SIGSTOP : signal.si_signo);

@@ -235,6 +235,15 @@ TEST_F(RunTest, SignalsAreForTheProgramAndItsEndIsTold) {
     EXPECT_EQ(launcher.wait(), 42);
 }
 
+TEST_F(RunTest, WhatAProgramHasStartedIsContinuedWithIt) {
+    const auto* const line = "sh -c 'kill -STOP $$; exit 7' & "
+                             "until grep -q 'State:.T' /proc/$!/status; do :; done; echo stopped; wait $!";
+    ChildProcess launcher(commandLine({"--identifier", app, "--", "/bin/sh", "-c", line}), scratch / "errors");
+    ASSERT_EQ(launcher.readLine(), "stopped") << readFile(scratch / "errors");
+    launcher.signal(SIGCONT);
+    EXPECT_EQ(launcher.wait(), 7);
+}
+
 TEST_F(RunTest, ARecordThatAKilledLauncherLeavesIsToldAndRemoved) {
     pid_t program = 0;
     {
