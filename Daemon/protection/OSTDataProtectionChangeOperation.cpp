@@ -2,10 +2,12 @@
 
 #include "model/OSTFailureReport.h"
 #include "platform/base/Log.h"
+#include "platform/base/Path.h"
 #include "platform/device/DeviceLockState.h"
 #include "platform/threads/BlockingSection.h"
 #include "protection/OSTDataProtectionPass.h"
 #include "protection/OSTLockStateQueue.h"
+#include "store/OSTContainerCache.h"
 
 #include <cerrno>
 #include <utility>
@@ -31,6 +33,11 @@ OSTDataProtectionChangeOperation::withChange(OSTDataProtectionChange change) {
 
 OSTDataProtectionChangeOperation::OSTDataProtectionChangeOperation(OSTDataProtectionChange change)
     : _change(std::move(change)), _directory(identityOf(*_change.dataContainerMetadata)) {}
+
+bool OSTDataProtectionChangeOperation::containerIsAnother() const {
+    const auto found = OSTContainerCache::sharedInstance().containerForUser(_change.dataContainerMetadata->name());
+    return found && _directory && identityOf(**found) != _directory;
+}
 
 void OSTDataProtectionChangeOperation::performChangeOperation() {
     const auto& metadata = *_change.dataContainerMetadata;
@@ -60,9 +67,10 @@ OSTDataProtectionChangeOperation::_runChangeOperationNeedToRetry() const {
     return OSTGuarded([&]() -> OSTResult<LockedError> {
         const platform::BlockingSection blocking;
         auto lockedError = OST_TRY(_changeItems());
-        // The class is recorded next, and what is recorded has happened.
+        // The class is recorded next, and what is recorded has happened. The container itself may have moved by now.
         if (!lockedError)
-            OST_TRY(OSTFileManager::defaultManager().makeFileSystemDurable(_change.dataContainerMetadata->url));
+            OST_TRY(OSTFileManager::defaultManager().makeFileSystemDurable(
+                platform::pathByDeletingLastComponent(_change.dataContainerMetadata->url)));
         return lockedError;
     });
 }

@@ -22,6 +22,9 @@ public:
 
     [[nodiscard]] const OSTDataProtectionChange& change() const { return _change; }
 
+    /// Whether the container was wiped since: another directory has its UUID and path then. The caller holds its lock.
+    [[nodiscard]] bool containerIsAnother() const;
+
     /// Is run once, just before the first retry.
     void setRetryStartBlock(std::move_only_function<void()> block) { _retryStartBlock = std::move(block); }
     /// Is run once, when the change has ended; `error` is null when it succeeded.

@@ -6,6 +6,7 @@
 #include "protection/OSTDataProtectionChangeOperation.h"
 #include "store/OSTClientConnection.h"
 #include "store/OSTContainerCache.h"
+#include "store/OSTLocks.h"
 
 #include <memory>
 #include <string>
@@ -88,10 +89,15 @@ private:
 constexpr const char* entryFunction = "setDataProtectionOnDataContainerForUser";
 
 /// Writes down the class that the container has now. What it was is no failure of the change, which has happened.
-void recordClass(const OSTMetadata& metadata, std::int32_t newClass) {
-    const auto recorded = OSTClientConnection::sharedClientConnection().setInfoValue(
-        OSTValue(static_cast<std::int64_t>(newClass)), OSTContentProtectionClassKey,
-        {.name = metadata.name(), .uuid = metadata.uuid});
+void recordClass(const OSTDataProtectionChangeOperation& operation) {
+    const auto& metadata = *operation.change().dataContainerMetadata;
+    const auto newClass = operation.change().newDataProtectionClass;
+    const OSTIdentifierLock lock({metadata.uuid.string()}, OSTLockKind::writing);
+    const auto recorded = operation.containerIsAnother()
+                              ? std::unexpected(OSTErrorCode::unexpectedPath)
+                              : OSTClientConnection::sharedClientConnection().setInfoValue(
+                                    OSTValue(static_cast<std::int64_t>(newClass)), OSTContentProtectionClassKey,
+                                    {.name = metadata.name(), .uuid = metadata.uuid}, OSTUseLocking::no);
     if (!recorded)
         platform::logAs(platform::LogLevel::error, entryFunction,
                         "Failed to set protection class info for %@ at %@ to %d : %llu", metadata.identifier,
@@ -111,7 +117,7 @@ void finish(const OSTDataProtectionChangeOperation& operation, SharedAssertion& 
                         "Unexpectedly got completion block called with wasLocked");
     assertion.invalidate();
     if (!error && !wasLocked)
-        recordClass(*metadata, newClass);
+        recordClass(operation);
 }
 
 } // namespace

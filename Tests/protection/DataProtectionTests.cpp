@@ -5,6 +5,7 @@
 #include "platform/threads/Transactions.h"
 #include "protection/OSTDataProtectionManager.h"
 #include "protection/OSTLockStateQueue.h"
+#include "store/OSTLocks.h"
 #include "support/StoreTest.h"
 
 #include <gtest/gtest.h>
@@ -23,6 +24,7 @@
 #include <initializer_list>
 #include <map>
 #include <memory>
+#include <thread>
 
 namespace ost {
 namespace {
@@ -230,6 +232,22 @@ TEST_F(DataProtection, AParkedChangeIsCancelledWhenTheContainerIsAnotherOne) {
     };
     EXPECT_EQ(codeAfter(wipe), 10);
     EXPECT_EQ(codeAfter([&] { ASSERT_TRUE(store().deleteContainerForUser(container->name())); }), 21);
+}
+
+TEST_F(DataProtection, AContainerThatIsWipedWhenItWasChangedHasNoClassOnRecord) {
+    const auto last = url / "Quibbet", aside = fs::path("/aside");
+    fs::create_directory(last);
+    std::future<int> code;
+    {
+        const OSTIdentifierLock beforeTheRecord({container->uuid.string()}, OSTLockKind::reading);
+        code = std::async(std::launch::async, [&] { return change(1); });
+        while (recorded(last) != "1")
+            std::this_thread::yield();
+        fs::rename(url, aside);
+        fs::copy(aside, url, fs::copy_options::recursive);
+    }
+    EXPECT_EQ(code.get(), 1);
+    EXPECT_EQ(recordedClass(), "-");
 }
 
 TEST_F(DataProtection, AnItemThatMayNotBeChangedEndsTheChange) {
