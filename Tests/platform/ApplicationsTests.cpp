@@ -4,6 +4,7 @@
 
 #include <gtest/gtest.h>
 
+#include <sys/resource.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -95,6 +96,21 @@ TEST_F(Applications, AStaleRecordIsToldFromALiveOneAndRemoved) {
     EXPECT_FALSE(fs::exists(entry(number)));
     EXPECT_FALSE(fs::exists(entry(std::to_string(reused.pid()))));
     EXPECT_EQ(2U, processes().size());
+}
+
+TEST_F(Applications, WhoIsKilledWhileWritingARecordLeavesNone) {
+    const Process launched;
+    const Process launcher([&] {
+        const rlimit nothing{0, 0};
+        ::setrlimit(RLIMIT_FSIZE, &nothing); // Writing is deadly.
+        [[maybe_unused]] const auto record = registerApplication(app, launched.instance());
+    });
+    siginfo_t ended{};
+    ASSERT_EQ(0, ::waitid(P_PID, static_cast<id_t>(launcher.pid()), &ended, WEXITED | WNOWAIT));
+    ASSERT_EQ(SIGXFSZ, ended.si_status);
+    EXPECT_EQ(Processes{}, processes()) << "whatever gets its number later is no application";
+    EXPECT_TRUE(registerApplication(app, launched.instance()));
+    EXPECT_EQ("", test::tree(applicationsDirectory));
 }
 
 TEST_F(Applications, IsOneUntilItsLastThreadEnds) {

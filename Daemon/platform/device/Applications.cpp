@@ -21,6 +21,8 @@ namespace {
 
 constexpr std::size_t recordLimit = 4096; // far above a reason and two numbers
 constexpr int directoryFlags = O_RDONLY | O_DIRECTORY;
+/// Of a launcher that was killed, until the next takes its place: one at a time registers in a directory.
+constexpr const char* unfinishedApplication = ".unfinished";
 
 /// The content of a record; absent when the record has gone meanwhile.
 std::expected<std::optional<std::string>, Errno> contentOf(const FileDescriptor& directory, const std::string& name) {
@@ -32,16 +34,20 @@ std::expected<std::optional<std::string>, Errno> contentOf(const FileDescriptor&
     return std::unexpected(content.error());
 }
 
-std::expected<void, Errno> makeRecord(const FileDescriptor& directory, const std::string& name, std::string_view text) {
+/// The record appears with its text: half of one would not tell of which process it is. `unfinished` is its name until
+/// then.
+std::expected<void, Errno> makeRecord(const FileDescriptor& directory, const std::string& name, std::string_view text,
+                                      const std::string& unfinished) {
     const FileDescriptor file(
-        ::openat(directory.get(), name.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_CLOEXEC, 0644));
+        ::openat(directory.get(), unfinished.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_CLOEXEC, 0644));
     if (!file)
         return std::unexpected(errno);
     const auto written = ::write(file.get(), text.data(), text.size());
-    if (written == static_cast<ssize_t>(text.size()))
+    const bool isWhole = written == static_cast<ssize_t>(text.size());
+    if (isWhole && ::renameat(directory.get(), unfinished.c_str(), directory.get(), name.c_str()) == 0)
         return {};
-    const int error = written < 0 ? errno : ENOSPC;
-    ::unlinkat(directory.get(), name.c_str(), 0);
+    const int error = isWhole || written < 0 ? errno : ENOSPC;
+    ::unlinkat(directory.get(), unfinished.c_str(), 0);
     return std::unexpected(error);
 }
 
@@ -166,7 +172,7 @@ std::expected<ApplicationRecord, Errno> registerApplication(std::string_view ide
         if (::flock(directory.get(), LOCK_EX) != 0)
             return std::unexpected(errno);
         removeStale(directory, processOfRecord);
-        auto made = makeRecord(directory, name, std::to_string(process.startTime));
+        auto made = makeRecord(directory, name, std::to_string(process.startTime), unfinishedApplication);
         ::flock(directory.get(), LOCK_UN);
         return made;
     };
@@ -194,14 +200,7 @@ std::expected<ApplicationRecord, Errno> recordTerminationAssertion(std::string_v
     const auto text = std::string(reason) + "\n" + number + " " + start + "\n";
     const auto make = [&](const FileDescriptor& directory) -> std::expected<void, Errno> {
         removeStale(directory, assertionOfRecord);
-        // Half a record would be one of which the holder cannot be told.
-        const auto unfinished = "." + name;
-        OST_TRY(makeRecord(directory, unfinished, text));
-        if (::renameat(directory.get(), unfinished.c_str(), directory.get(), name.c_str()) == 0)
-            return {};
-        const int error = errno;
-        ::unlinkat(directory.get(), unfinished.c_str(), 0);
-        return std::unexpected(error);
+        return makeRecord(directory, name, text, "." + name);
     };
     return ApplicationRecords(assertionsDirectory, identifier, image).add(name, make);
 }

@@ -21,8 +21,8 @@ namespace ost::platform {
 /// Threads: any. `image` is the device's directory as this process sees it. Fails with an errno: ENAMETOOLONG for an
 /// identifier too long for a file name, EINVAL for an empty one.
 
-/// `PID` in an identifier's directory, with the start time of that process in it, or empty as long as it is being
-/// written.
+/// `PID` in an identifier's directory, with the start time of that process in it; an empty one stands for whatever
+/// process has the number.
 inline constexpr const char* applicationsDirectory = "/private/var/run/applications";
 /// One file for each assertion, whatever its name: a line with the reason, a line with number and start time of the
 /// process that holds it. Names with a leading dot are not finished.
