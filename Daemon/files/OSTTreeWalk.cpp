@@ -132,6 +132,8 @@ bool OSTWalkTree(std::string_view path, const std::function<bool(const OSTTreeEn
     const auto item = place ? statusOf(place->directory(), place->name()) : std::unexpected(place.error());
     if (!item)
         return visitTop(Visit::failure, {}, item.error());
+    if (item->isMountPoint)
+        return true;
     if (!S_ISDIR(item->status.mode))
         return visitTop(Visit::item, item->status);
     if (!visitTop(Visit::directoryBefore, item->status))

@@ -175,14 +175,16 @@ TEST_F(DataProtection, TouchesNothingButTheDataItems) {
     ASSERT_EQ(::mkfifo((url / "Documents/fifo").c_str(), 0666), 0);
     test::writeFile(url / "Documents/twice", "");
     fs::create_hard_link(url / "Documents/twice", url / "tmp/again");
-    fs::create_directory(url / "tmp/mount");
-    mountOver(url / "tmp/mount");
-    test::writeFile(url / "tmp/mount/file", "");
+    for (const auto* const name : {"tmp/mount", "Quibbet"}) {
+        fs::create_directory(url / name);
+        mountOver(url / name);
+        test::writeFile(url / name / "file", "");
+    }
 
     EXPECT_EQ(change(1), 1);
-    for (const fs::path& item :
-         {fs::path("/victim"), fs::path("/victim/file"), fs::path("/private/var/mobile/file"), url / "Other",
-          url / "Other/file", url / "Documents/fifo", url / "tmp/mount", url / "tmp/mount/file", url / "Library"})
+    for (const fs::path& item : {fs::path("/victim"), fs::path("/victim/file"), fs::path("/private/var/mobile/file"),
+                                 url / "Other", url / "Other/file", url / "Documents/fifo", url / "tmp/mount",
+                                 url / "tmp/mount/file", url / "Quibbet", url / "Quibbet/file", url / "Library"})
         EXPECT_EQ(recorded(item), "-") << item;
     EXPECT_EQ(recorded(url), "0") << "the container itself";
     EXPECT_EQ(recorded(url / OSTMetadataFileName), "4");
