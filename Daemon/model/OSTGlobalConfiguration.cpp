@@ -1,14 +1,18 @@
 #include "model/OSTGlobalConfiguration.h"
 
+#include "files/OSTPathResolution.h"
 #include "model/OSTLayoutDirectory.h"
 #include "platform/base/Immortal.h"
 #include "platform/base/Log.h"
 #include "platform/base/Path.h"
 #include "platform/device/Accounts.h"
 
+#include <fcntl.h>
+
 #include <cerrno>
 #include <climits>
 #include <cstdlib>
+#include <utility>
 
 namespace ost {
 
@@ -27,6 +31,8 @@ std::string canonical(const char* path) {
 }
 
 constexpr std::string_view cachesName = "Library/Caches/com.tamarok.ostrandd";
+constexpr std::string_view libraryName = "Library/Ostrand";
+constexpr std::string_view replaceName = "Replace";
 constexpr std::string_view transientName = "Temp";
 
 /// Whether `base` holds class directories of real users. Fails with the errno of reading the accounts.
@@ -85,32 +91,42 @@ std::string OSTGlobalConfiguration::cachesDirectory() {
 
 std::string OSTGlobalConfiguration::libraryDirectory() {
     const platform::BasicMutexLock lock(_mutex);
-    return OSTMakeLayoutDirectory(pathByAppending(_homeDirectory, "Library/Ostrand"), unprotected,
+    return OSTMakeLayoutDirectory(pathByAppending(_homeDirectory, libraryName), unprotected,
                                   "Failed to create library dir at \"%@\": %@");
 }
 
 std::string OSTGlobalConfiguration::transientDirectory() {
-    const platform::BasicMutexLock lock(_mutex);
-    return OSTMakeLayoutDirectory(pathByAppending(cachesDirectory(), transientName), withIntermediates,
-                                  "Failed to create transient dir at \"%@\": %@");
+    return _directoryIn(cachesName, &OSTGlobalConfiguration::cachesDirectory, transientName,
+                        "Failed to create transient dir at \"%@\": %@");
 }
 
 std::string OSTGlobalConfiguration::stagingDirectory() {
-    const platform::BasicMutexLock lock(_mutex);
-    return OSTMakeLayoutDirectory(pathByAppending(cachesDirectory(), "Staging"), withIntermediates,
-                                  "Failed to create staging dir at \"%@\": %@");
+    return _directoryIn(cachesName, &OSTGlobalConfiguration::cachesDirectory, "Staging",
+                        "Failed to create staging dir at \"%@\": %@");
 }
 
 std::string OSTGlobalConfiguration::deathrowDirectory() {
-    const platform::BasicMutexLock lock(_mutex);
-    return OSTMakeLayoutDirectory(pathByAppending(cachesDirectory(), "Dead"), withIntermediates,
-                                  "Failed to create deathrow dir at \"%@\": %@");
+    return _directoryIn(cachesName, &OSTGlobalConfiguration::cachesDirectory, "Dead",
+                        "Failed to create deathrow dir at \"%@\": %@");
 }
 
 std::string OSTGlobalConfiguration::replaceDirectory() {
+    return _directoryIn(libraryName, &OSTGlobalConfiguration::libraryDirectory, replaceName,
+                        "Failed to create replace dir at \"%@\": %@");
+}
+
+std::string OSTGlobalConfiguration::replaceDirectoryPath() const {
+    return pathByAppending(pathByAppending(_homeDirectory, libraryName), replaceName);
+}
+
+std::string OSTGlobalConfiguration::_directoryIn(std::string_view parent, Accessor makeParent, std::string_view name,
+                                                 platform::Message<std::string, OSTError> failure) {
     const platform::BasicMutexLock lock(_mutex);
-    return OSTMakeLayoutDirectory(pathByAppending(libraryDirectory(), "Replace"), withIntermediates,
-                                  "Failed to create replace dir at \"%@\": %@");
+    auto path = pathByAppending(pathByAppending(_homeDirectory, parent), name);
+    if (OSTOpenItem(AT_FDCWD, path, O_PATH | O_DIRECTORY))
+        return path;
+    (this->*makeParent)();
+    return OSTMakeLayoutDirectory(std::move(path), withIntermediates, failure);
 }
 
 std::string OSTGlobalConfiguration::bundleDirectory() {

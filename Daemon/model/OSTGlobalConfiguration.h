@@ -38,6 +38,8 @@ public:
     /// What waits to be destroyed.
     [[nodiscard]] std::string deathrowDirectory();
     [[nodiscard]] std::string replaceDirectory();
+    /// The same without making it.
+    [[nodiscard]] std::string replaceDirectoryPath() const;
     [[nodiscard]] std::string bundleDirectory();
     /// Transient containers of the bundle classes, inside the installer's home.
     [[nodiscard]] std::string transientBundleDirectory();
@@ -64,7 +66,14 @@ public:
     [[nodiscard]] bool migrationFileExistsWithName(std::string_view name);
 
 private:
+    using Accessor = std::string (OSTGlobalConfiguration::*)();
+
     OSTGlobalConfiguration();
+
+    /// Makes the directory `name` in the home directory's `parent`. The parent is made with the rest only when the
+    /// directory is missing, since one that is there has its parent.
+    [[nodiscard]] std::string _directoryIn(std::string_view parent, Accessor makeParent, std::string_view name,
+                                           platform::Message<std::string, OSTError> failure);
 
     // Constant after construction. Roots of the layout are made canonical here, once; no path below them may pass a
     // link.

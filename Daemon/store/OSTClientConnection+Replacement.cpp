@@ -373,7 +373,7 @@ OSTResult<void> OSTClientConnection::_settleReplacementsAt(std::string_view plac
 
 OSTResult<void> OSTClientConnection::_discardReplaceFilesOf(std::string_view place) const {
     const auto& files = OSTFileManager::defaultManager();
-    const auto directory = OSTGlobalConfiguration::sharedInstance().replaceDirectory();
+    const auto directory = OSTGlobalConfiguration::sharedInstance().replaceDirectoryPath();
     const auto items = files.urlsForItemsInDirectoryAtURL(directory);
     if (!items && !platform::isAbsence(items.error()))
         return std::unexpected(OSTCreateError(OSTErrorCode::replaceFileInvalid, items.error(),
