@@ -1,7 +1,9 @@
 #include "protection/OSTDataProtectionChangeOperation.h"
 
 #include "model/OSTFailureReport.h"
+#include "platform/base/Immortal.h"
 #include "platform/base/Log.h"
+#include "platform/base/Mutex.h"
 #include "platform/base/Path.h"
 #include "platform/device/DeviceLockState.h"
 #include "platform/threads/BlockingSection.h"
@@ -10,11 +12,48 @@
 #include "store/OSTContainerCache.h"
 
 #include <cerrno>
+#include <set>
 #include <utility>
 
 namespace ost {
 
 namespace {
+
+/// A container's turn to be changed, until its class is on record. Of two changes side by side the record would be that
+/// of one, and some of the items those of the other.
+class ChangeTurn {
+public:
+    explicit ChangeTurn(const platform::UUID& container) : _container(container) {
+        auto& turns = _turns();
+        platform::MutexLock lock(turns.mutex);
+        const auto take = [&]() OST_REQUIRES(turns.mutex) { return turns.taken.insert(container).second; };
+        if (take())
+            return;
+        const platform::BlockingSection blocking;
+        turns.givenBack.wait(lock, take);
+    }
+    ChangeTurn(const ChangeTurn&) = delete;
+    ChangeTurn& operator=(const ChangeTurn&) = delete;
+    ~ChangeTurn() {
+        auto& turns = _turns();
+        const platform::MutexLock lock(turns.mutex);
+        turns.taken.erase(_container);
+        turns.givenBack.notifyAll();
+    }
+
+private:
+    struct Turns {
+        platform::Mutex mutex;
+        platform::Condition givenBack;
+        std::set<platform::UUID> taken OST_GUARDED_BY(mutex);
+    };
+    static Turns& _turns() {
+        static platform::Immortal turns([] { return Turns(); });
+        return *turns;
+    }
+
+    const platform::UUID _container;
+};
 
 /// No device is locked and unlocked again that often, each time at the wrong moment.
 constexpr unsigned mostPasses = 50;
@@ -41,6 +80,7 @@ bool OSTDataProtectionChangeOperation::containerIsAnother() const {
 
 void OSTDataProtectionChangeOperation::performChangeOperation() {
     const auto& metadata = *_change.dataContainerMetadata;
+    const ChangeTurn turn(metadata.uuid);
     const auto pass = _runChangeOperationNeedToRetry();
     if (!pass) {
         platform::logNotice("Operation to update protection classes for user: %u, id: %@, containerClass: %llu to "

@@ -32,7 +32,8 @@ public:
         _completionBlock = std::move(block);
     }
 
-    /// Runs a pass, and so on until the change has ended or is parked.
+    /// Runs a pass, and so on until the change has ended or is parked. Waits for another change of the container that
+    /// is being made.
     void performChangeOperation();
 
 private:

@@ -16,6 +16,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <chrono>
 #include <cstring>
@@ -234,6 +235,22 @@ TEST_F(DataProtection, AParkedChangeIsCancelledWhenTheContainerIsAnotherOne) {
     };
     EXPECT_EQ(codeAfter(wipe), 10);
     EXPECT_EQ(codeAfter([&] { ASSERT_TRUE(store().deleteContainerForUser(container->name())); }), 21);
+}
+
+TEST_F(DataProtection, OfTwoChangesAtTheSameTimeOneHasTheItemsAndTheRecord) {
+    for (int directory = 0; directory < 50; ++directory)
+        fs::create_directory(url / "Documents" / std::to_string(directory));
+    const auto has = [&](const std::string& protectionClass) {
+        return std::ranges::all_of(fs::directory_iterator(url / "Documents"),
+                                   [&](const fs::path& item) { return recorded(item) == protectionClass; });
+    };
+    for (int round = 0; round < 20 && !HasFailure(); ++round) {
+        auto other = std::async(std::launch::async, [&] { return change(4); });
+        EXPECT_EQ(change(1), 1);
+        EXPECT_EQ(other.get(), 1);
+        EXPECT_TRUE(has(recordedClass())) << recordedClass();
+        EXPECT_EQ(change(0), 1);
+    }
 }
 
 TEST_F(DataProtection, AContainerThatIsWipedWhenItWasChangedHasNoClassOnRecord) {
