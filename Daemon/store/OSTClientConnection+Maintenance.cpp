@@ -109,19 +109,30 @@ OSTClientConnection::diskUsageForUserId(const OSTContainerReference& container) 
                      name.containerClass);
             return std::unexpected(OSTErrorCode::invalidObject);
         }
-        const auto [url, known] = OST_TRY(_placeAndKnownUsage(container));
-        if (known)
-            return *known;
+        auto found = OST_TRY(_placeAndKnownUsage(container));
+        if (found.usage)
+            return *found.usage;
         // Measuring takes as long as the tree is large. It goes by descriptors, so it needs no lock, which would keep
         // every creation waiting.
         const platform::BlockingSection blocking;
-        const auto bytes = OSTFileManager::defaultManager().diskUsageForURL(url);
+        found.usage = OSTFileManager::defaultManager().diskUsageForURL(found.url);
         if (isBundleClass(name.containerClass))
-            if (const auto set = setInfoValue(OSTValue(bytes), staticDiskUsageKey, container); !set)
-                logError("Error setting info value for userId: %u, identifier: %@, Class: %llu: %llu", name.userId,
-                         name.identifier, name.containerClass, set.error());
-        return bytes;
+            _keepUsage(container, found);
+        return *found.usage;
     });
+}
+
+void OSTClientConnection::_keepUsage(const OSTContainerReference& container, const PlaceAndUsage& measured) const {
+    const auto& [name, uuid] = container;
+    const OSTIdentifierLock lock({uuid->string()}, OSTLockKind::writing);
+    // A container that has replaced the measured one may have its place and UUID.
+    const auto directory = OSTFileManager::defaultManager().identityOfItemAtURL(measured.url);
+    if (!directory || *directory != measured.directory)
+        return;
+    const auto set = setInfoValue(OSTValue(*measured.usage), staticDiskUsageKey, container, OSTUseLocking::no);
+    if (!set)
+        logError("Error setting info value for userId: %u, identifier: %@, Class: %llu: %llu", name.userId,
+                 name.identifier, name.containerClass, set.error());
 }
 
 std::expected<OSTClientConnection::PlaceAndUsage, OSTErrorCode>
@@ -144,6 +155,10 @@ OSTClientConnection::_placeAndKnownUsage(const OSTContainerReference& container)
     else if (!value && value.error() != OSTErrorCode::noInfoValue)
         logError("Error looking up info value for userId: %u, identifier: %@, Class: %llu: %llu", name.userId,
                  name.identifier, name.containerClass, value.error());
+    if (found.usage)
+        return found;
+    if (const auto directory = OSTFileManager::defaultManager().identityOfItemAtURL(record->url))
+        found.directory = *directory;
     return found;
 }
 

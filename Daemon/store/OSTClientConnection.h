@@ -1,5 +1,6 @@
 #pragma once
 
+#include "files/OSTFileManager.h"
 #include "model/OSTContainerName.h"
 #include "model/OSTMetadata.h"
 #include "platform/base/OSTError.h"
@@ -276,11 +277,13 @@ private:
     // +Maintenance
     struct PlaceAndUsage {
         std::string url;
+        std::optional<OSTItemIdentity> directory = std::nullopt; ///< a bundle's
         std::optional<std::uint64_t> usage = std::nullopt;
     };
     [[nodiscard]] std::expected<void, OSTErrorCode> _checkWipe(const OSTContainerName& name) const;
     [[nodiscard]] std::expected<PlaceAndUsage, OSTErrorCode>
     _placeAndKnownUsage(const OSTContainerReference& container) const;
+    void _keepUsage(const OSTContainerReference& container, const PlaceAndUsage& measured) const;
 
     // +Reboot
     [[nodiscard]] OSTResult<void> _moveTransientDirectoryToDeathRow(const std::string& url) const;

@@ -1,3 +1,4 @@
+#include "files/OSTFileManager.h"
 #include "platform/codec/PropertyList.h"
 #include "store/OSTContainerCache.h"
 #include "support/StoreTest.h"
@@ -9,6 +10,7 @@
 
 #include <filesystem>
 #include <fstream>
+#include <thread>
 
 namespace ost {
 namespace {
@@ -85,6 +87,22 @@ TEST_F(Maintenance, TheUsageOfABundleIsMeasuredOnceAndThatOfDataEachTime) {
     EXPECT_EQ(21, static_cast<int>(
                       store().diskUsageForUserId({.name = other.name(), .uuid = platform::UUID::generate()}).error()));
     EXPECT_EQ(11, static_cast<int>(store().diskUsageForUserId({.name = other.name()}).error()));
+}
+
+TEST_F(Maintenance, ABundleThatIsReplacedWhileItIsMeasuredDoesNotInheritTheFigure) {
+    for (int round = 0; round < 8; ++round) {
+        const auto old = make(bundleApplication, "a");
+        for (int file = 0; file < 2000; ++file)
+            test::writeFile(fs::path(old->url) / std::to_string(file), "x");
+        const auto fresh = make(bundleApplication, "a", true);
+        std::jthread measuring([&] { EXPECT_TRUE(usage(*old)); });
+        ASSERT_TRUE(store().replaceContainer({.oldContainer = {.name = old->name(), .uuid = old->uuid},
+                                              .newContainer = {.name = fresh->name(), .uuid = fresh->uuid},
+                                              .preserveOldUUID = true}));
+        measuring.join();
+        const auto now = cached(bundleApplication, "a");
+        EXPECT_EQ(OSTFileManager::defaultManager().diskUsageForURL(now->url), usage(*now));
+    }
 }
 
 TEST_F(Maintenance, TheRetryTestEndsTheProcessUntilItsCountIsSpentAlsoFromAForgottenZero) {
