@@ -4,6 +4,7 @@
 #include "model/OSTGlobalConfiguration.h"
 #include "model/OSTMigrationMarker.h"
 #include "platform/base/Log.h"
+#include "platform/base/PassingReason.h"
 #include "platform/base/Path.h"
 #include "store/OSTContainerCache.h"
 
@@ -46,6 +47,26 @@ OSTResult<void> moveLog(const std::string& log) {
     return OSTFileManager::defaultManager().moveItemAtURL(log, destination);
 }
 
+/// Moves all old logs away from the user. Answers whether none can be left: there is no such directory then, either.
+bool moveLogs(const std::string& directory) {
+    const auto items = OSTFileManager::defaultManager().urlsForItemsInDirectoryAtURL(directory);
+    if (!items) {
+        if (!items.error().isPOSIX(ENOENT))
+            logError("Failed to get items for deletion: %@ : %@", directory, items.error());
+        return !platform::isReasonThatPasses(items.error());
+    }
+    bool allMoved = true;
+    for (const auto& item : *items) {
+        const auto log = pathByAppending(directory, item.name);
+        const auto moved = moveLog(log);
+        allMoved = allMoved && moved;
+        if (!moved)
+            logError("Failed to move to new logging directory from %@ : %@", log, moved.error());
+    }
+    logNotice("Migrated log files on %@", OSTCurrentBuildVersion());
+    return allMoved;
+}
+
 /// Whether both are the same container, of which an interrupted copy left two.
 bool isSameContainer(const std::string& a, const std::string& b) {
     const auto read = [](const std::string& url) {
@@ -76,8 +97,8 @@ OSTResult<void> moveIntoPlace(const std::string& from, const std::string& to, bo
     return files.removeItemAtURL(from);
 }
 
-/// Moves the items of one directory into another and removes it when it is empty. Goes on after a failure; the last one
-/// is the result. What an interruption leaves is moved the next time.
+/// Moves the items of one directory into another and removes it when it is empty. Goes on after an item that cannot be
+/// moved; the last reason is the result. What an interruption leaves is moved the next time.
 OSTResult<void> mergeDirectory(const std::string& from, const std::string& to, Holds holds) {
     const auto& files = OSTFileManager::defaultManager();
     OSTResult<void> result;
@@ -87,9 +108,11 @@ OSTResult<void> mergeDirectory(const std::string& from, const std::string& to, H
         if (!moved)
             result = std::move(moved);
     }
-    if (result)
-        result = files.makeDirectoryDurable(to);
-    return result ? files.removeItemAtURL(from) : result;
+    OST_TRY(std::move(result));
+    OST_TRY(files.makeDirectoryDurable(to));
+    if (const auto removed = files.removeItemAtURL(from); !removed) // a mount point stays, but all is moved
+        logError("Failed to remove source %@ : %@", from, removed.error());
+    return {};
 }
 
 } // namespace
@@ -117,22 +140,7 @@ void OSTContainerMigrator::_cleanUpOldUserLocations() {
         return;
     if (const auto removed = files.removeItemAtURL(*library); !removed)
         logError("Failed to remove old Library directory: %@", removed.error());
-    const auto items = files.urlsForItemsInDirectoryAtURL(*logs);
-    if (!items) {
-        if (!items.error().isPOSIX(ENOENT))
-            logError("Failed to get items for deletion: %@ : %@", *logs, items.error());
-        return;
-    }
-    bool allMoved = true;
-    for (const auto& item : *items) {
-        const auto log = pathByAppending(*logs, item.name);
-        const auto moved = moveLog(log);
-        allMoved = allMoved && moved;
-        if (!moved)
-            logError("Failed to move to new logging directory from %@ : %@", log, moved.error());
-    }
-    logNotice("Migrated log files on %@", OSTCurrentBuildVersion());
-    if (!allMoved)
+    if (!moveLogs(*logs))
         return; // What stayed behind is moved at the next boot.
     if (const auto removed = files.removeItemAtURL(*logs); !removed)
         logError("Failed to remove old Log directory: %@", removed.error());

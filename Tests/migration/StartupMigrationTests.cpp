@@ -4,6 +4,8 @@
 
 #include <gtest/gtest.h>
 
+#include <sys/mount.h>
+
 #include <filesystem>
 
 namespace ost {
@@ -55,6 +57,7 @@ TEST_F(StartupMigration, LinksInOldLocationsAreNotFollowed) {
     fs::create_directory_symlink("/outside", fs::path(oldBundles) / "Application");
     EXPECT_FALSE(migrate());
     EXPECT_TRUE(fs::exists("/outside/file"));
+    EXPECT_FALSE(fs::is_symlink(oldLogs));
     EXPECT_FALSE(fs::is_symlink(fs::path(bundles) / "Application"));
 }
 
@@ -67,6 +70,18 @@ TEST_F(StartupMigration, BundleContainersMoveAlsoWhenTheTargetExists) {
     EXPECT_FALSE(fs::exists(oldBundles));
     EXPECT_TRUE(fs::exists(fs::path(a->url) / "a"));
     EXPECT_TRUE(fs::exists(fs::path(b->url) / "b"));
+}
+
+TEST_F(StartupMigration, AnOldTreeThatIsAMountPointIsEmptiedAndKeepsNothingElseFromBeingMigrated) {
+    const auto a = make(bundleApplication, "a");
+    fs::create_directories(oldBundles);
+    mountOver(oldBundles);
+    fs::copy(bundles, oldBundles, fs::copy_options::recursive);
+    fs::remove_all(bundles);
+    EXPECT_TRUE(migrate());
+    EXPECT_TRUE(fs::is_empty(oldBundles));
+    EXPECT_TRUE(fs::exists(fs::path(a->url) / "a"));
+    ::umount2(oldBundles, MNT_DETACH);
 }
 
 TEST_F(StartupMigration, AnInterruptedMoveIsFinishedAndNothingIsLostOrDoubled) {
