@@ -161,7 +161,11 @@ Result<void> ServiceLauncher::_listen(Listener& listener) const {
     const mode_t umask = ::umask(0111); // Everybody may connect; the daemon looks at who it is.
     const int bound = ::bind(listener.socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address);
     ::umask(umask);
-    if (bound != 0 || ::listen(listener.socket.get(), SOMAXCONN) != 0)
+    // Whose a packet is must be known of the first one, too, which may come before the daemon is there.
+    const int passCredentials = listener.type == SOCK_SEQPACKET ? 1 : 0;
+    if (bound != 0 ||
+        ::setsockopt(listener.socket.get(), SOL_SOCKET, SO_PASSCRED, &passCredentials, sizeof passCredentials) != 0 ||
+        ::listen(listener.socket.get(), SOMAXCONN) != 0)
         return std::unexpected(failure(std::string("listen on ") + listener.name));
     return {};
 }

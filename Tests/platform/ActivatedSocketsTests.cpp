@@ -72,6 +72,12 @@ TEST_F(ActivatedSocketsTest, BindsWhatWasNotHandedOver) {
         const auto listener =
             ActivatedSockets().takeListener(service, type).value(); // the second time over a stale one
         EXPECT_TRUE(connects(type));
+        const FileDescriptor early(::accept(listener.get(), nullptr, nullptr));
+        int passesCredentials = -1;
+        socklen_t size = sizeof passesCredentials;
+        ::getsockopt(early.get(), SOL_SOCKET, SO_PASSCRED, &passesCredentials, &size);
+        EXPECT_EQ(passesCredentials, type == SOCK_SEQPACKET ? 1 : 0)
+            << "of a connection that was made before any reader";
         EXPECT_EQ(test::tree(OSTServiceSocketDirectory), "srw-rw-rw- 0:0 com.tamarok.tests\n");
         EXPECT_EQ(ActivatedSockets().takeListener(service, type).error(), EADDRINUSE);
     }

@@ -85,8 +85,12 @@ std::expected<FileDescriptor, Errno> bindListener(std::string_view name, int typ
     auto listener = makeSocket(type);
     if (!listener || ::bind(listener.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0)
         return std::unexpected(errno);
-    // Before the socket listens, so that nobody is refused for the mode it was made with.
-    if (::chmod(address.sun_path, socketMode) != 0 || ::listen(listener.get(), pendingLimit) != 0)
+    // Before the socket listens, so that nobody is refused for the mode it was made with, and no packet comes without
+    // its sender's credentials.
+    const int passCredentials = type == SOCK_SEQPACKET ? 1 : 0;
+    if (::chmod(address.sun_path, socketMode) != 0 ||
+        ::setsockopt(listener.get(), SOL_SOCKET, SO_PASSCRED, &passCredentials, sizeof passCredentials) != 0 ||
+        ::listen(listener.get(), pendingLimit) != 0)
         return std::unexpected(errno);
     return listener;
 }

@@ -162,7 +162,8 @@ UpcallPort::~UpcallPort() { _aside->end(); }
 
 std::expected<std::unique_ptr<UpcallPort>, Errno> UpcallPort::open(RunLoop& loop, FileDescriptor listener,
                                                                    Handler handler) {
-    // Accepted sockets inherit it, so that no packet comes without its sender's credentials.
+    // Connections inherit it, so that no packet comes without its sender's credentials. Since Linux 6.16 they do so
+    // when they are made: what waits here already has it only if whoever made the listener had set it.
     const int on = 1;
     if (::setsockopt(listener.get(), SOL_SOCKET, SO_PASSCRED, &on, sizeof on) != 0)
         return std::unexpected(errno);
