@@ -9,7 +9,9 @@
 #include <sys/un.h>
 #include <unistd.h>
 
+#include <array>
 #include <chrono>
+#include <cstdint>
 
 using namespace ost::test;
 using ost::platform::FileDescriptor;
@@ -19,23 +21,31 @@ namespace {
 constexpr const char* clientSocket = "private/var/run/com.tamarok.ostrandd";
 constexpr const char* upcallSocket = "private/var/run/com.tamarok.ostrandd.upcall";
 
-bool connects(const std::filesystem::path& path) {
-    const FileDescriptor connection(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+/// A connection, empty when nobody takes it.
+FileDescriptor connectionTo(const std::filesystem::path& path, int type) {
+    FileDescriptor connection(::socket(AF_UNIX, type | SOCK_CLOEXEC, 0));
     sockaddr_un address{.sun_family = AF_UNIX, .sun_path = {}};
     path.string().copy(address.sun_path, sizeof address.sun_path - 1);
-    return ::connect(connection.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0;
+    if (::connect(connection.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0)
+        connection.reset();
+    return connection;
+}
+
+bool connects(const std::filesystem::path& path) { return static_cast<bool>(connectionTo(path, SOCK_STREAM)); }
+
+/// The first connection that the socket takes.
+FileDescriptor firstConnectionTo(const std::filesystem::path& socket, int type) {
+    const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(30);
+    auto connection = connectionTo(socket, type);
+    while (!connection && std::chrono::steady_clock::now() < deadline) {
+        ::sched_yield();
+        connection = connectionTo(socket, type);
+    }
+    return connection;
 }
 
 /// Whether the socket becomes one that takes connections.
-bool comesUp(const std::filesystem::path& socket) {
-    const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(30);
-    while (!connects(socket)) {
-        if (std::chrono::steady_clock::now() > deadline)
-            return false;
-        ::sched_yield();
-    }
-    return true;
-}
+bool comesUp(const std::filesystem::path& socket) { return static_cast<bool>(firstConnectionTo(socket, SOCK_STREAM)); }
 
 class LauncherTest : public testing::Test {
 protected:
@@ -120,6 +130,17 @@ TEST_F(LauncherTest, EndsTheDaemonInOrderWhenItIsAskedTo) {
     ASSERT_EQ(launcher.readLine(), "serving");
     launcher.signal(SIGTERM);
     EXPECT_EQ(launcher.wait(), 128 + SIGTERM) << complaints();
+}
+
+TEST_F(LauncherTest, AnUpcallThatComesBeforeTheDaemonIsAnswered) {
+    auto launcher = boot();
+    const auto connection = firstConnectionTo(image() / upcallSocket, SOCK_SEQPACKET);
+    const std::array<std::uint32_t, 6> refusedMessage{0, sizeof refusedMessage, 0, 0, 0, 322514901};
+    ASSERT_EQ(::send(connection.get(), refusedMessage.data(), sizeof refusedMessage, MSG_NOSIGNAL), 24) << complaints();
+    std::array<char, 64> reply{};
+    EXPECT_EQ(::recv(connection.get(), reply.data(), reply.size(), 0), 36);
+    launcher.signal(SIGTERM);
+    EXPECT_EQ(launcher.wait(), 0) << complaints();
 }
 
 TEST_F(LauncherTest, OneBootOfAnImageAtATime) {
