@@ -42,6 +42,17 @@ platform::Errno errorOfLooking(std::string_view path) {
     return item ? platform::Errno(0) : item.error();
 }
 
+OSTResult<struct statx> statusOfItem(std::string_view path, unsigned mask) {
+    const auto item = OSTOpenItem(AT_FDCWD, path, O_PATH);
+    struct statx status{};
+    platform::Errno error = item ? platform::Errno(0) : item.error();
+    if (item && ::statx(item->get(), "", AT_EMPTY_PATH, mask, &status) != 0)
+        error = errno;
+    if (error != 0)
+        return std::unexpected(OSTCreatePOSIXError(error, "stat of %@ failed: %s", path, error));
+    return status;
+}
+
 } // namespace
 
 OSTResult<std::vector<OSTDirectoryItem>> OSTFileManager::urlsForItemsInDirectoryAtURL(std::string_view path) const {
@@ -53,17 +64,15 @@ OSTResult<std::vector<OSTDirectoryItem>> OSTFileManager::urlsForItemsInDirectory
 }
 
 OSTResult<OSTItemIdentity> OSTFileManager::identityOfItemAtURL(std::string_view path) const {
-    const auto item = OSTOpenItem(AT_FDCWD, path, O_PATH);
-    struct statx status{};
-    platform::Errno error = item ? platform::Errno(0) : item.error();
-    if (item && ::statx(item->get(), "", AT_EMPTY_PATH, STATX_INO | STATX_BTIME, &status) != 0)
-        error = errno;
-    if (error != 0)
-        return std::unexpected(OSTCreatePOSIXError(error, "stat of %@ failed: %s", path, error));
+    const auto status = OST_TRY(statusOfItem(path, STATX_INO | STATX_BTIME));
     return OSTItemIdentity{.device = ::makedev(status.stx_dev_major, status.stx_dev_minor),
                            .inode = status.stx_ino,
                            .made = std::chrono::seconds(status.stx_btime.tv_sec) +
                                    std::chrono::nanoseconds(status.stx_btime.tv_nsec)};
+}
+
+OSTResult<uid_t> OSTFileManager::ownerOfItemAtURL(std::string_view path) const {
+    return OST_TRY(statusOfItem(path, STATX_UID)).stx_uid;
 }
 
 bool OSTFileManager::itemExistsAtURL(std::string_view path) const {

@@ -164,6 +164,7 @@ public:
 
     /// What lies at `path` now.
     [[nodiscard]] OSTResult<OSTItemIdentity> identityOfItemAtURL(std::string_view path) const;
+    [[nodiscard]] OSTResult<uid_t> ownerOfItemAtURL(std::string_view path) const;
 
     // Reading and writing files
 

@@ -89,6 +89,15 @@ OSTResult<OSTMetadataRecord> readItem(int open, const std::string& directory, co
     return std::make_shared<const OSTMetadata>(*std::move(metadata));
 }
 
+/// Whether the metadata is the daemon's. An application can put another file in the place of its container's, but not
+/// give it to root.
+OSTResult<bool> isGenuine(const OSTMetadata& metadata) {
+    const auto owner = OSTFileManager::defaultManager().ownerOfItemAtURL(metadata.metadataFileURL());
+    if (!owner && platform::isReasonThatPasses(owner.error()))
+        return std::unexpected(owner.error());
+    return owner == OSTRootUserId;
+}
+
 /// Below that many items, starting a thread takes longer than it saves.
 constexpr std::size_t itemsWorthAThread = 512;
 
@@ -362,8 +371,22 @@ OSTContainerCache::_readClassDirectory(const std::string& directory, std::uint32
     table.reserve(items.size());
     for (auto& record : records)
         if (auto valid = OST_TRY(std::move(record)))
-            _put(table, {std::move(valid)});
+            OST_TRY(_putFound(table, std::move(valid)));
     return table;
+}
+
+OSTResult<void> OSTContainerCache::_putFound(ClassTable& table, OSTMetadataRecord found) {
+    if (const auto old = table.find(found->identifier); old != table.end()) {
+        const auto other = old->second.entry.record;
+        const bool foundIsGenuine = OST_TRY(isGenuine(*found)), otherIsGenuine = OST_TRY(isGenuine(*other));
+        if (foundIsGenuine != otherIsGenuine)
+            platform::logError("Skipping container at %@, whose metadata is not the daemon's and says that it is %@",
+                               foundIsGenuine ? other->url : found->url, found->identifier);
+        if (otherIsGenuine && !foundIsGenuine)
+            return {};
+    }
+    _put(table, {std::move(found)});
+    return {};
 }
 
 void OSTContainerCache::_put(ClassTable& table, OSTCacheEntry entry) {

@@ -97,6 +97,9 @@ private:
     [[nodiscard]] OSTResult<ClassTable> _readClassDirectory(const std::string& directory, std::uint32_t userId,
                                                             bool transient) const OST_REQUIRES(_cacheLock);
     static void _put(ClassTable& table, OSTCacheEntry entry);
+    /// The same for what was found on disk. Of two containers of one name, one whose metadata an application wrote
+    /// gives way.
+    [[nodiscard]] static OSTResult<void> _putFound(ClassTable& table, OSTMetadataRecord found);
     /// What is held under a name; without a record when there is nothing.
     [[nodiscard]] OSTResult<Held> _heldForUser(const OSTContainerName& name, std::source_location where);
     /// Looks for the metadata file of what is held and remembers what was seen.

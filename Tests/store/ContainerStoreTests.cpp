@@ -243,6 +243,19 @@ TEST_F(ContainerStore, HostileItemsOfAClassDirectoryArePassedOver) {
     EXPECT_EQ(OSTErrorCode::notFound, lookUp("outside", false).error());
 }
 
+TEST_F(ContainerStore, ForgedMetadataDoesNotTakeTheNameOfAnotherContainer) {
+    const fs::path directory = classDirectory;
+    for (const auto* const name : {"forged-1", "genuine", "forged-2", "alone"}) { // whichever is listed first
+        plant(directory / name, name == std::string("alone") ? "org.example.alone" : "org.example.app");
+        if (name != std::string("genuine"))
+            ASSERT_EQ(0, ::chown((directory / name / OSTMetadataFileName).c_str(), 501, 501));
+    }
+    const auto found = lookUp("org.example.app", false);
+    ASSERT_TRUE(found);
+    EXPECT_EQ((*found)->url, directory / "genuine");
+    EXPECT_TRUE(lookUp("org.example.alone", false)) << "what was restored under another owner is found";
+}
+
 TEST_F(ContainerStore, LinkInPlaceOfADirectoryLeadsNowhere) {
     struct Case {
         const char* place;
