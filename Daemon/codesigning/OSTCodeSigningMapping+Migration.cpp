@@ -131,11 +131,13 @@ void OSTCodeSigningMapping::performAllCodeSigningMigrationAndReconciliation() {
     const bool groupsMigrated = _migrateAppGroupIdsFromDataContainersToFile();
     const bool legacyMigrated = _migrateDataFromLegacyEntitlementsFileToCodeSigningFile();
     const bool cachedMigrated = _migrateCachedCodeSigningInfoFromBundleContainersToMapping();
-    // It deletes what nobody references, so it must know all references.
-    if (groupsMigrated && legacyMigrated && cachedMigrated)
+    // It deletes what nobody references, so it must know all references, and an entry that is damaged may be one.
+    const bool allRead = _sync([&] { return _unreadableEntries.empty(); });
+    if (groupsMigrated && legacyMigrated && cachedMigrated && allRead)
         OSTGroupManager::defaultManager().reconcileGroupContainersOfType(OSTGroupType::application);
     else
-        logError("Group containers are not reconciled this time, because a migration is not complete");
+        logError("Group containers are not reconciled this time, because %s",
+                 allRead ? "a migration is not complete" : "the mapping file holds damaged entries");
 }
 
 OSTResult<void> OSTCodeSigningMapping::_storeMigrated(const std::function<bool()>& storeEntries) {

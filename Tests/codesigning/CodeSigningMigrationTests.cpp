@@ -112,6 +112,16 @@ TEST_F(CodeSigningMigration, CachedInfoWinsOverTheLegacyFileWhichWinsOverGroupsA
     EXPECT_TRUE(marked("code_signing"));
 }
 
+TEST_F(CodeSigningMigration, NoGroupContainerGoesWhileADamagedEntryMayReferenceIt) {
+    writeMapping(OSTDictionary({{"damaged", OSTValue("no dictionary")}}));
+    const auto group = makeContainer(sharedAppGroup, "group");
+    migrate();
+    EXPECT_TRUE(lives(sharedAppGroup, "group", group));
+    ASSERT_EQ(OSTErrorCode::success, registerInfo("damaged", OSTDictionary()));
+    migrate();
+    EXPECT_FALSE(lives(sharedAppGroup, "group", group));
+}
+
 TEST_F(CodeSigningMigration, WhatCannotBeReadOrWrittenIsKeptAndNoGroupContainerGoes) {
     const auto group = makeContainer(sharedAppGroup, "group.of-the-legacy-file");
     writeFile(legacyFile, "no property list");
