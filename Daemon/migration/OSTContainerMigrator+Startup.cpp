@@ -3,6 +3,7 @@
 #include "migration/OSTContainerMigrator.h"
 #include "model/OSTGlobalConfiguration.h"
 #include "model/OSTMigrationMarker.h"
+#include "platform/base/DirectoryNames.h"
 #include "platform/base/Log.h"
 #include "platform/base/PassingReason.h"
 #include "platform/base/Path.h"
@@ -97,6 +98,21 @@ OSTResult<void> moveIntoPlace(const std::string& from, const std::string& to, bo
     return files.removeItemAtURL(from);
 }
 
+/// Moves what no listing shows, such as another program's notes, and discards what an interrupted copy left.
+OSTResult<void> moveHiddenItems(const std::string& from, const std::string& to) {
+    const auto& files = OSTFileManager::defaultManager();
+    files.removeUnfinishedItemsInDirectoryURL(from);
+    const auto directory = OST_TRY(files.openDirectoryAtURL(from));
+    const auto names = platform::hiddenNames(directory);
+    if (!names)
+        return std::unexpected(OSTCreatePOSIXError(names.error(), "read of %@ failed: %s", from, names.error()));
+    for (const auto& name : *names) {
+        const auto place = OST_TRY(freePath(to, name));
+        OST_TRY(files.moveItemAtURL(pathByAppending(from, name), place));
+    }
+    return {};
+}
+
 /// Moves the items of one directory into another and removes it when it is empty. Goes on after an item that cannot be
 /// moved; the last reason is the result. What an interruption leaves is moved the next time.
 OSTResult<void> mergeDirectory(const std::string& from, const std::string& to, Holds holds) {
@@ -109,6 +125,7 @@ OSTResult<void> mergeDirectory(const std::string& from, const std::string& to, H
             result = std::move(moved);
     }
     OST_TRY(std::move(result));
+    OST_TRY(moveHiddenItems(from, to));
     OST_TRY(files.makeDirectoryDurable(to));
     if (const auto removed = files.removeItemAtURL(from); !removed) // a mount point stays, but all is moved
         logError("Failed to remove source %@ : %@", from, removed.error());

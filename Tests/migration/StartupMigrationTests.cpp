@@ -66,7 +66,11 @@ TEST_F(StartupMigration, BundleContainersMoveAlsoWhenTheTargetExists) {
     const auto b = make(bundleFramework, "b");
     makeOld();
     fs::create_directories(fs::path(bundles) / "Application");
+    test::writeFile(fs::path(oldBundles) / ".note", "old");
+    test::writeFile(fs::path(bundles) / ".note", "new");
     ASSERT_TRUE(migrate());
+    EXPECT_EQ("new", test::readFile(fs::path(bundles) / ".note"));
+    EXPECT_EQ("old", test::readFile(fs::path(bundles) / ".note.1"));
     EXPECT_FALSE(fs::exists(oldBundles));
     EXPECT_TRUE(fs::exists(fs::path(a->url) / "a"));
     EXPECT_TRUE(fs::exists(fs::path(b->url) / "b"));
