@@ -247,8 +247,8 @@ TEST_F(ContainerStore, ForgedMetadataDoesNotTakeTheNameOfAnotherContainer) {
     const fs::path directory = classDirectory;
     for (const auto* const name : {"forged-1", "genuine", "forged-2", "alone"}) { // whichever is listed first
         plant(directory / name, name == std::string("alone") ? "org.example.alone" : "org.example.app");
-        if (name != std::string("genuine"))
-            ASSERT_EQ(0, ::chown((directory / name / OSTMetadataFileName).c_str(), 501, 501));
+        const uid_t owner = name == std::string("genuine") ? 0 : 501;
+        ASSERT_EQ(0, ::chown((directory / name / OSTMetadataFileName).c_str(), owner, owner));
     }
     const auto found = lookUp("org.example.app", false);
     ASSERT_TRUE(found);
