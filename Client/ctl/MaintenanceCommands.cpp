@@ -151,7 +151,7 @@ std::string lineOf(const char* name, const std::string& value) {
     return std::string("    ") + name + ": " + escaped(value) + "\n";
 }
 
-Outcome check(const Arguments& arguments) {
+Outcome findingsOf(const Arguments& arguments) {
     auto connection = OST_TRY(connectToDevice(arguments));
     const auto found = OST_TRY(orFailure(checkStore(connection, deviceDirectory(arguments))));
     Report report;
@@ -174,6 +174,13 @@ Outcome check(const Arguments& arguments) {
     report.json.set("containers", static_cast<std::uint64_t>(found.containers));
     report.exitStatus = !found.unreadable.empty() ? incompleteStatus : !found.findings.empty() ? findingsStatus : 0;
     return report;
+}
+
+Outcome check(const Arguments& arguments) {
+    auto outcome = findingsOf(arguments);
+    if (!outcome) // nothing was found, and nothing was looked at
+        outcome.error().exitStatus = incompleteStatus;
+    return outcome;
 }
 
 } // namespace

@@ -155,7 +155,11 @@ std::size_t widthOf(std::string_view text) {
 
 } // namespace
 
-Failure Failure::usage(std::string message) { return makeFailure(usageStatus, "usage", 0, std::move(message)); }
+Failure Failure::usage(std::string message) {
+    auto failure = makeFailure(usageStatus, "usage", 0, std::move(message));
+    failure.isUsage = true;
+    return failure;
+}
 
 Failure Failure::of(const Error& error) {
     return makeFailure(EXIT_FAILURE, nameOf(error.kind), error.code, error.description(), std::string(hintFor(error)));

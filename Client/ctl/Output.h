@@ -37,6 +37,7 @@ struct Failure {
     std::string message;     ///< already escaped
     ost::OSTDictionary json; ///< {"error": {"kind": ..., "code": ..., "message": ..., "hint": ...}}
     std::string hint = {};   ///< what can be done about it; may be empty
+    bool isUsage = false;    ///< the command's usage helps
 };
 
 using Outcome = std::expected<Report, Failure>;

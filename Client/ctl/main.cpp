@@ -43,8 +43,8 @@ int printOutcome(const Invocation& invocation, const Outcome& outcome) {
             outcome->isPrinted ? EXIT_SUCCESS : print(asJSON ? jsonText(outcome->json) + "\n" : outcome->text);
         return failed != 0 ? failed : outcome->exitStatus;
     }
-    const bool isUsage = outcome.error().exitStatus == Failure::usageStatus;
-    return printFailure(outcome.error(), asJSON, isUsage ? usageLine(commandTable(), *invocation.command) : "");
+    return printFailure(outcome.error(), asJSON,
+                        outcome.error().isUsage ? usageLine(commandTable(), *invocation.command) : "");
 }
 
 /// Whether JSON is asked for in a command line that makes no sense.

@@ -194,6 +194,7 @@ TEST_F(CommandLine, MeasuresWipesMigratesAndChecks) {
     EXPECT_EQ(checked.status, 1);
     for (const auto& name : {std::string("planted"), std::string("link"), container.filename().string()})
         EXPECT_NE(checked.output.find("/" + name + "\""), std::string::npos) << checked.output;
+    EXPECT_EQ(run(unsignedProgram, {"check"}).status, 2) << "nothing is found by whom the daemon refuses";
 }
 
 TEST_F(CommandLine, DryRunsSayWhatWouldGoAndLeaveItAndTheLogIsShownByLevel) {
