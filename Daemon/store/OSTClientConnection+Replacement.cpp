@@ -163,10 +163,12 @@ OSTResult<void> OSTClientConnection::_replace(const OSTReplacement& replacement,
     for (const auto& side : {operation.oldContainer, operation.newContainer})
         if (side)
             OST_TRY(_discardReplaceFilesOf(side->url));
+    // A third container in the new one's place would be served no more, and stay on disk beside it.
+    if (!operation.oldContainer || operation.oldContainer->identifier != operation.newContainer->identifier)
+        OST_TRY(_checkNothingLives(operation));
     if (operation.oldContainer) {
         OST_TRY(_parkOldContainer(operation));
     } else {
-        OST_TRY(_checkNothingLives(operation));
         OST_TRY(OSTReplaceFile::makeDiscardsDurable()); // which the next replace file does otherwise
     }
     return _putNewContainerInPlace(replacement, operation);
@@ -218,7 +220,7 @@ OSTResult<void> OSTClientConnection::_findSides(const OSTReplacement& replacemen
 
 OSTResult<void> OSTClientConnection::_checkNothingLives(const ReplaceOperation& operation) {
     auto name = operation.newContainer->name();
-    name.transient = false;
+    name.transient = operation.transient;
     const auto living = OSTContainerCache::sharedInstance().containerForUser(name);
     if (living)
         return std::unexpected(OSTCreateError(OSTErrorCode::alreadyExists,

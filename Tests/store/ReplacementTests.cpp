@@ -104,6 +104,19 @@ TEST_F(Replacement, PutsTheNewContainerInThePlaceOfTheOldOne) {
         }
 }
 
+TEST_F(Replacement, UnderAnotherIdentifierTakesNobodyElsesPlace) {
+    for (const bool transient : {false, true}) {
+        const auto old = make(dataApplication, "a", transient);
+        const auto fresh = make(dataApplication, "b", !transient);
+        const auto third = make(dataApplication, "b", transient);
+        const auto before = places();
+        EXPECT_EQ(27, replace(old, fresh)) << transient;
+        EXPECT_EQ(before, places());
+        EXPECT_EQ(third->uuid, cached(dataApplication, "b", transient)->uuid);
+        EXPECT_EQ(1, replace(third, fresh));
+    }
+}
+
 TEST_F(Replacement, StartsAPassOnlyWhenAskedTo) {
     for (const bool start : {false, true}) {
         const auto old = make(dataApplication, "a");
@@ -307,7 +320,7 @@ TEST_F(Replacement, MovesThatFailChangeNothing) {
     EXPECT_EQ(14, replace(pinnedOld, fresh));
     EXPECT_TRUE(cached(dataApplication, "pinned"));
     ASSERT_EQ(0, ::umount(pinnedOld->url.c_str()));
-    const auto pinnedNew = make(dataApplication, "pinned", true);
+    const auto pinnedNew = make(dataApplication, "pinnedNew", true);
     pinDown(pinnedNew);
     EXPECT_EQ(15, replace(old, pinnedNew));
     EXPECT_EQ(15, replace(old, pinnedNew, true));
