@@ -30,10 +30,11 @@ void appendString(std::string& out, std::string_view text) {
         const auto character = ost::platform::takeCodePoint(text).value_or(replacementCharacter);
         if (character == '"' || character == '\\')
             out += '\\';
-        if (character >= 0x20 && (character < 0x7f || character > 0x9f)) {
+        if (ost::platform::onlyShowsItself(character)) {
             ost::platform::appendUTF8(out, character);
         } else {
-            out += "\\u00";
+            out += "\\u";
+            ost::platform::appendHex(out, static_cast<unsigned char>(character >> 8U));
             ost::platform::appendHex(out, static_cast<unsigned char>(character));
         }
     }

@@ -21,6 +21,7 @@ TEST(Output, WritesJSONThatHoldsWhateverTheValuesHold) {
         {dictionary, R"({"a\"": {}, "b": [true, 1, []]})"},
         {std::string("a\\b/\n\x1b[\0\x7f", 9), R"("a\\b/\u000a\u001b[\u0000\u007f")"},
         {"h\u00e9 \u65e5 \U0001f600 \u0085", "\"h\u00e9 \u65e5 \U0001f600 \\u0085\""},
+        {"left \u202e right", R"("left \u202e right")"},
         {"cut \xe6\x97, stray \x80, surrogate \xed\xa0\x80",
          "\"cut \ufffd\ufffd, stray \ufffd, surrogate \ufffd\ufffd\ufffd\""},
         {std::numeric_limits<std::uint64_t>::max(), "18446744073709551615"},

@@ -14,13 +14,7 @@ namespace {
 std::size_t printableSequence(std::string_view text) {
     auto rest = text;
     const auto codePoint = takeCodePoint(rest);
-    if (!codePoint)
-        return 0;
-    const auto isBetween = [&](char32_t first, char32_t last) { return *codePoint >= first && *codePoint <= last; };
-    const bool controls = *codePoint < 0x20 || isBetween(0x7f, 0x9f);
-    // Separators of lines, and what makes a terminal show a text in another order than it has.
-    const bool rearranges = isBetween(0x2028, 0x202e) || isBetween(0x2066, 0x2069);
-    return controls || rearranges ? 0 : text.size() - rest.size();
+    return codePoint && onlyShowsItself(*codePoint) ? text.size() - rest.size() : 0;
 }
 
 /// What a message shows of one text: every path and identifier of ordinary length, and not so much that a client could

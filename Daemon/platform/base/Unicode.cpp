@@ -66,6 +66,13 @@ bool isValidText(std::string_view text) {
     return true;
 }
 
+bool onlyShowsItself(char32_t codePoint) {
+    const auto isBetween = [&](char32_t first, char32_t last) { return codePoint >= first && codePoint <= last; };
+    const bool controls = codePoint < 0x20 || isBetween(0x7f, 0x9f);
+    const bool rearranges = isBetween(0x2028, 0x202e) || isBetween(0x2066, 0x2069);
+    return !controls && !rearranges;
+}
+
 void appendUTF8(std::string& out, char32_t codePoint) {
     const auto append = [&](char32_t byte) { out += static_cast<char>(byte); };
     const auto appendTail = [&](unsigned shift) { append(0x80 | (codePoint >> shift & 0x3f)); };

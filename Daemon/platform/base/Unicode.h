@@ -16,6 +16,10 @@ namespace ost::platform {
 /// off alone and gives nothing.
 [[nodiscard]] std::optional<char32_t> takeCodePoint(std::string_view& text);
 
+/// Whether the code point only shows itself: it neither controls a terminal nor ends a line nor makes the text around
+/// it appear in another order than it has.
+[[nodiscard]] bool onlyShowsItself(char32_t codePoint);
+
 /// Appends a code point that is no surrogate and at most U+10FFFF in UTF-8.
 void appendUTF8(std::string& out, char32_t codePoint);
 
