@@ -222,6 +222,8 @@ OSTResult<void> OSTClientConnection::_checkNothingLives(const ReplaceOperation& 
     auto name = operation.newContainer->name();
     name.transient = operation.transient;
     const auto living = OSTContainerCache::sharedInstance().containerForUser(name);
+    if (living && operation.oldContainer && (*living)->url == operation.newContainer->url) // no third one
+        return {};
     if (living)
         return std::unexpected(OSTCreateError(OSTErrorCode::alreadyExists,
                                               "Container with identifier: %@, class: %ld, transient: %d already exists",

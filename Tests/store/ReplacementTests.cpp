@@ -115,6 +115,7 @@ TEST_F(Replacement, UnderAnotherIdentifierTakesNobodyElsesPlace) {
         EXPECT_EQ(third->uuid, cached(dataApplication, "b", transient)->uuid);
         EXPECT_EQ(1, replace(third, fresh));
     }
+    EXPECT_EQ(1, replace(make(dataApplication, "c"), make(dataApplication, "d"), true)) << "both live, and no third";
 }
 
 TEST_F(Replacement, StartsAPassOnlyWhenAskedTo) {
