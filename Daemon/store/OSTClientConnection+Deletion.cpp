@@ -66,10 +66,13 @@ OSTClientConnection::stageForDeleteContainersWithUsers(const OSTDeletion& deleti
         std::set<std::string> directories;
         OSTAllIdentifiersLock lock(OSTLockKind::writing);
         // A list of users that is too short is the caller's mistake, which the guard reports.
-        for (std::size_t i = 0; i < deletion.uuids.size(); ++i)
-            OST_TRY(_stageForDeletion(
+        for (std::size_t i = 0; i < deletion.uuids.size(); ++i) {
+            const auto staged = _stageForDeletion(
                 {{deletion.userIds.at(i), deletion.classes[i], deletion.identifiers[i]}, deletion.uuids[i]},
-                directories));
+                directories);
+            if (!staged && !staged.error().is(OSTErrorCode::deletionFailed)) // one that stays does not keep the others
+                return staged;
+        }
         lock.unlock();
         return makeDeletionsDurable(directories);
     });
@@ -109,11 +112,9 @@ OSTResult<void> OSTClientConnection::_stageContainer(const OSTMetadata& metadata
         OSTStoreDelegate::shared().removeCodeSigningDictionariesForIdentifierAndItsChildren(metadata.identifier);
     if (const auto moved = files.moveItemAtURL(metadata.url, destination); !moved) {
         platform::logDebug("Couldn't stage for deletion from %@ to %@: %@", metadata.url, destination, moved.error());
-        if (const auto removed = files.removeItemAtURL(metadata.url); !removed) {
-            static_cast<void>(OSTCreateError(OSTErrorCode::deletionFailed, "Failed to delete container at %@: %@",
-                                             metadata.url, removed.error()));
-            return {};
-        }
+        if (const auto removed = files.removeItemAtURL(metadata.url); !removed)
+            return std::unexpected(OSTCreateError(OSTErrorCode::deletionFailed, "Failed to delete container at %@: %@",
+                                                  metadata.url, removed.error()));
     }
     directories.emplace(pathByDeletingLastComponent(metadata.url));
     if (!_setSandboxContainerMappingForUser(metadata.name(), std::nullopt))

@@ -139,8 +139,8 @@ public:
     /// classes differ in number, `cacheRemoveFailed`, `deletionFailed` when a power cut might bring a container back.
     [[nodiscard]] std::expected<void, OSTErrorCode>
     stageForDeleteContainersWithUsers(const OSTDeletion& deletion) const;
-    /// The same for a container that was found; one that has gone since is passed over. `useLocking` is false when the
-    /// caller holds the all-identifiers lock for writing.
+    /// The same for a container that was found; one that has gone since is passed over, and one that keeps its place
+    /// gives `deletionFailed`. `useLocking` is false when the caller holds the all-identifiers lock for writing.
     [[nodiscard]] std::expected<void, OSTErrorCode> stageForDeleteContainer(const OSTMetadata& container,
                                                                             bool useLocking = true) const;
 

@@ -171,9 +171,11 @@ TEST_F(Deletion, WhatCannotBeMovedIsRemovedAndWhatCannotBeRemovedStays) {
     const auto removed = make(dataApplication, "removed");
     const auto kept = make(dataApplication, "kept");
     const auto last = make(dataApplication, "last");
-    for (const auto& record : {removed, kept})
+    const auto alone = make(dataApplication, "alone");
+    for (const auto& record : {removed, kept, alone})
         test::writeFile(onDeathRow(record) / "occupied", "");
-    mountOver(fs::path(kept->url) / "tmp");
+    for (const auto& record : {kept, alone})
+        mountOver(fs::path(record->url) / "tmp");
     ASSERT_TRUE(platform::setSandboxUserStateItem(501, 1, "kept", kept->url));
     EXPECT_EQ(1, stage(deletionOf({removed, kept, last})));
     EXPECT_FALSE(fs::exists(removed->url));
@@ -181,6 +183,7 @@ TEST_F(Deletion, WhatCannotBeMovedIsRemovedAndWhatCannotBeRemovedStays) {
     EXPECT_TRUE(fs::exists(kept->url));
     EXPECT_TRUE(fs::is_symlink(fs::path(sandboxStateDirectory) / "501/1/kept"));
     EXPECT_TRUE(fs::exists(onDeathRow(last) / "last"));
+    EXPECT_EQ(28, codeOf(store().deleteContainerForUser(alone->name()))) << "what stays is not said to be deleted";
 }
 
 TEST_F(Deletion, OneContainerIsLookedUpAndStaged) {
