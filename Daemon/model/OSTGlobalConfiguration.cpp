@@ -4,10 +4,12 @@
 #include "model/OSTLayoutDirectory.h"
 #include "platform/base/Immortal.h"
 #include "platform/base/Log.h"
+#include "platform/base/PassingReason.h"
 #include "platform/base/Path.h"
 #include "platform/device/Accounts.h"
 
 #include <fcntl.h>
+#include <sys/stat.h>
 
 #include <cerrno>
 #include <climits>
@@ -35,17 +37,41 @@ constexpr std::string_view libraryName = "Library/Ostrand";
 constexpr std::string_view replaceName = "Replace";
 constexpr std::string_view transientName = "Temp";
 
-/// Whether `base` holds class directories of real users. Fails with the errno of reading the accounts.
+/// `path` without symbolic links, whose end may be missing. Fails with EAGAIN when a link leads nowhere: where the rest
+/// is shows when what it leads to is there again.
+std::expected<std::string, platform::Errno> canonicalWhereMissing(std::string path) {
+    char buffer[PATH_MAX] = "";
+    std::string missing;
+    while (!path.empty() && !::realpath(path.c_str(), buffer)) {
+        const platform::Errno error = errno;
+        struct stat item{};
+        if (error != ENOENT)
+            return std::unexpected(error);
+        if (::lstat(path.c_str(), &item) == 0)
+            return std::unexpected(EAGAIN);
+        missing = pathByAppending(platform::lastPathComponent(path), missing);
+        path = platform::pathByDeletingLastComponent(path);
+    }
+    return pathByAppending(path.empty() ? "" : buffer, missing);
+}
+
+/// Whether `base` holds class directories of real users. Fails with the errno of reading the accounts, or of looking
+/// for a home that might be the one.
 std::expected<bool, platform::Errno> isBaseOfAUser(std::string_view base) {
+    platform::Errno unknownHome = 0;
     const auto user = platform::accountMatching([&](const platform::Account& account) {
         if (account.uid <= OSTHighestSystemUserId)
             return false;
-        const auto home = canonical(account.home.c_str());
-        return base == pathByAppending(home, OSTUserBaseDirectoryName) ||
-               base == pathByAppending(home, OSTUserTransientDirectoryName);
+        const auto home = canonicalWhereMissing(account.home);
+        if (!home && !platform::speaksOfTheItem(home.error()))
+            unknownHome = home.error();
+        return home && (base == pathByAppending(*home, OSTUserBaseDirectoryName) ||
+                        base == pathByAppending(*home, OSTUserTransientDirectoryName));
     });
     if (!user && user.error() != ENOENT)
         return std::unexpected(user.error());
+    if (!user && unknownHome != 0)
+        return std::unexpected(unknownHome);
     return user.has_value();
 }
 

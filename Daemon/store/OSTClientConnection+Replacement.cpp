@@ -384,7 +384,7 @@ OSTResult<void> OSTClientConnection::_discardReplaceFilesOf(std::string_view pla
                                               "Failed to get items at replace URL%@ : %@", directory, items.error()));
     for (const auto& item : items.value_or(std::vector<OSTDirectoryItem>())) {
         const auto url = pathByAppending(directory, item.name);
-        const auto file = OSTReplaceFile::_readAndValidateReplaceFileAtUrl(url);
+        const auto file = OSTReplaceFile::readReplaceFileAtUrl(url);
         if (!file && platform::isReasonThatPasses(file.error()))
             return std::unexpected(file.error());
         if (!file || !(isAtOrBelow(file->oldURL, place) || isAtOrBelow(file->destinationURL, place)))

@@ -13,6 +13,7 @@
 #include <cstring>
 #include <expected>
 #include <optional>
+#include <utility>
 
 namespace ost {
 
@@ -105,7 +106,7 @@ OSTResult<void> OSTReplaceFile::_writeToDiskReplaceAt(const std::string& url) co
     return {};
 }
 
-OSTResult<OSTReplaceFile> OSTReplaceFile::_readAndValidateReplaceFileAtUrl(const std::string& url) {
+OSTResult<OSTReplaceFile> OSTReplaceFile::readReplaceFileAtUrl(const std::string& url) {
     const auto dictionary = OST_dictionaryWithContentsOfURL(url, OSTSmallDictionaryFileSize);
     if (!dictionary)
         return std::unexpected(OSTCreateError(OSTErrorCode::replaceFileInvalid, dictionary.error(),
@@ -114,23 +115,33 @@ OSTResult<OSTReplaceFile> OSTReplaceFile::_readAndValidateReplaceFileAtUrl(const
         const auto* const found = dictionary->find(key);
         return found ? std::optional(*found) : std::nullopt;
     };
-    const auto path = [&](const char* key) {
+    OSTReplaceFile file;
+    for (const auto& [key, path] : {std::pair(oldKey, &file.oldURL),
+                                    {newKey, &file.newURL},
+                                    {stagingKey, &file.stagingURL},
+                                    {destinationKey, &file.destinationURL}}) {
         const auto* const found = dictionary->find(key);
-        return found && found->asString() ? *found->asString() : std::string();
-    };
-    OSTReplaceFile file{path(oldKey), path(newKey), path(stagingKey), path(destinationKey)};
-    const auto plausible = isPlausible(file);
-    if (!plausible || !*plausible) {
-        std::optional<OSTError> cause;
-        if (!plausible)
-            cause =
-                OSTCreatePOSIXError(plausible.error(), "check of the paths in %@ failed: %s", url, plausible.error());
-        return std::unexpected(OSTCreateError(OSTErrorCode::replaceFileInvalid, OSTLogging::logged,
-                                              cause ? &*cause : nullptr,
-                                              "Invalid replace data: Old: %@, New: %@, Staging: %@, Dest: %@",
-                                              value(oldKey), value(newKey), value(stagingKey), value(destinationKey)));
+        if (!found || !found->asString())
+            return std::unexpected(OSTCreateError(
+                OSTErrorCode::replaceFileInvalid, "Invalid replace data: Old: %@, New: %@, Staging: %@, Dest: %@",
+                value(oldKey), value(newKey), value(stagingKey), value(destinationKey)));
+        *path = *found->asString();
     }
     return file;
+}
+
+OSTResult<OSTReplaceFile> OSTReplaceFile::_readAndValidateReplaceFileAtUrl(const std::string& url) {
+    auto file = OST_TRY(readReplaceFileAtUrl(url));
+    const auto plausible = isPlausible(file);
+    if (plausible && *plausible)
+        return file;
+    std::optional<OSTError> cause;
+    if (!plausible)
+        cause = OSTCreatePOSIXError(plausible.error(), "check of the paths in %@ failed: %s", url, plausible.error());
+    return std::unexpected(OSTCreateError(OSTErrorCode::replaceFileInvalid, OSTLogging::logged,
+                                          cause ? &*cause : nullptr,
+                                          "Invalid replace data: Old: %@, New: %@, Staging: %@, Dest: %@", file.oldURL,
+                                          file.newURL, file.stagingURL, file.destinationURL));
 }
 
 std::string OSTReplaceFile::description() const {

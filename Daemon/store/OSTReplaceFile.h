@@ -24,7 +24,9 @@ struct OSTReplaceFile {
     /// Writes the file, durably. Fails with `replaceDescriptionIncomplete` or `dictionaryWriteFailed`.
     [[nodiscard]] OSTResult<void> _writeToDiskReplaceAt(const std::string& url) const;
 
-    /// Reads the file, in either property-list encoding. One that asks for a move outside the directories of
+    /// Reads the file, in either property-list encoding, whatever the paths are. Fails with `replaceFileInvalid`.
+    [[nodiscard]] static OSTResult<OSTReplaceFile> readReplaceFileAtUrl(const std::string& url);
+    /// Reads the file for its replacement to be undone. One that asks for a move outside the directories of
     /// containers, or of anything but a directory in staging, is invalid. Fails with `replaceFileInvalid`.
     [[nodiscard]] static OSTResult<OSTReplaceFile> _readAndValidateReplaceFileAtUrl(const std::string& url);
 

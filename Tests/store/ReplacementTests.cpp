@@ -564,5 +564,24 @@ TEST_F(ReplaceRecovery, MoveThatFailsIsTriedAgainAtTheNextStart) {
     expectNothingUnderWay();
 }
 
+TEST_F(ReplaceRecovery, WaitsForAHomeWhoseLinkLeadsNowhere) {
+    const std::string away = "/volume/kim/Containers/Data/Application", name = "/0B1C9E44-52C5-4B62-9A0E-1C5A2F0D6A03";
+    test::writeFile("/etc/passwd", test::readFile("/etc/passwd") + "kim:x:502:502::/homes/kim:/bin/sh\n");
+    fs::create_directory_symlink("/volume", "/homes");
+    plantParkedContainer();
+    const OSTReplaceFile replaceFile{
+        .oldURL = away + name, .newURL = away + name, .stagingURL = parked, .destinationURL = away + name};
+    ASSERT_TRUE(replaceFile._writeToDiskReplaceAt(file));
+    store().containerManagerSetup();
+    store().containerManagerCleanup();
+    EXPECT_EQ(1, passCode());
+    EXPECT_TRUE(fs::exists(parked + "/old"));
+    EXPECT_TRUE(store().stageForDeleteContainer(*make(dataApplication, "of somebody else")));
+    fs::create_directories(away);
+    store().containerManagerSetup();
+    EXPECT_TRUE(fs::exists(away + name + "/old"));
+    expectNothingUnderWay();
+}
+
 } // namespace
 } // namespace ost
